@@ -1,0 +1,274 @@
+// The one interface to the host. Its operations bear the names of the host calls they stand for; every word
+// that the program learns of the machine comes through them, so that a recorded or made-up machine can stand
+// in for a live one.
+//
+// Names and paths handed up by any platform are safe text (HXSafeText.h).
+//
+// Unless an operation says otherwise it may be called from any thread.
+#pragma once
+
+#include "platform/HXHostRecords.h"
+
+#include <cstdint>
+#include <cstdio>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+// One entry of the option table given to `getopt_long`.
+struct HXLongOption {
+    const char *name; // may be empty: such an option has no long form
+    bool hasArgument;
+    int *flag; // when not null, set to `value` and `getopt_long` returns 0
+    int value;
+};
+
+// The scanner's state after a step of `getopt_long`.
+struct HXOptionScan {
+    int result = 0;                 // the option's value, 0, '?' or ':'; -1 at the end
+    const char *argument = nullptr; // the option's argument, if it has one
+    int index = 1;                  // at the end: the index of the first argument that is no option
+};
+
+// A concurrent work queue; made by `dispatch_queue_create`.
+struct HXDispatchQueue {
+    std::string label;
+    uint32_t qualityOfService = 0;
+};
+inline constexpr uint32_t QOS_CLASS_UTILITY = 0x11;
+
+// A source of signal events, live until `dispatch_source_cancel`.
+class HXDispatchSource {
+  public:
+    virtual ~HXDispatchSource() = default;
+};
+
+enum class HXSignalDisposition { byDefault, ignored };
+inline constexpr int HX_SIGINT = 2;
+
+// A file written beside its final place, readable by its owner alone, and renamed when it is complete.
+struct HXPendingFile {
+    std::FILE *stream = nullptr; // owned by the platform until commit or discard
+    std::string path;
+    std::string temporaryPath;
+};
+
+class HXPlatform {
+  public:
+    virtual ~HXPlatform() = default;
+
+    // The platform of this run. `setCurrent` is called once in main, or by a test; the caller keeps ownership
+    // and keeps the platform alive while it is current. `current` without one is an internal error.
+    static HXPlatform &current();
+    static void setCurrent(HXPlatform *platform);
+
+    // ---- Tasks and virtual memory
+    // -------------------------------------------------------------------------------
+
+    // The program's own task.
+    virtual mach_port_t mach_task_self() = 0;
+
+    // Opens the task of `pid` and stores a port to it, which stays bound to that very process even when its
+    // pid is given to another one later. KERN_FAILURE (5) when the process is gone, is a zombie or may not be
+    // examined.
+    virtual kern_return_t task_for_pid(mach_port_t self, int32_t pid, mach_port_t *task) = 0;
+
+    // Gives a task port back, and with it all that the platform holds for the task. The port must not be used
+    // again.
+    virtual void mach_port_deallocate(mach_port_t self, mach_port_t task) = 0;
+
+    // The first top-level mapping whose end lies above *address: its start and length in bytes, and its basic
+    // information. *infoCount: words there is room for, then words filled. KERN_INVALID_ADDRESS when there is
+    // none, MACH_SEND_INVALID_DEST when the process is gone.
+    virtual kern_return_t mach_vm_region(mach_port_t task, uint64_t *address, uint64_t *size, int32_t flavor,
+                                         vm_region_basic_info_64 *info, uint32_t *infoCount) = 0;
+
+    // The same for leaf mappings, however deep; *nestingDepth is the deepest submap level to descend to.
+    // *infoCount comes back as 18 or less from a kernel that fills the older record. A task's walk is
+    // answered from one snapshot of its address space, so it neither skips nor repeats a mapping; one thread
+    // walks a task.
+    virtual kern_return_t mach_vm_region_recurse(mach_port_t task, uint64_t *address, uint64_t *size,
+                                                 uint32_t *nestingDepth, vm_region_submap_info_64 *info,
+                                                 uint32_t *infoCount) = 0;
+
+    // The dispositions (VM_PAGE_QUERY_… bits) of the pages of [address, address + size), one word a page.
+    // *count: entries there is room for, then entries filled. KERN_INVALID_ADDRESS when a page lies in no
+    // mapping, KERN_INVALID_ARGUMENT when the process is gone.
+    virtual kern_return_t mach_vm_page_range_query(mach_port_t task, uint64_t address, uint64_t size,
+                                                   int32_t *dispositions, uint64_t *count) = 0;
+
+    // With VM_PURGABLE_GET_STATE: the purgeable state (VM_PURGABLE_…) of the object mapped at `address`.
+    // Fails for objects that are not purgeable.
+    virtual kern_return_t mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,
+                                                   int32_t *state) = 0;
+
+    // Bytes in a page of the machine, a power of two.
+    virtual uint32_t vm_kernel_page_size() = 0;
+
+    // Whether tasks of this host have a shared region at all. Without one its base and size are 0 for every
+    // task.
+    virtual bool hasSharedRegion() = 0;
+
+    // Prints "LABEL: TEXT\n" to standard error.
+    void mach_error(const char *label, kern_return_t error);
+    // The kernel's text for an error; never null, lives for ever.
+    const char *mach_error_string(kern_return_t error);
+
+    // ---- Processes
+    // ---------------------------------------------------------------------------------------------- These
+    // answer −1 with errno set when they fail, unless they say otherwise.
+
+    // Fills `pids` with the pids of all processes, as many as there is room for, and answers how many were
+    // filled. With a null buffer: how many there are about. Kernel threads are no processes; the kernel
+    // itself is pid 0.
+    virtual int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes) = 0;
+
+    // Fills `buffer` with the record of `flavor` (PROC_PIDTBSDINFO, PROC_PIDT_SHORTBSDINFO) and answers its
+    // length in bytes; 0 with errno set when it cannot (ESRCH: no such process). A zombie has no record of
+    // flavor 3.
+    virtual int32_t proc_pidinfo(int32_t pid, int32_t flavor, uint64_t argument, void *buffer,
+                                 uint32_t bufferBytes) = 0;
+
+    // Resource usage, flavor RUSAGE_INFO_V4. 0 on success.
+    virtual int32_t proc_pid_rusage(int32_t pid, int32_t flavor, rusage_info_v4 *info) = 0;
+
+    // Idle-exit flags (0x1 tracked, 0x2 allows idle exit, 0x4 dirty). 0 on success.
+    virtual int32_t proc_get_dirty(int32_t pid, uint32_t *flags) = 0;
+
+    // Path of the file mapped at `address`, not terminated, cut to `bufferBytes`; answers its length, 0 when
+    // there is none.
+    virtual int32_t proc_regionfilename(int32_t pid, uint64_t address, char *buffer,
+                                        uint32_t bufferBytes) = 0;
+
+    virtual int32_t getpid() = 0;
+    virtual uint32_t geteuid() = 0;
+
+    // { CTL_KERN, KERN_ARGMAX }: the size of the largest argument area in bytes, 32 bits.
+    // { CTL_KERN, KERN_PROCARGS2, pid }: the argument area: a 32-bit argument count, the executed file's
+    // path, at least one zero byte, then the arguments, each with a zero. *oldBytes: room, then bytes filled.
+    // 0 on success.
+    virtual int32_t sysctl(const int32_t *name, uint32_t nameLength, void *old, size_t *oldBytes) = 0;
+
+    // "vm.self_region_heft": read (32 bits) or written. "vm.get_owned_vmobjects": the new value is a task
+    // port, the old one a 64-bit count and that many `owned_vmobject`; without a buffer *oldBytes tells the
+    // size needed. ENOENT when the kernel has no such setting. 0 on success.
+    virtual int32_t sysctlbyname(const char *name, void *old, size_t *oldBytes, const void *newValue,
+                                 size_t newBytes) = 0;
+
+    // LEDGER_TEMPLATE_INFO: `buffer` holds *count `ledger_template_info`, `pid` is ignored.
+    // LEDGER_ENTRY_INFO: *count `ledger_entry_info` of `pid`, in template order. *count comes back as the
+    // entries filled. 0 on success.
+    virtual int32_t ledger(int32_t command, int32_t pid, void *buffer, int64_t *count) = 0;
+
+    // ---- Images and symbols
+    // -------------------------------------------------------------------------------------
+
+    virtual uint32_t RVSymbolicatorGetFlagsForNoSymbolOrSourceInfoData() { return 0; }
+    virtual uint32_t RVSymbolicatorGetFlagsForNListOnlyData() { return 0; }
+
+    // A symbolicator for the images that the task has loaded now; null when they cannot be listed.
+    virtual RVSymbolicator *RVSymbolicatorCreateWithTaskFlagsAndNotification(mach_port_t task, uint32_t flags,
+                                                                             const void *notification) = 0;
+    // Calls `each` for every loaded image. `time` is kRVNow.
+    virtual void
+    RVSymbolicatorForeachSymbolOwnerAtTime(RVSymbolicator *symbolicator, uint64_t time,
+                                           const std::function<void(const RVSymbolOwner &)> &each) = 0;
+    // The path with its symbolic links resolved, where the host that the task runs on can tell; else as
+    // given.
+    virtual std::string stringByResolvingSymlinksInPath(const std::string &path) = 0;
+
+    // A symbolicator for the running kernel; null when there is none.
+    virtual RVSymbolicator *
+    RVSymbolicatorCreateWithMachKernelFlagsAndNotification(uint32_t flags, const void *notification) = 0;
+    virtual RVSymbol RVSymbolicatorGetSymbolWithAddressAtTime(RVSymbolicator *symbolicator, uint64_t address,
+                                                              uint64_t time) = 0;
+    virtual RVSourceInfo RVSymbolicatorGetSourceInfoWithAddressAtTime(RVSymbolicator *symbolicator,
+                                                                      uint64_t address, uint64_t time) = 0;
+    // Releases a symbolicator; null is allowed.
+    virtual void RVRelease(RVSymbolicator *symbolicator) = 0;
+
+    // ---- The kernel's own memory
+    // --------------------------------------------------------------------------------
+
+    virtual mach_port_t mach_host_self() = 0;
+
+    // The kernel's wired memory: names and facts of its zones (one count) and its allocation sites. The
+    // arrays belong to the caller, who gives each back with `vm_deallocate`. KERN_NO_ACCESS without the right
+    // to know.
+    virtual kern_return_t mach_memory_info(mach_port_t host, mach_zone_name **names, uint32_t *nameCount,
+                                           mach_zone_info **zones, uint32_t *zoneCount,
+                                           mach_memory_info_record **records, uint32_t *recordCount) = 0;
+
+    // Gives back memory that a kernel call handed out; `bytes` is its length.
+    virtual kern_return_t vm_deallocate(mach_port_t task, const void *address, uint64_t bytes) = 0;
+
+    // All loaded kernel extensions.
+    virtual std::vector<OSKextInfo> OSKextCopyLoadedKextInfo() = 0;
+
+    // ---- Region types
+    // -------------------------------------------------------------------------------------------
+
+    // What the host calls memory of a user tag that the program has no name for; none when it has no name
+    // either.
+    virtual std::optional<std::string> GXRegionTypeDescriptionForTagShareProtAndPager(uint32_t tag,
+                                                                                      uint8_t shareMode,
+                                                                                      int32_t protection,
+                                                                                      uint8_t pager) = 0;
+
+    // ---- Command line, files, streams
+    // --------------------------------------------------------------------------- These are the real
+    // machine's on every platform, a replayed one included.
+
+    // One step of the option scanner, as getopt_long(3) does it: `shortOptions` in its notation; a first call
+    // with `restart` begins at the argument after the program's name. Options and other arguments may mix;
+    // the others are moved behind. What is wrong with an option is printed to standard error. Main thread
+    // only.
+    virtual HXOptionScan getopt_long(int argc, char *const argv[], const char *shortOptions,
+                                     const std::vector<HXLongOption> &options, bool restart) = 0;
+
+    // Whether a file system object exists at `path`; links are followed.
+    virtual bool stat(const std::string &path) = 0;
+
+    // fopen(3): a stream, which the caller closes with std::fclose, or null with errno set.
+    virtual std::FILE *fopen(const std::string &path, const char *mode) = 0;
+
+    // The whole content of a file that exists when the call begins; none with errno set when it cannot be
+    // read or is longer than `limit` bytes (EFBIG). Never waits on a fifo or a device (EINVAL).
+    virtual std::optional<std::string> readFile(const std::string &path, uint64_t limit) = 0;
+
+    // Begins a file that becomes visible at `path` only as a whole; none with errno set.
+    virtual std::optional<HXPendingFile> createPendingFile(const std::string &path) = 0;
+    // Closes and renames it; false with errno set (the temporary file is then removed).
+    virtual bool commitPendingFile(HXPendingFile &file) = 0;
+    // Closes and removes it.
+    virtual void discardPendingFile(HXPendingFile &file) = 0;
+
+    // Whether the stream of that descriptor (1: standard output) is a terminal.
+    virtual bool isatty(int descriptor) = 0;
+
+    // ---- Work queues and signals
+    // -------------------------------------------------------------------------------- These are the real
+    // machine's on every platform, too.
+
+    virtual HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) = 0;
+
+    // Calls `work` with 0 … iterations − 1, starting them in that order, several at once; returns when all
+    // have returned.
+    virtual void dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
+                                const std::function<void(size_t)> &work) = 0;
+
+    // A source of events for a signal, not yet running; null when there can be none. From here until `signal`
+    // sets the disposition anew the signal reaches no other thread.
+    virtual std::unique_ptr<HXDispatchSource> dispatch_source_create(int signal) = 0;
+    virtual void dispatch_source_set_event_handler(HXDispatchSource &source,
+                                                   std::function<void()> handler) = 0;
+    virtual void dispatch_resume(HXDispatchSource &source) = 0;
+    // No handler runs after this has returned.
+    virtual void dispatch_source_cancel(HXDispatchSource &source) = 0;
+
+    // Sets a signal's disposition. A signal that came between `dispatch_source_cancel` and this call is not
+    // lost.
+    virtual void signal(int signal, HXSignalDisposition disposition) = 0;
+};
