@@ -7,8 +7,6 @@
 #include <bsd/stdlib.h>
 
 #include <algorithm>
-#include <cinttypes>
-#include <functional>
 
 namespace {
 
@@ -47,17 +45,6 @@ const std::vector<SortColumn> &sortColumns() {
         {"Category", {}},
     };
     return columns;
-}
-
-// Length in UTF-16 code units of valid UTF-8.
-int utf16Length(const std::string &text) {
-    int length = 0;
-    for (const char c : text) {
-        const auto byte = static_cast<uint8_t>(c);
-        if ((byte & 0xC0) == 0x80) continue;
-        length += byte >= 0xF0 ? 2 : 1;
-    }
-    return length;
 }
 
 std::string humanized(int64_t size) {
