@@ -115,16 +115,18 @@ std::string nameForSite(const mach_memory_info_record &info, const HXKernelProce
     return "unknown site (" + hexadecimal(siteType(info)) + ", " + hexadecimal(info.site) + ")";
 }
 
-// Elements that outgrow the zone leave nothing to take back.
+// Elements that outgrow the zone leave nothing to take back, even if their size wraps around.
 void setZoneSizes(HXMemoryRegion &region, const mach_zone_info &zone) {
-    region.setSize(zone.mzi_cur_size);
+    const uint64_t size = zone.mzi_cur_size, elementSize = zone.mzi_elem_size;
+    region.setSize(size);
     if (zone.mzi_collectable == 0) {
-        region.setDirtySize(zone.mzi_cur_size);
+        region.setDirtySize(size);
         return;
     }
-    const uint64_t usedSize = zone.mzi_count * zone.mzi_elem_size;
+    const uint64_t usedSize = zone.mzi_count * elementSize;
+    const bool fits = elementSize == 0 || zone.mzi_count <= size / elementSize;
     region.setDirtySize(usedSize);
-    region.setReclaimableSize(usedSize > zone.mzi_cur_size ? 0 : zone.mzi_cur_size - usedSize);
+    region.setReclaimableSize(fits ? size - usedSize : 0);
 }
 
 // Wired memory is the kernel's charge, but for what is hidden, lies in a zone (which is charged as a whole)
