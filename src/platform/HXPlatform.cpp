@@ -4,7 +4,8 @@
 
 namespace {
 HXPlatform *currentPlatform = nullptr;
-}
+uint64_t currentGeneration = 0;
+} // namespace
 
 HXPlatform &HXPlatform::current() {
     HXRequire(currentPlatform != nullptr, "HXPlatform current", "a platform was set");
@@ -13,6 +14,11 @@ HXPlatform &HXPlatform::current() {
 
 void HXPlatform::setCurrent(HXPlatform *platform) {
     currentPlatform = platform;
+    currentGeneration++;
+}
+
+uint64_t HXPlatform::generation() {
+    return currentGeneration;
 }
 
 void HXPlatform::mach_error(const char *label, kern_return_t error) {

@@ -63,6 +63,8 @@ class HXPlatform {
     // and keeps the platform alive while it is current. `current` without one is an internal error.
     static HXPlatform &current();
     static void setCurrent(HXPlatform *platform);
+    // Counts the calls of `setCurrent`: what is cached of a platform holds while this stays the same.
+    static uint64_t generation();
 
     // ---- Tasks and virtual memory
     // -------------------------------------------------------------------------------

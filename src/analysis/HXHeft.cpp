@@ -1,0 +1,97 @@
+// Gathering and merging.
+#include "analysis/HXHeft.h"
+
+#include <algorithm>
+
+namespace {
+
+constexpr char kQueueLabel[] = "org.heft.gatherdata";
+
+} // namespace
+
+HXHeft::HXHeft(ProcessList processes)
+    : _processes(std::move(processes)), _objects(std::make_unique<HXMemoryObjects>()) {
+    _memoryObjects.reserve(100 * _processes.size());
+    _sharedCache64MemoryObjects.reserve(512);
+    _textMemoryObjects.reserve(2 * _processes.size());
+    _linkeditMemoryObjects.reserve(2 * _processes.size());
+}
+
+HXHeft::~HXHeft() = default;
+
+std::unique_ptr<HXDispatchSource> HXHeft::installCancelHandler(std::function<void()> callback) {
+    HXPlatform &platform = HXPlatform::current();
+    if (platform.isatty(1)) return nullptr;
+    auto source = platform.dispatch_source_create(HX_SIGINT);
+    if (!source) return nullptr;
+    platform.dispatch_source_set_event_handler(*source, std::move(callback));
+    platform.signal(HX_SIGINT, HXSignalDisposition::ignored);
+    platform.dispatch_resume(*source);
+    return source;
+}
+
+void HXHeft::gatherProcesses() {
+    HXPlatform &platform = HXPlatform::current();
+    const HXDispatchQueue queue = platform.dispatch_queue_create(kQueueLabel, QOS_CLASS_UTILITY);
+    const std::vector<HXProcess *> ordered = _processesBySortingPidDesc(_processes);
+    platform.dispatch_apply(ordered.size(), queue, [&](size_t i) {
+        if (!_earlyExit.load(std::memory_order_relaxed)) ordered[i]->gatherData();
+    });
+}
+
+void HXHeft::gatherData() {
+    gatherProcesses();
+    if (_earlyExit)
+        HXProcess::_addGlobalError("Heft exited early due to SIGINT and did not finish gathering all data");
+    for (const auto &process : _processes)
+        _addProcess(*process);
+    finalizeObjects();
+    _buildProcessToHeftMap();
+}
+
+HXMemoryObject &HXHeft::newObject() {
+    HXMemoryObject &object = _objects->emplace_back();
+    object.setIndex(static_cast<uint32_t>(_objects->size() - 1));
+    return object;
+}
+
+HXHeft::ObjectMap &HXHeft::mapForRegion(const HXMemoryRegion &region, const HXProcess &process) {
+    if (region.inSharedCache())
+        return process.is64bit() ? _sharedCache64MemoryObjects : _sharedCache32MemoryObjects;
+    if (region.segment() == HXSegmentText) return _textMemoryObjects;
+    if (region.segment() == HXSegmentLinkedit) return _linkeditMemoryObjects;
+    return _memoryObjects;
+}
+
+HXMemoryObject &HXHeft::objectForRegion(const HXMemoryRegion &region, const HXProcess &process) {
+    constexpr uint64_t noKey = UINT64_MAX;
+    uint64_t key = region.inSharedCache() ? region.start() : region.object_id();
+    if (key == noKey) return newObject();
+    // What a process has copied on write is its own, whoever else maps the object.
+    if (region.share_mode() == SM_COW && (region.dirtySize() != 0 || region.swappedSize() != 0))
+        key ^= uint64_t{static_cast<uint32_t>(process.pid())} << 32;
+    if (key == 0 || key == noKey) return newObject();
+    HXMemoryObject *&object = mapForRegion(region, process)[key];
+    if (!object) object = &newObject();
+    return *object;
+}
+
+void HXHeft::_addProcess(HXProcess &process) {
+    const bool breakDown = breakDownPhysHeft();
+    const bool sharingDisabled = isSharingAnalysisDisabled();
+    for (HXMemoryRegion &region : process.memoryRegions()) {
+        HXMemoryObject &object = objectForRegion(region, process);
+        if (sharingDisabled)
+            object.addRegion(region, process.pageSize());
+        else
+            object.addRegion(region, process);
+        if (breakDown && region.ownedExclusivelyByParentProcess()) object.setOwnerPid(process.pid());
+        region.setMemoryObject(&object);
+    }
+}
+
+// Every object lives in exactly one of the maps or shares with nothing; together they are all objects.
+void HXHeft::finalizeObjects() {
+    for (HXMemoryObject &object : *_objects)
+        object.finalize();
+}

@@ -1,0 +1,100 @@
+// The analysis: gathers all targets, merges their regions into memory objects, works out who shares what, and
+// drives the report.
+#pragma once
+
+#include "analysis/HXHeftSharingData.h"
+#include "analysis/HXHeftSwitches.h"
+#include "model/HXMemoryCategory.h"
+#include "model/HXMemoryObject.h"
+#include "output/HXOutputFormatter.h"
+#include "platform/HXPlatform.h"
+#include "process/HXProcess.h"
+
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <unordered_map>
+#include <vector>
+
+class HXHeft : public HXHeftSwitches {
+  public:
+    using ProcessList = std::vector<std::unique_ptr<HXProcess>>;
+    using Processes = std::vector<const HXProcess *>;
+
+    explicit HXHeft(ProcessList processes);
+    ~HXHeft();
+
+    // The targets, in the order given.
+    const ProcessList &processes() const { return _processes; }
+
+    // Gathers every process, several at once, then merges and finalises on the calling thread. Once.
+    void gatherData();
+    // Ends gathering early: processes not yet started are left out. Any thread.
+    void cancel() { _earlyExit.store(true, std::memory_order_relaxed); }
+    // Installs a handler of SIGINT that runs `callback` on a thread of its own; null when standard output is
+    // a terminal (the signal then ends the program).
+    static std::unique_ptr<HXDispatchSource> installCancelHandler(std::function<void()> callback);
+
+    // Formatters are not owned and must outlive the report.
+    void addOutputFormatter(HXOutputFormatter &formatter) { _outputFormatters.push_back(&formatter); }
+    // Writes the report, with `verbose` after the full region listings; with `summarize` categories have no
+    // detail. Once: the memory objects are gone afterwards.
+    void printOutputVerbose(bool verbose, bool summarize);
+    void printAtlasLikeOutputForProcesses(const Processes &processes);
+
+    // ---- Steps of the above ----
+    void _addProcess(HXProcess &process);
+    void finalizeObjects();
+    void _buildProcessToHeftMap();
+    uint64_t _calculateHeftForProcess(const HXProcess &process) const;
+    // The shown processes, in target order.
+    Processes _notHiddenProcesses() const;
+    static std::vector<HXProcess *> _processesBySortingPidDesc(const ProcessList &processes);
+    // By descending heft, then by descending pid.
+    Processes _processesBySortingHeft(Processes processes) const;
+    // Made anew on each call.
+    HXHeftSharingData _sharingData() const;
+    // The objects as one process sees them; *hasProcessView (may be null): whether that differs from the
+    // whole objects anywhere.
+    HXCategoryMap _categoriesForObjects(const HXHeftSharingData::Objects &objects, const HXProcess &viewedBy,
+                                        bool *hasProcessView, bool summarize) const;
+    // Each object that a shown process maps once, whole.
+    HXCategoryMap _categoriesForAllProcessesShouldSummarize(bool summarize) const;
+    static void _totalForCategories(const HXCategoryMap &categories, HXMemoryTotal *outTotal);
+
+    // The objects of the analysis, in the order in which they were made.
+    const HXMemoryObjects &memoryObjects() const { return *_objects; }
+
+  private:
+    // A key's low bits tell little: object identifiers are often numbered or aligned.
+    struct KeyHash {
+        size_t operator()(uint64_t key) const {
+            key = (key ^ (key >> 32)) * 0x9E3779B97F4A7C15;
+            return static_cast<size_t>(key ^ (key >> 29));
+        }
+    };
+    using ObjectMap = std::unordered_map<uint64_t, HXMemoryObject *, KeyHash>;
+    struct Report;
+
+    void gatherProcesses();
+    ObjectMap &mapForRegion(const HXMemoryRegion &region, const HXProcess &process);
+    HXMemoryObject &objectForRegion(const HXMemoryRegion &region, const HXProcess &process);
+    HXMemoryObject &newObject();
+    void reportProcess(const HXProcess &process, Report &report, const HXHeftSharingData &sharing,
+                       bool summarize);
+    void reportGroups(const HXProcess &process, const HXHeftSharingData::Groups &groups,
+                      const HXHeftSharingData &sharing, bool summarize);
+
+    ProcessList _processes;
+    std::unordered_map<int32_t, uint64_t> _pidToHeft;
+    std::unique_ptr<HXMemoryObjects>
+        _objects; // all objects: those of the maps, and those that share with nothing
+    ObjectMap _memoryObjects;
+    ObjectMap _sharedCache64MemoryObjects;
+    ObjectMap _sharedCache32MemoryObjects;
+    ObjectMap _textMemoryObjects;
+    ObjectMap _linkeditMemoryObjects;
+    std::vector<HXOutputFormatter *> _outputFormatters;
+    std::atomic<bool> _earlyExit{false};
+};

@@ -1,0 +1,87 @@
+// The report: what the formatters are called with, in which order.
+#include "analysis/HXHeft.h"
+
+struct HXHeft::Report {
+    Processes withWarnings;
+    Processes withErrors;
+    HXAuxTree globalAuxData; // of the shown processes without errors
+};
+
+void HXHeft::printAtlasLikeOutputForProcesses(const Processes &processes) {
+    for (const HXProcess *process : processes)
+        for (HXOutputFormatter *formatter : _outputFormatters)
+            if (formatter->printsAtlasLikeOutput())
+                formatter->printAtlasLikeOutputForProcess(*process, process->memoryRegions());
+}
+
+void HXHeft::reportGroups(const HXProcess &process, const HXHeftSharingData::Groups &groups,
+                          const HXHeftSharingData &sharing, bool summarize) {
+    for (const HXProcessGroup *group : groups) {
+        bool hasProcessView = false;
+        const auto categories = std::make_shared<const HXCategoryMap>(
+            _categoriesForObjects(sharing.objectsOfGroup(*group), process, &hasProcessView, summarize));
+        HXMemoryTotal total;
+        _totalForCategories(*categories, &total);
+        for (HXOutputFormatter *formatter : _outputFormatters) {
+            if (group->processes().size() == 1)
+                formatter->printProcessCategories(*categories, total);
+            else
+                formatter->printSharedCategories(categories, *group, process, hasProcessView, total);
+        }
+    }
+}
+
+void HXHeft::reportProcess(const HXProcess &process, Report &report, const HXHeftSharingData &sharing,
+                           bool summarize) {
+    const bool failed = process.hasErrors();
+    const HXAuxTree auxData = process.auxData();
+    if (!process.warnings().empty()) report.withWarnings.push_back(&process);
+    if (failed)
+        report.withErrors.push_back(&process);
+    else if (auxData)
+        report.globalAuxData = auxData->mergeWithData(report.globalAuxData.get());
+
+    for (HXOutputFormatter *formatter : _outputFormatters) {
+        formatter->printProcessHeader(process);
+        if (!failed) formatter->printProcessTotal(_pidToHeft[process.pid()], process);
+        formatter->endProcessHeader(process);
+    }
+    const HXHeftSharingData::Groups *groups = sharing.groupsOfProcess(process.pid());
+    if (!failed && groups) {
+        reportGroups(process, *groups, sharing, summarize);
+    } else {
+        for (HXOutputFormatter *formatter : _outputFormatters)
+            formatter->printProcessCategories(HXCategoryMap(), HXMemoryTotal());
+    }
+    for (HXOutputFormatter *formatter : _outputFormatters)
+        formatter->printProcessAuxData(auxData.get());
+}
+
+void HXHeft::printOutputVerbose(bool verbose, bool summarize) {
+    const Processes inOrder = _processesBySortingHeft(_notHiddenProcesses());
+    if (verbose) printAtlasLikeOutputForProcesses(inOrder);
+
+    HXHeftSharingData sharing = _sharingData();
+    // The report reads the objects through the sharing data; the maps are not needed any more.
+    sharing.objects = std::move(_objects);
+    for (ObjectMap *map : {&_memoryObjects, &_sharedCache32MemoryObjects, &_sharedCache64MemoryObjects,
+                           &_textMemoryObjects, &_linkeditMemoryObjects})
+        ObjectMap().swap(*map);
+
+    Report report;
+    for (const HXProcess *process : inOrder)
+        reportProcess(*process, report, sharing, summarize);
+
+    const std::vector<std::string> globalErrors = HXProcess::globalErrors();
+    for (HXOutputFormatter *formatter : _outputFormatters)
+        formatter->printProcessesWithWarnings(report.withWarnings, report.withErrors, globalErrors);
+    const HXCategoryMap summary = _categoriesForAllProcessesShouldSummarize(summarize);
+    HXMemoryTotal total;
+    _totalForCategories(summary, &total);
+    const bool hadErrors = !globalErrors.empty() || !report.withErrors.empty();
+    for (HXOutputFormatter *formatter : _outputFormatters) {
+        formatter->printSummaryCategories(summary, total, hadErrors);
+        formatter->printGlobalAuxData(report.globalAuxData.get());
+        formatter->end();
+    }
+}

@@ -1,0 +1,11 @@
+// heft: how much physical memory the kernel charges to processes, and for what.
+#include "cli/HXHeftMain.h"
+#include "platform/HXPlatform.h"
+#include "platform/linux/HXLinuxPlatform.h"
+
+int main(int argc, char *argv[]) {
+    static HXLinuxPlatform platform;
+    platform.prepareProcess();
+    HXPlatform::setCurrent(&platform);
+    return HXHeftMain(argc, argv);
+}

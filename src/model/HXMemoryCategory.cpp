@@ -1,0 +1,59 @@
+#include "model/HXMemoryCategory.h"
+
+#include <algorithm>
+
+void HXMemoryCategory::addMemoryObject(HXMemoryObject::View object) {
+    if (!_memoryObjects.empty()) {
+        if (_members.empty()) _members.insert(_memoryObjects.front().get());
+        if (!_members.insert(object.get()).second) return;
+    }
+    _totalDirtySize += object->totalDirtySize();
+    _totalSwappedSize += object->totalSwappedSize();
+    _totalCleanSize += object->totalCleanSize();
+    _totalReclaimableSize += object->totalReclaimableSize();
+    _totalWiredSize += object->totalWiredSize();
+    _totalRegions = -1;
+    _memoryObjects.push_back(std::move(object));
+}
+
+int32_t HXMemoryCategory::totalRegions() const {
+    if (_totalRegions >= 0) return _totalRegions;
+    std::vector<const HXMemoryRegion *> regions;
+    for (const HXMemoryObject::View &object : _memoryObjects)
+        regions.insert(regions.end(), object->memoryRegions().begin(), object->memoryRegions().end());
+    std::sort(regions.begin(), regions.end());
+    _totalRegions = static_cast<int32_t>(std::unique(regions.begin(), regions.end()) - regions.begin());
+    return _totalRegions;
+}
+
+HXString HXMemoryCategory::name() const {
+    return _memoryObjects.empty() ? HXString() : _memoryObjects.front()->name();
+}
+
+HXString HXMemoryCategory::detailedName() const {
+    return _isSummary || _memoryObjects.empty() ? HXString() : _memoryObjects.front()->detailedName();
+}
+
+std::string HXMemoryCategory::fullName() const {
+    if (_isSummary || _memoryObjects.empty()) return name().str();
+    return _memoryObjects.front()->fullName();
+}
+
+HXMemoryCategory &HXCategoryMap::categoryForObject(const HXMemoryObject &object, HXSegment segment,
+                                                   bool summarize) {
+    const HXMemoryRegion &naming = *object._canonicalRegion();
+    const NamePair names = {naming.name().identity(), summarize ? nullptr : naming.detailedName().identity()};
+    const auto known = _byName.find(names);
+    if (known != _byName.end()) return *_entries[known->second].category;
+
+    std::string key = summarize ? naming.name().str() : naming.fullName();
+    const auto [position, isNew] = _byKey.try_emplace(key, _entries.size());
+    if (isNew) _entries.push_back({std::move(key), std::make_unique<HXMemoryCategory>(segment, summarize)});
+    _byName.emplace(names, position->second);
+    return *_entries[position->second].category;
+}
+
+const HXMemoryCategory *HXCategoryMap::get(const std::string &key) const {
+    const auto found = _byKey.find(key);
+    return found == _byKey.end() ? nullptr : _entries[found->second].category.get();
+}

@@ -1,0 +1,72 @@
+// The report as one JSON document without white space, written to a file as it arrives.
+#pragma once
+
+#include "output/HXOutputFormatter.h"
+
+#include <cstdio>
+#include <optional>
+
+class HXOutputFormatterJSON : public HXOutputFormatter {
+  public:
+    // Opens (creates or truncates) the file and begins the document; null with errno set when the file cannot
+    // be opened.
+    static std::unique_ptr<HXOutputFormatterJSON> withPath(const std::string &path);
+    ~HXOutputFormatterJSON() override;
+
+    void printProcessHeader(const HXProcess &process) override;
+    void endProcessHeader(const HXProcess &) override {}
+    void printProcessTotal(uint64_t heft, const HXProcess &process) override;
+    void printProcessCategories(const HXCategoryMap &categories, const HXMemoryTotal &total) override;
+    void printSharedCategories(const std::shared_ptr<const HXCategoryMap> &categories,
+                               const HXProcessGroup &group, const HXProcess &process, bool hasProcessView,
+                               const HXMemoryTotal &total) override;
+    void printProcessAuxData(const HXAuxDictionary *data) override;
+    void printProcessesWithWarnings(const Processes &withWarnings, const Processes &withErrors,
+                                    const std::vector<std::string> &globalErrors) override;
+    void printSummaryCategories(const HXCategoryMap &categories, const HXMemoryTotal &total,
+                                bool hadErrors) override;
+    void printGlobalAuxData(const HXAuxDictionary *data) override;
+    // Completes the document and closes the file.
+    void end() override;
+    bool printsAtlasLikeOutput() const override { return true; }
+    void printAtlasLikeOutputForProcess(const HXProcess &, const HXMemoryRegionList &) override {
+        _verbose = true;
+    }
+
+    void JSONForCategories(const HXCategoryMap &categories);
+    void JSONForAuxData(const HXAuxDataType *data);
+
+    // The errno of the first write that failed, known after `end`; 0 when all is written.
+    int writeError() const { return _writeError; }
+
+  private:
+    struct SharedEntry {
+        std::vector<int32_t> pids;
+        std::shared_ptr<const HXCategoryMap> categories;
+        std::optional<int32_t> specificToPid; // whose view it is
+    };
+
+    explicit HXOutputFormatterJSON(std::FILE *stream);
+    // The writer's four steps. A key comes with its quotes and colon.
+    void key(const char *literal);
+    void open(char bracket);
+    void close(char bracket);
+    void number(uint64_t value);
+    void signedNumber(int64_t value);
+    void text(const std::string &value);
+    void texts(const char *literal, const std::vector<std::string> &values);
+    void member(const char *literal, uint64_t value);
+    void sizes(uint64_t dirty, uint64_t swapped, uint64_t clean, uint64_t reclaimable, uint64_t wired,
+               uint32_t regions);
+    void region(const HXMemoryRegion &region);
+    void sharedEntry(const SharedEntry &entry);
+    void noteFailure();
+
+    bool _verbose = false; // region lists are written
+    std::vector<SharedEntry> _shared;
+    std::unordered_set<const HXProcessGroup *> _addedProcessGroups; // those without a process view
+    uint32_t _pageSize = 0;                                         // that of the first process
+    std::FILE *_stream;
+    bool _needsComma = false;
+    int _writeError = 0;
+};

@@ -1,0 +1,45 @@
+// The region-by-region listing.
+#include "output/HXOutputFormatterText.h"
+
+#include <cinttypes>
+
+void HXOutputFormatterText::printAtlasLikeOutputForProcess(const HXProcess &process,
+                                                           const HXMemoryRegionList &regions) {
+    const auto optional = [](bool shown, const char *text) { return shown ? text : ""; };
+    const auto width = [](bool shown) { return shown ? 8 : 0; };
+    fprintf(_output, "%s\n\n", process.displayString().c_str());
+    fprintf(_output,
+            "           start                end  [objectid]      VRT     DRT%*s     CLN     RCL%*s   tag "
+            "(detail)\n",
+            width(showsSwapped()), optional(showsSwapped(), "     SWP"), width(showsWired()),
+            optional(showsWired(), "    WIRE"));
+    fprintf(_output,
+            "      ----------         ----------  ----------    -----   -----%*s   -----   -----%*s   "
+            "------------\n",
+            width(showsSwapped()), optional(showsSwapped(), "   -----"), width(showsWired()),
+            optional(showsWired(), "   -----"));
+    for (const HXMemoryRegion &region : regions)
+        printRegion(region, process.pageSize());
+    fputc('\n', _output);
+}
+
+void HXOutputFormatterText::printRegion(const HXMemoryRegion &region, uint64_t pageSize) {
+    constexpr uint64_t objectIdBits = 0xFFFFFFFFFF; // the low 40
+    const auto pages = [pageSize](uint64_t size) { return (size + pageSize - 1) / pageSize; };
+    const uint64_t id = region.object_id() & objectIdBits;
+    if (region.start() == kNoAddress)
+        fprintf(_output, "        unmapped -         unmapped [%10" PRIx64 "]", id);
+    else
+        fprintf(_output, "%16" PRIx64 " - %16" PRIx64 " [%10" PRIx64 "]", region.start(),
+                region.start() + region.size(), id);
+    fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.size()),
+            pages(region.dirtySize() + region.swappedSize()));
+    if (showsSwapped()) fprintf(_output, " %7" PRIu64, pages(region.swappedSize()));
+    fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.cleanNonSpecSize()),
+            pages(region.reclaimableSize()));
+    if (showsWired()) fprintf(_output, " %7" PRIu64, pages(region.wiredSize()));
+    fprintf(_output, "   %s", region.name().c_str());
+    if (const HXString detail = _truncatedNameForString(region.detailedName()))
+        fprintf(_output, " %s", detail.c_str());
+    fputc('\n', _output);
+}

@@ -1,0 +1,89 @@
+// Parsers of the kernel's own reports on its memory. They take the text of a file under /proc and give
+// records; lines that do not have the expected form are passed over, for the kernel's formats grow by lines
+// and words. Every `std::string_view` in a record points into the text that was parsed. Names are as the
+// kernel wrote them, not yet made safe.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+// One cache of /proc/slabinfo, version 2.x (slabinfo(5)).
+struct HXSlabCache {
+    std::string_view name;
+    uint64_t activeObjects = 0;
+    uint64_t objectSize = 0; // bytes
+    uint64_t slabs = 0;
+    uint64_t pagesPerSlab = 0;
+    // Whether the kernel accounts its slabs as SReclaimable; none where sysfs does not tell. Not in slabinfo.
+    std::optional<bool> reclaimable;
+};
+std::vector<HXSlabCache> HXParseSlabinfo(std::string_view text);
+
+// One area of /proc/vmallocinfo that has pages of its own. Areas without `pages=` map memory that is counted
+// elsewhere or is none: device memory (`ioremap`), the pages of others (`vmap` without pages, `vm_map_ram`),
+// per-CPU space (`pcpu_get_vm_areas`, counted as Percpu), and freed areas that are not yet unmapped
+// (`unpurged`).
+struct HXVmallocArea {
+    std::string_view function;  // the caller's symbol without its offset; empty when it is not named
+    std::string_view module;    // the module the caller lies in; empty for the kernel proper
+    uint64_t callerAddress = 0; // when the caller is no symbol: its address
+    uint64_t pages = 0;
+};
+std::vector<HXVmallocArea> HXParseVmallocinfo(std::string_view text);
+
+// One module of /proc/modules.
+struct HXKernelModule {
+    std::string_view name;
+    uint64_t size = 0; // bytes of code and data, without what is freed after initialisation
+};
+std::vector<HXKernelModule> HXParseModules(std::string_view text);
+
+// The fields of /proc/meminfo that describe the kernel's memory, in bytes; 0 for those that this kernel
+// lacks.
+struct HXKernelMeminfo {
+    uint64_t totalSize = 0;
+    uint64_t slabReclaimableSize = 0;
+    uint64_t slabUnreclaimableSize = 0;
+    uint64_t kernelStackSize = 0;
+    uint64_t pageTableSize = 0;
+    uint64_t secondaryPageTableSize = 0; // of virtual machines (since 6.1)
+    uint64_t vmallocUsedSize = 0;        // 0 before 5.3, which did not count it
+    uint64_t perCpuSize = 0;             // since 4.20
+    uint64_t mlockedSize = 0;
+    uint64_t zswapSize = 0; // the pool's pages (since 5.19)
+    uint64_t hardwareCorruptedSize = 0;
+    uint64_t balloonSize = 0; // since 6.15
+};
+// None when the text has no MemTotal.
+std::optional<HXKernelMeminfo> HXParseKernelMeminfo(std::string_view text);
+
+// Pages of RAM that the kernel found, whether or not it manages them: the `present` figures of /proc/zoneinfo
+// added up.
+uint64_t HXParseZoneinfoPresentPages(std::string_view text);
+
+// Bytes that a zram device holds (`mem_used_total` of its mm_stat); 0 when there is no such figure.
+uint64_t HXParseZramUsedSize(std::string_view text);
+
+// One allocation site of /proc/allocinfo (kernels with memory allocation profiling, since 6.10).
+struct HXAllocationSite {
+    uint64_t size = 0; // bytes
+    std::string_view path;
+    int32_t line = 0;
+    std::string_view module; // empty for the kernel proper
+    std::string_view function;
+};
+std::vector<HXAllocationSite> HXParseAllocinfo(std::string_view text);
+
+// One symbol of /proc/kallsyms.
+struct HXKernelSymbol {
+    uint64_t address = 0;
+    std::string_view name;
+    std::string_view module; // empty for the kernel proper
+    bool isCode = false;
+};
+// All symbols, by ascending address; several at one address in the order of the file, whose first is the one
+// that the kernel itself names the address by. Empty when the kernel hides its addresses by showing zeros.
+std::vector<HXKernelSymbol> HXParseKallsyms(std::string_view text);

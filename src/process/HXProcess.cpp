@@ -1,0 +1,140 @@
+#include "process/HXProcess.h"
+
+#include "analysis/HXHeftSwitches.h"
+#include "platform/HXPlatform.h"
+#include "process/HXKernelProcess.h"
+#include "process/HXUserProcess.h"
+
+#include <algorithm>
+#include <cstring>
+
+namespace {
+
+constexpr int32_t CTL_KERN = 1;
+constexpr int32_t KERN_ARGMAX = 8;
+constexpr int32_t KERN_PROCARGS2 = 49;
+
+std::vector<std::string> &globalErrorList() {
+    static std::vector<std::string> list;
+    return list;
+}
+
+std::string textOfField(const char *field, size_t width) {
+    return std::string(field, strnlen(field, width));
+}
+
+// The path in an argument area: after the count's first zero byte and the zeros that follow it. None when the
+// area ends first. The count is a little-endian word, so for counts below 256 this is the executable's path.
+std::optional<std::string_view> pathInArgumentArea(char *area, size_t length) {
+    if (length == 0) return std::nullopt;
+    area[length - 1] = '\0';
+    size_t i = 0;
+    while (i < length && area[i] != '\0')
+        i++;
+    while (i < length && area[i] == '\0')
+        i++;
+    if (i >= length) return std::nullopt;
+    return std::string_view(area + i);
+}
+
+} // namespace
+
+std::string_view HXLastPathComponent(std::string_view path) {
+    while (path.size() > 1 && path.back() == '/')
+        path.remove_suffix(1);
+    if (path == "/") return path;
+    const size_t slash = path.rfind('/');
+    return slash == std::string_view::npos ? path : path.substr(slash + 1);
+}
+
+void HXPidDescriptions::set(int32_t pid, Description description) {
+    const auto [position, isNew] = _index.try_emplace(pid, _entries.size());
+    if (isNew)
+        _entries.push_back({pid, std::move(description)});
+    else
+        _entries[position->second].description = std::move(description);
+}
+
+void HXPidDescriptions::remove(int32_t pid) {
+    const auto found = _index.find(pid);
+    if (found == _index.end()) return;
+    const size_t removed = found->second;
+    _entries.erase(_entries.begin() + static_cast<std::ptrdiff_t>(removed));
+    _index.erase(found);
+    for (auto &[other, position] : _index)
+        if (position > removed) position--;
+}
+
+std::unique_ptr<HXProcess> HXProcess::processWithBsdInfo(const proc_bsdinfo &info) {
+    std::unique_ptr<HXProcess> process;
+    if (info.pbi_flags & PROC_FLAG_SYSTEM)
+        process = std::make_unique<HXKernelProcess>();
+    else
+        process = std::make_unique<HXUserProcess>();
+    return process->initWithBsdInfo(info) ? std::move(process) : nullptr;
+}
+
+std::unique_ptr<HXProcess> HXProcess::processWithPid(int32_t pid) {
+    proc_bsdinfo info{};
+    const int32_t length = HXPlatform::current().proc_pidinfo(pid, PROC_PIDTBSDINFO, 0, &info, sizeof info);
+    if (length != static_cast<int32_t>(sizeof info)) return nullptr;
+    return processWithBsdInfo(info);
+}
+
+bool HXProcess::initWithBsdInfo(const proc_bsdinfo &info) {
+    _pid = info.pbi_pid;
+    _is64bit = (info.pbi_flags & PROC_FLAG_LP64) != 0;
+    if (!_populateTask()) return false;
+    _name = _nameForBsdInfo(info);
+    _displayString = _name + " [" + std::to_string(_pid) + "]";
+    _pageSize = _gatherPageSize();
+    return true;
+}
+
+uint32_t HXProcess::_gatherPageSize() {
+    return HXPlatform::current().vm_kernel_page_size();
+}
+
+bool HXProcess::breakDownPhysHeft() const {
+    return HXHeftSwitches::breakDownPhysHeft();
+}
+
+std::string HXProcess::description() const {
+    return "HXProcess[" + std::to_string(_pid) + "]";
+}
+
+void HXProcess::_addGlobalError(std::string error) {
+    globalErrorList().push_back(std::move(error));
+}
+
+void HXProcess::_clearGlobalErrors() {
+    globalErrorList().clear();
+}
+
+std::vector<std::string> HXProcess::globalErrors() {
+    return globalErrorList();
+}
+
+std::string HXProcess::_nameForBsdInfoCommName(const proc_bsdinfo &info) {
+    if (info.pbi_name[0] != '\0') return textOfField(info.pbi_name, sizeof info.pbi_name);
+    if (info.pbi_comm[0] != '\0') return textOfField(info.pbi_comm, sizeof info.pbi_comm);
+    return "Unknown";
+}
+
+std::string HXProcess::_nameForBsdInfo(const proc_bsdinfo &info) {
+    HXPlatform &platform = HXPlatform::current();
+    const int32_t maximumName[] = {CTL_KERN, KERN_ARGMAX};
+    int32_t maximum = 0;
+    size_t length = sizeof maximum;
+    if (platform.sysctl(maximumName, 2, &maximum, &length) != 0 || maximum <= 0)
+        return _nameForBsdInfoCommName(info);
+
+    const std::unique_ptr<char[]> area(new (std::nothrow) char[static_cast<size_t>(maximum)]);
+    if (!area) return _nameForBsdInfoCommName(info);
+    const int32_t areaName[] = {CTL_KERN, KERN_PROCARGS2, info.pbi_pid};
+    length = static_cast<size_t>(maximum);
+    if (platform.sysctl(areaName, 3, area.get(), &length) != 0) return _nameForBsdInfoCommName(info);
+
+    const auto path = pathInArgumentArea(area.get(), length);
+    return path ? std::string(HXLastPathComponent(*path)) : _nameForBsdInfoCommName(info);
+}

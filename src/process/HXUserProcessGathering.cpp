@@ -1,0 +1,305 @@
+// From the walk to the list of regions.
+#include "analysis/HXHeftSwitches.h"
+#include "platform/HXPlatform.h"
+#include "process/HXUserProcess.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+namespace {
+
+// The user tag of memory that several processes have a hand in: never taken as owned by the one that maps it.
+constexpr uint32_t kNeverOwnedTag = 87;
+
+constexpr char kOwnedObjectsSetting[] = "vm.get_owned_vmobjects";
+
+// Pages of `all` that are left after `taken`; a kernel whose counts disagree leaves none.
+uint64_t pagesLeft(uint64_t all, uint64_t taken) {
+    return all > taken ? all - taken : 0;
+}
+
+} // namespace
+
+// What one gathering's walk and its closing steps share.
+struct HXUserProcess::Gathering {
+    HXMemoryRegionList regions;
+    HXImageEnumerator enumerator;
+    bool hidden;
+    bool breakDown;
+    bool sharingDisabled;
+    std::optional<HXMemoryRegion> unmappedRegion; // built from the kernel's fake region
+    // Dirty and swapped bytes charged to mapped regions from owned objects: the kernel's fake region counts
+    // them, too.
+    uint64_t attributed = 0;
+};
+
+void HXUserProcess::gatherData() {
+    if (!hiddenFromDisplay()) {
+        _gatherImageData();
+        _gatherPhysHeft();
+        _ownedVmObjects = _gatherOwnedVmObjects();
+    }
+    _gatherMemoryData();
+    _images = {};
+    releaseTask();
+}
+
+std::optional<HXOwnedVmObjects> HXUserProcess::_gatherOwnedVmObjects() {
+    constexpr size_t slack = 0x380; // sixteen objects that appear between two calls
+    if (!HXHeftSwitches::breakDownPhysHeft()) return std::nullopt;
+    HXPlatform &platform = HXPlatform::current();
+    size_t size = 0;
+    if (platform.sysctlbyname(kOwnedObjectsSetting, nullptr, &size, &_task, sizeof _task) != 0) {
+        if (errno != ENOENT) _addErrnoWarningWithDescription(kOwnedObjectsSetting);
+        return std::nullopt;
+    }
+    HXOwnedVmObjects objects;
+    if (size == 0) return objects;
+
+    std::vector<unsigned char> reply;
+    size_t length = 0;
+    do {
+        size += slack;
+        reply.resize(size);
+        length = size;
+        if (platform.sysctlbyname(kOwnedObjectsSetting, reply.data(), &length, &_task, sizeof _task) != 0) {
+            _addErrnoWarningWithDescription(kOwnedObjectsSetting);
+            return std::nullopt;
+        }
+    } while (length == size); // a full buffer may have cut the reply
+    if (length == 0) return objects;
+
+    uint64_t count = 0;
+    HXRequire(length >= sizeof count, "_gatherOwnedVmObjects", "the reply holds a count");
+    memcpy(&count, reply.data(), sizeof count);
+    HXRequire(count <= (length - sizeof count) / sizeof(owned_vmobject), "_gatherOwnedVmObjects",
+              "the reply holds all its records");
+    for (uint64_t i = 0; i < count; i++) {
+        owned_vmobject object;
+        memcpy(&object, reply.data() + sizeof count + i * sizeof object, sizeof object);
+        objects.add(object);
+    }
+    return objects;
+}
+
+void HXUserProcess::_gatherMemoryData() {
+    Gathering gathering{.regions = {},
+                        .enumerator = HXImageEnumerator(_images),
+                        .hidden = hiddenFromDisplay(),
+                        .breakDown = breakDownPhysHeft(),
+                        .sharingDisabled = HXHeftSwitches::isSharingAnalysisDisabled(),
+                        .unmappedRegion = std::nullopt};
+    enumerateRegions([&](uint64_t start, uint64_t size, const vm_region_submap_info_64 &info,
+                         int32_t purgeState, std::optional<std::string_view> path) {
+        return addRegion(gathering, start, size, info, purgeState, path);
+    });
+    addUnmappedOwnedObjects(gathering);
+    addUnmappedHeft(gathering);
+    addPageTables(gathering);
+    _memoryRegions = std::move(gathering.regions);
+}
+
+// Returns true to stop the walk.
+bool HXUserProcess::addRegion(Gathering &gathering, uint64_t start, uint64_t size,
+                              const vm_region_submap_info_64 &info, int32_t purgeState,
+                              std::optional<std::string_view> path) {
+    if (inSharedRegion(start)) {
+        if (gathering.hidden ||
+            _addRegionsToArray(gathering.regions, start, size, info, gathering.enumerator))
+            return false;
+        printBailingOut();
+        return true;
+    }
+    HXMemoryRegion region;
+    region.setStart(start);
+    region.setSize(size);
+    region.setUser_tag(info.user_tag);
+    region.setObject_id(info.object_id_full);
+    region.setShare_mode(info.share_mode);
+    region.setOffset(info.offset);
+    region.setWired(info.user_wired_count != 0);
+
+    bool isUnmappedRegion = false;
+    if (purgeState == VM_PURGABLE_VOLATILE) {
+        region.setReclaimableSize(uint64_t{info.pages_resident} * pageSize());
+    } else if (purgeState == VM_PURGABLE_EMPTY) {
+        region.setReclaimableSize(size);
+    } else {
+        setSizes(region, gathering, info);
+        if (info.user_tag == kFakeRegionTag) {
+            if (_ownedVmObjects) return false; // the owned objects stand for that memory instead
+            if (info.object_id_full == 0) region.setObject_id(info.object_id);
+            isUnmappedRegion = true;
+        }
+    }
+    nameRegion(region, gathering, info, purgeState, path);
+    if (gathering.breakDown && !gathering.sharingDisabled && !gathering.hidden &&
+        region.eligibleForSubrangesUsingPageSize(pageSize()))
+        _addSubrangesForRegion(region, purgeState);
+
+    if (isUnmappedRegion)
+        gathering.unmappedRegion = std::move(region);
+    else
+        gathering.regions.push_back(std::move(region));
+    return false;
+}
+
+void HXUserProcess::setSizes(HXMemoryRegion &region, const Gathering &gathering,
+                             const vm_region_submap_info_64 &info) const {
+    const uint64_t dirtyPages = info.external_pager || gathering.breakDown
+                                    ? info.pages_dirtied
+                                    : pagesLeft(info.pages_resident, info.pages_reusable);
+    region.setDirtySize(dirtyPages * pageSize());
+    region.setReclaimableSize(uint64_t{info.pages_reusable} * pageSize());
+    region.setSwappedSize(uint64_t{info.pages_swapped_out} * pageSize());
+    region.setCleanNonSpecSize(pagesLeft(info.pages_resident, dirtyPages + info.pages_reusable) * pageSize());
+}
+
+void HXUserProcess::nameRegion(HXMemoryRegion &region, Gathering &gathering,
+                               const vm_region_submap_info_64 &info, int32_t purgeState,
+                               std::optional<std::string_view> path) {
+    static const HXString mappedFile = HXString::intern("mapped file");
+    region.setSegment(HXSegmentNoImage);
+    const uint64_t end = region.start() + region.size();
+    if (const HXImage *image = gathering.enumerator.nextImageForStart(region.start(), end)) {
+        region.setName(image->name());
+        region.setDetailedName(image->ownerPath());
+        region.setSegment(image->segment());
+    } else if (path || info.external_pager) {
+        region.setName(mappedFile);
+        if (path) region.setDetailedName(*path);
+    } else {
+        region.setName(HXMemoryRegion::categoryNameForTag(info.user_tag));
+        if (gathering.breakDown) chargeOwnedObject(region, gathering, info, purgeState);
+    }
+}
+
+void HXUserProcess::chargeOwnedObject(HXMemoryRegion &region, Gathering &gathering,
+                                      const vm_region_submap_info_64 &info, int32_t purgeState) {
+    if (_ownedVmObjects) {
+        const auto object = _ownedVmObjects->take(info.object_id_full);
+        if (!object) return;
+        const HXOwnedCharge charge = HXChargeOfOwnedObject(*object);
+        region.setOwnedExclusivelyByParentProcess(true);
+        region.setReclaimableSize(object->reusable_size);
+        region.setDirtySize(charge.dirty);
+        region.setSwappedSize(charge.swapped);
+        region.setCleanNonSpecSize(0);
+        gathering.attributed += charge.dirty + charge.swapped;
+    } else if (purgeState != VM_PURGABLE_DENY && info.user_tag != kNeverOwnedTag &&
+               info.pages_resident != 0) {
+        region.setOwnedExclusivelyByParentProcess(true);
+        region.setDirtySize(region.dirtySize() + region.cleanNonSpecSize());
+        region.setCleanNonSpecSize(0);
+        region.setSwappedSize(0);
+        gathering.attributed += region.dirtySize();
+    }
+}
+
+// Owned objects that no mapping showed become regions without an address.
+void HXUserProcess::addUnmappedOwnedObjects(Gathering &gathering) {
+    if (!_ownedVmObjects) return;
+    _ownedVmObjects->forEach([&](const owned_vmobject &object) {
+        const HXOwnedCharge charge = HXChargeOfOwnedObject(object);
+        HXMemoryRegion &region = gathering.regions.emplace_back();
+        region.setObject_id(object.object_id);
+        region.setOwnedExclusivelyByParentProcess(true);
+        region.setUser_tag(kFakeRegionTag);
+        region.setName(HXMemoryRegion::categoryNameForTag(kFakeRegionTag));
+        region.setSize(object.virtual_size);
+        region.setReclaimableSize(object.reusable_size);
+        region.setStart(kNoAddress);
+        region.setShare_mode(SM_SHARED);
+        region.setDirtySize(charge.dirty);
+        region.setSwappedSize(charge.swapped);
+        region.setWired(object.wired_size != 0);
+    });
+    _ownedVmObjects.reset();
+}
+
+// What the kernel's fake region holds beyond the bytes that mapped regions were already charged for.
+void HXUserProcess::addUnmappedHeft(Gathering &gathering) {
+    if (!gathering.unmappedRegion) return;
+    HXMemoryRegion &region = *gathering.unmappedRegion;
+    const uint64_t fromDirty = std::min(gathering.attributed, region.dirtySize());
+    const uint64_t fromSwapped = std::min(gathering.attributed - fromDirty, region.swappedSize());
+    const uint64_t excess = gathering.attributed - fromDirty - fromSwapped;
+    region.setDirtySize(region.dirtySize() - fromDirty);
+    region.setSwappedSize(region.swappedSize() - fromSwapped);
+    if (excess != 0)
+        _warnings.push_back(displayString() +
+                            ": Heft changed while analyzing \u2013 unmapped owned physical heft may be "
+                            "over-counted by " +
+                            std::to_string(excess) + " bytes");
+    if (region.dirtySize() == 0 && region.swappedSize() == 0) return;
+    region.setStart(kNoAddress);
+    gathering.regions.push_back(std::move(region));
+}
+
+void HXUserProcess::addPageTables(Gathering &gathering) {
+    if (!gathering.breakDown || _ledgers[0] == 0) return;
+    HXMemoryRegion &region = gathering.regions.emplace_back();
+    region.setSize(_ledgers[0]);
+    region.setDirtySize(_ledgers[0]);
+    region.setStart(kNoAddress);
+    region.setName("page table");
+    region.setObject_id(UINT64_MAX);
+    region.setShare_mode(SM_PRIVATE);
+}
+
+// A region of the cut with the fields that all pieces of an entry have in common, appended to the list.
+HXMemoryRegion &HXUserProcess::appendCut(HXMemoryRegionList &regions, uint64_t cursor, uint64_t entryStart,
+                                         const vm_region_submap_info_64 &info) const {
+    HXMemoryRegion &region = regions.emplace_back();
+    region.setStart(cursor);
+    region.setUser_tag(info.user_tag);
+    region.setObject_id(info.object_id_full);
+    region.setShare_mode(info.share_mode);
+    region.setOffset(info.offset + (cursor - entryStart));
+    region.setInSharedCache(true);
+    region.setWired(info.user_wired_count != 0);
+    return region;
+}
+
+bool HXUserProcess::_addRegionsToArray(HXMemoryRegionList &regions, uint64_t start, uint64_t size,
+                                       const vm_region_submap_info_64 &info, HXImageEnumerator &enumerator) {
+    const uint64_t end = start + size;
+    const uint64_t alignment = _sharedRegionAlignmentSize;
+    const bool writable = info.max_protection & VM_PROT_WRITE;
+    const auto isPageAligned = [&](uint64_t address) { return address % pageSize() == 0; };
+    const auto populate = [&](HXMemoryRegion &region) {
+        if (_populateMemoryRegionWithPageQueries(region, info)) return true;
+        regions.pop_back();
+        _pendingUnusedSharedRegion = nullptr;
+        return false;
+    };
+    _pendingUnusedSharedRegion = nullptr;
+    const HXImage *image = enumerator.nextImageForStart(start, end);
+    for (uint64_t cursor = start; cursor < end;) {
+        if (!image || cursor < image->start()) {
+            HXMemoryRegion &gap = appendCut(regions, cursor, start, info);
+            gap.setEnd(image && image->start() < end ? image->start() : end);
+            gap.setName("unused dyld shared cache area");
+            gap.setUnusedSharedCacheRegion(true);
+            if (writable && !(isPageAligned(gap.start()) && isPageAligned(gap.end())) && !populate(gap))
+                return false;
+            cursor = gap.end();
+            if (cursor >= end || !image) return true;
+        }
+        HXMemoryRegion &piece = appendCut(regions, std::max(image->start(), cursor), start, info);
+        piece.setEnd(std::min(image->end(), end));
+        const HXImage *next = enumerator.nextImageForStart(piece.end(), end);
+        const uint64_t nextStart = next ? next->start() : 0;
+        if (next != image && piece.start() % alignment == 0 && nextStart % alignment == 0)
+            piece.setEnd((piece.end() + alignment - 1) / alignment * alignment);
+        static const HXString sharedCache = HXString::intern("dyld shared cache");
+        piece.setName(image->name());
+        piece.setDetailedName(image->segment() == HXSegmentLinkedit ? sharedCache : image->ownerPath());
+        piece.setSegment(image->segment());
+        if (writable && !populate(piece)) return false;
+        cursor = piece.end();
+        image = next;
+    }
+    return true;
+}
