@@ -2,6 +2,7 @@
 
 #include "platform/HXSafeText.h"
 
+#include <bit>
 #include <cerrno>
 #include <charconv>
 #include <cstring>
@@ -53,6 +54,19 @@ bool HXCaptureReader::fail(std::string_view problem, std::string_view quoted) {
     constexpr size_t shownBytes = 60;
     const std::string safe = HXSafeText(quoted.substr(0, shownBytes));
     return fail(std::string(problem) + " \"" + safe + (quoted.size() > shownBytes ? "…\"" : "\""));
+}
+
+bool HXCaptureReader::checkPlace(uint64_t address, uint64_t size) {
+    constexpr uint64_t longest = uint64_t{1} << 57;
+    if (size == 0) return fail("a length of 0");
+    if (size > longest) return fail("it is longer than 2^57 bytes");
+    if (address > UINT64_MAX - size) return fail("it ends beyond the address space");
+    return true;
+}
+
+bool HXCaptureReader::checkPageSize(uint32_t pageSize) {
+    const bool fits = std::has_single_bit(pageSize) && pageSize >= 4096 && pageSize <= 65536;
+    return fits || fail("page_size is no power of two from 4096 to 65536");
 }
 
 bool HXCaptureReader::next() {

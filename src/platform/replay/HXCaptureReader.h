@@ -42,6 +42,11 @@ class HXCaptureReader {
     // The same, quoting text of the file.
     bool fail(std::string_view problem, std::string_view quoted);
 
+    // Fails the load unless `size` is 1 byte to 2^57 and [address, address + size) ends within 64 bits.
+    bool checkPlace(uint64_t address, uint64_t size);
+    // Fails the load unless it is a power of two from 4096 to 65536.
+    bool checkPageSize(uint32_t pageSize);
+
     // The current record: its index in the format's table, and its fields by their index in the record's.
     size_t kind() const { return _kind; }
     bool has(size_t field) const { return (_seen >> field & 1) != 0; }

@@ -3,7 +3,7 @@
 #include "platform/HXSafeText.h"
 #include "platform/replay/HXMachineFormat.h"
 
-#include <bit>
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
@@ -14,7 +14,6 @@ namespace {
 constexpr size_t kCommBytes = sizeof proc_bsdinfo::pbi_comm;
 constexpr size_t kNameBytes = sizeof proc_bsdinfo::pbi_name;
 constexpr size_t kPathBytes = 1024;
-constexpr uint64_t kMaxMappingSize = uint64_t{1} << 57;
 
 // Fills a field of fixed width; zeros follow a text that is shorter.
 template <size_t N>
@@ -95,15 +94,8 @@ bool HXMachineReader::findProcess() {
     return true;
 }
 
-bool HXMachineReader::checkPlace(uint64_t address, uint64_t size) {
-    if (size == 0) return _reader.fail("a length of 0");
-    if (size > kMaxMappingSize) return _reader.fail("longer than 2^57 bytes");
-    if (address > UINT64_MAX - size) return _reader.fail("it ends beyond the address space");
-    return true;
-}
-
 bool HXMachineReader::checkMapping(uint64_t address, uint64_t size, uint64_t previousEnd) {
-    if (!checkPlace(address, size)) return false;
+    if (!_reader.checkPlace(address, size)) return false;
     if ((address | size) % _machine.host.pageSize != 0)
         return _reader.fail("address or size is no multiple of the page size");
     if (address < previousEnd) return _reader.fail("it overlaps the mapping before it or does not ascend");
@@ -259,7 +251,7 @@ bool HXMachineReader::readSegment() {
     if (!findProcess()) return false;
     if (_process->images.empty()) return _reader.fail("a segment before an image of its process");
     const uint64_t start = _reader.number(Segment::start), size = _reader.number(Segment::size);
-    if (!checkPlace(start, size)) return false;
+    if (!_reader.checkPlace(start, size)) return false;
     _process->segments.push_back({start, size, internText(Segment::name)});
     return true;
 }
@@ -359,8 +351,7 @@ bool HXMachineReader::readHost() {
     _hasHost = true;
     HXMachineHost &host = _machine.host;
     host.pageSize = number32(Host::pageSize);
-    if (!std::has_single_bit(host.pageSize) || host.pageSize < 4096 || host.pageSize > 65536)
-        return _reader.fail("page_size is no power of two from 4096 to 65536");
+    if (!_reader.checkPageSize(host.pageSize)) return false;
     host.argMax = number32(Host::argMax);
     host.pid = signed32(Host::pid);
     host.euid = number32(Host::euid);

@@ -33,7 +33,6 @@ class HXMachineReader {
     bool readHost();
 
     bool findProcess();
-    bool checkPlace(uint64_t address, uint64_t size);
     bool checkMapping(uint64_t address, uint64_t size, uint64_t previousEnd);
     bool addExtra(HXMachineRegion &region);
     bool addPageRuns(HXMachineRegion &region, std::string_view text);
