@@ -1,0 +1,128 @@
+#include "process/HXMemgraphProcess.h"
+
+#include "platform/HXPlatform.h"
+
+#include <cerrno>
+#include <system_error>
+
+namespace {
+
+// Longer than any graph of a process; what is longer is no graph.
+constexpr uint64_t kLongestFile = uint64_t{4} << 30;
+
+enum { initializationFailed = 1, unknownPlatform = 2 };
+
+bool fail(HXError *error, int code, const char *description) {
+    if (error) *error = HXError(HXHeftErrorDomain, code, description);
+    return false;
+}
+
+} // namespace
+
+HXSharedRegionPlatform HXPlatformOfDescription(const std::string &description) {
+    const auto contains = [&](const char *word) { return description.find(word) != std::string::npos; };
+    if (contains("X86-64")) return HXPlatformIntel64;
+    if (contains("X86")) return HXPlatformIntel32;
+    const size_t arm64 = description.find("ARM64");
+    if (arm64 != std::string::npos)
+        return description.compare(arm64 + 5, 3, "-32") == 0 ? HXPlatformARM64_32 : HXPlatformARM64;
+    return contains("ARM") ? HXPlatformARM32 : HXPlatformUnknown;
+}
+
+std::unique_ptr<HXMemgraphProcess> HXMemgraphProcess::processWithMemgraph(const std::string &path,
+                                                                          HXError *error) {
+    auto process = std::make_unique<HXMemgraphProcess>();
+    return process->initWithMemgraph(path, error) ? std::move(process) : nullptr;
+}
+
+bool HXMemgraphProcess::initWithMemgraph(const std::string &path, HXError *error) {
+    if (error) *error = HXError();
+    const auto data = HXPlatform::current().readFile(path, kLongestFile);
+    if (!data) {
+        const int failure = errno;
+        if (error)
+            *error = HXError(HXPOSIXErrorDomain, failure,
+                             std::error_code(failure, std::generic_category()).message());
+        return false;
+    }
+    std::string reason;
+    _graph = GXProcessObjectGraph::directedGraphWithData(*data, &reason);
+    if (!_graph)
+        return fail(error, initializationFailed,
+                    reason.empty() ? "memgraph initialization failed with unknown error" : reason.c_str());
+
+    proc_bsdinfo info{};
+    info.pbi_flags = _graph->is64bit() ? PROC_FLAG_LP64 : 0;
+    info.pbi_pid = _graph->pid();
+    if (!initWithBsdInfo(info)) return false;
+    setName(_graph->processName());
+    setDisplayString(name() + " [" + std::to_string(pid()) + "] (memgraph)");
+    if (!_setSharedRegionFromPlatform(HXPlatformOfDescription(_graph->processDescriptionString())))
+        return fail(error, unknownPlatform,
+                    "Unable to determine platform from memory graph process description");
+    setIdleExitStatus(HXIdleExitUnknown);
+    return true;
+}
+
+void HXMemgraphProcess::_gatherPhysHeft() {
+    _phys_heft = _graph->physicalHeft();
+    _phys_heft_peak = _graph->physicalHeftPeak();
+}
+
+vm_region_submap_info_64 HXMemgraphProcess::infoOfRegion(const GXVMRegion &region) const {
+    const bool inSharedRegion =
+        region.address >= sharedRegionBase() && region.address - sharedRegionBase() < sharedRegionSize();
+    // Within the shared region the fields hold bytes; elsewhere pages, as a live walk delivers them.
+    const auto amount = [&](uint64_t bytes) {
+        return static_cast<uint32_t>(inSharedRegion ? bytes : bytes / pageSize());
+    };
+    vm_region_submap_info_64 info{};
+    info.protection = region.prot;
+    info.max_protection = region.maxProt;
+    info.offset = region.offset;
+    info.user_tag = region.user_tag;
+    info.pages_resident = amount(region.resident_size);
+    info.pages_shared_now_private = amount(region.shared_now_private_size);
+    info.pages_swapped_out = amount(region.swapped_out_size);
+    info.pages_dirtied = amount(region.dirty_size);
+    info.pages_reusable = amount(region.reusable_size);
+    info.ref_count = region.ref_count;
+    info.external_pager = region.external_pager;
+    info.share_mode = region.share_mode;
+    info.is_submap = static_cast<int32_t>(region.is_submap & 1);
+    info.object_id = region.object_id;
+    info.object_id_full = region.object_id;
+    return info;
+}
+
+// A region whose type names a segment completes the pending image; any other only names it.
+void HXMemgraphProcess::takeImage(const GXVMRegion &region, HXImage &pending) {
+    pending.setName(HXString::intern(region.type));
+    if (pending.segment() == HXSegmentUnset) return;
+    pending.setStart(region.address);
+    pending.setSize(region.length);
+    if (region.path) pending.setOwnerPath(HXString::intern(*region.path));
+    _images.push_back(pending);
+    pending = HXImage();
+}
+
+void HXMemgraphProcess::enumerateRegions(const HXRegionCallback &callback) {
+    HXImage pending;
+    _graph->enumerateRegionsWithBlock([&](const GXVMRegion &region, bool *stop) {
+        const vm_region_submap_info_64 info = infoOfRegion(region);
+        takeImage(region, pending);
+        std::optional<std::string_view> path;
+        if (region.external_pager && region.path) path = *region.path;
+        *stop = callback(region.address, region.length, info, region.purgeable, path);
+    });
+}
+
+bool HXMemgraphProcess::_populateMemoryRegionWithPageQueries(HXMemoryRegion &region,
+                                                             const vm_region_submap_info_64 &info) {
+    constexpr char operation[] = "_populateMemoryRegionWithPageQueries";
+    HXRequire(region.dirtySize() == 0, operation, "memoryRegion.dirtySize == 0");
+    HXRequire(region.swappedSize() == 0, operation, "memoryRegion.swappedSize == 0");
+    region.setDirtySize(info.pages_dirtied);
+    region.setSwappedSize(info.pages_swapped_out);
+    return true;
+}
