@@ -1,0 +1,262 @@
+// HXReplayPlatform: tasks and virtual memory.
+#include "platform/replay/HXReplayPlatform.h"
+
+#include "platform/HXRegionTags.h"
+#include "platform/HXSafeText.h"
+
+#include <algorithm>
+#include <cstring>
+
+namespace {
+
+constexpr mach_port_t kTaskSelf = 1;
+constexpr mach_port_t kHostSelf = 2;
+constexpr mach_port_t kFirstTask = 16; // the task of the first process
+
+// The first of mappings in ascending order whose end lies above `address`, from the one at `hint` on when it
+// can be.
+template <class Mappings>
+size_t firstEndingAbove(const Mappings &mappings, uint64_t address, size_t hint) {
+    const auto isFirst = [&](size_t i) {
+        return (i == mappings.size() || mappings[i].end() > address) &&
+               (i == 0 || mappings[i - 1].end() <= address);
+    };
+    for (size_t i = hint; i < hint + 2 && i <= mappings.size(); i++)
+        if (isFirst(i)) return i;
+    const auto found =
+        std::upper_bound(mappings.begin(), mappings.end(), address,
+                         [](uint64_t wanted, const auto &mapping) { return wanted < mapping.end(); });
+    return static_cast<size_t>(found - mappings.begin());
+}
+
+} // namespace
+
+HXReplayPlatform::HXReplayPlatform(const HXMachine &machine, HXPlatform &services)
+    : HXServicesPlatform(services), _machine(machine), _states(machine.processes.size()),
+      _selfRegionHeft(machine.host.selfRegionHeft.value_or(0)) {
+    mapNamedTags();
+}
+
+HXReplayPlatform::~HXReplayPlatform() = default;
+
+mach_port_t HXReplayPlatform::mach_task_self() {
+    return kTaskSelf;
+}
+
+mach_port_t HXReplayPlatform::mach_host_self() {
+    return kHostSelf;
+}
+
+kern_return_t HXReplayPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_t *task) {
+    const auto found = _machine.processIndices.find(pid);
+    if (found == _machine.processIndices.end()) return KERN_FAILURE;
+    const kern_return_t error = _machine.processes[found->second].taskError;
+    if (error == KERN_SUCCESS) *task = kFirstTask + found->second;
+    return error;
+}
+
+void HXReplayPlatform::mach_port_deallocate(mach_port_t, mach_port_t) {}
+
+const HXMachineProcess *HXReplayPlatform::taskProcess(mach_port_t task, State **state) {
+    const size_t index = size_t{task} - kFirstTask;
+    if (task < kFirstTask || index >= _machine.processes.size()) return nullptr;
+    *state = &_states[index];
+    return &_machine.processes[index];
+}
+
+HXReplayPlatform::State *HXReplayPlatform::stateOf(int32_t pid) {
+    const auto found = _machine.processIndices.find(pid);
+    return found == _machine.processIndices.end() ? nullptr : &_states[found->second];
+}
+
+// Counts a call; the error of the fault that it meets, or KERN_SUCCESS.
+kern_return_t HXReplayPlatform::countCall(const HXMachineProcess &process, State &state, HXMachineCall call) {
+    if (!process.faults) return KERN_SUCCESS;
+    const HXMachineFault &fault = process.faults->ofCall[static_cast<size_t>(call)];
+    if (fault.error == 0 || ++state.calls[static_cast<size_t>(call)] < fault.from) return KERN_SUCCESS;
+    if (fault.becomes != HXMachineFate::alive) state.fate = fault.becomes;
+    return fault.error;
+}
+
+bool HXReplayPlatform::exists(const HXMachineRegion &region) const {
+    return countsHeft() || !_machine.traits(region).heftOnly;
+}
+
+// The first region that ends above `address`; null when there is none.
+const HXMachineRegion *HXReplayPlatform::firstRegion(const HXMachineProcess &process, State &state,
+                                                     uint64_t address) const {
+    if (!process.regions) return nullptr;
+    const auto &regions = *process.regions;
+    size_t i = firstEndingAbove(regions, address, state.walkHint.load(std::memory_order_relaxed));
+    state.walkHint.store(i, std::memory_order_relaxed);
+    while (i < regions.size() && !exists(regions[i]))
+        i++;
+    return i < regions.size() ? &regions[i] : nullptr;
+}
+
+// The region that holds `address`; null when none does.
+const HXMachineRegion *HXReplayPlatform::regionAt(const HXMachineProcess &process, State &state,
+                                                  uint64_t address) const {
+    const HXMachineRegion *const region = firstRegion(process, state, address);
+    return region != nullptr && region->address <= address ? region : nullptr;
+}
+
+kern_return_t HXReplayPlatform::mach_vm_region(mach_port_t task, uint64_t *address, uint64_t *size,
+                                               int32_t flavor, vm_region_basic_info_64 *info,
+                                               uint32_t *infoCount) {
+    State *state = nullptr;
+    const HXMachineProcess *const process = taskProcess(task, &state);
+    if (process == nullptr) return MACH_SEND_INVALID_DEST;
+    if (const kern_return_t error = countCall(*process, *state, HXMachineCall::region)) return error;
+    if (flavor != VM_REGION_BASIC_INFO_64 || *infoCount < VM_REGION_BASIC_INFO_COUNT_64)
+        return KERN_INVALID_ARGUMENT;
+    if (!process->tops.empty()) {
+        const size_t i = firstEndingAbove(process->tops, *address, process->tops.size());
+        if (i == process->tops.size()) return KERN_INVALID_ADDRESS;
+        *address = process->tops[i].address;
+        *size = process->tops[i].size;
+        *info = process->tops[i].info;
+    } else {
+        const HXMachineRegion *const region = firstRegion(*process, *state, *address);
+        if (region == nullptr) return KERN_INVALID_ADDRESS;
+        const HXMachineRegionTraits &traits = _machine.traits(*region);
+        *address = region->address;
+        *size = region->size;
+        *info = {};
+        info->protection = traits.prot;
+        info->max_protection = traits.maxProt;
+        info->inheritance = traits.inheritance;
+        info->offset = region->offset;
+        info->behavior = traits.behavior;
+        info->user_wired_count = traits.wired;
+    }
+    *infoCount = VM_REGION_BASIC_INFO_COUNT_64;
+    return KERN_SUCCESS;
+}
+
+void HXReplayPlatform::fillInfo(const HXMachineRegion &region, vm_region_submap_info_64 *info) const {
+    const HXMachineRegionTraits &traits = _machine.traits(region);
+    const HXMachineRegionExtra &extra = _machine.extra(region);
+    info->protection = traits.prot;
+    info->max_protection = traits.maxProt;
+    info->inheritance = traits.inheritance;
+    info->offset = region.offset;
+    info->user_tag = hostTag(traits);
+    info->pages_resident = region.residentPages;
+    info->pages_shared_now_private = extra.sharedNowPrivatePages;
+    info->pages_swapped_out = region.swappedPages;
+    info->pages_dirtied = countsHeft() ? region.dirtiedPages : region.dirtiedObjectPages;
+    info->ref_count = traits.refs;
+    info->shadow_depth = traits.shadowDepth;
+    info->external_pager = traits.pager;
+    info->share_mode = traits.shareMode;
+    info->behavior = traits.behavior;
+    info->object_id = region.objectID;
+    info->user_wired_count = traits.wired;
+    info->pages_reusable = extra.reusablePages;
+    info->object_id_full = region.fullObjectID;
+}
+
+kern_return_t HXReplayPlatform::mach_vm_region_recurse(mach_port_t task, uint64_t *address, uint64_t *size,
+                                                       uint32_t *, vm_region_submap_info_64 *info,
+                                                       uint32_t *infoCount) {
+    State *state = nullptr;
+    const HXMachineProcess *const process = taskProcess(task, &state);
+    if (process == nullptr) return MACH_SEND_INVALID_DEST;
+    if (const kern_return_t error = countCall(*process, *state, HXMachineCall::regionRecurse)) return error;
+    const HXMachineRegion *const region = firstRegion(*process, *state, *address);
+    if (region == nullptr) return KERN_INVALID_ADDRESS;
+    vm_region_submap_info_64 filled{};
+    fillInfo(*region, &filled);
+    const uint32_t words = _machine.traits(*region).shortRecord ? VM_REGION_SUBMAP_INFO_V1_COUNT_64
+                                                                : VM_REGION_SUBMAP_INFO_COUNT_64;
+    *infoCount = std::min(*infoCount, words);
+    std::memcpy(static_cast<void *>(info), &filled, *infoCount * sizeof(uint32_t));
+    *address = region->address;
+    *size = region->size;
+    return KERN_SUCCESS;
+}
+
+kern_return_t HXReplayPlatform::mach_vm_page_range_query(mach_port_t task, uint64_t address, uint64_t size,
+                                                         int32_t *dispositions, uint64_t *count) {
+    State *state = nullptr;
+    const HXMachineProcess *const process = taskProcess(task, &state);
+    if (process == nullptr) return KERN_INVALID_ARGUMENT;
+    if (const kern_return_t error = countCall(*process, *state, HXMachineCall::pageRangeQuery)) return error;
+    const uint64_t pageSize = _machine.host.pageSize;
+    const uint64_t inPage = address % pageSize;
+    const uint64_t pages = size / pageSize + (size % pageSize + inPage + pageSize - 1) / pageSize;
+    const uint64_t wanted = std::min(pages, *count);
+    uint64_t page = address - inPage;
+    uint64_t filled = 0;
+    while (filled < wanted) {
+        const HXMachineRegion *const region = regionAt(*process, *state, page);
+        if (region == nullptr || !_machine.extra(*region).hasPageRuns) return KERN_INVALID_ADDRESS;
+        const HXMachineRegionExtra &extra = _machine.extra(*region);
+        const auto runs = _machine.pageRuns.begin() + static_cast<std::ptrdiff_t>(extra.firstPageRun);
+        const auto runsEnd = runs + extra.pageRunCount;
+        uint64_t index = (page - region->address) / pageSize;
+        const uint64_t endIndex = std::min(region->size / pageSize, index + wanted - filled);
+        auto run = std::upper_bound(runs, runsEnd, index, [](uint64_t pageIndex, const HXMachinePageRun &r) {
+            return pageIndex < r.endPage;
+        });
+        for (; index < endIndex; index++) {
+            while (run != runsEnd && run->endPage <= index)
+                ++run;
+            dispositions[filled++] = run == runsEnd ? 0 : run->disposition;
+        }
+        page = region->address + endIndex * pageSize;
+    }
+    *count = filled;
+    return KERN_SUCCESS;
+}
+
+kern_return_t HXReplayPlatform::mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,
+                                                         int32_t *purgeState) {
+    State *state = nullptr;
+    const HXMachineProcess *const process = taskProcess(task, &state);
+    if (process == nullptr || control != VM_PURGABLE_GET_STATE) return KERN_INVALID_ARGUMENT;
+    const HXMachineRegion *const region = regionAt(*process, *state, address);
+    if (region == nullptr) return KERN_INVALID_ADDRESS;
+    const HXMachineRegionTraits &traits = _machine.traits(*region);
+    if (!traits.hasPurge) return KERN_INVALID_ARGUMENT;
+    *purgeState = traits.purge;
+    return KERN_SUCCESS;
+}
+
+int32_t HXReplayPlatform::proc_regionfilename(int32_t pid, uint64_t address, char *buffer,
+                                              uint32_t bufferBytes) {
+    const HXMachineProcess *const process = _machine.process(pid);
+    if (process == nullptr) return 0;
+    const HXMachineRegion *const region = regionAt(*process, *stateOf(pid), address);
+    if (region == nullptr) return 0;
+    const std::string_view path = HXCutText(text(region->path), bufferBytes);
+    std::copy(path.begin(), path.end(), buffer);
+    return static_cast<int32_t>(path.size());
+}
+
+// The machine's names for tags that programs name get the tags that this run has for those names.
+void HXReplayPlatform::mapNamedTags() {
+    for (const auto &[tag, name] : _machine.tagNames) {
+        if (tag < HXHostTagFirstNamed || tag > HXHostTagLastNamed) continue;
+        const std::optional<uint32_t> own = HXNamedTags::shared().tagForName(name);
+        _namedTags[tag] = own.value_or(HXHostTagAnonymous);
+    }
+}
+
+uint32_t HXReplayPlatform::hostTag(const HXMachineRegionTraits &traits) const {
+    const auto found = _namedTags.find(traits.tag);
+    if (found == _namedTags.end()) return traits.tag;
+    // As on a live host, names that find no free tag are lost.
+    const bool unnamed = found->second == HXHostTagAnonymous;
+    return unnamed && traits.shareMode == SM_SHARED ? HXHostTagSharedAnonymous : found->second;
+}
+
+std::optional<std::string>
+HXReplayPlatform::GXRegionTypeDescriptionForTagShareProtAndPager(uint32_t tag, uint8_t, int32_t, uint8_t) {
+    // Memory graphs that are read beside the machine may have brought names of their own.
+    if (auto name = HXNamedTags::shared().nameForTag(tag)) return name;
+    const auto found = _machine.tagNames.find(tag);
+    if (found == _machine.tagNames.end()) return std::nullopt;
+    return found->second;
+}
