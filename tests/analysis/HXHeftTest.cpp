@@ -1,0 +1,305 @@
+#include "analysis/HXHeft.h"
+#include "support/HXBarePlatform.h"
+#include "support/HXBuilders.h"
+
+#include <cerrno>
+#include <gtest/gtest.h>
+
+namespace {
+constexpr uint64_t kPage = 16384;
+
+HXRegionFacts object(uint64_t id, uint8_t shareMode = SM_SHARED) {
+    return {.object = id, .size = kPage, .dirty = kPage, .shareMode = shareMode};
+}
+
+class HXHeftTest : public testing::Test {
+  protected:
+    HXHeftTest() {
+        HXHeftSwitches::setBreakDownPhysHeft(true);
+        HXProcess::_clearGlobalErrors();
+    }
+    ~HXHeftTest() override {
+        HXHeftSwitches::setSharingAnalysisDisabled(false);
+        HXProcess::_clearGlobalErrors();
+    }
+    HXMadeUpProcess &add(int32_t pid, const std::vector<HXRegionFacts> &regions, bool is64bit = true) {
+        auto process = std::make_unique<HXMadeUpProcess>(pid, "p", regions);
+        HXMadeUpProcess &reference = *process;
+        process->setIs64bit(is64bit);
+        _targets.push_back(std::move(process));
+        return reference;
+    }
+    HXHeft &gather() {
+        _heft = std::make_unique<HXHeft>(std::move(_targets));
+        _heft->gatherData();
+        return *_heft;
+    }
+    // The object of a process's region.
+    static const HXMemoryObject *objectOf(const HXProcess &process, size_t region = 0) {
+        return process.memoryRegions()[region].memoryObject();
+    }
+
+    HXBarePlatform _platform;
+
+  private:
+    HXHeft::ProcessList _targets;
+    std::unique_ptr<HXHeft> _heft;
+};
+
+std::vector<std::vector<int32_t>> groupsOf(const HXHeftSharingData &sharing, int32_t pid) {
+    std::vector<std::vector<int32_t>> groups;
+    const auto *found = sharing.groupsOfProcess(pid);
+    if (found == nullptr) return groups;
+    for (const HXProcessGroup *group : *found) {
+        groups.emplace_back();
+        for (const HXProcess *member : group->processes())
+            groups.back().push_back(member->pid());
+    }
+    return groups;
+}
+} // namespace
+
+using Groups = std::vector<std::vector<int32_t>>;
+
+TEST_F(HXHeftTest, RegionsOfOneKeyShareAnObject) {
+    HXRegionFacts cowDirty = object(7, SM_COW), cowClean = object(7, SM_COW), cowSwapped = cowClean;
+    cowClean.dirty = cowSwapped.dirty = 0;
+    cowSwapped.swapped = kPage;
+    HXRegionFacts text = object(7), linkedit = object(7), data = object(7), cache = object(7);
+    text.segment = HXSegmentText;
+    linkedit.segment = HXSegmentLinkedit;
+    data.segment = HXSegmentData;
+    cache.sharedCache = true;
+    HXRegionFacts cacheElsewhere = cache, cacheOtherObject = cache, textInCache = cache;
+    cacheElsewhere.start = 0x2000;
+    cacheOtherObject.object = 8;
+    textInCache.segment = HXSegmentText;
+    // A key whose upper half is turned to zero, or to all ones, by the process's pid (10, and 20 beside it).
+    const auto key = [](uint64_t high, uint64_t low, uint8_t mode) { return object(high << 32 | low, mode); };
+    struct {
+        const char *title;
+        HXRegionFacts first, second; // of process 10 and of process 20
+        bool shared;
+        bool both64bit = true;
+    } cases[] = {
+        {"shared", object(7), object(7), true},
+        {"different objects", object(7), object(8), false},
+        {"the upper half counts", object(7), key(1, 7, SM_SHARED), false},
+        {"copied on write", cowDirty, cowDirty, false},
+        {"copied on write, swapped", cowSwapped, cowSwapped, false},
+        {"copied on write by one only", cowDirty, cowClean, false},
+        {"not yet copied", cowClean, cowClean, true},
+        {"a key that looks like the other's copy", cowDirty, key(10, 7, SM_SHARED), true},
+        {"no object", object(0), object(0), false},
+        {"no object, copied on write", object(0, SM_COW), object(0, SM_COW), false},
+        {"all ones", object(UINT64_MAX), object(UINT64_MAX), false},
+        {"all ones after the turn", key(0xFFFFFFFF ^ 10, 0xFFFFFFFF, SM_COW),
+         key(0xFFFFFFFF ^ 20, 0xFFFFFFFF, SM_COW), false},
+        {"zero after the turn", key(10, 0, SM_COW), key(20, 0, SM_COW), false},
+        {"text and data", text, data, false},
+        {"text and linkedit", text, linkedit, false},
+        {"text", text, text, true},
+        {"data and no image", data, object(7), true},
+        {"the shared cache goes by address", cache, cacheOtherObject, true},
+        {"two places of the shared cache", cache, cacheElsewhere, false},
+        {"the shared cache knows no segments", cache, textInCache, true},
+        {"the shared cache and an object", cache, object(0x1000), false},
+        {"the shared cache of 32 and 64 bits", cache, cache, false, false},
+    };
+    for (const auto &test : cases) {
+        const auto &first = add(10, {test.first});
+        const auto &second = add(20, {test.second}, test.both64bit);
+        gather();
+        EXPECT_EQ(objectOf(first) == objectOf(second), test.shared) << test.title;
+        EXPECT_TRUE(objectOf(first)->accurateSizes() && objectOf(second)->accurateSizes()) << test.title;
+    }
+    // Two regions of one process with no identifier to go by never share.
+    const auto &alone = add(10, {object(0), object(0), object(UINT64_MAX), object(UINT64_MAX)});
+    EXPECT_EQ(gather().memoryObjects().size(), 4u);
+    EXPECT_EQ(objectOf(alone, 1)->totalDirtySize(), 0u);
+    EXPECT_EQ(objectOf(alone, 2)->totalDirtySize(), kPage);
+}
+
+TEST_F(HXHeftTest, OwnersAndViewsFollowTheSwitches) {
+    HXRegionFacts owned = object(7);
+    owned.owned = true;
+    for (const bool breakDown : {true, false})
+        for (const bool disabled : {true, false}) {
+            HXHeftSwitches::setBreakDownPhysHeft(breakDown);
+            HXHeftSwitches::setSharingAnalysisDisabled(disabled);
+            const auto &first = add(10, {owned, object(8), object(8)});
+            const auto &second = add(20, {owned, object(8)});
+            gather();
+            EXPECT_EQ(objectOf(first)->ownerPid(), breakDown ? 20 : -1); // the later one
+            EXPECT_EQ(objectOf(second, 1)->processMemoryRegions().size(), disabled ? 0u : 3u);
+        }
+}
+
+TEST_F(HXHeftTest, HeftIsTheKernelsChargeOrTheWholeObjects) {
+    const HXRegionFacts fake{.object = 9,
+                             .start = kNoAddress,
+                             .size = 5,
+                             .dirty = 3,
+                             .swapped = 2,
+                             .tag = kFakeRegionTag,
+                             .owned = true};
+    for (const bool breakDown : {true, false}) {
+        HXHeftSwitches::setBreakDownPhysHeft(breakDown);
+        HXRegionFacts mixed = object(8);
+        mixed.swapped = 100, mixed.clean = 1000, mixed.reclaimable = 1000, mixed.wired = true;
+        const auto &first = add(10, {object(7), object(7), mixed, fake});
+        const auto &second = add(20, {object(7), object(0)});
+        const auto &none = add(30, {});
+        add(40, {object(7)}).setHiddenFromDisplay(true);
+        HXHeft &heft = gather();
+        // Without breakdown each object counts once and whole; the object without an identifier has no size.
+        EXPECT_EQ(heft._calculateHeftForProcess(first), (breakDown ? 3 : 2) * kPage + 105);
+        EXPECT_EQ(heft._calculateHeftForProcess(second), (breakDown ? 2 : 1) * kPage);
+        EXPECT_EQ(heft._calculateHeftForProcess(none), 0u);
+        HXMemoryTotal total;
+        HXHeft::_totalForCategories(heft._categoriesForAllProcessesShouldSummarize(true), &total);
+        // The page of object 7 that process 10 maps twice: with breakdown it is charged twice.
+        EXPECT_EQ(total.dirty, (breakDown ? 3 : 2) * kPage + 3);
+        EXPECT_EQ(total.swapped, 102u);
+        EXPECT_EQ(total.wired, kPage);
+        EXPECT_EQ(total.regionCount, 7u); // the hidden process's region belongs to a shown object
+    }
+}
+
+TEST_F(HXHeftTest, ProcessesAreOrderedByHeftThenPid) {
+    add(10, {object(1)});
+    add(30, {object(2), object(3)});
+    add(20, {object(4)});
+    add(40, {});
+    add(50, {object(5), object(6), object(7)}).setHiddenFromDisplay(true);
+    std::vector<int32_t> gathered, expected{50, 40, 30, 20, 10};
+    HXHeft &heft = gather();
+    for (const HXProcess *process : HXHeft::_processesBySortingPidDesc(heft.processes()))
+        gathered.push_back(process->pid());
+    EXPECT_EQ(gathered, expected);
+    std::vector<int32_t> reported, order{30, 20, 10, 40};
+    for (const HXProcess *process : heft._processesBySortingHeft(heft._notHiddenProcesses()))
+        reported.push_back(process->pid());
+    EXPECT_EQ(reported, order);
+}
+
+TEST_F(HXHeftTest, AnInterruptLeavesOutWhatHasNotBegun) {
+    HXHeft *heft = nullptr;
+    HXHeft::ProcessList targets;
+    auto started = std::make_unique<HXMadeUpProcess>(30, "started", std::vector{object(1)});
+    started->whenGathered = [&] { heft->cancel(); };
+    targets.push_back(std::make_unique<HXMadeUpProcess>(10, "late", std::vector{object(2)}));
+    targets.push_back(std::move(started));
+    HXHeft analysis(std::move(targets));
+    heft = &analysis;
+    analysis.gatherData();
+    EXPECT_EQ(analysis.processes()[0]->memoryRegions().size(), 0u);
+    EXPECT_EQ(analysis.processes()[1]->memoryRegions().size(), 1u);
+    EXPECT_EQ(
+        HXProcess::globalErrors(),
+        std::vector<std::string>{"Heft exited early due to SIGINT and did not finish gathering all data"});
+}
+
+TEST_F(HXHeftTest, GroupsPartitionObjectsByWhoMapsThem) {
+    const HXRegionFacts fake{.object = 5, .start = kNoAddress, .tag = kFakeRegionTag, .owned = true};
+    add(10, {object(1), object(2), object(3), fake});
+    add(20, {object(2), object(1), object(4)});
+    add(30, {object(2), object(1)});
+    // A hidden process counts only for what a shown process owns and shows no mapping of.
+    add(40, {object(1), object(5), object(6)}).setHiddenFromDisplay(true);
+    HXHeft &heft = gather();
+    const HXHeftSharingData sharing = heft._sharingData();
+    EXPECT_EQ(groupsOf(sharing, 10), (Groups{{10}, {10, 20, 30}, {10, 40}}));
+    EXPECT_EQ(groupsOf(sharing, 20), (Groups{{20}, {10, 20, 30}}));
+    EXPECT_EQ(groupsOf(sharing, 30), (Groups{{10, 20, 30}}));
+    EXPECT_EQ(groupsOf(sharing, 40), (Groups{{10, 40}}));
+    EXPECT_EQ(groupsOf(sharing, 99), Groups{});
+    size_t objects = 0;
+    for (const auto &group : sharing.groups) {
+        EXPECT_TRUE(group.immutable());
+        objects += sharing.objectsOfGroup(group).size();
+    }
+    EXPECT_EQ(sharing.groups.size(), 4u);
+    EXPECT_EQ(objects, 5u); // not object 6
+}
+
+TEST_F(HXHeftTest, CategoriesTellWhetherAViewDiffers) {
+    HXRegionFacts first = object(1), second = object(2), owned = object(3);
+    first.name = second.name = "libA", first.detail = "/x/libA", second.detail = "/y/libA";
+    owned.name = "owned", owned.owned = true;
+    add(10, {first, second, owned});
+    const auto &viewer = add(20, {object(3)});
+    HXHeft &heft = gather();
+    HXHeftSharingData::Objects objects;
+    for (const auto &each : heft.memoryObjects())
+        objects.push_back(&each);
+    for (const bool summarize : {true, false}) {
+        bool hasView = true;
+        const HXCategoryMap own =
+            heft._categoriesForObjects(objects, *heft.processes()[0], &hasView, summarize);
+        EXPECT_FALSE(hasView);
+        EXPECT_EQ(own.entries().size(), summarize ? 2u : 3u);
+        const HXCategoryMap seen = heft._categoriesForObjects(objects, viewer, &hasView, summarize);
+        EXPECT_TRUE(hasView);
+        EXPECT_EQ(seen.get("owned")->totalDirtySize(), 0u);
+        EXPECT_EQ(seen.get("owned")->totalCleanSize(), kPage);
+    }
+    HXMemoryTotal total{1, 2, 3, 4, 5, 6};
+    HXHeft::_totalForCategories(HXCategoryMap(), &total);
+    EXPECT_EQ(total, HXMemoryTotal());
+}
+
+TEST_F(HXHeftTest, ProcessGroupsHashInOrderAndFreeze) {
+    const HXMadeUpProcess ten(10, "a"), twenty(20, "b"), tenAgain(10, "c");
+    HXProcessGroup group, open, other;
+    EXPECT_EQ(group.hash(), 19u);
+    for (const auto *process : {&ten, &twenty, &tenAgain, &ten})
+        group.addProcess(*process);
+    EXPECT_EQ(group.hash(), 25661u);
+    EXPECT_EQ(group.processes().size(), 2u);
+    open.addProcess(twenty);
+    EXPECT_FALSE(group.isEqual(open));
+    open.addProcess(tenAgain);
+    other.addProcess(ten), other.addProcess(twenty);
+    group.freeze(), other.freeze();
+    EXPECT_TRUE(group.isEqual(open)); // by members, whatever their order
+    EXPECT_TRUE(group.isEqual(group));
+    EXPECT_FALSE(group.isEqual(other));
+    EXPECT_DEATH(group.addProcess(ten), "!_immutable");
+    EXPECT_DEATH((void)open.isEqual(group), "self->_immutable");
+    EXPECT_EQ(group.description().substr(0, 14), "HXProcessGroup");
+    EXPECT_NE(group.description().find("HXProcess[20]"), std::string::npos);
+}
+
+TEST_F(HXHeftTest, TheBreakdownSwitchAsksTheKernelAgainAfterEachChange) {
+    HXHeftSwitches::setBreakDownPhysHeft(true);
+    EXPECT_TRUE(HXHeftSwitches::breakDownPhysHeft());
+    const int reads = _platform.settingReads;
+    EXPECT_TRUE(HXHeftSwitches::breakDownPhysHeft());
+    EXPECT_EQ(_platform.settingReads, reads);
+
+    struct {
+        bool set;
+        std::optional<uint32_t> kernelThen; // what the kernel makes of it
+        int error;
+        bool answer;
+        std::string printed;
+    } cases[] = {
+        {true, 0, 0, false, ""},
+        {false, 5, 0, true, ""},
+        {true, std::nullopt, 0, false, ""},
+        {true, 1, EPERM, false,
+         "Unable to configure physical heft data collection: Operation not permitted\n"
+         "Unable to retrieve status of physical heft data collection: Operation not permitted\n"},
+    };
+    for (const auto &test : cases) {
+        _platform.settingError = test.error;
+        if (!test.kernelThen) _platform.selfRegionHeft = std::nullopt;
+        const auto printed = printedBy([&] {
+            HXHeftSwitches::setBreakDownPhysHeft(test.set);
+            _platform.selfRegionHeft = test.kernelThen;
+            EXPECT_EQ(HXHeftSwitches::breakDownPhysHeft(), test.answer);
+        });
+        EXPECT_EQ(printed.err, test.printed);
+    }
+}
