@@ -105,7 +105,7 @@ void Reader::take(const HXMapsEntry &entry) {
     mapping.path = _addressSpace->intern(entry.path);
     const HXMappedPath &path = _addressSpace->path(mapping.path);
     const HXFileSystemKind fileSystem = fileSystemOf(mapping, path);
-    const uint32_t sharedMemory = mapping.inode == 0 ? 0 : _setting.fileSystems->sharedMemoryDevice();
+    const uint32_t sharedMemory = !mapping.isFile() ? 0 : _setting.fileSystems->sharedMemoryDevice();
     HXClassifyMapping(path.kind, fileSystem, sharedMemory, path.namedTag, &mapping);
     if (path.kind == HXPathKind::stack) _sawStack = true;
     if (path.kind == HXPathKind::special && path.text == "[vsyscall]") _sawGate = true;
@@ -115,7 +115,7 @@ void Reader::take(const HXMapsEntry &entry) {
 }
 
 HXFileSystemKind Reader::fileSystemOf(const HXMapping &mapping, const HXMappedPath &path) {
-    if (mapping.inode == 0 || (path.kind != HXPathKind::file && path.kind != HXPathKind::deletedFile &&
+    if (!mapping.isFile() || (path.kind != HXPathKind::file && path.kind != HXPathKind::deletedFile &&
                                path.kind != HXPathKind::memfd && path.kind != HXPathKind::systemV))
         return HXFileSystemKind::unknown;
     if (mapping.device == _setting.fileSystems->sharedMemoryDevice() || path.text.front() != '/')

@@ -140,7 +140,7 @@ int32_t HXLinuxPlatform::proc_regionfilename(int32_t pid, uint64_t address, char
     const HXAddressSpace &addressSpace = task->addressSpace(_readerSetting);
     const size_t index = task->find(address, _readerSetting);
     if (index == addressSpace.count() || !addressSpace[index].contains(address) ||
-        addressSpace[index].inode == 0)
+        !addressSpace[index].isFile())
         return 0;
     const std::string &path = addressSpace.path(addressSpace[index].path).text;
     const size_t length = std::min<size_t>(path.size(), bufferBytes);
