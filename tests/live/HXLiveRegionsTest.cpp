@@ -286,8 +286,8 @@ TEST_P(HXLiveRegions, ShowDirtyPagesOfObjectsInTheOtherMode) {
     for (const HXSmapsEntry &entry : HXReadSmaps(subject.pid())) {
         const HXMemoryRegion *region = regionAt(*process, entry.start);
         ASSERT_TRUE(region) << entry.path;
-        const bool file = entry.path.starts_with("/") && !isSwapBacked(entry) &&
-                          !entry.path.starts_with("/anon_hugepage");
+        const bool file =
+            entry.path.starts_with("/") && !isSwapBacked(entry) && !entry.path.starts_with("/anon_hugepage");
         if (entry.path.starts_with("[v")) continue; // the kernel's own pages in the process
         const uint64_t expected = file ? entry.dirty : entry.rss + entry.hugetlb - entry.lazyFree;
         EXPECT_EQ(region->dirtySize(), expected) << entry.path;

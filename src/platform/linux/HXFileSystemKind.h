@@ -1,0 +1,17 @@
+// Kinds of file systems, as far as memory accounting and reading a mapped file tell them apart.
+#pragma once
+
+#include <cstdint>
+#include <string_view>
+
+enum class HXFileSystemKind : uint8_t {
+    unknown,
+    remote,      // may wait for another machine or a user's process
+    local,       // reads end in bounded time
+    swapBacked,  // tmpfs: its pages leave memory only for swap
+    deviceNodes, // devtmpfs: a tmpfs of device files, whose mappings need not be its pages
+    hugePages,   // hugetlbfs
+};
+
+// The kind of a file system type as mountinfo names it.
+HXFileSystemKind HXFileSystemKindOf(std::string_view type);

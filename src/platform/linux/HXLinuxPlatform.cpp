@@ -1,0 +1,272 @@
+// Everything of the live host but tasks, which are in HXLinuxPlatformTasks.cpp.
+#include "platform/linux/HXLinuxPlatform.h"
+
+#include "platform/HXRegionTags.h"
+#include "platform/linux/HXLinuxDispatch.h"
+#include "platform/linux/HXLinuxFiles.h"
+
+#include <fcntl.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+
+#include <bit>
+#include <cerrno>
+#include <cstring>
+
+namespace {
+
+constexpr mach_port_t hostPort = 2;
+constexpr int32_t kernelNamespace = 1, argumentMaximum = 8, processArguments = 49; // CTL_KERN, KERN_…
+constexpr uint32_t argumentAreaSize = 131072;
+constexpr const char *chargeSwitch = "vm.self_region_heft";
+constexpr const char *pageTableEntry = "page_table";
+
+uint32_t machinePageSize() {
+    return static_cast<uint32_t>(::sysconf(_SC_PAGESIZE));
+}
+
+// Copies a value of sysctl; fails with ENOMEM when there is no room for it.
+template <typename Value>
+int32_t copyOut(const Value &value, void *old, size_t *oldBytes) {
+    if (oldBytes == nullptr) return 0;
+    if (old != nullptr) {
+        if (*oldBytes < sizeof value) {
+            errno = ENOMEM;
+            return -1;
+        }
+        std::memcpy(old, &value, sizeof value);
+    }
+    *oldBytes = sizeof value;
+    return 0;
+}
+
+int32_t failed(int error) {
+    errno = error;
+    return -1;
+}
+
+} // namespace
+
+HXLinuxPlatform::HXLinuxPlatform(const Setting &setting)
+    : _pageSize(machinePageSize()), _fileSystems(setting.sharedMemoryDevice),
+      _readerSetting{&_fileSystems, static_cast<uint32_t>(std::countr_zero(_pageSize))},
+      _imageHeaders(_fileSystems, _pageSize), _processes(setting.procPath),
+      _kernelMemory(setting.procPath, setting.sysPath, _pageSize) {}
+
+void HXLinuxPlatform::prepareProcess() {
+    for (int descriptor = 0; descriptor <= 2; descriptor++) {
+        if (::fcntl(descriptor, F_GETFD) >= 0 || errno != EBADF) continue;
+        // The lowest free descriptor is this one.
+        [[maybe_unused]] const int opened = ::open("/dev/null", O_RDWR);
+    }
+    rlimit limit;
+    if (::getrlimit(RLIMIT_NOFILE, &limit) != 0) return;
+    limit.rlim_cur = limit.rlim_max;
+    ::setrlimit(RLIMIT_NOFILE, &limit);
+}
+
+// ---- Processes
+
+int32_t HXLinuxPlatform::proc_listallpids(int32_t *pids, uint32_t bufferBytes) {
+    return _processes.proc_listallpids(pids, bufferBytes);
+}
+
+int32_t HXLinuxPlatform::proc_pidinfo(int32_t pid, int32_t flavor, uint64_t, void *buffer,
+                                      uint32_t bufferBytes) {
+    return _processes.proc_pidinfo(pid, flavor, buffer, bufferBytes);
+}
+
+int32_t HXLinuxPlatform::proc_pid_rusage(int32_t pid, int32_t flavor, rusage_info_v4 *info) {
+    if (flavor != RUSAGE_INFO_V4) return failed(EINVAL);
+    const auto status = statusOf(pid, HXLinuxTask::StatusUse::usage);
+    if (!status) return -1;
+    *info = {};
+    info->ri_phys_heft = status->heftSize();
+    info->ri_lifetime_max_phys_heft = status->peakHeftSize();
+    return 0;
+}
+
+int32_t HXLinuxPlatform::proc_get_dirty(int32_t, uint32_t *) {
+    return failed(ENOTSUP); // no process says that it may be ended when idle
+}
+
+std::optional<HXStatusRecord> HXLinuxPlatform::statusOf(int32_t pid, HXLinuxTask::StatusUse use) {
+    HXLinuxTask *task = _tasks.findByPid(pid);
+    if (task != nullptr) return task->status(use);
+    const HXDescriptor directory = pid > 0 ? _processes.open(pid) : HXDescriptor();
+    if (!directory) {
+        errno = ESRCH;
+        return std::nullopt;
+    }
+    return HXReadStatus(directory.get());
+}
+
+int32_t HXLinuxPlatform::ledger(int32_t command, int32_t pid, void *buffer, int64_t *count) {
+    if (command != LEDGER_TEMPLATE_INFO && command != LEDGER_ENTRY_INFO) return failed(EINVAL);
+    if (*count < 1) {
+        *count = 0;
+        return 0;
+    }
+    if (command == LEDGER_TEMPLATE_INFO) {
+        ledger_template_info entry{};
+        std::strcpy(entry.lti_name, pageTableEntry);
+        std::strcpy(entry.lti_group, "physmem");
+        std::strcpy(entry.lti_units, "bytes");
+        std::memcpy(buffer, &entry, sizeof entry);
+    } else {
+        const auto status = statusOf(pid, HXLinuxTask::StatusUse::ledger);
+        if (!status) return -1;
+        ledger_entry_info entry{};
+        entry.lei_balance = static_cast<int64_t>(status->pageTableSize);
+        std::memcpy(buffer, &entry, sizeof entry);
+    }
+    *count = 1;
+    return 0;
+}
+
+int32_t HXLinuxPlatform::getpid() {
+    return ::getpid();
+}
+
+uint32_t HXLinuxPlatform::geteuid() {
+    return ::geteuid();
+}
+
+int32_t HXLinuxPlatform::sysctl(const int32_t *name, uint32_t nameLength, void *old, size_t *oldBytes) {
+    if (nameLength < 2 || name[0] != kernelNamespace) return failed(ENOENT);
+    if (nameLength == 2 && name[1] == argumentMaximum) return copyOut(argumentAreaSize, old, oldBytes);
+    if (nameLength != 3 || name[1] != processArguments) return failed(ENOENT);
+    if (name[2] <= 0) return failed(EINVAL);
+    return _processes.copyArguments(name[2], old, oldBytes);
+}
+
+int32_t HXLinuxPlatform::sysctlbyname(const char *name, void *old, size_t *oldBytes, const void *newValue,
+                                      size_t newBytes) {
+    if (std::strcmp(name, chargeSwitch) != 0) return failed(ENOENT);
+    uint32_t value = 0;
+    if (newValue != nullptr && newBytes != sizeof value) return failed(EINVAL);
+    if (copyOut(_reportsCharge.load(), old, oldBytes) != 0) return -1;
+    if (newValue == nullptr) return 0;
+    std::memcpy(&value, newValue, sizeof value);
+    _reportsCharge = value;
+    return 0;
+}
+
+// ---- The kernel's own memory, and region types
+
+RVSymbolicator *
+HXLinuxPlatform::RVSymbolicatorCreateWithMachKernelFlagsAndNotification(uint32_t flags,
+                                                                        const void *notification) {
+    return _kernelMemory.RVSymbolicatorCreateWithMachKernelFlagsAndNotification(flags, notification);
+}
+
+RVSymbol HXLinuxPlatform::RVSymbolicatorGetSymbolWithAddressAtTime(RVSymbolicator *symbolicator,
+                                                                   uint64_t address, uint64_t time) {
+    return _kernelMemory.RVSymbolicatorGetSymbolWithAddressAtTime(symbolicator, address, time);
+}
+
+RVSourceInfo HXLinuxPlatform::RVSymbolicatorGetSourceInfoWithAddressAtTime(RVSymbolicator *symbolicator,
+                                                                           uint64_t address, uint64_t time) {
+    return _kernelMemory.RVSymbolicatorGetSourceInfoWithAddressAtTime(symbolicator, address, time);
+}
+
+void HXLinuxPlatform::RVRelease(RVSymbolicator *symbolicator) {
+    _kernelMemory.RVRelease(symbolicator);
+}
+
+mach_port_t HXLinuxPlatform::mach_host_self() {
+    return hostPort;
+}
+
+kern_return_t HXLinuxPlatform::mach_memory_info(mach_port_t host, mach_zone_name **names, uint32_t *nameCount,
+                                                mach_zone_info **zones, uint32_t *zoneCount,
+                                                mach_memory_info_record **records, uint32_t *recordCount) {
+    return _kernelMemory.mach_memory_info(host, names, nameCount, zones, zoneCount, records, recordCount);
+}
+
+kern_return_t HXLinuxPlatform::vm_deallocate(mach_port_t task, const void *address, uint64_t bytes) {
+    return _kernelMemory.vm_deallocate(task, address, bytes);
+}
+
+std::vector<OSKextInfo> HXLinuxPlatform::OSKextCopyLoadedKextInfo() {
+    return _kernelMemory.OSKextCopyLoadedKextInfo();
+}
+
+std::optional<std::string>
+HXLinuxPlatform::GXRegionTypeDescriptionForTagShareProtAndPager(uint32_t tag, uint8_t, int32_t, uint8_t) {
+    const auto name = HXHostTagName(tag);
+    if (name) return std::string(*name);
+    return HXNamedTags::shared().nameForTag(tag);
+}
+
+// ---- Command line, files, streams
+
+HXOptionScan HXLinuxPlatform::getopt_long(int argc, char *const argv[], const char *shortOptions,
+                                          const std::vector<HXLongOption> &options, bool restart) {
+    return HXScanOption(argc, argv, shortOptions, options, restart);
+}
+
+bool HXLinuxPlatform::stat(const std::string &path) {
+    struct ::stat status;
+    return ::stat(path.c_str(), &status) == 0;
+}
+
+std::FILE *HXLinuxPlatform::fopen(const std::string &path, const char *mode) {
+    const std::string closedOnExecution = std::string(mode) + "e";
+    return std::fopen(path.c_str(), closedOnExecution.c_str());
+}
+
+std::optional<std::string> HXLinuxPlatform::readFile(const std::string &path, uint64_t limit) {
+    return HXReadRegularFile(path, limit);
+}
+
+std::optional<HXPendingFile> HXLinuxPlatform::createPendingFile(const std::string &path) {
+    return HXBeginPendingFile(path);
+}
+
+bool HXLinuxPlatform::commitPendingFile(HXPendingFile &file) {
+    return HXCommitPendingFile(file);
+}
+
+void HXLinuxPlatform::discardPendingFile(HXPendingFile &file) {
+    HXDiscardPendingFile(file);
+}
+
+bool HXLinuxPlatform::isatty(int descriptor) {
+    return ::isatty(descriptor) == 1;
+}
+
+// ---- Work queues and signals
+
+HXDispatchQueue HXLinuxPlatform::dispatch_queue_create(const std::string &label, uint32_t qualityOfService) {
+    return {label, qualityOfService};
+}
+
+void HXLinuxPlatform::dispatch_apply(size_t iterations, const HXDispatchQueue &,
+                                     const std::function<void(size_t)> &work) {
+    HXConcurrentLoop(iterations, _workerCount == 0 ? HXUsableProcessorCount() : _workerCount, work);
+}
+
+std::unique_ptr<HXDispatchSource> HXLinuxPlatform::dispatch_source_create(int signal) {
+    return HXSignalSource::create(signal);
+}
+
+void HXLinuxPlatform::dispatch_source_set_event_handler(HXDispatchSource &source,
+                                                        std::function<void()> handler) {
+    static_cast<HXSignalSource &>(source).setHandler(std::move(handler));
+}
+
+void HXLinuxPlatform::dispatch_resume(HXDispatchSource &source) {
+    static_cast<HXSignalSource &>(source).resume();
+}
+
+void HXLinuxPlatform::dispatch_source_cancel(HXDispatchSource &source) {
+    static_cast<HXSignalSource &>(source).cancel();
+}
+
+void HXLinuxPlatform::signal(int signal, HXSignalDisposition disposition) {
+    // To ignore a signal that a source has blocked would throw away one that is pending for it; the block
+    // alone keeps it from acting.
+    if (disposition == HXSignalDisposition::ignored && HXIsSignalBlocked(signal)) return;
+    HXSetSignalDisposition(signal, disposition);
+}

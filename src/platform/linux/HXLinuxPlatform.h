@@ -1,0 +1,120 @@
+// The live Linux host.
+#pragma once
+
+#include "platform/HXPlatform.h"
+#include "platform/linux/HXFileSystems.h"
+#include "platform/linux/HXImageHeaders.h"
+#include "platform/linux/HXLinuxKernelMemory.h"
+#include "platform/linux/HXLinuxProcesses.h"
+#include "platform/linux/HXLinuxTask.h"
+
+#include <atomic>
+#include <cstdint>
+#include <string>
+
+class HXLinuxPlatform final : public HXPlatform {
+  public:
+    struct Setting {
+        std::string procPath = "/proc";
+        std::string sysPath = "/sys";
+        // The device of the kernel's own tmpfs; found out where it is not given.
+        uint32_t sharedMemoryDevice = UINT32_MAX;
+    };
+    // Touches no system.
+    HXLinuxPlatform() : HXLinuxPlatform(Setting()) {}
+    explicit HXLinuxPlatform(const Setting &setting);
+
+    // Readies the running process for examining thousands of others: as many open files as it may have, and
+    // no file of its own on the descriptors of the standard streams, should one be closed. For main.
+    static void prepareProcess();
+
+    // How many workers `dispatch_apply` has; 0: one for each usable processor.
+    void setWorkerCount(size_t count) { _workerCount = count; }
+
+    mach_port_t mach_task_self() override;
+    kern_return_t task_for_pid(mach_port_t self, int32_t pid, mach_port_t *task) override;
+    void mach_port_deallocate(mach_port_t self, mach_port_t task) override;
+    kern_return_t mach_vm_region(mach_port_t task, uint64_t *address, uint64_t *size, int32_t flavor,
+                                 vm_region_basic_info_64 *info, uint32_t *infoCount) override;
+    kern_return_t mach_vm_region_recurse(mach_port_t task, uint64_t *address, uint64_t *size,
+                                         uint32_t *nestingDepth, vm_region_submap_info_64 *info,
+                                         uint32_t *infoCount) override;
+    kern_return_t mach_vm_page_range_query(mach_port_t task, uint64_t address, uint64_t size,
+                                           int32_t *dispositions, uint64_t *count) override;
+    kern_return_t mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,
+                                           int32_t *state) override;
+    uint32_t vm_kernel_page_size() override { return _pageSize; }
+    bool hasSharedRegion() override { return false; }
+
+    int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes) override;
+    int32_t proc_pidinfo(int32_t pid, int32_t flavor, uint64_t argument, void *buffer,
+                         uint32_t bufferBytes) override;
+    int32_t proc_pid_rusage(int32_t pid, int32_t flavor, rusage_info_v4 *info) override;
+    int32_t proc_get_dirty(int32_t pid, uint32_t *flags) override;
+    int32_t proc_regionfilename(int32_t pid, uint64_t address, char *buffer, uint32_t bufferBytes) override;
+    int32_t getpid() override;
+    uint32_t geteuid() override;
+    int32_t sysctl(const int32_t *name, uint32_t nameLength, void *old, size_t *oldBytes) override;
+    int32_t sysctlbyname(const char *name, void *old, size_t *oldBytes, const void *newValue,
+                         size_t newBytes) override;
+    int32_t ledger(int32_t command, int32_t pid, void *buffer, int64_t *count) override;
+
+    RVSymbolicator *RVSymbolicatorCreateWithTaskFlagsAndNotification(mach_port_t task, uint32_t flags,
+                                                                     const void *notification) override;
+    void
+    RVSymbolicatorForeachSymbolOwnerAtTime(RVSymbolicator *symbolicator, uint64_t time,
+                                           const std::function<void(const RVSymbolOwner &)> &each) override;
+    std::string stringByResolvingSymlinksInPath(const std::string &path) override;
+    RVSymbolicator *RVSymbolicatorCreateWithMachKernelFlagsAndNotification(uint32_t flags,
+                                                                           const void *notification) override;
+    RVSymbol RVSymbolicatorGetSymbolWithAddressAtTime(RVSymbolicator *symbolicator, uint64_t address,
+                                                      uint64_t time) override;
+    RVSourceInfo RVSymbolicatorGetSourceInfoWithAddressAtTime(RVSymbolicator *symbolicator, uint64_t address,
+                                                              uint64_t time) override;
+    void RVRelease(RVSymbolicator *symbolicator) override;
+
+    mach_port_t mach_host_self() override;
+    kern_return_t mach_memory_info(mach_port_t host, mach_zone_name **names, uint32_t *nameCount,
+                                   mach_zone_info **zones, uint32_t *zoneCount,
+                                   mach_memory_info_record **records, uint32_t *recordCount) override;
+    kern_return_t vm_deallocate(mach_port_t task, const void *address, uint64_t bytes) override;
+    std::vector<OSKextInfo> OSKextCopyLoadedKextInfo() override;
+    std::optional<std::string> GXRegionTypeDescriptionForTagShareProtAndPager(uint32_t tag, uint8_t shareMode,
+                                                                              int32_t protection,
+                                                                              uint8_t pager) override;
+
+    HXOptionScan getopt_long(int argc, char *const argv[], const char *shortOptions,
+                             const std::vector<HXLongOption> &options, bool restart) override;
+    bool stat(const std::string &path) override;
+    std::FILE *fopen(const std::string &path, const char *mode) override;
+    std::optional<std::string> readFile(const std::string &path, uint64_t limit) override;
+    std::optional<HXPendingFile> createPendingFile(const std::string &path) override;
+    bool commitPendingFile(HXPendingFile &file) override;
+    void discardPendingFile(HXPendingFile &file) override;
+    bool isatty(int descriptor) override;
+
+    HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) override;
+    void dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
+                        const std::function<void(size_t)> &work) override;
+    std::unique_ptr<HXDispatchSource> dispatch_source_create(int signal) override;
+    void dispatch_source_set_event_handler(HXDispatchSource &source, std::function<void()> handler) override;
+    void dispatch_resume(HXDispatchSource &source) override;
+    void dispatch_source_cancel(HXDispatchSource &source) override;
+    void signal(int signal, HXSignalDisposition disposition) override;
+
+  private:
+    // The first mapping whose end lies above *address, of which it stores the place; null with *error.
+    const HXMapping *mappingAt(HXLinuxTask *task, uint64_t *address, uint64_t *size, kern_return_t *error);
+    vm_region_submap_info_64 infoOf(HXLinuxTask *task, const HXMapping &mapping);
+    std::optional<HXStatusRecord> statusOf(int32_t pid, HXLinuxTask::StatusUse use);
+
+    const uint32_t _pageSize;
+    HXFileSystems _fileSystems;
+    const HXReaderSetting _readerSetting;
+    HXImageHeaders _imageHeaders;
+    HXLinuxProcesses _processes;
+    HXLinuxKernelMemory _kernelMemory;
+    HXTaskTable _tasks;
+    std::atomic<uint32_t> _reportsCharge = 0; // "vm.self_region_heft"
+    size_t _workerCount = 0;
+};

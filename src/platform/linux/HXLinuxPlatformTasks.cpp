@@ -1,0 +1,180 @@
+// Tasks, their mappings, their pages and their images.
+#include "platform/linux/HXImageLayout.h"
+#include "platform/linux/HXLinuxPlatform.h"
+#include "platform/linux/HXProcFile.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+namespace {
+
+constexpr mach_port_t selfPort = 1;
+
+// The images of a task; the paths and segment names that it hands out are its own.
+class TaskSymbolicator final : public RVSymbolicator {
+  public:
+    struct Owner {
+        std::string path;
+        uint64_t baseAddress;
+        std::vector<RVRegion> segments;
+    };
+    std::vector<Owner> owners;
+};
+
+bool hasAddressSpace(int directory) {
+    const HXDescriptor maps = HXOpenAt(directory, "maps");
+    char text[2048];
+    if (!maps) return false;
+    if (::read(maps.get(), text, 1) > 0) return true;
+    // No mapping at all: a kernel thread, a process that has ended, or one that has unmapped everything.
+    const auto stat = HXReadOnce(directory, "stat", text);
+    const auto record = stat ? HXParseStat(*stat) : std::nullopt;
+    return record && !record->isZombie() && !record->isKernelThread();
+}
+
+} // namespace
+
+mach_port_t HXLinuxPlatform::mach_task_self() {
+    return selfPort;
+}
+
+kern_return_t HXLinuxPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_t *task) {
+    HXDescriptor directory = pid > 0 ? _processes.open(pid) : HXDescriptor();
+    if (!directory || !hasAddressSpace(directory.get())) return KERN_FAILURE;
+    *task = _tasks.add(std::make_unique<HXLinuxTask>(pid, std::move(directory), _readerSetting.pageShift));
+    return *task == 0 ? KERN_RESOURCE_SHORTAGE : KERN_SUCCESS;
+}
+
+void HXLinuxPlatform::mach_port_deallocate(mach_port_t, mach_port_t task) {
+    _tasks.remove(task);
+}
+
+const HXMapping *HXLinuxPlatform::mappingAt(HXLinuxTask *task, uint64_t *address, uint64_t *size,
+                                            kern_return_t *error) {
+    if (task == nullptr) {
+        *error = KERN_INVALID_ARGUMENT;
+        return nullptr;
+    }
+    const HXAddressSpace &addressSpace = task->addressSpace(_readerSetting);
+    const size_t index = task->find(*address, _readerSetting);
+    if (index == addressSpace.count()) {
+        *error = addressSpace.endError;
+        return nullptr;
+    }
+    const HXMapping &mapping = addressSpace[index];
+    *address = mapping.start;
+    *size = mapping.end - mapping.start;
+    *error = KERN_SUCCESS;
+    return &mapping;
+}
+
+vm_region_submap_info_64 HXLinuxPlatform::infoOf(HXLinuxTask *task, const HXMapping &mapping) {
+    HXRegionContext context;
+    context.pid = task->pid();
+    context.ipcNamespace = task->addressSpace(_readerSetting).ipcNamespace;
+    context.reportsCharge = _reportsCharge.load(std::memory_order_relaxed) != 0;
+    return HXRegionInfo(mapping, context);
+}
+
+kern_return_t HXLinuxPlatform::mach_vm_region(mach_port_t port, uint64_t *address, uint64_t *size,
+                                              int32_t flavor, vm_region_basic_info_64 *info,
+                                              uint32_t *infoCount) {
+    if (flavor != VM_REGION_BASIC_INFO_64 || *infoCount < VM_REGION_BASIC_INFO_COUNT_64)
+        return KERN_INVALID_ARGUMENT;
+    HXLinuxTask *task = _tasks.find(port);
+    kern_return_t error = KERN_SUCCESS;
+    const HXMapping *mapping = mappingAt(task, address, size, &error);
+    if (mapping == nullptr) return error;
+    const vm_region_submap_info_64 full = infoOf(task, *mapping);
+    *info = {};
+    info->protection = full.protection;
+    info->max_protection = full.max_protection;
+    info->inheritance = full.inheritance;
+    info->shared = mapping->has(HXMappingShared);
+    info->offset = full.offset;
+    info->behavior = full.behavior;
+    info->user_wired_count = full.user_wired_count;
+    *infoCount = VM_REGION_BASIC_INFO_COUNT_64;
+    return KERN_SUCCESS;
+}
+
+kern_return_t HXLinuxPlatform::mach_vm_region_recurse(mach_port_t port, uint64_t *address, uint64_t *size,
+                                                      uint32_t *nestingDepth, vm_region_submap_info_64 *info,
+                                                      uint32_t *infoCount) {
+    if (*infoCount < VM_REGION_SUBMAP_INFO_COUNT_64) return KERN_INVALID_ARGUMENT;
+    HXLinuxTask *task = _tasks.find(port);
+    kern_return_t error = KERN_SUCCESS;
+    const HXMapping *mapping = mappingAt(task, address, size, &error);
+    if (mapping == nullptr) return error;
+    *info = infoOf(task, *mapping);
+    *nestingDepth = 0; // there are no submaps
+    *infoCount = VM_REGION_SUBMAP_INFO_COUNT_64;
+    return KERN_SUCCESS;
+}
+
+kern_return_t HXLinuxPlatform::mach_vm_page_range_query(mach_port_t port, uint64_t address, uint64_t size,
+                                                        int32_t *dispositions, uint64_t *count) {
+    HXLinuxTask *task = _tasks.find(port);
+    if (task == nullptr) return KERN_INVALID_ARGUMENT;
+    const uint64_t mask = _pageSize - 1;
+    const uint64_t start = address & ~mask;
+    const uint64_t pages = std::min<uint64_t>((size + (address - start) + mask) / _pageSize, *count);
+    const kern_return_t error = task->pages().query(task->addressSpace(_readerSetting), start,
+                                                    std::span(dispositions, static_cast<size_t>(pages)));
+    if (error == KERN_SUCCESS) *count = pages;
+    return error;
+}
+
+kern_return_t HXLinuxPlatform::mach_vm_purgable_control(mach_port_t, uint64_t, int32_t, int32_t *) {
+    return KERN_INVALID_ARGUMENT; // nothing is purgeable here
+}
+
+int32_t HXLinuxPlatform::proc_regionfilename(int32_t pid, uint64_t address, char *buffer,
+                                             uint32_t bufferBytes) {
+    HXLinuxTask *task = _tasks.findByPid(pid);
+    if (task == nullptr) {
+        errno = ESRCH;
+        return 0;
+    }
+    const HXAddressSpace &addressSpace = task->addressSpace(_readerSetting);
+    const size_t index = task->find(address, _readerSetting);
+    if (index == addressSpace.count() || !addressSpace[index].contains(address) ||
+        addressSpace[index].inode == 0)
+        return 0;
+    const std::string &path = addressSpace.path(addressSpace[index].path).text;
+    const size_t length = std::min<size_t>(path.size(), bufferBytes);
+    std::memcpy(buffer, path.data(), length);
+    return static_cast<int32_t>(length);
+}
+
+RVSymbolicator *HXLinuxPlatform::RVSymbolicatorCreateWithTaskFlagsAndNotification(mach_port_t port, uint32_t,
+                                                                                  const void *) {
+    HXLinuxTask *task = _tasks.find(port);
+    if (task == nullptr) return nullptr;
+    const HXAddressSpace &addressSpace = task->addressSpace(_readerSetting);
+    const auto images = HXFindImages(addressSpace, _pageSize, [&](size_t index) {
+        return _imageHeaders.headersOf(addressSpace, index, task->directory());
+    });
+    auto symbolicator = std::make_unique<TaskSymbolicator>();
+    for (const HXLoadedImage &image : images) {
+        auto &owner = symbolicator->owners.emplace_back();
+        owner.path = addressSpace.path(image.path).text;
+        owner.baseAddress = image.baseAddress;
+        for (const HXImageSegment &segment : image.segments)
+            owner.segments.push_back({segment.name, segment.start, segment.length});
+    }
+    return symbolicator.release();
+}
+
+void HXLinuxPlatform::RVSymbolicatorForeachSymbolOwnerAtTime(
+    RVSymbolicator *symbolicator, uint64_t, const std::function<void(const RVSymbolOwner &)> &each) {
+    const auto *task = dynamic_cast<const TaskSymbolicator *>(symbolicator);
+    if (task == nullptr) return;
+    for (const auto &owner : task->owners)
+        each({owner.path.c_str(), owner.baseAddress, owner.segments.data(), owner.segments.size()});
+}
+
+std::string HXLinuxPlatform::stringByResolvingSymlinksInPath(const std::string &path) {
+    return path; // the kernel names mapped files without links
+}

@@ -1,0 +1,24 @@
+// Which pages of shared memory are swapped out: no page table shows it.
+#pragma once
+
+#include "platform/linux/HXDescriptor.h"
+#include "platform/linux/HXMapping.h"
+
+#include <cstdint>
+#include <functional>
+#include <span>
+
+// Opens the file that a mapping maps; not open without the right to.
+HXDescriptor HXOpenMappedFile(int directory, const HXMapping &mapping);
+
+// How many of `count` pages from page `first` of the object on are swapped out; none when the kernel does not
+// tell.
+using HXCountSwapped = std::function<bool(uint64_t first, uint64_t count, uint64_t *swapped)>;
+
+// Marks, among the dispositions of the pages from page `first` of the object on, at most `limit` pages that
+// are not there as paged out: those that are swapped out, or, where that cannot be told, the first ones.
+// Answers how many.
+uint64_t HXMarkSwapped(int file, uint64_t first, uint32_t pageShift, uint64_t limit,
+                       std::span<int32_t> dispositions);
+uint64_t HXMarkSwapped(const HXCountSwapped &countSwapped, uint64_t first, uint64_t limit,
+                       std::span<int32_t> dispositions);

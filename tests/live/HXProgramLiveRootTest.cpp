@@ -1,0 +1,110 @@
+// The built program on the whole machine: needs root.
+#include "support/HXProgramRun.h"
+#include "support/HXSubject.h"
+
+#include <gtest/gtest.h>
+
+#include <csignal>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <set>
+#include <sys/mman.h>
+#include <sys/prctl.h>
+#include <unistd.h>
+
+namespace {
+
+constexpr uid_t kNobody = 65534;
+
+class HXProgramAsRoot : public testing::Test {
+  protected:
+    void SetUp() override {
+        if (geteuid() != 0) GTEST_SKIP() << "needs root";
+    }
+};
+
+// Processes with memory of their own, by /proc; kernel threads and zombies have none.
+std::set<int> userProcesses() {
+    std::set<int> pids;
+    for (const auto &entry : std::filesystem::directory_iterator("/proc")) {
+        const std::string name = entry.path().filename();
+        if (name.find_first_not_of("0123456789") != std::string::npos) continue;
+        std::ifstream statm(entry.path() / "statm");
+        long size = 0;
+        if (statm >> size && size > 0) pids.insert(std::stoi(name));
+    }
+    return pids;
+}
+
+std::map<int, int> reportedProcesses(const std::string &report) {
+    std::map<int, int> pids;
+    for (size_t at = 0; (at = report.find("]: ", at)) != std::string::npos; at++) {
+        if (report.compare(at + 5, 4, "-bit") != 0) continue;
+        const size_t open = report.rfind('[', at);
+        pids[std::stoi(report.substr(open + 1))]++;
+    }
+    return pids;
+}
+
+TEST_F(HXProgramAsRoot, ListsEveryUserProcessOnce) {
+    const HXSubject stable([]() -> std::vector<HXExpectedRegion> { return {}; });
+    const std::set<int> before = userProcesses();
+    const HXProgramRun run = HXRunHeft({"-a", "-f", "bytes"});
+    const std::set<int> after = userProcesses();
+    EXPECT_EQ(run.status, 0);
+    const std::map<int, int> reported = reportedProcesses(run.out);
+    for (const auto &[pid, times] : reported)
+        EXPECT_EQ(times, 1) << pid;
+    EXPECT_TRUE(reported.contains(0));
+    EXPECT_TRUE(reported.contains(stable.pid()));
+    for (const int pid : before)
+        if (after.contains(pid)) EXPECT_TRUE(reported.contains(pid)) << pid;
+    for (const auto &[pid, times] : reported)
+        if (pid != 0)
+            EXPECT_TRUE(before.contains(pid) || after.contains(pid)) << pid << " is no user process";
+}
+
+TEST_F(HXProgramAsRoot, RefusesWhatOnlyRootMay) {
+    EXPECT_EQ(HXRunHeft({"-a"}, kNobody).err, "Must run as root.\n");
+    EXPECT_EQ(HXRunHeft({"--unmapped", "1"}, kNobody).err, "Must run as root.\n");
+    const HXProgramRun refused = HXRunHeft({"1"}, kNobody);
+    EXPECT_EQ(refused.status, 1);
+    EXPECT_NE(refused.err.find("Unable to analyze process with pid 1 (try as root?)\n"), std::string::npos)
+        << refused.err;
+    const HXProgramRun kernel = HXRunHeft({"0"}, kNobody);
+    EXPECT_EQ(kernel.status, 0);
+    EXPECT_NE(kernel.out.find("kernel [0]: (os/kern) no access"), std::string::npos) << kernel.out;
+}
+
+// Two hundred processes that start, map, unmap and die while everything is examined again and again.
+TEST_F(HXProgramAsRoot, SurvivesAMachineInMotion) {
+    const HXSubject parent([]() -> std::vector<HXExpectedRegion> {
+        for (int i = 0; i < 200; i++) {
+            if (fork() != 0) continue;
+            prctl(PR_SET_PDEATHSIG, SIGKILL);
+            std::signal(SIGCHLD, SIG_IGN);
+            for (unsigned round = static_cast<unsigned>(i);; round++) {
+                void *all = mmap(nullptr, 64 << 12, PROT_READ | PROT_WRITE,
+                                 MAP_PRIVATE | MAP_ANONYMOUS | MAP_POPULATE, -1, 0);
+                usleep(1000 + round % 7 * 1000);
+                munmap(all, 64 << 12);
+                if (round % 4 == 0 && fork() == 0) {
+                    usleep(2000);
+                    _exit(0);
+                }
+            }
+        }
+        return {};
+    });
+    ASSERT_TRUE(parent.stopped());
+    for (int i = 0; i < 50; i++) {
+        const HXProgramRun run = HXRunHeft({"-a"});
+        ASSERT_EQ(run.status, 0) << run.err;
+        ASSERT_NE(run.out.find("Summary Heft: "), std::string::npos) << run.err;
+        ASSERT_TRUE(run.out.ends_with("\n\n") || run.out.ends_with("TOTAL\n\n") ||
+                    run.out.ends_with("TOTAL\n"));
+    }
+}
+
+} // namespace

@@ -1,0 +1,53 @@
+#include "support/HXProgramRun.h"
+
+#include <cstdio>
+
+#include <fcntl.h>
+#include <grp.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+namespace {
+
+std::string contentOf(std::FILE *file) {
+    std::string content;
+    rewind(file);
+    char buffer[1 << 16];
+    for (size_t length; (length = fread(buffer, 1, sizeof buffer, file)) > 0;)
+        content.append(buffer, length);
+    fclose(file);
+    return content;
+}
+
+} // namespace
+
+HXProgramRun HXRunProgram(const std::vector<std::string> &arguments, uid_t user) {
+    HXProgramRun run;
+    std::FILE *out = tmpfile();
+    std::FILE *err = tmpfile();
+    if (!out || !err) return run;
+    const pid_t pid = fork();
+    if (pid == 0) {
+        dup2(open("/dev/null", O_RDONLY), 0);
+        dup2(fileno(out), 1);
+        dup2(fileno(err), 2);
+        if (user != 0 && (setgroups(0, nullptr) != 0 || setgid(user) != 0 || setuid(user) != 0)) _exit(126);
+        std::vector<char *> argv;
+        for (const std::string &argument : arguments)
+            argv.push_back(const_cast<char *>(argument.c_str()));
+        argv.push_back(nullptr);
+        execv(argv[0], argv.data());
+        _exit(127);
+    }
+    int status = 0;
+    waitpid(pid, &status, 0);
+    run.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+    run.out = contentOf(out);
+    run.err = contentOf(err);
+    return run;
+}
+
+HXProgramRun HXRunHeft(std::vector<std::string> arguments, uid_t user) {
+    arguments.insert(arguments.begin(), HEFT_PROGRAM);
+    return HXRunProgram(arguments, user);
+}
