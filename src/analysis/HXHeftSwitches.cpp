@@ -12,12 +12,15 @@ enum class Cached { unknown, no, yes };
 
 constexpr char kSetting[] = "vm.self_region_heft";
 std::atomic<Cached> cachedBreakDown{Cached::unknown};
+// The platform that the cache was asked of (HXPlatform::generation).
+std::atomic<uint64_t> cachedGeneration{0};
 std::atomic<bool> sharingDisabled{false};
 
 } // namespace
 
 bool HXHeftSwitches::breakDownPhysHeft() {
-    const Cached cached = cachedBreakDown;
+    const uint64_t generation = HXPlatform::generation();
+    const Cached cached = cachedGeneration == generation ? cachedBreakDown.load() : Cached::unknown;
     if (cached != Cached::unknown) return cached == Cached::yes;
     int32_t value = 0;
     size_t size = sizeof value;
@@ -26,6 +29,7 @@ bool HXHeftSwitches::breakDownPhysHeft() {
         value = 0;
     }
     cachedBreakDown = value != 0 ? Cached::yes : Cached::no;
+    cachedGeneration = generation;
     return value != 0;
 }
 

@@ -21,6 +21,16 @@ uint64_t HXPlatform::generation() {
     return currentGeneration;
 }
 
+std::string HXPlatform::hostDescription() {
+#if defined(__x86_64__)
+    return "X86-64";
+#elif defined(__aarch64__)
+    return "ARM64";
+#else
+    return "unknown architecture";
+#endif
+}
+
 void HXPlatform::mach_error(const char *label, kern_return_t error) {
     std::fprintf(stderr, "%s: %s\n", label, mach_error_string(error));
 }

@@ -109,6 +109,9 @@ class HXPlatform {
     // Bytes in a page of the machine, a power of two.
     virtual uint32_t vm_kernel_page_size() = 0;
 
+    // What the host is, its machine architecture named as memory graphs name it, like "Linux 6.1.0, X86-64".
+    virtual std::string hostDescription();
+
     // Whether tasks of this host have a shared region at all. Without one its base and size are 0 for every
     // task.
     virtual bool hasSharedRegion() = 0;

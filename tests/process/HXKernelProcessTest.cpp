@@ -1,6 +1,6 @@
 #include "process/HXKernelProcess.h"
 
-#include "support/HXEmptyPlatform.h"
+#include "support/HXBarePlatform.h"
 
 #include <gtest/gtest.h>
 
@@ -45,7 +45,7 @@ mach_memory_info_record counter(uint64_t flags, uint64_t number, uint64_t mapped
 }
 
 // A kernel of made-up records, which counts what is handed out and given back.
-class KernelPlatform : public HXEmptyPlatform {
+class KernelPlatform : public HXBarePlatform {
   public:
     class Symbolicator : public RVSymbolicator {};
 
@@ -96,14 +96,12 @@ class KernelPlatform : public HXEmptyPlatform {
 class HXKernelProcessTest : public testing::Test {
   protected:
     void SetUp() override {
-        HXPlatform::setCurrent(&platform);
         proc_bsdinfo info{};
         info.pbi_flags = PROC_FLAG_SYSTEM | PROC_FLAG_LP64;
         std::memcpy(info.pbi_name, "kernel", 6);
         kernel = HXProcess::processWithBsdInfo(info);
         ASSERT_NE(dynamic_cast<HXKernelProcess *>(kernel.get()), nullptr);
     }
-    void TearDown() override { HXPlatform::setCurrent(nullptr); }
 
     // The single region that one record makes.
     const HXMemoryRegion &regionOf(const mach_memory_info_record &record) {
@@ -135,7 +133,7 @@ const std::string k80(80, 'n');
 TEST_F(HXKernelProcessTest, isConstructedFromTheSystemRecord) {
     EXPECT_EQ(kernel->displayString(), "kernel [0]");
     EXPECT_EQ(kernel->idleExitStatus(), HXIdleExitNotSupported);
-    EXPECT_EQ(kernel->pageSize(), 4096u);
+    EXPECT_EQ(kernel->pageSize(), 16384u);
     EXPECT_TRUE(counters().empty());
 }
 

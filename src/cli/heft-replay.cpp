@@ -1,0 +1,43 @@
+// heft-replay: heft over a machine that a file describes.
+#include "cli/HXHeftMain.h"
+#include "platform/linux/HXLinuxPlatform.h"
+#include "platform/replay/HXReplayPlatform.h"
+
+#include <cstdio>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace {
+constexpr char kUsage[] = "Usage: heft-replay FILE [heft's arguments]\n"
+                          "\n"
+                          "Prints heft's report on the machine that the machine file FILE describes.\n"
+                          "heft-record writes such files; heft --help tells heft's arguments.\n";
+}
+
+int main(int argc, char *argv[]) {
+    if (argc < 2) {
+        std::fputs(kUsage, stderr);
+        return 1;
+    }
+    if (std::string_view(argv[1]) == "--help" || std::string_view(argv[1]) == "-h") {
+        std::fputs(kUsage, stdout);
+        return 0;
+    }
+    static HXLinuxPlatform live;
+    live.prepareProcess();
+    std::string reason;
+    static std::unique_ptr<HXMachine> machine;
+    machine = HXMachine::load(live, argv[1], &reason);
+    if (!machine) {
+        std::fprintf(stderr, "%s: %s\n", argv[1], reason.c_str());
+        return 1;
+    }
+    static HXReplayPlatform replay(*machine, live);
+    HXPlatform::setCurrent(&replay);
+
+    std::vector<char *> arguments = {argv[0]};
+    arguments.insert(arguments.end(), argv + 2, argv + argc);
+    arguments.push_back(nullptr);
+    return HXHeftMain(argc - 1, arguments.data());
+}
