@@ -309,6 +309,6 @@ const Case cases[] = {
 };
 
 INSTANTIATE_TEST_SUITE_P(Subjects, HXLiveRegions, testing::ValuesIn(cases),
-                         [](const auto &info) { return info.param.name; });
+                         [](const auto &each) { return each.param.name; });
 
 } // namespace

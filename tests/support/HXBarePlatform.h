@@ -1,107 +1,33 @@
-// A host with nothing on it: no process, no memory, no settings but the analysis switch. The tests of classes
-// that hardly ask the host derive from it what they need.
+// A host with nothing on it but the analysis switch, and the real machine's command line, files and queue. It
+// is the current platform while it lives.
 #pragma once
 
-#include "platform/HXPlatform.h"
+#include "support/HXEmptyPlatform.h"
 
-#include <string>
-#include <vector>
+#include <set>
 
-class HXBarePlatform : public HXPlatform {
+class HXBarePlatform : public HXEmptyPlatform {
   public:
     // "vm.self_region_heft"; none: the kernel lacks the setting. An error other than 0 fails its queries.
     std::optional<uint32_t> selfRegionHeft = 1;
     int settingError = 0;
     int settingReads = 0;
-    uint32_t pageSize = 16384;
 
     HXBarePlatform() { setCurrent(this); }
     ~HXBarePlatform() override { setCurrent(nullptr); }
 
-    mach_port_t mach_task_self() override { return 1; }
-    kern_return_t task_for_pid(mach_port_t, int32_t, mach_port_t *) override { return KERN_FAILURE; }
-    void mach_port_deallocate(mach_port_t, mach_port_t) override {}
-    kern_return_t mach_vm_region(mach_port_t, uint64_t *, uint64_t *, int32_t, vm_region_basic_info_64 *,
-                                 uint32_t *) override {
-        return KERN_INVALID_ADDRESS;
-    }
-    kern_return_t mach_vm_region_recurse(mach_port_t, uint64_t *, uint64_t *, uint32_t *,
-                                         vm_region_submap_info_64 *, uint32_t *) override {
-        return KERN_INVALID_ADDRESS;
-    }
-    kern_return_t mach_vm_page_range_query(mach_port_t, uint64_t, uint64_t, int32_t *, uint64_t *) override {
-        return KERN_INVALID_ADDRESS;
-    }
-    kern_return_t mach_vm_purgable_control(mach_port_t, uint64_t, int32_t, int32_t *) override {
-        return KERN_INVALID_ARGUMENT;
-    }
-    uint32_t vm_kernel_page_size() override { return pageSize; }
+    uint32_t vm_kernel_page_size() override { return 16384; }
     bool hasSharedRegion() override { return true; }
-
-    int32_t proc_listallpids(int32_t *, uint32_t) override { return -1; }
-    int32_t proc_pidinfo(int32_t, int32_t, uint64_t, void *, uint32_t) override { return 0; }
-    int32_t proc_pid_rusage(int32_t, int32_t, rusage_info_v4 *) override { return -1; }
-    int32_t proc_get_dirty(int32_t, uint32_t *) override { return -1; }
-    int32_t proc_regionfilename(int32_t, uint64_t, char *, uint32_t) override { return 0; }
-    int32_t getpid() override { return 1; }
-    uint32_t geteuid() override { return 0; }
-    int32_t sysctl(const int32_t *, uint32_t, void *, size_t *) override { return -1; }
     int32_t sysctlbyname(const char *name, void *old, size_t *oldBytes, const void *newValue,
                          size_t newBytes) override;
-    int32_t ledger(int32_t, int32_t, void *, int64_t *) override { return -1; }
-
-    RVSymbolicator *RVSymbolicatorCreateWithTaskFlagsAndNotification(mach_port_t, uint32_t,
-                                                                     const void *) override {
-        return nullptr;
-    }
-    void RVSymbolicatorForeachSymbolOwnerAtTime(RVSymbolicator *, uint64_t,
-                                                const std::function<void(const RVSymbolOwner &)> &) override {
-    }
-    std::string stringByResolvingSymlinksInPath(const std::string &path) override { return path; }
-    RVSymbolicator *RVSymbolicatorCreateWithMachKernelFlagsAndNotification(uint32_t, const void *) override {
-        return nullptr;
-    }
-    RVSymbol RVSymbolicatorGetSymbolWithAddressAtTime(RVSymbolicator *, uint64_t, uint64_t) override {
-        return {};
-    }
-    RVSourceInfo RVSymbolicatorGetSourceInfoWithAddressAtTime(RVSymbolicator *, uint64_t, uint64_t) override {
-        return {nullptr, 0, true};
-    }
-    void RVRelease(RVSymbolicator *) override {}
-    mach_port_t mach_host_self() override { return 1; }
-    kern_return_t mach_memory_info(mach_port_t, mach_zone_name **, uint32_t *, mach_zone_info **, uint32_t *,
-                                   mach_memory_info_record **, uint32_t *) override {
-        return KERN_NO_ACCESS;
-    }
-    kern_return_t vm_deallocate(mach_port_t, const void *, uint64_t) override { return KERN_SUCCESS; }
-    std::vector<OSKextInfo> OSKextCopyLoadedKextInfo() override { return {}; }
+    // Tag 100 is a heap; tag 101 has a description that tells nothing.
     std::optional<std::string> GXRegionTypeDescriptionForTagShareProtAndPager(uint32_t tag, uint8_t, int32_t,
                                                                               uint8_t) override;
-
     HXOptionScan getopt_long(int argc, char *const argv[], const char *shortOptions,
                              const std::vector<HXLongOption> &options, bool restart) override;
-    bool stat(const std::string &) override { return false; }
+    bool stat(const std::string &path) override;
     std::FILE *fopen(const std::string &path, const char *mode) override {
         return std::fopen(path.c_str(), mode);
     }
-    std::optional<std::string> readFile(const std::string &, uint64_t) override { return std::nullopt; }
-    std::optional<HXPendingFile> createPendingFile(const std::string &) override { return std::nullopt; }
-    bool commitPendingFile(HXPendingFile &) override { return false; }
-    void discardPendingFile(HXPendingFile &) override {}
-    bool isatty(int) override { return false; }
-
-    HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) override {
-        return {label, qualityOfService};
-    }
-    // On the calling thread, in order.
-    void dispatch_apply(size_t iterations, const HXDispatchQueue &,
-                        const std::function<void(size_t)> &work) override {
-        for (size_t i = 0; i < iterations; i++)
-            work(i);
-    }
-    std::unique_ptr<HXDispatchSource> dispatch_source_create(int) override { return nullptr; }
-    void dispatch_source_set_event_handler(HXDispatchSource &, std::function<void()>) override {}
-    void dispatch_resume(HXDispatchSource &) override {}
-    void dispatch_source_cancel(HXDispatchSource &) override {}
-    void signal(int, HXSignalDisposition) override {}
+    std::optional<std::string> readFile(const std::string &path, uint64_t limit) override;
 };
