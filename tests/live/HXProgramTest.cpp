@@ -76,7 +76,7 @@ TEST(HXProgram, SaysWhatIsWrongWithItsArguments) {
         EXPECT_EQ(run.status, each.status) << label;
         EXPECT_TRUE(contains(run.err, each.err)) << label << ": " << run.err;
         EXPECT_EQ(contains(run.out, kUsageStart), each.usage) << label;
-        if (!each.usage) EXPECT_EQ(run.out, "") << label;
+        EXPECT_EQ(run.out.empty(), !each.usage) << label;
     }
 }
 

@@ -8,6 +8,10 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+namespace {
+constexpr uint64_t kEndOfExpected = UINT64_MAX;
+}
+
 HXSubject::HXSubject(const SetUp &setUp) {
     int ends[2];
     if (pipe(ends) != 0) return;
@@ -17,7 +21,9 @@ HXSubject::HXSubject(const SetUp &setUp) {
         prctl(PR_SET_PDEATHSIG, SIGKILL);
         if (getppid() != parent) _exit(1);
         close(ends[0]);
-        const std::vector<HXExpectedRegion> expected = setUp();
+        std::vector<HXExpectedRegion> expected = setUp();
+        // The end is marked, since the subject's own children may hold the pipe open.
+        expected.push_back({.start = kEndOfExpected});
         for (const HXExpectedRegion &region : expected)
             if (write(ends[1], &region, sizeof region) != static_cast<ssize_t>(sizeof region)) _exit(1);
         close(ends[1]);
@@ -26,7 +32,8 @@ HXSubject::HXSubject(const SetUp &setUp) {
     }
     close(ends[1]);
     HXExpectedRegion region;
-    while (read(ends[0], &region, sizeof region) == static_cast<ssize_t>(sizeof region))
+    while (read(ends[0], &region, sizeof region) == static_cast<ssize_t>(sizeof region) &&
+           region.start != kEndOfExpected)
         _expected.push_back(region);
     close(ends[0]);
     waitUntilStopped();

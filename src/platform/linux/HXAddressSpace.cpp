@@ -29,7 +29,7 @@ void HXAddressSpace::append(HXMapping mapping) {
         const uint64_t previousEnd = (*this)[_count - 1].end;
         if (mapping.end <= previousEnd) return;
         if (mapping.start < previousEnd) {
-            if (mapping.inode != 0) mapping.offset += previousEnd - mapping.start;
+            if (mapping.isFile()) mapping.offset += previousEnd - mapping.start;
             mapping.start = previousEnd;
         }
     }

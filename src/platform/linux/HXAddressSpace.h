@@ -27,6 +27,7 @@ class HXAddressSpace {
     // What a query past the last mapping answers: KERN_INVALID_ADDRESS when all mappings were read, else why
     // not: MACH_SEND_INVALID_DEST for a process that died or executed another program meanwhile.
     kern_return_t endError = KERN_INVALID_ADDRESS;
+    bool knowsDirtyPages = false;
     uint64_t ipcNamespace = 0; // read when there is System V memory
 
     size_t count() const { return _count; }

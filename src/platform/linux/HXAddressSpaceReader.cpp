@@ -1,6 +1,7 @@
 #include "platform/linux/HXAddressSpaceReader.h"
 
 #include "platform/linux/HXMapsParser.h"
+#include "platform/linux/HXPageScan.h"
 #include "platform/linux/HXProcFile.h"
 #include "platform/linux/HXProcText.h"
 #include "platform/linux/HXTextNumber.h"
@@ -15,28 +16,34 @@ namespace {
 
 class Reader {
   public:
-    Reader(int directory, const HXReaderSetting &setting)
-        : _directory(directory), _setting(setting), _addressSpace(std::make_unique<HXAddressSpace>()) {
-        _lookup.directory = directory;
+    Reader(const HXReadRequest &request, const HXReaderSetting &setting)
+        : _request(request), _setting(setting) {
+        _lookup.directory = request.directory;
     }
 
-    std::unique_ptr<HXAddressSpace> read(std::optional<uint64_t> threadCount);
+    std::unique_ptr<HXAddressSpace> read();
 
   private:
+    bool mapsMaySuffice();
+    bool mapsSuffice() const;
+    bool hasFreedLazily() const;
+    bool readMapsAndScan();
+    void readFile(const char *name);
     void readMappings(const HXDescriptor &file);
     void take(const HXMapsEntry &entry);
     HXFileSystemKind fileSystemOf(const HXMapping &mapping, const HXMappedPath &path);
     bool isDeviceFile(const HXMapping &mapping, const HXMappedPath &path) const;
     kern_return_t endError(const HXDescriptor &file) const;
-    bool isSingleThreaded(std::optional<uint64_t> threadCount) const;
+    bool isSingleThreaded() const;
 
-    const int _directory;
+    HXReadRequest _request;
     const HXReaderSetting &_setting;
     HXFileSystemLookup _lookup;
     std::unique_ptr<HXAddressSpace> _addressSpace;
     bool _readFailed = false;
     bool _sawStack = false;
     bool _sawGate = false;
+    bool _sawSwapBacked = false;
 };
 
 std::optional<HXStatRecord> readStat(int directory) {
@@ -68,16 +75,57 @@ uint64_t readIpcNamespace(int directory) {
     return number;
 }
 
-std::unique_ptr<HXAddressSpace> Reader::read(std::optional<uint64_t> threadCount) {
-    const HXDescriptor file = HXOpenAt(_directory, "smaps");
+std::unique_ptr<HXAddressSpace> Reader::read() {
+    if (!mapsMaySuffice() || !readMapsAndScan()) {
+        readFile("smaps");
+        _addressSpace->knowsDirtyPages = true;
+    }
+    if (_addressSpace->count() > 0 && (!_sawStack || !isSingleThreaded()))
+        HXTagThreadStacks(_request.directory, _addressSpace.get());
+    return std::move(_addressSpace);
+}
+
+// Locked mappings and dirty file pages show in smaps alone; pages of the huge-page pool are left to it, too.
+bool Reader::mapsMaySuffice() {
+    if (!_setting.mayScan || _request.needsDirtyPages || !HXPageScan::isComplete()) return false;
+    if (!_request.status) _request.status = HXReadStatus(_request.directory);
+    return _request.status && _request.status->lockedSize == 0 && _request.status->hugePageSize == 0;
+}
+
+bool Reader::readMapsAndScan() {
+    readFile("maps");
+    if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return true;
+    return mapsSuffice() && HXScanFigures(_request.directory, _setting.pageShift, _request.status->swapSize,
+                                          _addressSpace.get());
+}
+
+bool Reader::mapsSuffice() const {
+    // Page tables do not show which pages of shared memory are swapped out.
+    if (_sawSwapBacked && _setting.machine->usesSwap()) return false;
+    return !_setting.machine->hasFreedLazily() || !hasFreedLazily();
+}
+
+// Whether the process holds lazily freed pages, which look like others in the page tables; also true where
+// smaps costs less than to find out.
+bool Reader::hasFreedLazily() const {
+    constexpr uint64_t fewPagesPerMapping = 128;
+    const uint64_t pages = _request.status->residentSize >> _setting.pageShift;
+    if (pages > fewPagesPerMapping * _addressSpace->count()) return true;
+    char buffer[4096];
+    const auto text = HXReadOnce(_request.directory, "smaps_rollup", buffer);
+    return !text || HXParseLabelled(*text, "LazyFree:").value_or(1) != 0;
+}
+
+void Reader::readFile(const char *name) {
+    _addressSpace = std::make_unique<HXAddressSpace>();
+    _readFailed = _sawStack = _sawGate = _sawSwapBacked = false;
+    const HXDescriptor file = HXOpenAt(_request.directory, name);
     if (!file) {
         _addressSpace->endError = errorOfOpening(errno);
-        return std::move(_addressSpace);
+        return;
     }
     readMappings(file);
     _addressSpace->endError = endError(file);
-    if (!_sawStack || !isSingleThreaded(threadCount)) HXTagThreadStacks(_directory, _addressSpace.get());
-    return std::move(_addressSpace);
 }
 
 void Reader::readMappings(const HXDescriptor &file) {
@@ -105,18 +153,19 @@ void Reader::take(const HXMapsEntry &entry) {
     mapping.path = _addressSpace->intern(entry.path);
     const HXMappedPath &path = _addressSpace->path(mapping.path);
     const HXFileSystemKind fileSystem = fileSystemOf(mapping, path);
-    const uint32_t sharedMemory = mapping.inode == 0 ? 0 : _setting.fileSystems->sharedMemoryDevice();
+    const uint32_t sharedMemory = !mapping.isFile() ? 0 : _setting.fileSystems->sharedMemoryDevice();
     HXClassifyMapping(path.kind, fileSystem, sharedMemory, path.namedTag, &mapping);
+    if (mapping.has(HXMappingSwapBacked)) _sawSwapBacked = true;
     if (path.kind == HXPathKind::stack) _sawStack = true;
     if (path.kind == HXPathKind::special && path.text == "[vsyscall]") _sawGate = true;
     if (path.kind == HXPathKind::systemV && _addressSpace->ipcNamespace == 0)
-        _addressSpace->ipcNamespace = readIpcNamespace(_directory);
+        _addressSpace->ipcNamespace = readIpcNamespace(_request.directory);
     _addressSpace->append(mapping);
 }
 
 HXFileSystemKind Reader::fileSystemOf(const HXMapping &mapping, const HXMappedPath &path) {
-    if (mapping.inode == 0 || (path.kind != HXPathKind::file && path.kind != HXPathKind::deletedFile &&
-                               path.kind != HXPathKind::memfd && path.kind != HXPathKind::systemV))
+    if (!mapping.isFile() || (path.kind != HXPathKind::file && path.kind != HXPathKind::deletedFile &&
+                              path.kind != HXPathKind::memfd && path.kind != HXPathKind::systemV))
         return HXFileSystemKind::unknown;
     if (mapping.device == _setting.fileSystems->sharedMemoryDevice() || path.text.front() != '/')
         return HXFileSystemKind::unknown;
@@ -131,7 +180,7 @@ bool Reader::isDeviceFile(const HXMapping &mapping, const HXMappedPath &path) co
     struct statx status;
     const std::string below = "root" + path.text;
     const int flags = AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT | AT_STATX_DONT_SYNC;
-    if (::statx(_directory, below.c_str(), flags, STATX_TYPE | STATX_INO, &status) != 0) return true;
+    if (::statx(_request.directory, below.c_str(), flags, STATX_TYPE | STATX_INO, &status) != 0) return true;
     return !S_ISREG(status.stx_mode) || status.stx_ino != mapping.inode;
 }
 
@@ -143,19 +192,19 @@ kern_return_t Reader::endError(const HXDescriptor &file) const {
     char byte;
     if (::pread(file.get(), &byte, 1, 0) > 0) return KERN_INVALID_ADDRESS;
     if (_addressSpace->count() > 0) return MACH_SEND_INVALID_DEST;
-    const auto stat = readStat(_directory);
+    const auto stat = readStat(_request.directory);
     return stat && !stat->isZombie() ? KERN_INVALID_ADDRESS : MACH_SEND_INVALID_DEST;
 }
 
-bool Reader::isSingleThreaded(std::optional<uint64_t> threadCount) const {
-    if (threadCount) return *threadCount <= 1;
-    const auto stat = readStat(_directory);
+bool Reader::isSingleThreaded() const {
+    if (_request.status) return _request.status->threadCount <= 1;
+    const auto stat = readStat(_request.directory);
     return !stat || stat->threadCount <= 1;
 }
 
 } // namespace
 
-std::unique_ptr<HXAddressSpace> HXReadAddressSpace(int directory, const HXReaderSetting &setting,
-                                                   std::optional<uint64_t> threadCount) {
-    return Reader(directory, setting).read(threadCount);
+std::unique_ptr<HXAddressSpace> HXReadAddressSpace(const HXReadRequest &request,
+                                                   const HXReaderSetting &setting) {
+    return Reader(request, setting).read();
 }

@@ -3,6 +3,8 @@
 
 #include "platform/linux/HXAddressSpace.h"
 #include "platform/linux/HXFileSystems.h"
+#include "platform/linux/HXMachineFacts.h"
+#include "platform/linux/HXProcText.h"
 
 #include <cstdint>
 #include <memory>
@@ -11,13 +13,30 @@
 // What the readings of all address spaces share.
 struct HXReaderSetting {
     HXFileSystems *fileSystems;
+    HXMachineFacts *machine;
     uint32_t pageShift;
+    // Whether figures may be counted from the page tables where that is enough, which is faster than smaps.
+    bool mayScan;
 };
 
-// Reads the mappings of the process whose directory in /proc is open as `directory`, and classifies them.
-// `threadCount`: where it is known already. A process that vanishes leaves what was read until then.
-std::unique_ptr<HXAddressSpace> HXReadAddressSpace(int directory, const HXReaderSetting &setting,
-                                                   std::optional<uint64_t> threadCount);
+// What a reader of one process knows and wants.
+struct HXReadRequest {
+    int directory;                        // of the process in /proc
+    std::optional<HXStatusRecord> status; // where it has been read already
+    bool needsDirtyPages = true;          // HXMapping::dirtyPages
+};
+
+// Reads the mappings of a process and classifies them. A process that vanishes leaves what was read until
+// then.
+std::unique_ptr<HXAddressSpace> HXReadAddressSpace(const HXReadRequest &request,
+                                                   const HXReaderSetting &setting);
+
+// Reads and parses the status of a process; none with errno set.
+std::optional<HXStatusRecord> HXReadStatus(int directory);
+
+// Counts the resident and swapped pages of all mappings by the process's page tables. False when they cannot
+// tell: `swappedSize`, what the kernel has counted, is not what is found.
+bool HXScanFigures(int directory, uint32_t pageShift, uint64_t swappedSize, HXAddressSpace *addressSpace);
 
 // Gives the mappings that hold the stack pointers of threads the user tag of stacks. Threads that keep
 // running, and those beyond the first few thousand, are left out.

@@ -51,7 +51,7 @@ class Finder {
 
 bool mapsCode(const HXMapping &mapping) {
     const auto kind = static_cast<HXPathKind>(mapping.kind);
-    return mapping.has(HXMappingExecutable) && !mapping.has(HXMappingShared) && mapping.inode != 0 &&
+    return mapping.has(HXMappingExecutable) && !mapping.has(HXMappingShared) && mapping.isFile() &&
            (kind == HXPathKind::file || kind == HXPathKind::deletedFile || kind == HXPathKind::memfd);
 }
 
@@ -116,7 +116,7 @@ void Finder::assignMappings() {
 
 void Finder::assign(const HXMapping &mapping, Candidate *candidate) const {
     HXImageSegment segment{nullptr, mapping.start, mapping.end - mapping.start};
-    if (mapping.inode != 0) {
+    if (mapping.isFile()) {
         if (mapping.device == candidate->device && mapping.inode == candidate->inode)
             segment.name = nameInFile(mapping, *candidate);
     } else if (const auto part = zeroFilledPart(mapping, *candidate)) {

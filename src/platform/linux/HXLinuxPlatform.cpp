@@ -6,6 +6,7 @@
 #include "platform/linux/HXLinuxFiles.h"
 
 #include <fcntl.h>
+#include <malloc.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 
@@ -49,7 +50,9 @@ int32_t failed(int error) {
 
 HXLinuxPlatform::HXLinuxPlatform(const Setting &setting)
     : _pageSize(machinePageSize()), _fileSystems(setting.sharedMemoryDevice),
-      _readerSetting{&_fileSystems, static_cast<uint32_t>(std::countr_zero(_pageSize))},
+      _machine(setting.procPath), _readerSetting{&_fileSystems, &_machine,
+                                                 static_cast<uint32_t>(std::countr_zero(_pageSize)),
+                                                 setting.mayScanPageTables},
       _imageHeaders(_fileSystems, _pageSize), _processes(setting.procPath),
       _kernelMemory(setting.procPath, setting.sysPath, _pageSize) {}
 
@@ -59,6 +62,9 @@ void HXLinuxPlatform::prepareProcess() {
         // The lowest free descriptor is this one.
         [[maybe_unused]] const int opened = ::open("/dev/null", O_RDWR);
     }
+    // Heaps of worker threads then grow in few steps, each of which is a system call that stops the others.
+    constexpr int heapStep = 1 << 20;
+    ::mallopt(M_TOP_PAD, heapStep);
     rlimit limit;
     if (::getrlimit(RLIMIT_NOFILE, &limit) != 0) return;
     limit.rlim_cur = limit.rlim_max;

@@ -19,6 +19,9 @@ class HXLinuxPlatform final : public HXPlatform {
         std::string sysPath = "/sys";
         // The device of the kernel's own tmpfs; found out where it is not given.
         uint32_t sharedMemoryDevice = UINT32_MAX;
+        // Whether figures may come from page tables where they suffice; else always from smaps. For tests and
+        // benchmarks.
+        bool mayScanPageTables = true;
     };
     // Touches no system.
     HXLinuxPlatform() : HXLinuxPlatform(Setting()) {}
@@ -103,6 +106,7 @@ class HXLinuxPlatform final : public HXPlatform {
     void signal(int signal, HXSignalDisposition disposition) override;
 
   private:
+    const HXAddressSpace &addressSpaceOf(HXLinuxTask *task);
     // The first mapping whose end lies above *address, of which it stores the place; null with *error.
     const HXMapping *mappingAt(HXLinuxTask *task, uint64_t *address, uint64_t *size, kern_return_t *error);
     vm_region_submap_info_64 infoOf(HXLinuxTask *task, const HXMapping &mapping);
@@ -110,6 +114,7 @@ class HXLinuxPlatform final : public HXPlatform {
 
     const uint32_t _pageSize;
     HXFileSystems _fileSystems;
+    HXMachineFacts _machine;
     const HXReaderSetting _readerSetting;
     HXImageHeaders _imageHeaders;
     HXLinuxProcesses _processes;

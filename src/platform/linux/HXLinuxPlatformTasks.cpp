@@ -50,14 +50,18 @@ void HXLinuxPlatform::mach_port_deallocate(mach_port_t, mach_port_t task) {
     _tasks.remove(task);
 }
 
+const HXAddressSpace &HXLinuxPlatform::addressSpaceOf(HXLinuxTask *task) {
+    return task->addressSpace(_readerSetting, _reportsCharge.load(std::memory_order_relaxed) == 0);
+}
+
 const HXMapping *HXLinuxPlatform::mappingAt(HXLinuxTask *task, uint64_t *address, uint64_t *size,
                                             kern_return_t *error) {
     if (task == nullptr) {
         *error = KERN_INVALID_ARGUMENT;
         return nullptr;
     }
-    const HXAddressSpace &addressSpace = task->addressSpace(_readerSetting);
-    const size_t index = task->find(*address, _readerSetting);
+    const HXAddressSpace &addressSpace = addressSpaceOf(task);
+    const size_t index = task->find(*address);
     if (index == addressSpace.count()) {
         *error = addressSpace.endError;
         return nullptr;
@@ -72,7 +76,7 @@ const HXMapping *HXLinuxPlatform::mappingAt(HXLinuxTask *task, uint64_t *address
 vm_region_submap_info_64 HXLinuxPlatform::infoOf(HXLinuxTask *task, const HXMapping &mapping) {
     HXRegionContext context;
     context.pid = task->pid();
-    context.ipcNamespace = task->addressSpace(_readerSetting).ipcNamespace;
+    context.ipcNamespace = addressSpaceOf(task).ipcNamespace;
     context.reportsCharge = _reportsCharge.load(std::memory_order_relaxed) != 0;
     return HXRegionInfo(mapping, context);
 }
@@ -120,8 +124,8 @@ kern_return_t HXLinuxPlatform::mach_vm_page_range_query(mach_port_t port, uint64
     const uint64_t mask = _pageSize - 1;
     const uint64_t start = address & ~mask;
     const uint64_t pages = std::min<uint64_t>((size + (address - start) + mask) / _pageSize, *count);
-    const kern_return_t error = task->pages().query(task->addressSpace(_readerSetting), start,
-                                                    std::span(dispositions, static_cast<size_t>(pages)));
+    const kern_return_t error =
+        task->pages().query(addressSpaceOf(task), start, std::span(dispositions, static_cast<size_t>(pages)));
     if (error == KERN_SUCCESS) *count = pages;
     return error;
 }
@@ -137,10 +141,10 @@ int32_t HXLinuxPlatform::proc_regionfilename(int32_t pid, uint64_t address, char
         errno = ESRCH;
         return 0;
     }
-    const HXAddressSpace &addressSpace = task->addressSpace(_readerSetting);
-    const size_t index = task->find(address, _readerSetting);
+    const HXAddressSpace &addressSpace = addressSpaceOf(task);
+    const size_t index = task->find(address);
     if (index == addressSpace.count() || !addressSpace[index].contains(address) ||
-        addressSpace[index].inode == 0)
+        !addressSpace[index].isFile())
         return 0;
     const std::string &path = addressSpace.path(addressSpace[index].path).text;
     const size_t length = std::min<size_t>(path.size(), bufferBytes);
@@ -152,7 +156,7 @@ RVSymbolicator *HXLinuxPlatform::RVSymbolicatorCreateWithTaskFlagsAndNotificatio
                                                                                   const void *) {
     HXLinuxTask *task = _tasks.find(port);
     if (task == nullptr) return nullptr;
-    const HXAddressSpace &addressSpace = task->addressSpace(_readerSetting);
+    const HXAddressSpace &addressSpace = addressSpaceOf(task);
     const auto images = HXFindImages(addressSpace, _pageSize, [&](size_t index) {
         return _imageHeaders.headersOf(addressSpace, index, task->directory());
     });

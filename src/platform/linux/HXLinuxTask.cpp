@@ -1,24 +1,13 @@
 #include "platform/linux/HXLinuxTask.h"
 
-#include "platform/linux/HXProcFile.h"
-
-std::optional<HXStatusRecord> HXReadStatus(int directory) {
-    char buffer[8192];
-    const auto text = HXReadOnce(directory, "status", buffer);
-    if (!text) return std::nullopt;
-    return HXParseStatus(*text);
-}
-
-HXAddressSpace &HXLinuxTask::addressSpace(const HXReaderSetting &setting) {
-    if (!_addressSpace) {
-        const auto threads = _status ? std::optional(_status->threadCount) : std::nullopt;
-        _addressSpace = HXReadAddressSpace(directory(), setting, threads);
-    }
+const HXAddressSpace &HXLinuxTask::addressSpace(const HXReaderSetting &setting, bool needsDirtyPages) {
+    if (!_addressSpace || (needsDirtyPages && !_addressSpace->knowsDirtyPages))
+        _addressSpace = HXReadAddressSpace({directory(), _status, needsDirtyPages}, setting);
     return *_addressSpace;
 }
 
-size_t HXLinuxTask::find(uint64_t address, const HXReaderSetting &setting) {
-    _cursor = addressSpace(setting).find(address, _cursor);
+size_t HXLinuxTask::find(uint64_t address) {
+    _cursor = _addressSpace->find(address, _cursor);
     return _cursor;
 }
 

@@ -26,10 +26,12 @@ class HXLinuxTask {
     int32_t pid() const { return _pid; }
     int directory() const { return _directory.get(); }
 
-    // The address space as it was when this was first asked for.
-    HXAddressSpace &addressSpace(const HXReaderSetting &setting);
-    // The index of the first mapping that ends above `address`. A walk in ascending order costs no search.
-    size_t find(uint64_t address, const HXReaderSetting &setting);
+    // The address space as it was when this was first asked for; read again when dirty file pages are wanted
+    // of one that was read without them.
+    const HXAddressSpace &addressSpace(const HXReaderSetting &setting, bool needsDirtyPages);
+    // The index in the address space, once read, of the first mapping that ends above `address`. A walk in
+    // ascending order costs no search.
+    size_t find(uint64_t address);
     HXPageReader &pages() { return _pages; }
 
     // The process's status; none with errno set. `usage` and `ledger` share one reading when they are asked
@@ -46,9 +48,6 @@ class HXLinuxTask {
     std::optional<HXStatusRecord> _status;
     bool _used[2] = {};
 };
-
-// Reads and parses the status of the process with that directory; none with errno set.
-std::optional<HXStatusRecord> HXReadStatus(int directory);
 
 // The open tasks by port and by pid. Any thread; looking up a port takes no lock.
 class HXTaskTable {

@@ -38,6 +38,8 @@ struct HXMapping {
     uint8_t kind = 0;        // HXPathKind
     uint8_t tag = 0;         // user tag
 
+    // Of a file or a shared object. An inode number may be 0: System V memory's is its identifier.
+    bool isFile() const { return device != 0 || inode != 0; }
     bool has(uint16_t wanted) const { return (flags & wanted) != 0; }
     bool contains(uint64_t address) const { return address >= start && address < end; }
 };

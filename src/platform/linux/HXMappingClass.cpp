@@ -30,13 +30,9 @@ bool isAccessible(const HXMapping &mapping) {
     return mapping.has(HXMappingReadable | HXMappingWritable | HXMappingExecutable);
 }
 
-bool isFile(const HXMapping &mapping) {
-    return mapping.inode != 0;
-}
-
 bool isPrivateAnonymous(const HXMapping &mapping) {
     if (mapping.has(HXMappingShared)) return false;
-    return !isFile(mapping) || mapping.kind == static_cast<uint8_t>(HXPathKind::anonymousHuge);
+    return !mapping.isFile() || mapping.kind == static_cast<uint8_t>(HXPathKind::anonymousHuge);
 }
 
 uint32_t saturated(uint64_t pages) {
@@ -52,7 +48,7 @@ uint8_t tagOf(const HXMapping &mapping, HXPathKind kind, uint8_t namedTag) {
     if (!isAccessible(mapping)) return HXHostTagGuard;
     if (namedTag != 0) return namedTag;
     const bool huge = mapping.has(HXMappingHugePages);
-    const bool anonymous = mapping.has(HXMappingShared) || isFile(mapping);
+    const bool anonymous = mapping.has(HXMappingShared) || mapping.isFile();
     switch (kind) {
     case HXPathKind::heap:
         return HXHostTagHeap;
@@ -82,7 +78,7 @@ bool isNamelessSharedMemory(HXPathKind kind) {
 }
 
 bool hasPager(const HXMapping &mapping, HXPathKind kind) {
-    if (!isFile(mapping) || isNamelessSharedMemory(kind)) return false;
+    if (!mapping.isFile() || isNamelessSharedMemory(kind)) return false;
     const bool nameIsGone = kind == HXPathKind::deletedFile;
     return !(nameIsGone && mapping.has(HXMappingSwapBacked | HXMappingHugePages));
 }
@@ -137,10 +133,10 @@ std::string_view HXGivenName(std::string_view path) {
 void HXClassifyMapping(HXPathKind kind, HXFileSystemKind fileSystem, uint32_t sharedMemoryDevice,
                        uint8_t namedTag, HXMapping *mapping) {
     const bool huge = mapping->has(HXMappingHugePages);
-    const bool kernelsOwn = isFile(*mapping) && mapping->device == sharedMemoryDevice;
+    const bool kernelsOwn = mapping->isFile() && mapping->device == sharedMemoryDevice;
     if (isNamelessSharedMemory(kind) && !kernelsOwn && !huge) kind = HXPathKind::deletedFile;
     mapping->kind = static_cast<uint8_t>(kind);
-    if (!huge && (kernelsOwn || (isFile(*mapping) && fileSystem == HXFileSystemKind::swapBacked)))
+    if (!huge && (kernelsOwn || (mapping->isFile() && fileSystem == HXFileSystemKind::swapBacked)))
         mapping->flags |= HXMappingSwapBacked;
     if (hasPager(*mapping, kind)) mapping->flags |= HXMappingHasPager;
     mapping->tag = tagOf(*mapping, kind, namedTag);

@@ -3,53 +3,17 @@
 #include "platform/linux/HXProcFile.h"
 #include "platform/linux/HXSharedSwap.h"
 
-#include <sys/ioctl.h>
-
 #include <algorithm>
 #include <array>
-#include <atomic>
 #include <cerrno>
 
 namespace {
-
-// The PAGEMAP_SCAN request (kernel 6.7), whose declarations the C library's headers may not have yet.
-struct ScanRegion {
-    uint64_t start;
-    uint64_t end;
-    uint64_t categories;
-};
-struct ScanArgument {
-    uint64_t size;
-    uint64_t flags;
-    uint64_t start;
-    uint64_t end;
-    uint64_t walkEnd;
-    uint64_t vector;
-    uint64_t vectorLength;
-    uint64_t maximumPages;
-    uint64_t invertedCategories;
-    uint64_t requiredCategories;
-    uint64_t anyOfCategories;
-    uint64_t returnedCategories;
-};
-constexpr unsigned long scanRequest = _IOWR('f', 16, ScanArgument);
-constexpr uint64_t scanFile = 1 << 2, scanPresent = 1 << 3, scanSwapped = 1 << 4, scanZero = 1 << 5;
-constexpr uint64_t scanGuard = 1 << 8; // kernel 6.15
 
 // Bits of an entry of pagemap.
 constexpr uint64_t entryPresent = uint64_t{1} << 63;
 constexpr uint64_t entrySwapped = uint64_t{1} << 62;
 constexpr uint64_t entryFile = uint64_t{1} << 61;
 constexpr uint64_t entryGuard = uint64_t{1} << 58;
-
-uint8_t factsOfCategories(uint64_t categories) {
-    uint8_t facts = 0;
-    if (categories & scanPresent) facts |= HXPageRun::present;
-    if (categories & scanFile) facts |= HXPageRun::file;
-    if (categories & scanSwapped) facts |= HXPageRun::swapped;
-    if (categories & (scanZero | scanGuard)) facts |= HXPageRun::nothing;
-    return facts;
-}
 
 uint8_t factsOfEntry(uint64_t entry) {
     uint8_t facts = 0;
@@ -164,29 +128,14 @@ kern_return_t HXPageReader::readRuns(uint64_t start, uint64_t end) {
 }
 
 bool HXPageReader::scan(uint64_t start, uint64_t end) {
-    static std::atomic<uint64_t> guard = scanGuard;
-    thread_local std::array<ScanRegion, 1024> regions;
-    ScanArgument argument{};
-    argument.size = sizeof argument;
-    argument.start = start;
-    argument.end = end;
-    argument.vector = reinterpret_cast<uint64_t>(regions.data());
-    argument.vectorLength = regions.size();
-    argument.anyOfCategories = scanPresent | scanSwapped;
-    argument.returnedCategories = scanPresent | scanSwapped | scanFile | scanZero | guard;
-    int count = ::ioctl(_pagemap.get(), scanRequest, &argument);
-    if (count < 0 && errno == EINVAL && guard != 0) {
-        guard = 0;
-        argument.returnedCategories &= ~scanGuard;
-        count = ::ioctl(_pagemap.get(), scanRequest, &argument);
-    }
-    if (count < 0 || argument.walkEnd <= start) {
-        _mayScan = count >= 0;
-        return false;
-    }
-    for (const ScanRegion &region : std::span(regions).first(static_cast<size_t>(count)))
-        _runs.push_back({region.start, region.end, factsOfCategories(region.categories)});
-    _windowEnd = std::min(argument.walkEnd, end);
+    constexpr size_t window = 1024;
+    if (!HXPageScan::isSupported()) return false;
+    _runs.resize(window);
+    uint64_t walkEnd = start;
+    const int count = HXPageScan::find(_pagemap.get(), true, start, end, _runs, &walkEnd);
+    _runs.resize(static_cast<size_t>(std::max(count, 0)));
+    if (count < 0 || walkEnd <= start) return false;
+    _windowEnd = std::min(walkEnd, end);
     return true;
 }
 

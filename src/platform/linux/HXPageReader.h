@@ -4,23 +4,12 @@
 
 #include "platform/linux/HXAddressSpace.h"
 #include "platform/linux/HXDescriptor.h"
+#include "platform/linux/HXPageScan.h"
 
+#include <cstddef>
 #include <cstdint>
 #include <span>
 #include <vector>
-
-// A run of pages that the kernel tells alike.
-struct HXPageRun {
-    enum Fact : uint8_t {
-        present = 1,
-        file = 2, // of a file or of shared memory
-        swapped = 4,
-        nothing = 8, // the shared page of zeros, or a guard: no memory
-    };
-    uint64_t start;
-    uint64_t end;
-    uint8_t facts;
-};
 
 // How many pages of a mapping are still to be found where the page tables do not show which they are.
 struct HXPagesLeft {

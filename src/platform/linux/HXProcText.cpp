@@ -71,6 +71,8 @@ HXStatusRecord HXParseStatus(std::string_view text) {
         {"VmHWM:", &HXStatusRecord::peakResidentSize, 1024},
         {"HugetlbPages:", &HXStatusRecord::hugePageSize, 1024},
         {"Threads:", &HXStatusRecord::threadCount, 1},
+        {"VmRSS:", &HXStatusRecord::residentSize, 1024},
+        {"VmLck:", &HXStatusRecord::lockedSize, 1024},
     };
     HXStatusRecord record;
     HXTextCursor cursor{text};
@@ -87,6 +89,19 @@ HXStatusRecord HXParseStatus(std::string_view text) {
         }
     }
     return record;
+}
+
+std::optional<uint64_t> HXParseLabelled(std::string_view text, std::string_view label) {
+    HXTextCursor cursor{text};
+    while (!cursor.rest.empty()) {
+        HXTextCursor line{cursor.line()};
+        if (!line.rest.starts_with(label)) continue;
+        line.rest.remove_prefix(label.size());
+        line.skipBlanks();
+        uint64_t value = 0;
+        if (line.number(&value)) return value;
+    }
+    return std::nullopt;
 }
 
 void HXParseMountInfo(std::string_view text,

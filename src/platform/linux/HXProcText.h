@@ -38,6 +38,8 @@ struct HXStatusRecord {
     uint64_t pageTableSize = 0;
     uint64_t hugePageSize = 0;
     uint64_t peakResidentSize = 0;
+    uint64_t residentSize = 0;
+    uint64_t lockedSize = 0;
     uint64_t threadCount = 0;
 
     uint64_t heftSize() const { return rssAnonSize + rssShmemSize + swapSize + pageTableSize + hugePageSize; }
@@ -45,6 +47,10 @@ struct HXStatusRecord {
     uint64_t peakHeftSize() const;
 };
 HXStatusRecord HXParseStatus(std::string_view text);
+
+// The number behind `label` (with its colon) at the beginning of a line, as of smaps_rollup and vmstat; none
+// when there is no such line.
+std::optional<uint64_t> HXParseLabelled(std::string_view text, std::string_view label);
 
 // A device number as maps and mountinfo print it (MAJOR:MINOR), in one word.
 constexpr uint32_t HXDeviceNumber(uint32_t major, uint32_t minor) {

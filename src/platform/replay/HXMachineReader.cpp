@@ -1,6 +1,7 @@
 #include "platform/replay/HXMachineReader.h"
 
 #include "platform/HXSafeText.h"
+#include "platform/replay/HXFixedText.h"
 #include "platform/replay/HXMachineFormat.h"
 
 #include <algorithm>
@@ -14,12 +15,6 @@ namespace {
 constexpr size_t kCommBytes = sizeof proc_bsdinfo::pbi_comm;
 constexpr size_t kNameBytes = sizeof proc_bsdinfo::pbi_name;
 constexpr size_t kPathBytes = 1024;
-
-// Fills a field of fixed width; zeros follow a text that is shorter.
-template <size_t N>
-void fill(char (&field)[N], std::string_view text) {
-    std::memcpy(field, text.data(), std::min(N, text.size()));
-}
 
 } // namespace
 
@@ -294,7 +289,7 @@ bool HXMachineReader::readFault() {
 
 bool HXMachineReader::readZone() {
     mach_zone_name name{};
-    fill(name.mzn_name, safeName(Zone::name, sizeof name.mzn_name));
+    HXFillText(name.mzn_name, safeName(Zone::name, sizeof name.mzn_name));
     mach_zone_info zone{};
     zone.mzi_count = _reader.number(Zone::count);
     zone.mzi_cur_size = _reader.number(Zone::curSize);
@@ -313,7 +308,7 @@ bool HXMachineReader::readSite() {
     site.mapped = _reader.number(Site::mapped);
     site.tag = static_cast<uint16_t>(_reader.number(Site::tag));
     site.zone = static_cast<uint16_t>(_reader.number(Site::zone));
-    fill(site.name, safeName(Site::name, sizeof site.name));
+    HXFillText(site.name, safeName(Site::name, sizeof site.name));
     _machine.sites.push_back(site);
     return true;
 }

@@ -1,6 +1,7 @@
 #include "platform/replay/HXMachineRecorder.h"
 
 #include "platform/HXRegionTags.h"
+#include "platform/replay/HXFixedText.h"
 #include "platform/replay/HXMachineFormat.h"
 #include "platform/replay/HXProcessRecorder.h"
 #include "platform/replay/HXRegionHeftSetting.h"
@@ -13,11 +14,6 @@ namespace {
 
 constexpr int32_t kArgMaxName[] = {1, 8};
 constexpr uint32_t kLastDescribedTag = 239; // from 240 on tags are the program's own
-
-template <size_t N>
-std::string_view textOf(const char (&field)[N]) {
-    return {field, static_cast<size_t>(std::find(field, field + N, '\0') - field)};
-}
 
 } // namespace
 
@@ -87,7 +83,7 @@ void HXMachineRecorder::readLedgerTemplate() {
     }
     _ledger.emplace();
     for (size_t i = 0; i < static_cast<size_t>(count); i++) {
-        std::string name(textOf(entries[i].lti_name));
+        std::string name(HXTextOfField(entries[i].lti_name));
         std::replace(name.begin(), name.end(), ',', '?'); // the comma joins them
         if (!_pageTableIndex && name == "page_table") _pageTableIndex = i;
         _ledger->push_back(std::move(name));
@@ -125,7 +121,7 @@ void HXMachineRecorder::recordKernel() {
     if (_memoryInfoError != KERN_SUCCESS) return;
     for (uint32_t i = 0; i < std::min(nameCount, zoneCount); i++) {
         _writer.begin(zoneRecord);
-        _writer.text(Zone::name, textOf(names[i].mzn_name));
+        _writer.text(Zone::name, HXTextOfField(names[i].mzn_name));
         _writer.number(Zone::count, zones[i].mzi_count);
         _writer.number(Zone::curSize, zones[i].mzi_cur_size);
         _writer.number(Zone::elemSize, zones[i].mzi_elem_size);
@@ -142,7 +138,7 @@ void HXMachineRecorder::recordKernel() {
         _writer.number(Site::mapped, record.mapped);
         _writer.number(Site::tag, record.tag);
         _writer.number(Site::zone, record.zone);
-        _writer.text(Site::name, textOf(record.name));
+        _writer.text(Site::name, HXTextOfField(record.name));
         _writer.end();
         if ((record.flags & VM_KERN_SITE_TYPE) == VM_KERN_SITE_KERNEL) code.insert(record.site);
     }

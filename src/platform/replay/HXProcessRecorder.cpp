@@ -1,5 +1,6 @@
 #include "platform/replay/HXProcessRecorder.h"
 
+#include "platform/replay/HXFixedText.h"
 #include "platform/replay/HXMachineFormat.h"
 
 #include <algorithm>
@@ -14,11 +15,6 @@ constexpr uint64_t kChunkPages = 4096;
 constexpr size_t kRunsTextBytes = kMaxCaptureRecordBytes / 2; // in one record, other fields beside them
 constexpr int32_t kArgMaxName[] = {1, 8};
 constexpr int32_t kProcArgs2 = 49;
-
-template <size_t N>
-std::string_view textOf(const char (&field)[N]) {
-    return {field, static_cast<size_t>(std::find(field, field + N, '\0') - field)};
-}
 
 // Run-length text of dispositions, in pieces that each fit a record. Zeros at the end are left out.
 class RunsText {
@@ -95,8 +91,9 @@ bool HXProcessRecorder::recordProcess(int32_t pid, bool listed) {
     _head.signedNumber(Process::pid, pid);
     _head.signedNumber(Process::ppid, readable ? info.pbi_ppid : shortInfo.pbsi_ppid);
     _head.number(Process::flags, flags);
-    _head.text(Process::comm, name(readable ? textOf(info.pbi_comm) : textOf(shortInfo.pbsi_comm)));
-    _head.text(Process::name, name(textOf(info.pbi_name)));
+    _head.text(Process::comm,
+               name(readable ? HXTextOfField(info.pbi_comm) : HXTextOfField(shortInfo.pbsi_comm)));
+    _head.text(Process::name, name(HXTextOfField(info.pbi_name)));
     _head.number(Process::status, exists ? shortInfo.pbsi_status : info.pbi_status);
     _head.number(Process::listed, listed);
     _head.number(Process::readable, readable);

@@ -1,6 +1,8 @@
 // HXReplayPlatform: processes, settings, images and the kernel's own memory.
 #include "platform/replay/HXReplayPlatform.h"
 
+#include "platform/replay/HXFixedText.h"
+
 #include <algorithm>
 #include <cerrno>
 #include <cstdlib>
@@ -21,11 +23,6 @@ void handOut(const void *result, size_t bytes, void *old, size_t *oldBytes) {
     const size_t copied = old == nullptr ? bytes : std::min(bytes, *oldBytes);
     if (old != nullptr) std::memcpy(old, result, copied);
     *oldBytes = copied;
-}
-
-template <size_t N>
-void fill(char (&field)[N], std::string_view text) {
-    std::memcpy(field, text.data(), std::min(N, text.size()));
 }
 
 // A copy of `records` that `vm_deallocate` gives back; null when there is no memory for it.
@@ -79,8 +76,8 @@ int32_t HXReplayPlatform::proc_pidinfo(int32_t pid, int32_t flavor, uint64_t, vo
         info.pbi_status = process->status;
         info.pbi_pid = process->pid;
         info.pbi_ppid = process->ppid;
-        fill(info.pbi_comm, text(process->comm));
-        fill(info.pbi_name, text(process->name));
+        HXFillText(info.pbi_comm, text(process->comm));
+        HXFillText(info.pbi_name, text(process->name));
         std::memcpy(buffer, &info, sizeof info);
         return sizeof info;
     }
@@ -92,7 +89,7 @@ int32_t HXReplayPlatform::proc_pidinfo(int32_t pid, int32_t flavor, uint64_t, vo
     info.pbsi_pid = process->pid;
     info.pbsi_ppid = process->ppid;
     info.pbsi_status = fate == HXMachineFate::zombie ? SZOMB : process->status;
-    fill(info.pbsi_comm, text(process->comm));
+    HXFillText(info.pbsi_comm, text(process->comm));
     info.pbsi_flags = process->flags;
     std::memcpy(buffer, &info, sizeof info);
     return sizeof info;
@@ -185,7 +182,8 @@ int32_t HXReplayPlatform::ledger(int32_t command, int32_t pid, void *buffer, int
         auto *const entries = static_cast<ledger_template_info *>(buffer);
         for (size_t i = 0; i < filled; i++) {
             entries[i] = {};
-            fill(entries[i].lti_name, std::string_view(names[i]).substr(0, sizeof entries[i].lti_name - 1));
+            HXFillText(entries[i].lti_name,
+                       std::string_view(names[i]).substr(0, sizeof entries[i].lti_name - 1));
         }
     } else if (command == LEDGER_ENTRY_INFO) {
         const HXMachineProcess *const process = _machine.process(pid);

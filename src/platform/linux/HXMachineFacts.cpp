@@ -1,0 +1,26 @@
+#include "platform/linux/HXMachineFacts.h"
+
+#include "platform/linux/HXProcFile.h"
+#include "platform/linux/HXProcText.h"
+
+#include <fcntl.h>
+#include <sys/sysinfo.h>
+
+bool HXMachineFacts::usesSwap() const {
+    struct sysinfo info;
+    return ::sysinfo(&info) != 0 || info.freeswap != info.totalswap;
+}
+
+bool HXMachineFacts::hasFreedLazily() {
+    constexpr std::chrono::milliseconds validity(100);
+    constexpr size_t limit = 1 << 20;
+    const std::lock_guard lock(_mutex);
+    const auto now = std::chrono::steady_clock::now();
+    // It never becomes false again: the kernel counts events.
+    if (_hasFreedLazily || (_lookedUp.time_since_epoch().count() != 0 && now - _lookedUp < validity))
+        return _hasFreedLazily;
+    const auto text = HXReadText(AT_FDCWD, _vmstatPath.c_str(), limit);
+    _hasFreedLazily = !text || HXParseLabelled(*text, "pglazyfree ").value_or(1) != 0;
+    _lookedUp = now;
+    return _hasFreedLazily;
+}
