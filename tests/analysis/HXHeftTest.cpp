@@ -221,6 +221,7 @@ TEST_F(HXHeftTest, GroupsPartitionObjectsByWhoMapsThem) {
         EXPECT_TRUE(group.immutable());
         objects += sharing.objectsOfGroup(group).size();
     }
+    EXPECT_EQ(sharing.objectsOfGroup(*sharing.groupsOfProcess(40)->front()).size(), 1u); // not object 7
     EXPECT_EQ(sharing.groups.size(), 4u);
     EXPECT_EQ(objects, 6u); // not object 6
 }
