@@ -26,17 +26,26 @@ int32_t HXMemoryCategory::totalRegions() const {
     return _totalRegions;
 }
 
+void HXMemoryCategory::setNaming(HXString name, HXString detailedName) {
+    _isNamed = true;
+    _name = name;
+    _detailedName = detailedName;
+}
+
 HXString HXMemoryCategory::name() const {
+    if (_isNamed) return _name;
     return _memoryObjects.empty() ? HXString() : _memoryObjects.front()->name();
 }
 
 HXString HXMemoryCategory::detailedName() const {
-    return _isSummary || _memoryObjects.empty() ? HXString() : _memoryObjects.front()->detailedName();
+    if (_isSummary) return HXString();
+    if (_isNamed) return _detailedName;
+    return _memoryObjects.empty() ? HXString() : _memoryObjects.front()->detailedName();
 }
 
 std::string HXMemoryCategory::fullName() const {
-    if (_isSummary || _memoryObjects.empty()) return name().str();
-    return _memoryObjects.front()->fullName();
+    const HXString detail = detailedName();
+    return detail.isEmpty() ? name().str() : name().str() + " " + detail.str();
 }
 
 HXMemoryCategory &HXCategoryMap::categoryForObject(const HXMemoryObject &object, HXSegment segment,
@@ -48,7 +57,10 @@ HXMemoryCategory &HXCategoryMap::categoryForObject(const HXMemoryObject &object,
 
     std::string key = summarize ? naming.name().str() : naming.fullName();
     const auto [position, isNew] = _byKey.try_emplace(key, _entries.size());
-    if (isNew) _entries.push_back({std::move(key), std::make_unique<HXMemoryCategory>(segment, summarize)});
+    if (isNew) {
+        _entries.push_back({std::move(key), std::make_unique<HXMemoryCategory>(segment, summarize)});
+        _entries.back().category->setNaming(naming.name(), naming.detailedName());
+    }
     _byName.emplace(names, position->second);
     return *_entries[position->second].category;
 }

@@ -30,7 +30,11 @@ class HXMemoryCategory {
     // The number of different regions of all objects.
     int32_t totalRegions() const;
 
-    // Those of the first object; none without one.
+    // Gives the category the name that its objects were chosen by. Views of an object may be made of regions
+    // that other processes call otherwise.
+    void setNaming(HXString name, HXString detailedName);
+
+    // Those given, else those of the first object; none without either.
     HXString name() const;
     // None for a summary category.
     HXString detailedName() const;
@@ -39,6 +43,9 @@ class HXMemoryCategory {
   private:
     bool _isSummary;
     HXSegment _segment;
+    bool _isNamed = false;
+    HXString _name;
+    HXString _detailedName;
     std::vector<HXMemoryObject::View> _memoryObjects;
     std::unordered_set<const HXMemoryObject *> _members; // from the second object on
     uint64_t _totalDirtySize = 0;
