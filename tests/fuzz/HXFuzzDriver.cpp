@@ -40,9 +40,28 @@ std::vector<std::string> split(const std::string &text, const char *separators) 
 struct Corpus {
     std::vector<std::string> inputs;
     std::vector<std::string> words = {
-        "0", "1", "-1", "0x", "4096", "65535", "2147483648", "4294967296", "18446744073709551615",
-        "0xffffffffffffffff", "0xfffffffffffff000", "144115188075855872", "\\t", "\\", "\t", "\n", "=",
-        "1*1,", "18446744073709551615*1", std::string(1, '\0'), "\xff", "#",
+        "0",
+        "1",
+        "-1",
+        "0x",
+        "4096",
+        "65535",
+        "2147483648",
+        "4294967296",
+        "18446744073709551615",
+        "0xffffffffffffffff",
+        "0xfffffffffffff000",
+        "144115188075855872",
+        "\\t",
+        "\\",
+        "\t",
+        "\n",
+        "=",
+        "1*1,",
+        "18446744073709551615*1",
+        std::string(1, '\0'),
+        "\xff",
+        "#",
     };
 
     explicit Corpus(const std::string &folder) {
@@ -74,8 +93,8 @@ void mutateBytes(const Corpus &corpus, std::string &input) {
         const std::string &word = corpus.words[below(corpus.words.size())];
         const size_t number = input.find('=', place);
         if (number != std::string::npos && below(2) == 0)
-            input.replace(number + 1, std::min(input.find_first_of("\t\n", number), input.size()) - number - 1,
-                          word);
+            input.replace(number + 1,
+                          std::min(input.find_first_of("\t\n", number), input.size()) - number - 1, word);
         else
             input.insert(place, word);
     }
@@ -110,7 +129,8 @@ int main(int argc, char *argv[]) {
     for (const std::string &input : corpus.inputs)
         run(input);
     const char *const setting = std::getenv("HEFT_FUZZ_SECONDS");
-    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(setting ? std::atoi(setting) : 2);
+    const auto end =
+        std::chrono::steady_clock::now() + std::chrono::seconds(setting ? std::atoi(setting) : 2);
     size_t runs = 0;
     for (; std::chrono::steady_clock::now() < end; runs++) {
         std::string input = corpus.inputs[below(corpus.inputs.size())];

@@ -1,7 +1,7 @@
 // Fuzz target: any bytes as a machine file, and all questions to the machine that they make.
 #include "platform/HXRegionTags.h"
+#include "platform/linux/HXLinuxPlatform.h"
 #include "platform/replay/HXReplayPlatform.h"
-#include "support/HXEmptyPlatform.h"
 
 #include <cstdlib>
 
@@ -72,7 +72,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     require((machine != nullptr) == reason.empty());
     HXNamedTags::shared().clear();
     if (!machine) return 0;
-    HXEmptyPlatform services;
+    static HXLinuxPlatform services; // never asked
     HXReplayPlatform host(*machine, services);
     int32_t pids[kAskedProcesses];
     const int32_t count = host.proc_listallpids(pids, sizeof pids);

@@ -86,10 +86,10 @@ TEST_F(HXProgramAsRoot, SurvivesAMachineInMotion) {
             for (unsigned round = static_cast<unsigned>(i);; round++) {
                 void *all = mmap(nullptr, 64 << 12, PROT_READ | PROT_WRITE,
                                  MAP_PRIVATE | MAP_ANONYMOUS | MAP_POPULATE, -1, 0);
-                usleep(1000 + round % 7 * 1000);
+                usleep(50000 + round % 7 * 20000);
                 munmap(all, 64 << 12);
                 if (round % 4 == 0 && fork() == 0) {
-                    usleep(2000);
+                    usleep(20000);
                     _exit(0);
                 }
             }

@@ -3,7 +3,7 @@
 #include "platform/HXRegionTags.h"
 #include "platform/memgraph/HXMemgraphRecorder.h"
 #include "platform/replay/HXReplayPlatform.h"
-#include "support/HXEmptyPlatform.h"
+#include "support/HXBarePlatform.h"
 
 #include <gtest/gtest.h>
 
@@ -108,7 +108,7 @@ TEST(GXProcessObjectGraph, NamesTheLineThatBreaksTheForm) {
 // Records the process 5 of a machine as a graph and gives its text, or the reason.
 std::string recorded(const std::string &records, bool breakDown) {
     HXNamedTags::shared().clear();
-    HXEmptyPlatform services;
+    HXBarePlatform services;
     std::string reason, text;
     const auto machine = HXMachine::loadText("heft-machine 1\n" + tabbed(records), &reason);
     if (!machine) return reason;

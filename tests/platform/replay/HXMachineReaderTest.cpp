@@ -1,6 +1,6 @@
 // What breaks the form of machine files, with the line that the load fails at.
 #include "platform/replay/HXMachine.h"
-#include "support/HXEmptyPlatform.h"
+#include "support/HXBarePlatform.h"
 
 #include <gtest/gtest.h>
 
@@ -121,7 +121,7 @@ TEST(HXMachineReader, NamesTheLineThatBreaksTheForm) {
 }
 
 // A host whose only file is a text.
-class OneFile : public HXEmptyPlatform {
+class OneFile : public HXBarePlatform {
   public:
     explicit OneFile(std::string text) : _text(std::move(text)) {}
     std::FILE *fopen(const std::string &, const char *) override {
@@ -169,9 +169,8 @@ TEST(HXMachineReader, ReadsFilesInPiecesAsItReadsText) {
         EXPECT_FALSE(HXMachine::load(brokenHost, "", &reason));
         EXPECT_EQ(reason, test.reason);
     }
-    HXEmptyPlatform without;
-    errno = ENOENT;
-    EXPECT_FALSE(HXMachine::load(without, "missing", &reason));
+    HXBarePlatform without;
+    EXPECT_FALSE(HXMachine::load(without, "/nonexistent/machine", &reason));
     EXPECT_EQ(reason, "No such file or directory");
 }
 

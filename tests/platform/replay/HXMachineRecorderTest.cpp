@@ -2,7 +2,7 @@
 #include "platform/replay/HXMachineRecorder.h"
 #include "platform/HXRegionTags.h"
 #include "platform/replay/HXReplayPlatform.h"
-#include "support/HXEmptyPlatform.h"
+#include "support/HXBarePlatform.h"
 
 #include <gtest/gtest.h>
 
@@ -33,7 +33,7 @@ class Recording {
             settingAfter = setting;
     }
 
-    HXEmptyPlatform services;
+    HXBarePlatform services;
     std::string reason;
     std::string text;
     int32_t settingAfter = -1;
@@ -57,7 +57,7 @@ const std::string kWorker =
     "|shadow_depth=1|pager=1|share_mode=1|behavior=-1|object_id=0x7|full_object_id=0x900000007"
     "|path=/opt/big/worker\n"
     "region|pid=5|address=0x500000|size=0x4000|tag=110|resident=2|shared_now_private=1|swapped=1|dirtied=2"
-    "|reusable=1|dirtied_object=1|share_mode=4|object_id=0x8|wired=1|purge=1|pages=1*9,1*0,1*16\n"
+    "|reusable=1|share_mode=4|object_id=0x8|wired=1|purge=1|dirtied_object=1|pages=1*9,1*0,1*16\n"
     "region|pid=5|address=0x600000|size=0x2000|tag=101|resident=1|share_mode=4|short_record=1|pages=\n"
     "region|pid=5|address=0x700000|size=0x1000|tag=4294967295|dirtied=2|heft_only=1\n";
 const std::string kOthers =

@@ -1,7 +1,7 @@
 // What a replayed machine answers.
 #include "platform/replay/HXReplayPlatform.h"
 #include "platform/HXRegionTags.h"
-#include "support/HXEmptyPlatform.h"
+#include "support/HXBarePlatform.h"
 
 #include <gtest/gtest.h>
 
@@ -70,7 +70,7 @@ class HXReplay : public testing::Test {
         return bytes == sizeof info ? static_cast<int32_t>(info.pbsi_status) : -errno;
     }
 
-    HXEmptyPlatform services;
+    HXBarePlatform services;
     std::unique_ptr<HXMachine> machine;
     std::unique_ptr<HXReplayPlatform> host;
 };
