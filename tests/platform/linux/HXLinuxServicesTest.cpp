@@ -1,0 +1,155 @@
+// Work queues, signals and the command line's own files on the live host.
+#include "platform/linux/HXLinuxDispatch.h"
+#include "platform/linux/HXLinuxPlatform.h"
+
+#include <gtest/gtest.h>
+
+#include <sys/stat.h>
+#include <sys/wait.h>
+
+#include <atomic>
+#include <cerrno>
+#include <csignal>
+#include <filesystem>
+#include <fstream>
+#include <future>
+#include <numeric>
+
+namespace {
+
+namespace fs = std::filesystem;
+
+TEST(HXLinuxDispatch, LoopCallsEachIterationOnce) {
+    HXLinuxPlatform platform;
+    for (const size_t workers : {0, 1, 7}) {
+        platform.setWorkerCount(workers);
+        std::vector<std::atomic<int>> calls(100);
+        const auto queue = platform.dispatch_queue_create("q", QOS_CLASS_UTILITY);
+        platform.dispatch_apply(calls.size(), queue, [&](size_t i) { calls[i]++; });
+        for (const auto &count : calls)
+            EXPECT_EQ(count, 1);
+        platform.dispatch_apply(0, queue, [](size_t) { ADD_FAILURE(); });
+    }
+    platform.setWorkerCount(1);
+    std::vector<size_t> order;
+    platform.dispatch_apply(5, {}, [&](size_t i) { order.push_back(i); });
+    EXPECT_EQ(order, (std::vector<size_t>{0, 1, 2, 3, 4}));
+}
+
+// In a process of its own, for signals are the whole process's.
+int statusOf(const std::function<int()> &body) {
+    const pid_t child = fork();
+    if (child == 0) _exit(body());
+    int status = 0;
+    waitpid(child, &status, 0);
+    return status;
+}
+
+TEST(HXLinuxDispatch, SignalsGoToTheSourceThenToTheDisposition) {
+    const int heard = statusOf([] {
+        HXLinuxPlatform platform;
+        std::promise<void> came;
+        const auto source = platform.dispatch_source_create(SIGINT);
+        platform.dispatch_source_set_event_handler(*source, [&] { came.set_value(); });
+        kill(getpid(), SIGINT); // before the source runs, and before the disposition changes
+        platform.signal(SIGINT, HXSignalDisposition::ignored);
+        platform.dispatch_resume(*source);
+        came.get_future().wait();
+        platform.dispatch_source_cancel(*source);
+        platform.signal(SIGINT, HXSignalDisposition::byDefault);
+        return 17;
+    });
+    EXPECT_TRUE(WIFEXITED(heard) && WEXITSTATUS(heard) == 17) << heard;
+    const int ended = statusOf([] {
+        HXLinuxPlatform platform;
+        const auto source = platform.dispatch_source_create(SIGINT);
+        platform.dispatch_source_set_event_handler(*source, [] { _exit(1); });
+        platform.signal(SIGINT, HXSignalDisposition::ignored);
+        platform.dispatch_resume(*source);
+        platform.dispatch_source_cancel(*source);
+        kill(getpid(), SIGINT); // too late for the source, too early for the disposition
+        platform.signal(SIGINT, HXSignalDisposition::byDefault);
+        return 2;
+    });
+    EXPECT_TRUE(WIFSIGNALED(ended) && WTERMSIG(ended) == SIGINT) << ended;
+}
+
+class HXLinuxFiles : public testing::Test {
+  protected:
+    HXLinuxFiles() {
+        std::string name = fs::temp_directory_path() / "heft-files-XXXXXX";
+        if (mkdtemp(name.data()) == nullptr) abort();
+        folder = name;
+    }
+    ~HXLinuxFiles() override { fs::remove_all(folder); }
+
+    HXLinuxPlatform platform;
+    fs::path folder;
+};
+
+TEST_F(HXLinuxFiles, ReadsPlainFilesAlone) {
+    std::ofstream(folder / "plain") << std::string(100000, 'x');
+    mkfifo((folder / "fifo").c_str(), 0600);
+    EXPECT_EQ(platform.readFile(folder / "plain", 100000)->size(), 100000u);
+    EXPECT_GT(platform.readFile("/proc/self/status", 100000).value_or("").size(), 100u) << "of no size";
+    const struct {
+        std::string path;
+        int error;
+    } cases[] = {{folder / "plain", EFBIG},
+                 {folder / "fifo", EINVAL},
+                 {"/dev/zero", EINVAL},
+                 {folder, EISDIR},
+                 {folder / "none", ENOENT}};
+    for (const auto &item : cases) {
+        EXPECT_FALSE(platform.readFile(item.path, 99999)) << item.path;
+        EXPECT_EQ(errno, item.error) << item.path;
+    }
+}
+
+TEST_F(HXLinuxFiles, PendingFilesAppearWhole) {
+    const std::string path = folder / "report";
+    auto file = platform.createPendingFile(path);
+    ASSERT_TRUE(file);
+    std::fputs("text", file->stream);
+    EXPECT_FALSE(platform.stat(path));
+    EXPECT_TRUE(platform.commitPendingFile(*file));
+    EXPECT_EQ(platform.readFile(path, 10), "text");
+    struct stat status;
+    ASSERT_EQ(::stat(path.c_str(), &status), 0);
+    EXPECT_EQ(status.st_mode & 0777, 0600u);
+
+    auto discarded = platform.createPendingFile(path);
+    platform.discardPendingFile(*discarded);
+    auto lost = platform.createPendingFile(folder / "sub" / "x");
+    EXPECT_FALSE(lost);
+    fs::create_directory(folder / "sub");
+    lost = platform.createPendingFile(folder / "sub" / "x");
+    fs::create_directory(folder / "sub" / "x"); // in the way
+    EXPECT_FALSE(platform.commitPendingFile(*lost));
+    EXPECT_EQ(std::distance(fs::directory_iterator(folder), {}), 2) << "nothing is left over";
+    EXPECT_EQ(std::distance(fs::directory_iterator(folder / "sub"), {}), 1);
+}
+
+TEST_F(HXLinuxFiles, OptionScannerBeginsAnew) {
+    int flag = 0;
+    const std::vector<HXLongOption> options = {
+        {"all", false, nullptr, 'a'}, {"wide", false, &flag, 1}, {"pid", true, nullptr, 'p'}};
+    for (int round = 0; round < 2; round++) {
+        char program[] = "heft", one[] = "name", all[] = "-a", pid[] = "--pid=12", wide[] = "--wide";
+        char *arguments[] = {program, one, all, pid, wide, nullptr};
+        flag = 0;
+        auto scan = platform.getopt_long(5, arguments, ":ap:", options, true);
+        EXPECT_EQ(scan.result, 'a');
+        scan = platform.getopt_long(5, arguments, ":ap:", options, false);
+        EXPECT_EQ(scan.result, 'p');
+        EXPECT_STREQ(scan.argument, "12");
+        scan = platform.getopt_long(5, arguments, ":ap:", options, false);
+        EXPECT_EQ(scan.result, 0);
+        EXPECT_EQ(flag, 1);
+        scan = platform.getopt_long(5, arguments, ":ap:", options, false);
+        EXPECT_EQ(scan.result, -1);
+        EXPECT_STREQ(arguments[scan.index], "name");
+    }
+}
+
+} // namespace
