@@ -1,10 +1,7 @@
 #include "support/HXBarePlatform.h"
 
-#include "support/HXBuilders.h"
-
 #include <cerrno>
 #include <cstring>
-#include <filesystem>
 #include <getopt.h>
 
 int32_t HXBarePlatform::sysctlbyname(const char *name, void *old, size_t *oldBytes, const void *newValue,
@@ -45,15 +42,4 @@ HXOptionScan HXBarePlatform::getopt_long(int argc, char *const argv[], const cha
     scan.argument = optarg;
     scan.index = optind;
     return scan;
-}
-
-bool HXBarePlatform::stat(const std::string &path) {
-    std::error_code ignored;
-    return std::filesystem::exists(path, ignored);
-}
-
-std::optional<std::string> HXBarePlatform::readFile(const std::string &path, uint64_t) {
-    errno = EINVAL;
-    if (!std::filesystem::is_regular_file(path)) return std::nullopt;
-    return contentOf(path);
 }

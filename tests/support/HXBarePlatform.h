@@ -4,8 +4,6 @@
 
 #include "support/HXEmptyPlatform.h"
 
-#include <set>
-
 class HXBarePlatform : public HXEmptyPlatform {
   public:
     // "vm.self_region_heft"; none: the kernel lacks the setting. An error other than 0 fails its queries.
@@ -25,9 +23,7 @@ class HXBarePlatform : public HXEmptyPlatform {
                                                                               uint8_t) override;
     HXOptionScan getopt_long(int argc, char *const argv[], const char *shortOptions,
                              const std::vector<HXLongOption> &options, bool restart) override;
-    bool stat(const std::string &path) override;
     std::FILE *fopen(const std::string &path, const char *mode) override {
         return std::fopen(path.c_str(), mode);
     }
-    std::optional<std::string> readFile(const std::string &path, uint64_t limit) override;
 };

@@ -1,35 +1,16 @@
 #include "support/HXRun.h"
 
 #include "cli/HXHeftMain.h"
+#include "platform/linux/HXLinuxPlatform.h"
 #include "platform/replay/HXReplayPlatform.h"
 #include "process/HXProcess.h"
-#include "support/HXBarePlatform.h"
 #include "support/HXBuilders.h"
 #include "support/HXCheckReport.h"
 
-#include <atomic>
 #include <gtest/gtest.h>
 #include <stdexcept>
-#include <thread>
 
 namespace {
-// The real machine's files and a queue of three workers.
-class Services : public HXBarePlatform {
-  public:
-    void dispatch_apply(size_t iterations, const HXDispatchQueue &,
-                        const std::function<void(size_t)> &work) override {
-        std::atomic<size_t> next = 0;
-        const auto worker = [&] {
-            for (size_t i = next++; i < iterations; i = next++)
-                work(i);
-        };
-        std::thread first(worker), second(worker);
-        worker();
-        first.join();
-        second.join();
-    }
-};
-
 std::string machineFile(const std::string &text) {
     std::string file = "heft-machine 1\n";
     for (size_t i = 0; i < text.size(); i++)
@@ -42,12 +23,13 @@ std::string machineFile(const std::string &text) {
 } // namespace
 
 struct HXMadeUpMachine::Parts {
-    Services services;
+    HXLinuxPlatform services; // the real machine's files, streams, queues and signals
     std::unique_ptr<const HXMachine> machine;
     std::unique_ptr<HXReplayPlatform> platform;
 };
 
 HXMadeUpMachine::HXMadeUpMachine(const std::string &text) : _parts(std::make_unique<Parts>()) {
+    _parts->services.setWorkerCount(3);
     std::string reason;
     _parts->machine = HXMachine::loadText(machineFile(text), &reason);
     if (!_parts->machine) throw std::runtime_error("bad machine file: " + reason);
@@ -58,6 +40,7 @@ HXMadeUpMachine::HXMadeUpMachine(const std::string &text) : _parts(std::make_uni
 
 HXMadeUpMachine::~HXMadeUpMachine() {
     HXProcess::_clearGlobalErrors();
+    HXPlatform::setCurrent(nullptr);
 }
 
 HXPlatform &HXMadeUpMachine::platform() {

@@ -108,7 +108,7 @@ bool Reader::mapsSuffice() const {
 // Whether the process holds lazily freed pages, which look like others in the page tables; also true where
 // smaps costs less than to find out.
 bool Reader::hasFreedLazily() const {
-    constexpr uint64_t fewPagesPerMapping = 64;
+    constexpr uint64_t fewPagesPerMapping = 128;
     const uint64_t pages = _request.status->residentSize >> _setting.pageShift;
     if (pages > fewPagesPerMapping * _addressSpace->count()) return true;
     char buffer[4096];

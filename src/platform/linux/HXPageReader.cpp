@@ -132,7 +132,7 @@ bool HXPageReader::scan(uint64_t start, uint64_t end) {
     if (!HXPageScan::isSupported()) return false;
     _runs.resize(window);
     uint64_t walkEnd = start;
-    const int count = HXPageScan::find(_pagemap.get(), start, end, _runs, &walkEnd);
+    const int count = HXPageScan::find(_pagemap.get(), true, start, end, _runs, &walkEnd);
     _runs.resize(static_cast<size_t>(std::max(count, 0)));
     if (count < 0 || walkEnd <= start) return false;
     _windowEnd = std::min(walkEnd, end);

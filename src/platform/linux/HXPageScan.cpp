@@ -90,6 +90,17 @@ bool knowsHugeZeros(int pagemap, const Support &support) {
     return count == 1 && (region.categories & zeroCategory) != 0;
 }
 
+// Kernels that have guards without telling them (6.13, 6.14) show them as swapped.
+bool hasGuards() {
+    constexpr int installGuard = 102; // MADV_GUARD_INSTALL
+    const auto length = static_cast<size_t>(::sysconf(_SC_PAGESIZE));
+    void *memory = ::mmap(nullptr, length, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+    if (memory == MAP_FAILED) return true;
+    const bool installed = ::madvise(memory, length, installGuard) == 0;
+    ::munmap(memory, length);
+    return installed;
+}
+
 Support findSupport() {
     Support support;
     const HXDescriptor pagemap = HXOpenAt(AT_FDCWD, "/proc/self/pagemap");
@@ -103,8 +114,8 @@ Support findSupport() {
     support.isSupported = answers(support.categories);
     const bool knowsGuards = support.isSupported && answers(support.categories | guardCategory);
     if (knowsGuards) support.categories |= guardCategory;
-    // Kernels that have guards without telling them (6.13, 6.14) show them as swapped.
-    support.isComplete = knowsGuards && knowsHugeZeros(pagemap.get(), support);
+    support.isComplete =
+        support.isSupported && (knowsGuards || !hasGuards()) && knowsHugeZeros(pagemap.get(), support);
     return support;
 }
 
@@ -123,17 +134,18 @@ bool HXPageScan::isComplete() {
     return support().isComplete;
 }
 
-int HXPageScan::find(int pagemap, uint64_t start, uint64_t end, std::span<HXPageRun> runs,
+int HXPageScan::find(int pagemap, bool tellsFiles, uint64_t start, uint64_t end, std::span<HXPageRun> runs,
                      uint64_t *walkEnd) {
     thread_local std::array<Region, 1024> regions;
     const auto room = std::span(regions).first(std::min(regions.size(), runs.size()));
-    const int count = scan(pagemap, support().categories, start, end, room, walkEnd);
+    const uint64_t categories = support().categories & ~(tellsFiles ? 0 : fileCategory);
+    const int count = scan(pagemap, categories, start, end, room, walkEnd);
     for (int i = 0; i < count; i++) {
         const Region &region = regions[static_cast<size_t>(i)];
         runs[static_cast<size_t>(i)] = {region.start, region.end, factsOf(region.categories)};
     }
-    // A walk that the kernel did in several steps may tell the end of an earlier one: all of [start, end) has been
-    // walked if there was room to spare, and what has been found is behind it in any case.
+    // A walk that the kernel did in several steps may tell the end of an earlier one: all of [start, end) has
+    // been walked if there was room to spare, and what has been found is behind it in any case.
     if (count >= 0 && static_cast<size_t>(count) < room.size()) *walkEnd = end;
     if (count > 0) *walkEnd = std::max(*walkEnd, room[static_cast<size_t>(count) - 1].end);
     return count;

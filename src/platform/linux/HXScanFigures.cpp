@@ -15,41 +15,30 @@ std::optional<HXStatusRecord> HXReadStatus(int directory) {
 
 namespace {
 
-class Counter {
-  public:
-    Counter(uint32_t pageShift, HXAddressSpace &addressSpace)
-        : _pageShift(pageShift), _addressSpace(addressSpace) {}
+// Whether only a page itself shows whose it is: a private mapping of a file holds the file's pages and its
+// own, and a driver's mapping what is nobody's memory.
+bool needsPages(const HXMapping &mapping) {
+    const auto kind = static_cast<HXPathKind>(mapping.kind);
+    if (!mapping.isFile()) return kind == HXPathKind::vdso || kind == HXPathKind::special;
+    return !(mapping.has(HXMappingShared) && mapping.has(HXMappingSwapBacked));
+}
 
-    // Runs come in ascending order; one may reach over several mappings.
-    void add(const HXPageRun &run) {
-        while (_index < _addressSpace.count() && _addressSpace[_index].end <= run.start)
-            _index++;
-        for (size_t i = _index; i < _addressSpace.count() && _addressSpace[i].start < run.end; i++) {
-            HXMapping &mapping = _addressSpace[i];
-            const uint64_t size = std::min(run.end, mapping.end) - std::max(run.start, mapping.start);
-            count(run.facts, static_cast<uint32_t>(size >> _pageShift), mapping);
-        }
-    }
-    uint64_t swappedPages() const { return _swappedPages; }
+// Walks the page tables of a process, stretch by stretch of its mappings, and counts what is there.
+class Scanner {
+  public:
+    Scanner(int directory, uint32_t pageShift, HXAddressSpace &addressSpace)
+        : _pagemap(HXOpenAt(directory, "pagemap")), _pageShift(pageShift), _addressSpace(addressSpace) {}
+
+    bool scan();
+    uint64_t swappedSize() const { return _swappedPages << _pageShift; }
     bool foundAny() const { return _foundAny; }
 
   private:
-    void count(uint8_t facts, uint32_t pages, HXMapping &mapping) {
-        _foundAny = true;
-        if (facts & HXPageRun::nothing) return;
-        const bool isFile = (facts & HXPageRun::file) != 0;
-        // Memory of the process's own is in private mappings only; what else has no file is a driver's.
-        if (!isFile && mapping.has(HXMappingShared)) return;
-        if (facts & HXPageRun::swapped) {
-            if (isFile) return; // on its way from one place to another
-            mapping.swappedPages += pages;
-            _swappedPages += pages;
-            return;
-        }
-        mapping.residentPages += pages;
-        if (!isFile) mapping.anonymousPages += pages;
-    }
+    bool scan(uint64_t start, uint64_t end, bool tellsFiles);
+    void add(const HXPageRun &run);
+    void count(uint8_t facts, uint32_t pages, HXMapping &mapping);
 
+    const HXDescriptor _pagemap;
     const uint32_t _pageShift;
     HXAddressSpace &_addressSpace;
     size_t _index = 0;
@@ -57,29 +46,73 @@ class Counter {
     bool _foundAny = false;
 };
 
-// Where the last mapping ends that the page tables of the process can show: the gate page lies above.
-uint64_t endOfUserSpace(const HXAddressSpace &addressSpace) {
-    size_t count = addressSpace.count();
-    while (count > 0 && addressSpace[count - 1].end >> 63 != 0)
-        count--;
-    return count == 0 ? 0 : addressSpace[count - 1].end;
+bool Scanner::scan() {
+    // A stretch of less memory is not worth a request of its own.
+    constexpr uint64_t smallSize = 1 << 20;
+    if (!_pagemap) return false;
+    size_t count = _addressSpace.count();
+    while (count > 0 && _addressSpace[count - 1].end >> 63 != 0)
+        count--; // the gate page, which no page table of the process shows
+    size_t begin = 0;
+    bool tellsFiles = true;
+    for (size_t i = 0; i < count;) {
+        const bool needs = needsPages(_addressSpace[i]);
+        const size_t first = i;
+        uint64_t size = 0;
+        for (; i < count && needsPages(_addressSpace[i]) == needs; i++)
+            size += _addressSpace[i].end - _addressSpace[i].start;
+        const bool tellsNext = needs || size < smallSize;
+        if (first == 0) tellsFiles = tellsNext;
+        if (tellsNext == tellsFiles) continue;
+        if (!scan(_addressSpace[begin].start, _addressSpace[first - 1].end, tellsFiles)) return false;
+        begin = first;
+        tellsFiles = tellsNext;
+    }
+    return count == 0 || scan(_addressSpace[begin].start, _addressSpace[count - 1].end, tellsFiles);
+}
+
+bool Scanner::scan(uint64_t start, uint64_t end, bool tellsFiles) {
+    thread_local std::array<HXPageRun, 1024> runs;
+    for (uint64_t walkEnd = start; start < end; start = walkEnd) {
+        const int count = HXPageScan::find(_pagemap.get(), tellsFiles, start, end, runs, &walkEnd);
+        if (count < 0 || walkEnd <= start) return false;
+        for (const HXPageRun &run : std::span(runs).first(static_cast<size_t>(count)))
+            add(run);
+    }
+    return true;
+}
+
+// Runs come in ascending order; one may reach over several mappings.
+void Scanner::add(const HXPageRun &run) {
+    while (_index < _addressSpace.count() && _addressSpace[_index].end <= run.start)
+        _index++;
+    for (size_t i = _index; i < _addressSpace.count() && _addressSpace[i].start < run.end; i++) {
+        HXMapping &mapping = _addressSpace[i];
+        const uint64_t size = std::min(run.end, mapping.end) - std::max(run.start, mapping.start);
+        count(run.facts, static_cast<uint32_t>(size >> _pageShift), mapping);
+    }
+}
+
+void Scanner::count(uint8_t facts, uint32_t pages, HXMapping &mapping) {
+    _foundAny = true;
+    if (facts & HXPageRun::nothing) return;
+    const bool isFile = needsPages(mapping) ? (facts & HXPageRun::file) != 0 : mapping.isFile();
+    // Memory of the process's own is in private mappings only; what else has no file is a driver's.
+    if (!isFile && mapping.has(HXMappingShared)) return;
+    if (facts & HXPageRun::swapped) {
+        if (isFile) return; // on its way from one place to another
+        mapping.swappedPages += pages;
+        _swappedPages += pages;
+        return;
+    }
+    mapping.residentPages += pages;
+    if (!isFile) mapping.anonymousPages += pages;
 }
 
 } // namespace
 
 bool HXScanFigures(int directory, uint32_t pageShift, uint64_t swappedSize, HXAddressSpace *addressSpace) {
-    const HXDescriptor pagemap = HXOpenAt(directory, "pagemap");
-    if (!pagemap || addressSpace->count() == 0) return false;
-    thread_local std::array<HXPageRun, 1024> runs;
-    Counter counter(pageShift, *addressSpace);
-    const uint64_t end = endOfUserSpace(*addressSpace);
-    uint64_t walkEnd = 0;
-    for (uint64_t start = (*addressSpace)[0].start; start < end; start = walkEnd) {
-        const int count = HXPageScan::find(pagemap.get(), start, end, runs, &walkEnd);
-        if (count < 0 || walkEnd <= start) return false;
-        for (const HXPageRun &run : std::span(runs).first(static_cast<size_t>(count)))
-            counter.add(run);
-    }
+    Scanner scanner(directory, pageShift, *addressSpace);
     // A living process has pages; the page tables of one that has gone are empty.
-    return counter.foundAny() && counter.swappedPages() << pageShift == swappedSize;
+    return scanner.scan() && scanner.foundAny() && scanner.swappedSize() == swappedSize;
 }
