@@ -16,14 +16,35 @@ void HXMemoryCategory::addMemoryObject(HXMemoryObject::View object) {
     _memoryObjects.push_back(std::move(object));
 }
 
+// An analysed region belongs to one object, and views hold regions of the object that they are views of:
+// objects of different origin have no region in common.
+bool HXMemoryCategory::objectsHaveDifferentOrigins() const {
+    std::vector<const HXMemoryObject *> origins;
+    origins.reserve(_memoryObjects.size());
+    for (const HXMemoryObject::View &object : _memoryObjects) {
+        const auto regions = object->memoryRegions();
+        const HXMemoryObject *origin = regions.empty() ? nullptr : regions.front()->memoryObject();
+        if (!origin) return false;
+        origins.push_back(origin);
+    }
+    std::sort(origins.begin(), origins.end());
+    return std::adjacent_find(origins.begin(), origins.end()) == origins.end();
+}
+
 int32_t HXMemoryCategory::totalRegions() const {
     if (_totalRegions >= 0) return _totalRegions;
+    if (objectsHaveDifferentOrigins()) {
+        size_t count = 0;
+        for (const HXMemoryObject::View &object : _memoryObjects)
+            count += object->memoryRegions().size();
+        return _totalRegions = static_cast<int32_t>(count);
+    }
     std::vector<const HXMemoryRegion *> regions;
     for (const HXMemoryObject::View &object : _memoryObjects)
         regions.insert(regions.end(), object->memoryRegions().begin(), object->memoryRegions().end());
     std::sort(regions.begin(), regions.end());
-    _totalRegions = static_cast<int32_t>(std::unique(regions.begin(), regions.end()) - regions.begin());
-    return _totalRegions;
+    return _totalRegions =
+               static_cast<int32_t>(std::unique(regions.begin(), regions.end()) - regions.begin());
 }
 
 void HXMemoryCategory::setNaming(HXString name, HXString detailedName) {

@@ -41,6 +41,8 @@ class HXMemoryCategory {
     std::string fullName() const;
 
   private:
+    bool objectsHaveDifferentOrigins() const;
+
     bool _isSummary;
     HXSegment _segment;
     bool _isNamed = false;
