@@ -2,49 +2,39 @@
 
 #include <algorithm>
 
-void HXMemoryCategory::addMemoryObject(HXMemoryObject::View object) {
-    if (!_memoryObjects.empty()) {
-        if (_members.empty()) _members.insert(_memoryObjects.front().get());
-        if (!_members.insert(object.get()).second) return;
+bool HXMemoryCategory::isMember(const HXMemoryObject &object) {
+    if (_memoryObjects.empty()) return false;
+    if (_isAscending && object.index() > _memoryObjects.back()->index()) return false;
+    if (_isAscending) {
+        _isAscending = false;
+        for (const HXMemoryObject::View &member : _memoryObjects)
+            _members.insert(member.get());
     }
+    return !_members.insert(&object).second;
+}
+
+void HXMemoryCategory::addMemoryObject(HXMemoryObject::View object) {
+    if (isMember(*object)) return;
     _totalDirtySize += object->totalDirtySize();
     _totalSwappedSize += object->totalSwappedSize();
     _totalCleanSize += object->totalCleanSize();
     _totalReclaimableSize += object->totalReclaimableSize();
     _totalWiredSize += object->totalWiredSize();
-    _totalRegions = -1;
+    _totalRegions += object->memoryRegions().size();
+    _countsRegions = _isAscending;
     _memoryObjects.push_back(std::move(object));
 }
 
-// An analysed region belongs to one object, and views hold regions of the object that they are views of:
-// objects of different origin have no region in common.
-bool HXMemoryCategory::objectsHaveDifferentOrigins() const {
-    std::vector<const HXMemoryObject *> origins;
-    origins.reserve(_memoryObjects.size());
-    for (const HXMemoryObject::View &object : _memoryObjects) {
-        const auto regions = object->memoryRegions();
-        const HXMemoryObject *origin = regions.empty() ? nullptr : regions.front()->memoryObject();
-        if (!origin) return false;
-        origins.push_back(origin);
-    }
-    std::sort(origins.begin(), origins.end());
-    return std::adjacent_find(origins.begin(), origins.end()) == origins.end();
-}
-
 int32_t HXMemoryCategory::totalRegions() const {
-    if (_totalRegions >= 0) return _totalRegions;
-    if (objectsHaveDifferentOrigins()) {
-        size_t count = 0;
+    if (!_countsRegions) {
+        std::vector<const HXMemoryRegion *> regions;
         for (const HXMemoryObject::View &object : _memoryObjects)
-            count += object->memoryRegions().size();
-        return _totalRegions = static_cast<int32_t>(count);
+            regions.insert(regions.end(), object->memoryRegions().begin(), object->memoryRegions().end());
+        std::sort(regions.begin(), regions.end());
+        _totalRegions = static_cast<size_t>(std::unique(regions.begin(), regions.end()) - regions.begin());
+        _countsRegions = true;
     }
-    std::vector<const HXMemoryRegion *> regions;
-    for (const HXMemoryObject::View &object : _memoryObjects)
-        regions.insert(regions.end(), object->memoryRegions().begin(), object->memoryRegions().end());
-    std::sort(regions.begin(), regions.end());
-    return _totalRegions =
-               static_cast<int32_t>(std::unique(regions.begin(), regions.end()) - regions.begin());
+    return static_cast<int32_t>(_totalRegions);
 }
 
 void HXMemoryCategory::setNaming(HXString name, HXString detailedName) {
