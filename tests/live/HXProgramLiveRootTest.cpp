@@ -24,8 +24,8 @@ class HXProgramAsRoot : public testing::Test {
     }
 };
 
-// Processes with memory of their own that root may examine, by /proc; kernel threads and zombies have none, and a
-// container's first process can be out of its root's reach.
+// Processes with memory of their own that root may examine, by /proc; kernel threads and zombies have none,
+// and a container's first process can be out of its root's reach.
 std::set<int> userProcesses() {
     std::set<int> pids;
     for (const auto &entry : std::filesystem::directory_iterator("/proc")) {

@@ -117,6 +117,25 @@ TEST(HXProgram, NamesScriptsAfterTheScriptAndProgramsAfterTheirFile) {
     EXPECT_TRUE(contains(run.out, "__DATA " + folder.file("my shell") + " (deleted)"));
 }
 
+TEST(HXProgram, TellsThirtyTwoBitProgramsApart) {
+    const Folder folder;
+    // kill(getpid(), SIGSTOP), for ever, by the 32-bit system call gate.
+    std::ofstream(folder.file("stop.s"))
+        << ".globl _start\n.data\nword: .long 1\n.text\n_start: movl $20, %eax\n"
+           "int $0x80\nmovl $1, word\nmovl %eax, %ebx\nmovl $19, %ecx\n"
+           "movl $37, %eax\nint $0x80\njmp _start\n";
+    const std::string build = "as --32 -o " + folder.file("stop.o") + " " + folder.file("stop.s") +
+                              " && ld -m elf_i386 -o " + folder.file("stop") + " " + folder.file("stop.o");
+    if (HXRunProgram({"/bin/sh", "-c", build}).status != 0)
+        GTEST_SKIP() << "no 32-bit program can be built here";
+    const HXSubject subject(folder.file("stop"), {});
+    if (!subject.stopped()) GTEST_SKIP() << "the kernel runs no 32-bit programs";
+    const HXProgramRun run = HXRunHeft({"-p", "stop", "-v"});
+    EXPECT_TRUE(contains(run.out, "stop [" + std::to_string(subject.pid()) + "]: 32-bit\tHeft: ")) << run.out;
+    EXPECT_TRUE(contains(run.out, "__TEXT .../stop")) << run.out;
+    EXPECT_TRUE(contains(run.out, "__DATA .../stop")) << run.out;
+}
+
 TEST(HXProgram, PrintsHostileNamesAsPlainText) {
     const Folder folder;
     const std::string hostile = "a\x1b[31m\"b\"\nc\xff\\n";

@@ -10,6 +10,7 @@ struct HXProgramRun {
     int status = -1; // exit status; 128 + N when signal N ended the program
     std::string out;
     std::string err;
+    long peakKilobytes = 0; // most resident memory
 };
 
 // Runs `arguments` (the first is the program's path) with empty standard input; as another user where `user`
