@@ -95,8 +95,7 @@ void analyseSharing(benchmark::State &state) {
 }
 BENCHMARK(analyseSharing)->Apply(shapes);
 
-template <bool verbose>
-void report(benchmark::State &state, const char *format) {
+void report(benchmark::State &state, const char *format, bool verbose) {
     usePlatform();
     std::FILE *null = std::fopen("/dev/null", "w");
     for (auto _ : state) {
@@ -119,12 +118,12 @@ void report(benchmark::State &state, const char *format) {
     std::fclose(null);
     countRegions(state);
 }
-BENCHMARK_CAPTURE(report<false>, text, "text")->Apply(shapes);
-BENCHMARK_CAPTURE(report<false>, json, "json")->Apply(shapes);
-BENCHMARK_CAPTURE(report<true>, textWithRegions, "text")
+BENCHMARK_CAPTURE(report, text, "text", false)->Apply(shapes);
+BENCHMARK_CAPTURE(report, json, "json", false)->Apply(shapes);
+BENCHMARK_CAPTURE(report, textWithRegions, "text", true)
     ->Args({200, 400, 100})
     ->Unit(benchmark::kMillisecond);
-BENCHMARK_CAPTURE(report<true>, jsonWithRegions, "json")
+BENCHMARK_CAPTURE(report, jsonWithRegions, "json", true)
     ->Args({200, 400, 100})
     ->Unit(benchmark::kMillisecond);
 

@@ -11,7 +11,9 @@ int main(int argc, char *argv[]) {
         fprintf(stderr, "usage: heft-variant smaps|maps [heft's arguments]\n");
         return 1;
     }
-    static HXLinuxPlatform platform;
+    HXLinuxPlatform::Setting setting;
+    setting.mayScanPageTables = maps;
+    static HXLinuxPlatform platform(setting);
     platform.prepareProcess();
     HXPlatform::setCurrent(&platform);
     return HXHeftMain(argc - 1, argv + 1);

@@ -10,12 +10,8 @@ constexpr char kQueueLabel[] = "org.heft.gatherdata";
 } // namespace
 
 HXHeft::HXHeft(ProcessList processes)
-    : _processes(std::move(processes)), _objects(std::make_unique<HXMemoryObjects>()) {
-    _memoryObjects.reserve(100 * _processes.size());
-    _sharedCache64MemoryObjects.reserve(512);
-    _textMemoryObjects.reserve(2 * _processes.size());
-    _linkeditMemoryObjects.reserve(2 * _processes.size());
-}
+    : _processes(std::move(processes)), _objects(std::make_unique<HXMemoryObjects>()),
+      _maps(std::make_unique<ObjectMaps>()) {}
 
 HXHeft::~HXHeft() = default;
 
@@ -43,36 +39,42 @@ void HXHeft::gatherData() {
     gatherProcesses();
     if (_earlyExit)
         HXProcess::_addGlobalError("Heft exited early due to SIGINT and did not finish gathering all data");
+    reserveMaps();
     for (const auto &process : _processes)
         _addProcess(*process);
     finalizeObjects();
     _buildProcessToHeftMap();
 }
 
-HXMemoryObject &HXHeft::newObject() {
-    HXMemoryObject &object = _objects->emplace_back();
-    object.setIndex(static_cast<uint32_t>(_objects->size() - 1));
-    return object;
+// Growing a map step by step would leave every smaller table behind.
+void HXHeft::reserveMaps() {
+    size_t regions = 0;
+    for (const auto &process : _processes)
+        regions += process->memoryRegions().size();
+    _maps->_memoryObjects.reserve(regions);
+    _maps->_sharedCache64MemoryObjects.reserve(512);
+    _maps->_textMemoryObjects.reserve(2 * _processes.size());
+    _maps->_linkeditMemoryObjects.reserve(2 * _processes.size());
 }
 
 HXHeft::ObjectMap &HXHeft::mapForRegion(const HXMemoryRegion &region, const HXProcess &process) {
     if (region.inSharedCache())
-        return process.is64bit() ? _sharedCache64MemoryObjects : _sharedCache32MemoryObjects;
-    if (region.segment() == HXSegmentText) return _textMemoryObjects;
-    if (region.segment() == HXSegmentLinkedit) return _linkeditMemoryObjects;
-    return _memoryObjects;
+        return process.is64bit() ? _maps->_sharedCache64MemoryObjects : _maps->_sharedCache32MemoryObjects;
+    if (region.segment() == HXSegmentText) return _maps->_textMemoryObjects;
+    if (region.segment() == HXSegmentLinkedit) return _maps->_linkeditMemoryObjects;
+    return _maps->_memoryObjects;
 }
 
 HXMemoryObject &HXHeft::objectForRegion(const HXMemoryRegion &region, const HXProcess &process) {
     constexpr uint64_t noKey = UINT64_MAX;
     uint64_t key = region.inSharedCache() ? region.start() : region.object_id();
-    if (key == noKey) return newObject();
+    if (key == noKey) return _objects->add();
     // What a process has copied on write is its own, whoever else maps the object.
     if (region.share_mode() == SM_COW && (region.dirtySize() != 0 || region.swappedSize() != 0))
         key ^= uint64_t{static_cast<uint32_t>(process.pid())} << 32;
-    if (key == 0 || key == noKey) return newObject();
+    if (key == 0 || key == noKey) return _objects->add();
     HXMemoryObject *&object = mapForRegion(region, process)[key];
-    if (!object) object = &newObject();
+    if (!object) object = &_objects->add();
     return *object;
 }
 

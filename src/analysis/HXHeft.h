@@ -14,6 +14,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <memory_resource>
 #include <unordered_map>
 #include <vector>
 
@@ -74,13 +75,13 @@ class HXHeft : public HXHeftSwitches {
             return static_cast<size_t>(key ^ (key >> 29));
         }
     };
-    using ObjectMap = std::unordered_map<uint64_t, HXMemoryObject *, KeyHash>;
+    using ObjectMap = std::pmr::unordered_map<uint64_t, HXMemoryObject *, KeyHash>;
     struct Report;
 
     void gatherProcesses();
+    void reserveMaps();
     ObjectMap &mapForRegion(const HXMemoryRegion &region, const HXProcess &process);
     HXMemoryObject &objectForRegion(const HXMemoryRegion &region, const HXProcess &process);
-    HXMemoryObject &newObject();
     void reportProcess(const HXProcess &process, Report &report, const HXHeftSharingData &sharing,
                        bool summarize);
     void reportGroups(const HXProcess &process, const HXHeftSharingData::Groups &groups,
@@ -90,11 +91,16 @@ class HXHeft : public HXHeftSwitches {
     std::unordered_map<int32_t, uint64_t> _pidToHeft;
     std::unique_ptr<HXMemoryObjects>
         _objects; // all objects: those of the maps, and those that share with nothing
-    ObjectMap _memoryObjects;
-    ObjectMap _sharedCache64MemoryObjects;
-    ObjectMap _sharedCache32MemoryObjects;
-    ObjectMap _textMemoryObjects;
-    ObjectMap _linkeditMemoryObjects;
+    // The maps only grow, and go together.
+    struct ObjectMaps {
+        std::pmr::monotonic_buffer_resource memory;
+        ObjectMap _memoryObjects{&memory};
+        ObjectMap _sharedCache64MemoryObjects{&memory};
+        ObjectMap _sharedCache32MemoryObjects{&memory};
+        ObjectMap _textMemoryObjects{&memory};
+        ObjectMap _linkeditMemoryObjects{&memory};
+    };
+    std::unique_ptr<ObjectMaps> _maps;
     std::vector<HXOutputFormatter *> _outputFormatters;
     std::atomic<bool> _earlyExit{false};
 };

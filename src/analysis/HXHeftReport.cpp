@@ -64,9 +64,7 @@ void HXHeft::printOutputVerbose(bool verbose, bool summarize) {
     HXHeftSharingData sharing = _sharingData();
     // The report reads the objects through the sharing data; the maps are not needed any more.
     sharing.objects = std::move(_objects);
-    for (ObjectMap *map : {&_memoryObjects, &_sharedCache32MemoryObjects, &_sharedCache64MemoryObjects,
-                           &_textMemoryObjects, &_linkeditMemoryObjects})
-        ObjectMap().swap(*map);
+    _maps.reset();
 
     Report report;
     for (const HXProcess *process : inOrder)

@@ -7,11 +7,29 @@
 #include <cstdint>
 #include <deque>
 #include <memory>
+#include <memory_resource>
 #include <unordered_map>
 #include <vector>
 
-// The objects of an analysis: addresses stay as it grows.
-using HXMemoryObjects = std::deque<HXMemoryObject>;
+// The objects of an analysis: addresses stay as it grows. They are taken from memory in bulk and given back
+// at once.
+class HXMemoryObjects {
+  public:
+    HXMemoryObject &add() {
+        HXMemoryObject &object = _objects.emplace_back();
+        object.setIndex(static_cast<uint32_t>(_objects.size() - 1));
+        return object;
+    }
+    size_t size() const { return _objects.size(); }
+    auto begin() { return _objects.begin(); }
+    auto end() { return _objects.end(); }
+    auto begin() const { return _objects.begin(); }
+    auto end() const { return _objects.end(); }
+
+  private:
+    std::pmr::monotonic_buffer_resource _memory;
+    std::pmr::deque<HXMemoryObject> _objects{&_memory};
+};
 
 class HXHeftSharingData {
   public:

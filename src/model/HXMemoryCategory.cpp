@@ -2,41 +2,61 @@
 
 #include <algorithm>
 
-void HXMemoryCategory::addMemoryObject(HXMemoryObject::View object) {
-    if (!_memoryObjects.empty()) {
-        if (_members.empty()) _members.insert(_memoryObjects.front().get());
-        if (!_members.insert(object.get()).second) return;
+bool HXMemoryCategory::isMember(const HXMemoryObject &object) {
+    if (_memoryObjects.empty()) return false;
+    if (_isAscending && object.index() > _memoryObjects.back()->index()) return false;
+    if (_isAscending) {
+        _isAscending = false;
+        for (const HXMemoryObject::View &member : _memoryObjects)
+            _members.insert(member.get());
     }
+    return !_members.insert(&object).second;
+}
+
+void HXMemoryCategory::addMemoryObject(HXMemoryObject::View object) {
+    if (isMember(*object)) return;
     _totalDirtySize += object->totalDirtySize();
     _totalSwappedSize += object->totalSwappedSize();
     _totalCleanSize += object->totalCleanSize();
     _totalReclaimableSize += object->totalReclaimableSize();
     _totalWiredSize += object->totalWiredSize();
-    _totalRegions = -1;
+    _totalRegions += object->memoryRegions().size();
+    _countsRegions = _isAscending;
     _memoryObjects.push_back(std::move(object));
 }
 
 int32_t HXMemoryCategory::totalRegions() const {
-    if (_totalRegions >= 0) return _totalRegions;
-    std::vector<const HXMemoryRegion *> regions;
-    for (const HXMemoryObject::View &object : _memoryObjects)
-        regions.insert(regions.end(), object->memoryRegions().begin(), object->memoryRegions().end());
-    std::sort(regions.begin(), regions.end());
-    _totalRegions = static_cast<int32_t>(std::unique(regions.begin(), regions.end()) - regions.begin());
-    return _totalRegions;
+    if (!_countsRegions) {
+        std::vector<const HXMemoryRegion *> regions;
+        for (const HXMemoryObject::View &object : _memoryObjects)
+            regions.insert(regions.end(), object->memoryRegions().begin(), object->memoryRegions().end());
+        std::sort(regions.begin(), regions.end());
+        _totalRegions = static_cast<size_t>(std::unique(regions.begin(), regions.end()) - regions.begin());
+        _countsRegions = true;
+    }
+    return static_cast<int32_t>(_totalRegions);
+}
+
+void HXMemoryCategory::setNaming(HXString name, HXString detailedName) {
+    _isNamed = true;
+    _name = name;
+    _detailedName = detailedName;
 }
 
 HXString HXMemoryCategory::name() const {
+    if (_isNamed) return _name;
     return _memoryObjects.empty() ? HXString() : _memoryObjects.front()->name();
 }
 
 HXString HXMemoryCategory::detailedName() const {
-    return _isSummary || _memoryObjects.empty() ? HXString() : _memoryObjects.front()->detailedName();
+    if (_isSummary) return HXString();
+    if (_isNamed) return _detailedName;
+    return _memoryObjects.empty() ? HXString() : _memoryObjects.front()->detailedName();
 }
 
 std::string HXMemoryCategory::fullName() const {
-    if (_isSummary || _memoryObjects.empty()) return name().str();
-    return _memoryObjects.front()->fullName();
+    const HXString detail = detailedName();
+    return detail.isEmpty() ? name().str() : name().str() + " " + detail.str();
 }
 
 HXMemoryCategory &HXCategoryMap::categoryForObject(const HXMemoryObject &object, HXSegment segment,
@@ -48,7 +68,10 @@ HXMemoryCategory &HXCategoryMap::categoryForObject(const HXMemoryObject &object,
 
     std::string key = summarize ? naming.name().str() : naming.fullName();
     const auto [position, isNew] = _byKey.try_emplace(key, _entries.size());
-    if (isNew) _entries.push_back({std::move(key), std::make_unique<HXMemoryCategory>(segment, summarize)});
+    if (isNew) {
+        _entries.push_back({std::move(key), std::make_unique<HXMemoryCategory>(segment, summarize)});
+        _entries.back().category->setNaming(naming.name(), naming.detailedName());
+    }
     _byName.emplace(names, position->second);
     return *_entries[position->second].category;
 }

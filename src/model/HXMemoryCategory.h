@@ -30,23 +30,36 @@ class HXMemoryCategory {
     // The number of different regions of all objects.
     int32_t totalRegions() const;
 
-    // Those of the first object; none without one.
+    // Gives the category the name that its objects were chosen by. Views of an object may be made of regions
+    // that other processes call otherwise.
+    void setNaming(HXString name, HXString detailedName);
+
+    // Those given, else those of the first object; none without either.
     HXString name() const;
     // None for a summary category.
     HXString detailedName() const;
     std::string fullName() const;
 
   private:
+    bool isMember(const HXMemoryObject &object);
+
     bool _isSummary;
     HXSegment _segment;
+    bool _isNamed = false;
+    HXString _name;
+    HXString _detailedName;
     std::vector<HXMemoryObject::View> _memoryObjects;
-    std::unordered_set<const HXMemoryObject *> _members; // from the second object on
+    // Objects of an analysis come by ascending index, so that each is new and shares no region with those
+    // before. Once one breaks the order, members are looked up and regions counted one by one.
+    bool _isAscending = true;
+    std::unordered_set<const HXMemoryObject *> _members;
     uint64_t _totalDirtySize = 0;
     uint64_t _totalSwappedSize = 0;
     uint64_t _totalCleanSize = 0;
     uint64_t _totalReclaimableSize = 0;
     uint64_t _totalWiredSize = 0;
-    mutable int32_t _totalRegions = -1; // −1: not counted since the last object came
+    mutable size_t _totalRegions = 0;
+    mutable bool _countsRegions = true; // whether _totalRegions is up to date
 };
 
 // Categories by key (name or full name), in the order in which the keys came.

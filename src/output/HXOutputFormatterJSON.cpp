@@ -53,6 +53,12 @@ void HXOutputFormatterJSON::key(const char *literal) {
     _needsComma = false;
 }
 
+void HXOutputFormatterJSON::keyNamed(const std::string &name) {
+    if (_needsComma) fputc(',', _stream);
+    fprintf(_stream, "\"%s\":", name.c_str());
+    _needsComma = false;
+}
+
 void HXOutputFormatterJSON::open(char bracket) {
     if (_needsComma) fputc(',', _stream);
     fputc(bracket, _stream);
@@ -240,7 +246,7 @@ void HXOutputFormatterJSON::end() {
 
 void HXOutputFormatterJSON::JSONForCategories(const HXCategoryMap &categories) {
     for (const auto &[name, category] : categories.entries()) {
-        key(("\"" + escaped(category->fullName()) + "\":").c_str());
+        keyNamed(escaped(category->fullName()));
         open('{');
         sizes(category->totalDirtySize(), category->totalSwappedSize(), category->totalCleanSize(),
               category->totalReclaimableSize(), category->totalWiredSize(),
@@ -254,7 +260,7 @@ void HXOutputFormatterJSON::JSONForAuxData(const HXAuxDataType *data) {
         return signedNumber(data ? static_cast<const HXAuxData *>(data)->value() : 0);
     open('{');
     for (const auto &[name, node] : static_cast<const HXAuxDictionary *>(data)->entries()) {
-        key(("\"" + name + "\":").c_str());
+        keyNamed(name);
         JSONForAuxData(node.get());
     }
     close('}');

@@ -49,6 +49,7 @@ class HXOutputFormatterJSON : public HXOutputFormatter {
     explicit HXOutputFormatterJSON(std::FILE *stream);
     // The writer's four steps. A key comes with its quotes and colon.
     void key(const char *literal);
+    void keyNamed(const std::string &name);
     void open(char bracket);
     void close(char bracket);
     void number(uint64_t value);

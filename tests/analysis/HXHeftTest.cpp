@@ -202,11 +202,13 @@ TEST_F(HXHeftTest, AnInterruptLeavesOutWhatHasNotBegun) {
 
 TEST_F(HXHeftTest, GroupsPartitionObjectsByWhoMapsThem) {
     const HXRegionFacts fake{.object = 5, .start = kNoAddress, .tag = kFakeRegionTag, .owned = true};
-    add(10, {object(1), object(2), object(3), fake});
+    HXRegionFacts owned = object(7);
+    owned.owned = true;
+    add(10, {object(1), object(2), object(3), fake, owned});
     add(20, {object(2), object(1), object(4)});
     add(30, {object(2), object(1)});
     // A hidden process counts only for what a shown process owns and shows no mapping of.
-    add(40, {object(1), object(5), object(6)}).setHiddenFromDisplay(true);
+    add(40, {object(1), object(5), object(6), object(7)}).setHiddenFromDisplay(true);
     HXHeft &heft = gather();
     const HXHeftSharingData sharing = heft._sharingData();
     EXPECT_EQ(groupsOf(sharing, 10), (Groups{{10}, {10, 20, 30}, {10, 40}}));
@@ -219,8 +221,9 @@ TEST_F(HXHeftTest, GroupsPartitionObjectsByWhoMapsThem) {
         EXPECT_TRUE(group.immutable());
         objects += sharing.objectsOfGroup(group).size();
     }
+    EXPECT_EQ(sharing.objectsOfGroup(*sharing.groupsOfProcess(40)->front()).size(), 1u); // not object 7
     EXPECT_EQ(sharing.groups.size(), 4u);
-    EXPECT_EQ(objects, 5u); // not object 6
+    EXPECT_EQ(objects, 6u); // not object 6
 }
 
 TEST_F(HXHeftTest, CategoriesTellWhetherAViewDiffers) {

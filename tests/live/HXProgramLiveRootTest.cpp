@@ -24,7 +24,8 @@ class HXProgramAsRoot : public testing::Test {
     }
 };
 
-// Processes with memory of their own, by /proc; kernel threads and zombies have none.
+// Processes with memory of their own that root may examine, by /proc; kernel threads and zombies have none, and a
+// container's first process can be out of its root's reach.
 std::set<int> userProcesses() {
     std::set<int> pids;
     for (const auto &entry : std::filesystem::directory_iterator("/proc")) {
@@ -32,7 +33,8 @@ std::set<int> userProcesses() {
         if (name.find_first_not_of("0123456789") != std::string::npos) continue;
         std::ifstream statm(entry.path() / "statm");
         long size = 0;
-        if (statm >> size && size > 0) pids.insert(std::stoi(name));
+        const bool mayExamine = std::ifstream(entry.path() / "smaps").good();
+        if (mayExamine && statm >> size && size > 0) pids.insert(std::stoi(name));
     }
     return pids;
 }

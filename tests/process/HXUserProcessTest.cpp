@@ -421,6 +421,13 @@ TEST(HXUserProcessTest, RegionsOfMixedPagesAreCutIntoRuns) {
         EXPECT_EQ(runsOf(gather(machine("  owned_none=1", "  page_size=4096") + records, true).list[0]),
                   "none");
     }
+    // 4,096 pages are one query, one page more is another.
+    for (const uint64_t pages : {4096, 4097}) {
+        const Gathered cut =
+            gather(machine("", "  page_size=4096") + at(0x1000000, pages * 4096, some + "  pages=1*9") +
+                   "fault  pid=7  call=mach_vm_page_range_query  from=2  error=5\n");
+        EXPECT_EQ(cut.errors.size(), pages - 4096);
+    }
     // A query that fails in the middle keeps the runs it has; the walk goes on.
     const Gathered gathered = gather(
         machine("", "  page_size=4096") + at(0x1000000, 4098 * 4096, some + "  pages=1*9,4094*0,2*1,1*0") +

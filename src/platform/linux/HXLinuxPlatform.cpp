@@ -2,6 +2,7 @@
 #include "platform/linux/HXLinuxPlatform.h"
 
 #include "platform/HXRegionTags.h"
+#include "platform/HXSafeText.h"
 #include "platform/linux/HXLinuxDispatch.h"
 #include "platform/linux/HXLinuxFiles.h"
 
@@ -9,6 +10,7 @@
 #include <malloc.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/utsname.h>
 
 #include <bit>
 #include <cerrno>
@@ -132,6 +134,12 @@ int32_t HXLinuxPlatform::ledger(int32_t command, int32_t pid, void *buffer, int6
 
 int32_t HXLinuxPlatform::getpid() {
     return ::getpid();
+}
+
+std::string HXLinuxPlatform::hostDescription() {
+    utsname names{};
+    if (::uname(&names) != 0) return HXPlatform::hostDescription();
+    return "Linux " + HXSafeText(names.release) + ", " + HXPlatform::hostDescription();
 }
 
 uint32_t HXLinuxPlatform::geteuid() {

@@ -56,6 +56,8 @@ class HXLinuxPlatform final : public HXPlatform {
     int32_t proc_get_dirty(int32_t pid, uint32_t *flags) override;
     int32_t proc_regionfilename(int32_t pid, uint64_t address, char *buffer, uint32_t bufferBytes) override;
     int32_t getpid() override;
+    // "Linux RELEASE, X86-64".
+    std::string hostDescription() override;
     uint32_t geteuid() override;
     int32_t sysctl(const int32_t *name, uint32_t nameLength, void *old, size_t *oldBytes) override;
     int32_t sysctlbyname(const char *name, void *old, size_t *oldBytes, const void *newValue,

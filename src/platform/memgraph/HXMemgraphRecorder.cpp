@@ -17,6 +17,7 @@ constexpr size_t kFlushBytes = 1 << 16;
 // have no address, are put into the first gap.
 constexpr uint64_t kPageTablePlace = uint64_t{1} << 63;
 constexpr char kPageTableType[] = "page table";
+constexpr uint32_t kPageTableObjectID = 0xFFFFFFFE;
 
 // The page tables are told as memory that is named by its user, under the last tag for such memory: readers
 // go by the name.
@@ -204,7 +205,8 @@ void HXMemgraphRecorder::recordRegion(int32_t pid, uint64_t address, uint64_t si
     _writer.end();
 }
 
-// Without an object id, so that the region is merged with no other.
+// Under an object id that no other region has, as memory that was copied on write: such memory is never
+// merged with another process's.
 void HXMemgraphRecorder::recordPageTable(uint64_t address, uint64_t size) {
     _writer.begin(regionRecord);
     _writer.hex(Region::address, address);
@@ -213,18 +215,27 @@ void HXMemgraphRecorder::recordPageTable(uint64_t address, uint64_t size) {
     _writer.number(Region::userTag, kPageTableTag);
     _writer.number(Region::resident, size);
     _writer.number(Region::dirty, size);
+    _writer.number(Region::shareMode, SM_COW);
+    _writer.hex(Region::objectID, freeObjectID(kPageTableObjectID));
     _writer.end();
 }
 
 // An id of 32 bits for an object's full id: the host's own short id where no other object of the graph has
-// it, so that graphs of one host agree; else the next that is free. 0 and all ones stay what they are.
+// it, so that graphs of one host agree; else the next that is free. Without a full id (0) there is none; all
+// ones stand for an object of the region's own.
 uint32_t HXMemgraphRecorder::graphObjectID(uint64_t fullID, uint32_t preferred) {
-    if (fullID == 0) return preferred;
+    if (fullID == 0) return 0;
+    if (fullID == UINT64_MAX) return freeObjectID(preferred);
     const auto known = _objectIDs.find(fullID);
     if (known != _objectIDs.end()) return known->second;
+    const uint32_t id = freeObjectID(preferred);
+    _objectIDs.emplace(fullID, id);
+    return id;
+}
+
+uint32_t HXMemgraphRecorder::freeObjectID(uint32_t preferred) {
     uint32_t id = preferred;
     while (id == 0 || id == UINT32_MAX || !_takenObjectIDs.insert(id).second)
         id++;
-    _objectIDs.emplace(fullID, id);
     return id;
 }

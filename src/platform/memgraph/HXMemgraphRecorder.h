@@ -42,6 +42,7 @@ class HXMemgraphRecorder {
     void recordPageTable(uint64_t address, uint64_t size);
     const Segment *nextSegment(uint64_t start, uint64_t end);
     uint32_t graphObjectID(uint64_t fullID, uint32_t preferred);
+    uint32_t freeObjectID(uint32_t preferred);
     bool flush();
 
     HXPlatform &_host;

@@ -5,6 +5,8 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cinttypes>
+#include <cstdio>
 #include <cstring>
 
 using namespace HXMachineFormat;
@@ -213,7 +215,13 @@ void HXProcessRecorder::recordRegion(int32_t pid, uint64_t address, uint64_t siz
     recordRegionObject(address, size, info);
 
     std::optional<std::vector<std::string>> runs;
-    if (isPageQueried(size, info)) runs = pageRuns(address, size);
+    if (isPageQueried(size, info)) {
+        if (size <= kMaxPagesRegionSize)
+            runs = pageRuns(address, size);
+        else
+            std::fprintf(stderr, "heft-record: %d: the pages from 0x%" PRIx64 " on are too many to record\n",
+                         pid, address);
+    }
     for (size_t i = 0; runs && i < runs->size(); i++) {
         if (i > 0) {
             _body.end();
@@ -245,7 +253,6 @@ void HXProcessRecorder::recordRegionObject(uint64_t address, uint64_t size,
 
 // Whether an analysis would ask for the dispositions of the region's pages.
 bool HXProcessRecorder::isPageQueried(uint64_t size, const vm_region_submap_info_64 &info) const {
-    if (size > kMaxPagesRegionSize) return false;
     // Pieces of a shared region are measured by their pages alone.
     if (_host.hasSharedRegion() && (info.max_protection & VM_PROT_WRITE) != 0) return true;
     const bool isPrivate =

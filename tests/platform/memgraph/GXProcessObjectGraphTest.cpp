@@ -161,7 +161,7 @@ TEST(HXMemgraphRecorder, WritesWhatALiveWalkFinds) {
         recorded(machine, true),
         start + images + "8192|object_id=0x8|purgeable=0\n" +
             "region|address=0x8000000000000000|length=0x3000|type=page table|user_tag=239|resident=12288"
-            "|dirty=12288\n" +
+            "|dirty=12288|share_mode=1|object_id=0xfffffffe\n" +
             end);
     EXPECT_EQ(recorded(machine, false),
               start + "|shows_phys_heft=0" + images + "4096|object_id=0x8|purgeable=0\n" + end);

@@ -1,0 +1,172 @@
+// Whole reports of several processes.
+#include "support/HXRun.h"
+
+#include <gtest/gtest.h>
+#include <random>
+
+namespace {
+using Words = std::vector<std::string>;
+
+// Everything from the first of `starts` on that the text holds.
+std::string from(const std::string &text, const std::string &start) {
+    const size_t at = text.find(start);
+    return at == std::string::npos ? "no " + start + " in " + text : text.substr(at);
+}
+bool beginsWith(const std::string &text, const std::string &start) {
+    return text.compare(0, start.size(), start) == 0;
+}
+} // namespace
+
+TEST(HXHeftReportTest, TheSearchForUnmappedMemoryNamesItAfterWhoMapsIt) {
+    const std::string machine =
+        "host  self_region_heft=0  ledger=other\nprocess  pid=1010  name=target\n"
+        "owned  pid=1010  object_id=5  virtual=0x8000  resident=0x8000\n" +
+        region(1010, 0x4000, 0x4000, "tag=2  resident=1  dirtied=1  object_id=1") +
+        "process  pid=1020  name=mapper\n" +
+        region(1020, 0x4000, 0x4000, "tag=2  resident=1  dirtied=1  object_id=1") +
+        region(1020, 0x8000, 0x8000, "tag=3  share_mode=4  resident=2  dirtied=2  object_id=5") +
+        region(1020, 0x10000, 0x4000, "tag=7  resident=1  dirtied=1  object_id=6");
+    const HXRun alone = report(machine, {"target"});
+    EXPECT_NE(alone.out.find(
+                  "    32768 B           0 B           0 B          1    Owned physical heft (unmapped)\n"),
+              std::string::npos)
+        << alone.out;
+    const HXRun searched = report(machine, {"target", "--unmapped"});
+    EXPECT_EQ(from(searched.out, "Shared with"), R"(Shared with mapper [1020]:
+      Dirty         Clean   Reclaimable    Regions    Category
+        ---           ---           ---        ---    ---
+    32768 B           0 B           0 B          2    MALLOC_LARGE
+        ---           ---           ---        ---    ---
+    32768 B           0 B           0 B          2    TOTAL
+
+)");
+    EXPECT_NE(searched.out.find("Heft: 49152 B"), std::string::npos);
+    EXPECT_EQ(searched.out.find("mapper [1020]: 64-bit"), std::string::npos);
+    // Both shown, the mapper sees the owner's memory as clean, beside what it is charged for itself.
+    const HXRun both = report(machine, {"target", "mapper"});
+    EXPECT_NE(
+        both.json.find(
+            R"({"pids":[1010,1020],"specific_to_pid":1020,"categories":{)"
+            R"("MALLOC_SMALL":{"dirty":16384,"swapped":0,"clean":0,"reclaimable":0,"wired":0,"regions":2},)"
+            R"("MALLOC_LARGE":{"dirty":0,"swapped":0,"clean":32768,"reclaimable":0,"wired":0,"regions":2}}})"),
+        std::string::npos)
+        << both.json;
+}
+
+TEST(HXHeftReportTest, ProcessesWithErrorsTakeNoPartInTheAuxiliaryData) {
+    const std::string bad = "process  pid=1010  name=bad  heft=5\n" +
+                            region(1010, 0x4000, 0x4000, "resident=1  dirtied=1  object_id=1") +
+                            "fault  pid=1010  call=mach_vm_region_recurse  from=2  error=5\n";
+    const std::string json = report(bad, {"bad"}).json;
+    EXPECT_NE(
+        json.find(R"({"name":"bad","pid":1010,"errors":["bad [1010]: (os/kern) failure"],"categories":{},)"
+                  R"("auxiliary":{"phys_heft":5,"phys_heft_peak":0}}])"),
+        std::string::npos)
+        << json;
+    EXPECT_TRUE(beginsWith(from(json, "\"total heft\""), R"("total heft":16384,"auxiliary":0,"shared":[])"))
+        << json;
+}
+
+// A process name or path is whatever its owner likes: the report stays one line a line and parses.
+TEST(HXHeftReportTest, HostileNamesBreakNothing) {
+    const std::string machine =
+        "process  pid=1010  name=a\"b\\\\c\\nd\x1b[2J\xff\n" +
+        region(1010, 0x4000, 0x4000, "pager=1  path=/x\"\\\\\\n\x7f/\xc3\xa9\"  resident=1  object_id=1");
+    const HXRun result = report(machine, {"1010", "-v", "-w"});
+    EXPECT_NE(result.json.find(R"({"name":"a'b?c?d?[2J?","pid":1010,)"), std::string::npos) << result.json;
+    EXPECT_NE(result.json.find("\"mapped file /x\\\"\?\?\?/\xc3\xa9\\\"\""), std::string::npos)
+        << result.json;
+    EXPECT_NE(result.out.find("   mapped file /x\"\?\?\?/\xc3\xa9\"\n"), std::string::npos) << result.out;
+}
+
+namespace {
+// Machines of a few processes whose mappings meet in a handful of objects, in every state.
+class RandomMachine {
+  public:
+    explicit RandomMachine(uint64_t seed) : _random(seed) {}
+
+    std::string text() {
+        std::string text = "host  ledger=page_table" + std::string(one(2) ? "  self_region_heft=0\n" : "\n");
+        for (int pid = 1001; pid <= 1002 + static_cast<int>(below(4)); pid++)
+            text += process(pid);
+        return text;
+    }
+    Words arguments() {
+        Words words{one(2) ? "-a" : "same"};
+        for (const char *option : {"-v", "-w", "--vmObjectDirty", "--swapped", "--wired", "--unmapped", "-t"})
+            if (one(4)) words.push_back(option);
+        static const char *const columns[] = {"dirty", "swapped", "clean",   "reclaimable",
+                                              "wired", "regions", "category"};
+        words.insert(words.end(), {"--sort", columns[below(7)]});
+        return words;
+    }
+
+  private:
+    static constexpr uint64_t kPage = 16384;
+
+    std::string process(int pid) {
+        std::string text = field("process  pid=", pid) + "  name=" + (one(2) ? "same" : "other") +
+                           field("  flags=", one(4) ? 0 : 16) + field("  heft=", below(1000000)) +
+                           field("  page_table=", below(3) * kPage) + (one(3) ? "  owned_none=1\n" : "\n");
+        const bool ownsNothing = text.find("owned_none") != std::string::npos;
+        for (uint64_t count = ownsNothing ? 0 : below(3); count > 0; count--)
+            text += field("owned  pid=", pid) + field("  object_id=", 1 + below(6)) +
+                    field("  virtual=", 4 * kPage) + field("  resident=", below(4) * kPage) +
+                    field("  compressed=", below(2) * kPage) + field("  flags=", below(4) << 4) + "\n";
+        text += field("image  pid=", pid) + "  path=/bin/x  base=0x7000000\n" + field("segment  pid=", pid) +
+                "  name=__DATA  start=0x7000000  size=0x10000\n";
+        uint64_t address = kPage;
+        for (uint64_t count = below(12); count > 0; count--) {
+            address += below(3) * kPage;
+            const uint64_t pages = 1 + below(6);
+            text += region(pid, address, pages * kPage, facts(pages));
+            address += pages * kPage;
+        }
+        text += region(pid, 0x7000000, 4 * kPage,
+                       "share_mode=1  object_id=8  resident=3  dirtied=" + std::to_string(below(3)));
+        for (const uint64_t cache : {uint64_t{0x40000000}, uint64_t{0x180000000}})
+            if (one(3)) text += region(pid, cache, 2 * kPage, "max_prot=3  object_id=9  pages=1*9,1*1");
+        return one(8) ? text + field("fault  pid=", pid) + "  call=mach_vm_region_recurse  from=3  error=5\n"
+                      : text;
+    }
+    // Of a mapping of that many pages. What it is called depends on its object alone.
+    std::string facts(uint64_t pages) {
+        static const char *const names[] = {
+            "tag=87", "tag=2", "tag=3", "pager=1  path=/a/x", "pager=1  path=/b/x", "tag=30", "tag=240"};
+        const uint64_t resident = below(pages + 1), dirtied = below(resident + 1),
+                       object = below(std::size(names));
+        std::string text = field("resident=", resident) + field("  dirtied=", dirtied) +
+                           field("  swapped=", below(pages - resident + 1)) +
+                           field("  reusable=", below(resident - dirtied + 1)) +
+                           field("  share_mode=", 1 + below(7)) + field("  object_id=", object) + "  " +
+                           names[object] + field("  offset=", below(3) * kPage);
+        if (one(4)) text += field("  purge=", below(3));
+        if (one(4)) text += "  wired=1";
+        static const char *const dispositions[] = {"0", "1", "9", "0x10", "0x81", "0x801", "0x89"};
+        text += "  pages=";
+        for (uint64_t i = 0; i < pages; i++)
+            text += std::string(i > 0 ? ",1*" : "1*") + dispositions[below(7)];
+        return text;
+    }
+    static std::string field(const char *name, uint64_t value) { return name + std::to_string(value); }
+    uint64_t below(uint64_t limit) { return _random() % limit; }
+    bool one(uint64_t in) { return below(in) == 0; }
+
+    std::mt19937_64 _random;
+};
+} // namespace
+
+TEST(HXHeftReportTest, EveryReportAddsUp) {
+    for (uint64_t seed = 1; seed <= 300 && !testing::Test::HasFailure(); seed++) {
+        RandomMachine random(seed);
+        const std::string machine = random.text();
+        const Words arguments = random.arguments();
+        SCOPED_TRACE("seed " + std::to_string(seed) + "\n" + machine);
+        const HXRun result = run(machine, arguments);
+        if (result.status == 0) {
+            (void)report(machine, arguments);
+        } else { // no process of that name
+            EXPECT_EQ(arguments[0], "same") << result.err;
+        }
+    }
+}
