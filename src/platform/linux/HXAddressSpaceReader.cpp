@@ -102,7 +102,7 @@ bool Reader::readMapsAndScan() {
 bool Reader::mapsSuffice() const {
     // Page tables do not show which pages of shared memory are swapped out.
     if (_sawSwapBacked && _setting.machine->usesSwap()) return false;
-    return !_setting.machine->hasFreedLazily() || !hasFreedLazily();
+    return !_setting.machine->hasFreedLazily(_request.opened) || !hasFreedLazily();
 }
 
 // Whether the process holds lazily freed pages, which look like others in the page tables; also true where

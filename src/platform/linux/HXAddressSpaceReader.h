@@ -6,6 +6,7 @@
 #include "platform/linux/HXMachineFacts.h"
 #include "platform/linux/HXProcText.h"
 
+#include <chrono>
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -21,9 +22,10 @@ struct HXReaderSetting {
 
 // What a reader of one process knows and wants.
 struct HXReadRequest {
-    int directory;                        // of the process in /proc
-    std::optional<HXStatusRecord> status; // where it has been read already
-    bool needsDirtyPages = true;          // HXMapping::dirtyPages
+    int directory;                                  // of the process in /proc
+    std::optional<HXStatusRecord> status;           // where it has been read already
+    bool needsDirtyPages = true;                    // HXMapping::dirtyPages
+    std::chrono::steady_clock::time_point opened{}; // when the process was
 };
 
 // Reads the mappings of a process and classifies them. A process that vanishes leaves what was read until

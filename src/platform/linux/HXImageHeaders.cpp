@@ -20,18 +20,17 @@ using ReadBytes = std::function<std::optional<std::string>(uint64_t offset, uint
 
 struct Outcome {
     bool isRead = false;
-    std::unique_ptr<const HXElfHeaders> headers;
+    std::optional<HXElfHeaders> headers;
 };
 
 Outcome readHeaders(const ReadBytes &read) {
     const auto beginning = read(0, HXElfFileHeaderSize);
     if (!beginning) return {};
     const auto place = HXParseElfFileHeader(*beginning);
-    if (!place) return {true, nullptr};
+    if (!place) return {true, std::nullopt};
     const auto bytes = read(place->offset, place->size());
     if (!bytes) return {};
-    auto headers = HXParseElfProgramHeaders(*bytes, *place);
-    return {true, headers ? std::make_unique<const HXElfHeaders>(std::move(*headers)) : nullptr};
+    return {true, HXParseElfProgramHeaders(*bytes, *place)};
 }
 
 std::optional<std::string> readExactly(int file, uint64_t position, uint64_t length) {
@@ -149,7 +148,7 @@ const HXElfHeaders *HXImageHeaders::headersOf(const HXAddressSpace &addressSpace
     {
         const std::lock_guard lock(_mutex);
         File &file = _files[key];
-        if (file.isRead) return file.headers.get();
+        if (file.isRead) return file.headers ? &*file.headers : nullptr;
         if (file.tries == maximumTries) return nullptr;
         file.tries++;
     }
@@ -168,5 +167,5 @@ const HXElfHeaders *HXImageHeaders::headersOf(const HXAddressSpace &addressSpace
         file.isRead = true;
         file.headers = std::move(outcome.headers);
     }
-    return file.headers.get();
+    return file.headers ? &*file.headers : nullptr;
 }

@@ -6,8 +6,8 @@
 #include "platform/linux/HXFileSystems.h"
 
 #include <cstdint>
-#include <memory>
 #include <mutex>
+#include <optional>
 #include <unordered_map>
 
 class HXImageHeaders {
@@ -36,7 +36,7 @@ class HXImageHeaders {
     struct File {
         uint32_t tries = 0;
         bool isRead = false;
-        std::unique_ptr<const HXElfHeaders> headers; // null: no image
+        std::optional<HXElfHeaders> headers; // none: no image
     };
 
     HXFileSystems &_fileSystems;

@@ -148,7 +148,7 @@ int32_t HXLinuxPlatform::proc_regionfilename(int32_t pid, uint64_t address, char
         return 0;
     const std::string &path = addressSpace.path(addressSpace[index].path).text;
     const size_t length = std::min<size_t>(path.size(), bufferBytes);
-    std::memcpy(buffer, path.data(), length);
+    std::copy_n(path.data(), length, buffer);
     return static_cast<int32_t>(length);
 }
 

@@ -2,7 +2,7 @@
 
 const HXAddressSpace &HXLinuxTask::addressSpace(const HXReaderSetting &setting, bool needsDirtyPages) {
     if (!_addressSpace || (needsDirtyPages && !_addressSpace->knowsDirtyPages))
-        _addressSpace = HXReadAddressSpace({directory(), _status, needsDirtyPages}, setting);
+        _addressSpace = HXReadAddressSpace({directory(), _status, needsDirtyPages, _opened}, setting);
     return *_addressSpace;
 }
 

@@ -8,6 +8,7 @@
 
 #include <array>
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <memory>
 #include <mutex>
@@ -42,6 +43,7 @@ class HXLinuxTask {
   private:
     const int32_t _pid;
     const HXDescriptor _directory;
+    const std::chrono::steady_clock::time_point _opened = std::chrono::steady_clock::now();
     std::unique_ptr<HXAddressSpace> _addressSpace;
     size_t _cursor = 0;
     HXPageReader _pages;

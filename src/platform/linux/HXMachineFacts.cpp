@@ -11,16 +11,13 @@ bool HXMachineFacts::usesSwap() const {
     return ::sysinfo(&info) != 0 || info.freeswap != info.totalswap;
 }
 
-bool HXMachineFacts::hasFreedLazily() {
-    constexpr std::chrono::milliseconds validity(100);
+bool HXMachineFacts::hasFreedLazily(std::chrono::steady_clock::time_point since) {
     constexpr size_t limit = 1 << 20;
     const std::lock_guard lock(_mutex);
-    const auto now = std::chrono::steady_clock::now();
     // It never becomes false again: the kernel counts events.
-    if (_hasFreedLazily || (_lookedUp.time_since_epoch().count() != 0 && now - _lookedUp < validity))
-        return _hasFreedLazily;
+    if (_hasFreedLazily || _lookedUp > since) return _hasFreedLazily;
+    _lookedUp = std::chrono::steady_clock::now();
     const auto text = HXReadText(AT_FDCWD, _vmstatPath.c_str(), limit);
     _hasFreedLazily = !text || HXParseLabelled(*text, "pglazyfree ").value_or(1) != 0;
-    _lookedUp = now;
     return _hasFreedLazily;
 }

@@ -12,8 +12,9 @@ class HXMachineFacts {
 
     // Whether any page is swapped out now.
     bool usesSwap() const;
-    // Whether any process has ever freed pages lazily. Looked up again after a while.
-    bool hasFreedLazily();
+    // Whether any process had ever freed pages lazily at some moment after `since`: one lookup serves all
+    // processes that were opened before it.
+    bool hasFreedLazily(std::chrono::steady_clock::time_point since);
 
   private:
     const std::string _vmstatPath;

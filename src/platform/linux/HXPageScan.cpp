@@ -81,8 +81,10 @@ bool knowsHugeZeros(int pagemap, const Support &support) {
         ::mmap(nullptr, length, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
     if (memory == MAP_FAILED) return false;
     ::madvise(memory, length, MADV_HUGEPAGE);
-    const auto start = (reinterpret_cast<uint64_t>(memory) + hugeSize - 1) & ~uint64_t{hugeSize - 1};
-    [[maybe_unused]] const volatile char zero = *reinterpret_cast<const volatile char *>(start);
+    const uint64_t past = reinterpret_cast<uint64_t>(memory) % hugeSize;
+    const volatile char *page = static_cast<const volatile char *>(memory) + (hugeSize - past) % hugeSize;
+    [[maybe_unused]] const char zero = *page;
+    const auto start = reinterpret_cast<uint64_t>(page);
     Region region{};
     uint64_t walkEnd = 0;
     const int count = scan(pagemap, support.categories, start, start + hugeSize, {&region, 1}, &walkEnd);

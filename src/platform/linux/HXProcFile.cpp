@@ -18,7 +18,7 @@ void HXDescriptor::reset(int descriptor) {
 }
 
 std::span<char> HXScratchBuffer() {
-    constexpr size_t size = 64 * 1024;
+    constexpr size_t size = 65536;
     thread_local const std::unique_ptr<char[]> buffer(new char[size]);
     return {buffer.get(), size};
 }

@@ -218,7 +218,7 @@ TEST_F(HXLinuxPlatformTest, WalksMappings) {
     count = 9;
     ASSERT_EQ(platform.mach_vm_region(task, &address, &size, 9, &basic, &count), KERN_SUCCESS);
     EXPECT_EQ(address, 0x1000u);
-    EXPECT_EQ(basic.offset, 0x2000u);
+    EXPECT_EQ(uint64_t{basic.offset}, 0x2000u);
     setReportsCharge(0);
     count = 19;
     address = 0x30000;

@@ -82,7 +82,8 @@ TEST(HXMappingClass, TagsPagersAndShareModes) {
         EXPECT_EQ(info.share_mode, item.shareMode) << what;
         EXPECT_EQ(mapping.has(HXMappingSwapBacked), item.swapBacked) << what;
         EXPECT_EQ(info.user_wired_count, (item.flags & H) != 0) << what;
-        EXPECT_EQ(info.offset, info.share_mode == SM_PRIVATE || item.device == 0 ? 0u : 0x3000u) << what;
+        EXPECT_EQ(uint64_t{info.offset}, info.share_mode == SM_PRIVATE || item.device == 0 ? 0u : 0x3000u)
+            << what;
     }
     HXMapping empty = classified("", 0, 0);
     empty.residentPages = 0;
