@@ -46,6 +46,7 @@ class Finder {
 
     const HXAddressSpace &_addressSpace;
     const Pages _pages;
+    bool _readableIsExecutable = false; // as the stack tells
     std::vector<Candidate> _candidates;
 };
 
@@ -56,6 +57,9 @@ bool mapsCode(const HXMapping &mapping) {
 }
 
 void Finder::findCandidates(const HXHeadersOfMapping &headersOf) {
+    for (size_t i = 0; i < _addressSpace.count(); i++)
+        if (_addressSpace[i].kind == static_cast<uint8_t>(HXPathKind::stack))
+            _readableIsExecutable = _addressSpace[i].has(HXMappingExecutable);
     for (size_t i = 0; i < _addressSpace.count(); i++) {
         const HXMapping &mapping = _addressSpace[i];
         if (mapping.kind == static_cast<uint8_t>(HXPathKind::vdso)) addVdso(mapping);
@@ -74,14 +78,38 @@ void Finder::addVdso(const HXMapping &mapping) {
     _candidates.push_back({nullptr, 0, 0, 0, std::move(image), mapping.end});
 }
 
+// A stretch of the file that one executable mapping may show: a load; with `isJoined` also those that follow
+// it at the same distance from their addresses, which are one mapping in a process whose readable memory is
+// all executable (READ_IMPLIES_EXEC, personality(2)). `isCode`: one of them is executable.
+struct Stretch {
+    uint64_t fileStart;
+    uint64_t fileEnd;
+    bool isCode;
+};
+
+Stretch stretchFrom(const std::vector<HXElfLoad> &loads, size_t first, const Pages &pages, bool isJoined) {
+    const auto distance = [](const HXElfLoad &load) { return load.address - load.offset; };
+    Stretch stretch{pages.down(loads[first].offset), 0, false};
+    for (size_t i = first; i < loads.size(); i++) {
+        const HXElfLoad &load = loads[i];
+        const bool follows = i == first || (isJoined && distance(load) == distance(loads[first]) &&
+                                            pages.down(load.offset) <= stretch.fileEnd);
+        if (load.writable || !follows) break;
+        stretch.fileEnd = std::max(stretch.fileEnd, pages.up(load.offset + load.fileSize));
+        stretch.isCode = stretch.isCode || load.executable;
+    }
+    return stretch;
+}
+
 void Finder::addCandidate(const HXMapping &mapping, const HXElfHeaders &headers) {
     const uint64_t first = _pages.down(headers.loads.front().address);
-    for (const HXElfLoad &load : headers.loads) {
-        const uint64_t fileStart = _pages.down(load.offset);
-        const uint64_t fileEnd = _pages.up(load.offset + load.fileSize);
+    for (size_t i = 0; i < headers.loads.size(); i++) {
+        const HXElfLoad &load = headers.loads[i];
+        const auto [fileStart, fileEnd, isCode] =
+            stretchFrom(headers.loads, i, _pages, _readableIsExecutable);
         const uint64_t mappedEnd = mapping.offset + (mapping.end - mapping.start);
         // A mapping that goes beyond the executable part is a mapping of the file as data.
-        if (!load.executable || mapping.offset < fileStart || mappedEnd > fileEnd) continue;
+        if (!isCode || mapping.offset < fileStart || mappedEnd > fileEnd) continue;
         const uint64_t loadStart = mapping.start - (mapping.offset - fileStart);
         const uint64_t distance = _pages.down(load.address) - first;
         if (loadStart > mapping.start || distance > loadStart) continue;
@@ -150,6 +178,15 @@ const char *Finder::nameInFile(const HXMapping &mapping, const Candidate &candid
                        : dataName;
         if (fits) return afterCode ? constantsName : symbolsName;
         afterCode = afterCode || load.executable;
+    }
+    // Code together with what is readable around it.
+    for (size_t i = 0; i < headers.loads.size() && mapping.has(HXMappingExecutable); i++) {
+        const Stretch stretch = stretchFrom(headers.loads, i, _pages, _readableIsExecutable);
+        const uint64_t loadStart = _pages.down(headers.loads[i].address);
+        if (stretch.isCode && start >= loadStart &&
+            end <= loadStart + (stretch.fileEnd - stretch.fileStart) &&
+            mapping.offset - stretch.fileStart == start - loadStart)
+            return textName;
     }
     return nullptr;
 }
