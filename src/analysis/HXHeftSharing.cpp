@@ -1,13 +1,15 @@
 // Who shares what: the exact set of processes behind every object.
 #include "analysis/HXHeft.h"
 
+#include <algorithm>
+#include <map>
 #include <unordered_set>
 
 namespace {
 
 // The sets of processes met so far, as paths in a tree: a set's last member and the set without it. Processes
-// are added in target order, so one set has one path, and adding a process to a set costs one lookup however
-// large the set is.
+// are added in target order, so one set has one path (but see `unified`), and adding a process to a set costs
+// one lookup however large the set is.
 class MemberSets {
   public:
     static constexpr uint32_t kEmpty = 0;
@@ -39,6 +41,17 @@ class MemberSets {
 
     size_t size() const { return _sets.size(); }
 
+    // The first of all paths asked for that have the members of `set`: where several records have one pid, it
+    // can follow in one path what it goes before in another.
+    uint32_t unified(uint32_t set) {
+        if (_repeatedPids.empty()) return set;
+        std::vector<int32_t> members;
+        for (uint32_t rest = set; rest != kEmpty; rest = _sets[rest].without)
+            members.push_back(_sets[rest].last->pid());
+        std::sort(members.begin(), members.end());
+        return _byMembers.try_emplace(std::move(members), set).first->second;
+    }
+
   private:
     struct Set {
         const HXProcess *last;
@@ -58,6 +71,7 @@ class MemberSets {
     std::vector<Set> _sets = {{nullptr, kEmpty}};
     std::unordered_map<uint64_t, uint32_t> _next;
     std::unordered_set<int32_t> _repeatedPids;
+    std::map<std::vector<int32_t>, uint32_t> _byMembers; // only where pids repeat
 };
 
 // Whether an object counts for a process that is gathered only to find memory owned by the shown ones in it.
@@ -108,7 +122,7 @@ HXHeftSharingData HXHeft::_sharingData() const {
     HXHeftSharingData sharing;
     std::vector<std::pair<const HXProcessGroup *, HXHeftSharingData::Objects *>> bySet(sets.size());
     for (const HXMemoryObject *object : grouped.order) {
-        const uint32_t set = grouped.setOf[object->index()];
+        const uint32_t set = sets.unified(grouped.setOf[object->index()]);
         auto &[group, objects] = bySet[set];
         if (!group) {
             HXProcessGroup &made = sharing.groups.emplace_back();

@@ -172,8 +172,10 @@ void HXOutputFormatterJSON::printSharedCategories(const std::shared_ptr<const HX
 
 void HXOutputFormatterJSON::printProcessAuxData(const HXAuxDictionary *data) {
     key("\"auxiliary\":");
+    errno = 0;
     JSONForAuxData(data);
     close('}');
+    if (fflush(_stream) != 0) noteFailure(); // while the reason is known
 }
 
 void HXOutputFormatterJSON::printProcessesWithWarnings(const Processes &withWarnings,

@@ -21,6 +21,12 @@ uint64_t HXPlatform::generation() {
     return currentGeneration;
 }
 
+std::optional<std::string> HXPlatform::readFileStart(const std::string &path, size_t bytes) {
+    auto content = readFile(path, UINT64_MAX);
+    if (content && content->size() > bytes) content->resize(bytes);
+    return content;
+}
+
 std::string HXPlatform::hostDescription() {
 #if defined(__x86_64__)
     return "X86-64";

@@ -242,6 +242,8 @@ class HXPlatform {
     // The whole content of a file that exists when the call begins; none with errno set when it cannot be
     // read or is longer than `limit` bytes (EFBIG). Never waits on a fifo or a device (EINVAL).
     virtual std::optional<std::string> readFile(const std::string &path, uint64_t limit) = 0;
+    // The first `bytes` of such a file, or all of a shorter one.
+    virtual std::optional<std::string> readFileStart(const std::string &path, size_t bytes);
 
     // Begins a file that becomes visible at `path` only as a whole; none with errno set.
     virtual std::optional<HXPendingFile> createPendingFile(const std::string &path) = 0;

@@ -37,7 +37,10 @@ std::unique_ptr<HXMemgraphProcess> HXMemgraphProcess::processWithMemgraph(const 
 
 bool HXMemgraphProcess::initWithMemgraph(const std::string &path, HXError *error) {
     if (error) *error = HXError();
-    const auto data = HXPlatform::current().readFile(path, kLongestFile);
+    // What does not begin as a graph is not read on: it may be a core dump or a disk image.
+    auto data = HXPlatform::current().readFileStart(path, GXProcessObjectGraph::header.size());
+    if (data && *data == GXProcessObjectGraph::header)
+        data = HXPlatform::current().readFile(path, kLongestFile);
     if (!data) {
         const int failure = errno;
         if (error)

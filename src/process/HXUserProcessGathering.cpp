@@ -287,6 +287,10 @@ bool HXUserProcess::_addRegionsToArray(HXMemoryRegionList &regions, uint64_t sta
             cursor = gap.end();
             if (cursor >= end || !image) return true;
         }
+        if (image->end() <= cursor) { // an image that overlaps the one before, and ends within it
+            image = enumerator.nextImageForStart(cursor, end);
+            continue;
+        }
         HXMemoryRegion &piece = appendCut(regions, std::max(image->start(), cursor), start, info);
         piece.setEnd(std::min(image->end(), end));
         const HXImage *next = enumerator.nextImageForStart(piece.end(), end);

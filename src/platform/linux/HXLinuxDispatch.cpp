@@ -10,6 +10,7 @@
 #include <atomic>
 #include <cerrno>
 #include <csignal>
+#include <system_error>
 #include <vector>
 
 size_t HXUsableProcessorCount() {
@@ -30,14 +31,22 @@ size_t HXUsableProcessorCount() {
 void HXConcurrentLoop(size_t iterations, size_t workers, const std::function<void(size_t)> &work) {
     std::atomic<size_t> next = 0;
     const auto run = [&] {
-        const sched_param parameter{};
-        ::pthread_setschedparam(::pthread_self(), SCHED_BATCH, &parameter);
         for (size_t i = next++; i < iterations; i = next++)
             work(i);
     };
+    const auto runAsBatch = [&] {
+        const sched_param parameter{};
+        ::pthread_setschedparam(::pthread_self(), SCHED_BATCH, &parameter);
+        run();
+    };
     std::vector<std::jthread> threads;
-    for (size_t i = 0; i < std::min(iterations, std::max<size_t>(workers, 1)); i++)
-        threads.emplace_back(run);
+    try {
+        for (size_t i = 0; i < std::min(iterations, std::max<size_t>(workers, 1)); i++)
+            threads.emplace_back(runAsBatch);
+    } catch (const std::system_error &) {
+        // No more threads may be had: those that run share the work, or this one does it.
+        if (threads.empty()) run();
+    }
 }
 
 std::unique_ptr<HXSignalSource> HXSignalSource::create(int signal) {
@@ -51,7 +60,12 @@ std::unique_ptr<HXSignalSource> HXSignalSource::create(int signal) {
 }
 
 void HXSignalSource::resume() {
-    if (!_thread.joinable()) _thread = std::thread([this] { watch(); });
+    if (_thread.joinable()) return;
+    try {
+        _thread = std::thread([this] { watch(); });
+    } catch (const std::system_error &) {
+        // Without a thread to watch for it the signal waits until its disposition is set anew.
+    }
 }
 
 void HXSignalSource::watch() {

@@ -27,14 +27,30 @@ HXOptionScan HXScanOption(int argc, char *const argv[], const char *shortOptions
     return scan;
 }
 
-std::optional<std::string> HXReadRegularFile(const std::string &path, uint64_t limit) {
-    const HXDescriptor file = HXOpenAt(AT_FDCWD, path.c_str());
+// An open regular file and its facts; nothing, with errno set, when it is another kind of thing.
+static HXDescriptor openRegularFile(const std::string &path, struct stat *status) {
+    HXDescriptor file = HXOpenAt(AT_FDCWD, path.c_str());
+    if (!file || ::fstat(file.get(), status) != 0) return {};
+    if (S_ISREG(status->st_mode)) return file;
+    errno = S_ISDIR(status->st_mode) ? EISDIR : EINVAL;
+    return {};
+}
+
+std::optional<std::string> HXReadRegularFileStart(const std::string &path, size_t bytes) {
     struct stat status;
-    if (!file || ::fstat(file.get(), &status) != 0) return std::nullopt;
-    if (!S_ISREG(status.st_mode)) {
-        errno = S_ISDIR(status.st_mode) ? EISDIR : EINVAL;
-        return std::nullopt;
-    }
+    const HXDescriptor file = openRegularFile(path, &status);
+    if (!file) return std::nullopt;
+    std::string content(bytes, '\0');
+    const ssize_t got = HXReadFully(file.get(), std::span(content));
+    if (got < 0) return std::nullopt;
+    content.resize(static_cast<size_t>(got));
+    return content;
+}
+
+std::optional<std::string> HXReadRegularFile(const std::string &path, uint64_t limit) {
+    struct stat status;
+    const HXDescriptor file = openRegularFile(path, &status);
+    if (!file) return std::nullopt;
     if (static_cast<uint64_t>(status.st_size) > limit) {
         errno = EFBIG;
         return std::nullopt;
@@ -57,6 +73,12 @@ std::optional<std::string> HXReadRegularFile(const std::string &path, uint64_t l
 }
 
 std::optional<HXPendingFile> HXBeginPendingFile(const std::string &path) {
+    // Renaming over a device or a pipe would take it away.
+    struct stat status;
+    if (::stat(path.c_str(), &status) == 0 && !S_ISREG(status.st_mode)) {
+        errno = S_ISDIR(status.st_mode) ? EISDIR : EINVAL;
+        return std::nullopt;
+    }
     HXPendingFile file;
     file.path = path;
     file.temporaryPath = path + ".XXXXXX";

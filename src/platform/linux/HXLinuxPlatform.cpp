@@ -230,6 +230,10 @@ std::FILE *HXLinuxPlatform::fopen(const std::string &path, const char *mode) {
     return std::fopen(path.c_str(), closedOnExecution.c_str());
 }
 
+std::optional<std::string> HXLinuxPlatform::readFileStart(const std::string &path, size_t bytes) {
+    return HXReadRegularFileStart(path, bytes);
+}
+
 std::optional<std::string> HXLinuxPlatform::readFile(const std::string &path, uint64_t limit) {
     return HXReadRegularFile(path, limit);
 }

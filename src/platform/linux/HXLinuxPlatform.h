@@ -93,6 +93,7 @@ class HXLinuxPlatform final : public HXPlatform {
     bool stat(const std::string &path) override;
     std::FILE *fopen(const std::string &path, const char *mode) override;
     std::optional<std::string> readFile(const std::string &path, uint64_t limit) override;
+    std::optional<std::string> readFileStart(const std::string &path, size_t bytes) override;
     std::optional<HXPendingFile> createPendingFile(const std::string &path) override;
     bool commitPendingFile(HXPendingFile &file) override;
     void discardPendingFile(HXPendingFile &file) override;

@@ -38,6 +38,9 @@ struct GXVMRegion {
 
 class GXProcessObjectGraph {
   public:
+    // How every memory-graph file begins.
+    static constexpr std::string_view header = "heft-memgraph 1";
+
     // The graph that the content of a memory-graph file describes; null with the reason when it breaks the
     // form. The content is not needed afterwards.
     static std::unique_ptr<GXProcessObjectGraph> directedGraphWithData(std::string_view data,

@@ -11,7 +11,7 @@ std::string HXAnonymizer::path(std::string_view path) {
     constexpr std::string_view deleted = " (deleted)", systemV = "/SYSV", memfd = "/memfd:";
     if (path.ends_with(deleted))
         return this->path(path.substr(0, path.size() - deleted.size())) + std::string(deleted);
-    if (path.starts_with('[')) return std::string(path);
+    if (path == "[vdso]") return std::string(path);
     if (path.starts_with(systemV))
         return std::string(systemV) + made(_segments, 'k', path.substr(systemV.size()));
     if (path.starts_with(memfd)) return std::string(memfd) + made(_files, 'f', path.substr(memfd.size()));

@@ -22,6 +22,9 @@ class HXServicesPlatform : public HXPlatform {
     std::optional<std::string> readFile(const std::string &path, uint64_t limit) override {
         return _services.readFile(path, limit);
     }
+    std::optional<std::string> readFileStart(const std::string &path, size_t bytes) override {
+        return _services.readFileStart(path, bytes);
+    }
     std::optional<HXPendingFile> createPendingFile(const std::string &path) override {
         return _services.createPendingFile(path);
     }
