@@ -33,6 +33,7 @@ class Reader {
     void take(const HXMapsEntry &entry);
     HXFileSystemKind fileSystemOf(const HXMapping &mapping, const HXMappedPath &path);
     bool isDeviceFile(const HXMapping &mapping, const HXMappedPath &path) const;
+    bool mayHoldHugePages(const HXMapping &mapping, HXPathKind kind, HXFileSystemKind fileSystem) const;
     kern_return_t endError(const HXDescriptor &file) const;
     bool isSingleThreaded() const;
 
@@ -44,6 +45,7 @@ class Reader {
     bool _sawStack = false;
     bool _sawGate = false;
     bool _sawSwapBacked = false;
+    bool _mayHoldHugePages = false;
 };
 
 std::optional<HXStatRecord> readStat(int directory) {
@@ -100,6 +102,8 @@ bool Reader::readMapsAndScan() {
 }
 
 bool Reader::mapsSuffice() const {
+    // The pool's mappings are told by their flags in smaps alone, even those that nobody has touched.
+    if (_mayHoldHugePages) return false;
     // Page tables do not show which pages of shared memory are swapped out.
     if (_sawSwapBacked && _setting.machine->usesSwap()) return false;
     return !_setting.machine->hasFreedLazily(_request.opened) || !hasFreedLazily();
@@ -118,7 +122,7 @@ bool Reader::hasFreedLazily() const {
 
 void Reader::readFile(const char *name) {
     _addressSpace = std::make_unique<HXAddressSpace>();
-    _readFailed = _sawStack = _sawGate = _sawSwapBacked = false;
+    _readFailed = _sawStack = _sawGate = _sawSwapBacked = _mayHoldHugePages = false;
     const HXDescriptor file = HXOpenAt(_request.directory, name);
     if (!file) {
         _addressSpace->endError = errorOfOpening(errno);
@@ -156,6 +160,7 @@ void Reader::take(const HXMapsEntry &entry) {
     const uint32_t sharedMemory = !mapping.isFile() ? 0 : _setting.fileSystems->sharedMemoryDevice();
     HXClassifyMapping(path.kind, fileSystem, sharedMemory, path.namedTag, &mapping);
     if (mapping.has(HXMappingSwapBacked)) _sawSwapBacked = true;
+    if (mayHoldHugePages(mapping, path.kind, fileSystem)) _mayHoldHugePages = true;
     if (path.kind == HXPathKind::stack) _sawStack = true;
     if (path.kind == HXPathKind::special && path.text == "[vsyscall]") _sawGate = true;
     if (path.kind == HXPathKind::systemV && _addressSpace->ipcNamespace == 0)
@@ -182,6 +187,13 @@ bool Reader::isDeviceFile(const HXMapping &mapping, const HXMappedPath &path) co
     const int flags = AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT | AT_STATX_DONT_SYNC;
     if (::statx(_request.directory, below.c_str(), flags, STATX_TYPE | STATX_INO, &status) != 0) return true;
     return !S_ISREG(status.stx_mode) || status.stx_ino != mapping.inode;
+}
+
+// By the path and the file system, which is all that maps tells of the huge-page pool.
+bool Reader::mayHoldHugePages(const HXMapping &mapping, HXPathKind kind, HXFileSystemKind fileSystem) const {
+    if (kind == HXPathKind::anonymousHuge || fileSystem == HXFileSystemKind::hugePages) return true;
+    return (kind == HXPathKind::memfd || kind == HXPathKind::systemV) &&
+           mapping.device != _setting.fileSystems->sharedMemoryDevice();
 }
 
 kern_return_t Reader::endError(const HXDescriptor &file) const {
