@@ -312,8 +312,8 @@ TEST_F(HXLinuxPlatformTest, PageTablesOfMadeUpProcess) {
 TEST_F(HXLinuxPlatformTest, FiguresAndLedger) {
     proc.process(10, "p", mapping);
     const auto status = [&](int pageTable) {
-        proc.write("10/status",
-                   "VmHWM: 900 kB\nRssAnon: 100 kB\nVmPTE: " + std::to_string(pageTable) + " kB\n");
+        proc.write("10/status", "VmHWM: 900 kB\nRssAnon: 100 kB\nVmPTE: " + std::to_string(pageTable) +
+                                    " kB\nThreads: 1\n");
     };
     status(8);
     const mach_port_t task = open(10);
