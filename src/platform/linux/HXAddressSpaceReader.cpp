@@ -28,7 +28,7 @@ class Reader {
     bool mapsSuffice() const;
     bool hasFreedLazily() const;
     bool readMapsAndScan();
-    void readFile(const char *name);
+    HXDescriptor readFile(const char *name);
     void readMappings(const HXDescriptor &file);
     void take(const HXMapsEntry &entry);
     HXFileSystemKind fileSystemOf(const HXMapping &mapping, const HXMappedPath &path);
@@ -77,6 +77,12 @@ uint64_t readIpcNamespace(int directory) {
     return number;
 }
 
+// A file of an address space that is gone reads as empty; one that lives still has its first line.
+bool isAlive(const HXDescriptor &file) {
+    char byte;
+    return ::pread(file.get(), &byte, 1, 0) > 0;
+}
+
 std::unique_ptr<HXAddressSpace> Reader::read() {
     if (!mapsMaySuffice() || !readMapsAndScan()) {
         readFile("smaps");
@@ -95,10 +101,14 @@ bool Reader::mapsMaySuffice() {
 }
 
 bool Reader::readMapsAndScan() {
-    readFile("maps");
+    const HXDescriptor maps = readFile("maps");
     if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return true;
-    return mapsSuffice() && HXScanFigures(_request.directory, _setting.pageShift, _request.status->swapSize,
-                                          _addressSpace.get());
+    if (!mapsSuffice() || !HXScanFigures(_request.directory, _setting.pageShift, _request.status->swapSize,
+                                         _addressSpace.get()))
+        return false;
+    // If the process executed another program before its page tables were opened, those are not of this.
+    if (!isAlive(maps)) _addressSpace->endError = MACH_SEND_INVALID_DEST;
+    return true;
 }
 
 bool Reader::mapsSuffice() const {
@@ -120,16 +130,18 @@ bool Reader::hasFreedLazily() const {
     return !text || HXParseLabelled(*text, "LazyFree:").value_or(1) != 0;
 }
 
-void Reader::readFile(const char *name) {
+// Answers the open file.
+HXDescriptor Reader::readFile(const char *name) {
     _addressSpace = std::make_unique<HXAddressSpace>();
     _readFailed = _sawStack = _sawGate = _sawSwapBacked = _mayHoldHugePages = false;
-    const HXDescriptor file = HXOpenAt(_request.directory, name);
+    HXDescriptor file = HXOpenAt(_request.directory, name);
     if (!file) {
         _addressSpace->endError = errorOfOpening(errno);
-        return;
+        return file;
     }
     readMappings(file);
     _addressSpace->endError = endError(file);
+    return file;
 }
 
 void Reader::readMappings(const HXDescriptor &file) {
@@ -200,9 +212,7 @@ kern_return_t Reader::endError(const HXDescriptor &file) const {
     if (_readFailed) return MACH_SEND_INVALID_DEST;
     // The gate page of some machines is the last line of every whole list.
     if (_sawGate) return KERN_INVALID_ADDRESS;
-    // A file of an address space that is gone reads as empty; a whole one still has its first line.
-    char byte;
-    if (::pread(file.get(), &byte, 1, 0) > 0) return KERN_INVALID_ADDRESS;
+    if (isAlive(file)) return KERN_INVALID_ADDRESS;
     if (_addressSpace->count() > 0) return MACH_SEND_INVALID_DEST;
     const auto stat = readStat(_request.directory);
     return stat && !stat->isZombie() ? KERN_INVALID_ADDRESS : MACH_SEND_INVALID_DEST;
