@@ -1,13 +1,13 @@
 #include "platform/linux/HXAddressSpaceReader.h"
 
+#include "platform/linux/HXMappedFile.h"
 #include "platform/linux/HXMapsParser.h"
 #include "platform/linux/HXPageScan.h"
 #include "platform/linux/HXProcFile.h"
 #include "platform/linux/HXProcText.h"
 #include "platform/linux/HXTextNumber.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
@@ -194,11 +194,9 @@ HXFileSystemKind Reader::fileSystemOf(const HXMapping &mapping, const HXMappedPa
 // Whether a path on a devtmpfs leads to a device (what its driver maps is no tmpfs page) and not to a plain
 // file.
 bool Reader::isDeviceFile(const HXMapping &mapping, const HXMappedPath &path) const {
-    struct statx status;
-    const std::string below = "root" + path.text;
-    const int flags = AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT | AT_STATX_DONT_SYNC;
-    if (::statx(_request.directory, below.c_str(), flags, STATX_TYPE | STATX_INO, &status) != 0) return true;
-    return !S_ISREG(status.stx_mode) || status.stx_ino != mapping.inode;
+    HXDescriptor place = HXLocateMapped(_request.directory, mapping);
+    if (!place) place = HXLocateBelowRoot(_request.directory, path.text);
+    return !place || !HXIsMappedFile(mapping, place.get());
 }
 
 // By the path and the file system, which is all that maps tells of the huge-page pool.

@@ -1,5 +1,6 @@
 #include "platform/linux/HXPageReader.h"
 
+#include "platform/linux/HXMappedFile.h"
 #include "platform/linux/HXProcFile.h"
 #include "platform/linux/HXProcText.h"
 #include "platform/linux/HXSharedSwap.h"
