@@ -1,13 +1,13 @@
 #include "platform/linux/HXAddressSpaceReader.h"
 
+#include "platform/linux/HXMappedFile.h"
 #include "platform/linux/HXMapsParser.h"
 #include "platform/linux/HXPageScan.h"
 #include "platform/linux/HXProcFile.h"
 #include "platform/linux/HXProcText.h"
 #include "platform/linux/HXTextNumber.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
@@ -28,11 +28,12 @@ class Reader {
     bool mapsSuffice() const;
     bool hasFreedLazily() const;
     bool readMapsAndScan();
-    void readFile(const char *name);
+    HXDescriptor readFile(const char *name);
     void readMappings(const HXDescriptor &file);
     void take(const HXMapsEntry &entry);
     HXFileSystemKind fileSystemOf(const HXMapping &mapping, const HXMappedPath &path);
     bool isDeviceFile(const HXMapping &mapping, const HXMappedPath &path) const;
+    bool mayHoldHugePages(const HXMapping &mapping, HXPathKind kind, HXFileSystemKind fileSystem) const;
     kern_return_t endError(const HXDescriptor &file) const;
     bool isSingleThreaded() const;
 
@@ -44,6 +45,7 @@ class Reader {
     bool _sawStack = false;
     bool _sawGate = false;
     bool _sawSwapBacked = false;
+    bool _mayHoldHugePages = false;
 };
 
 std::optional<HXStatRecord> readStat(int directory) {
@@ -75,6 +77,12 @@ uint64_t readIpcNamespace(int directory) {
     return number;
 }
 
+// A file of an address space that is gone reads as empty; one that lives still has its first line.
+bool isAlive(const HXDescriptor &file) {
+    char byte;
+    return ::pread(file.get(), &byte, 1, 0) > 0;
+}
+
 std::unique_ptr<HXAddressSpace> Reader::read() {
     if (!mapsMaySuffice() || !readMapsAndScan()) {
         readFile("smaps");
@@ -93,13 +101,19 @@ bool Reader::mapsMaySuffice() {
 }
 
 bool Reader::readMapsAndScan() {
-    readFile("maps");
+    const HXDescriptor maps = readFile("maps");
     if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return true;
-    return mapsSuffice() && HXScanFigures(_request.directory, _setting.pageShift, _request.status->swapSize,
-                                          _addressSpace.get());
+    if (!mapsSuffice() || !HXScanFigures(_request.directory, _setting.pageShift, _request.status->swapSize,
+                                         _addressSpace.get()))
+        return false;
+    // If the process executed another program before its page tables were opened, those are not of this.
+    if (!isAlive(maps)) _addressSpace->endError = MACH_SEND_INVALID_DEST;
+    return true;
 }
 
 bool Reader::mapsSuffice() const {
+    // The pool's mappings are told by their flags in smaps alone, even those that nobody has touched.
+    if (_mayHoldHugePages) return false;
     // Page tables do not show which pages of shared memory are swapped out.
     if (_sawSwapBacked && _setting.machine->usesSwap()) return false;
     return !_setting.machine->hasFreedLazily(_request.opened) || !hasFreedLazily();
@@ -116,16 +130,18 @@ bool Reader::hasFreedLazily() const {
     return !text || HXParseLabelled(*text, "LazyFree:").value_or(1) != 0;
 }
 
-void Reader::readFile(const char *name) {
+// Answers the open file.
+HXDescriptor Reader::readFile(const char *name) {
     _addressSpace = std::make_unique<HXAddressSpace>();
-    _readFailed = _sawStack = _sawGate = _sawSwapBacked = false;
-    const HXDescriptor file = HXOpenAt(_request.directory, name);
+    _readFailed = _sawStack = _sawGate = _sawSwapBacked = _mayHoldHugePages = false;
+    HXDescriptor file = HXOpenAt(_request.directory, name);
     if (!file) {
         _addressSpace->endError = errorOfOpening(errno);
-        return;
+        return file;
     }
     readMappings(file);
     _addressSpace->endError = endError(file);
+    return file;
 }
 
 void Reader::readMappings(const HXDescriptor &file) {
@@ -156,6 +172,7 @@ void Reader::take(const HXMapsEntry &entry) {
     const uint32_t sharedMemory = !mapping.isFile() ? 0 : _setting.fileSystems->sharedMemoryDevice();
     HXClassifyMapping(path.kind, fileSystem, sharedMemory, path.namedTag, &mapping);
     if (mapping.has(HXMappingSwapBacked)) _sawSwapBacked = true;
+    if (mayHoldHugePages(mapping, path.kind, fileSystem)) _mayHoldHugePages = true;
     if (path.kind == HXPathKind::stack) _sawStack = true;
     if (path.kind == HXPathKind::special && path.text == "[vsyscall]") _sawGate = true;
     if (path.kind == HXPathKind::systemV && _addressSpace->ipcNamespace == 0)
@@ -177,20 +194,23 @@ HXFileSystemKind Reader::fileSystemOf(const HXMapping &mapping, const HXMappedPa
 // Whether a path on a devtmpfs leads to a device (what its driver maps is no tmpfs page) and not to a plain
 // file.
 bool Reader::isDeviceFile(const HXMapping &mapping, const HXMappedPath &path) const {
-    struct statx status;
-    const std::string below = "root" + path.text;
-    const int flags = AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT | AT_STATX_DONT_SYNC;
-    if (::statx(_request.directory, below.c_str(), flags, STATX_TYPE | STATX_INO, &status) != 0) return true;
-    return !S_ISREG(status.stx_mode) || status.stx_ino != mapping.inode;
+    HXDescriptor place = HXLocateMapped(_request.directory, mapping);
+    if (!place) place = HXLocateBelowRoot(_request.directory, path.text);
+    return !place || !HXIsMappedFile(mapping, place.get());
+}
+
+// By the path and the file system, which is all that maps tells of the huge-page pool.
+bool Reader::mayHoldHugePages(const HXMapping &mapping, HXPathKind kind, HXFileSystemKind fileSystem) const {
+    if (kind == HXPathKind::anonymousHuge || fileSystem == HXFileSystemKind::hugePages) return true;
+    return (kind == HXPathKind::memfd || kind == HXPathKind::systemV) &&
+           mapping.device != _setting.fileSystems->sharedMemoryDevice();
 }
 
 kern_return_t Reader::endError(const HXDescriptor &file) const {
     if (_readFailed) return MACH_SEND_INVALID_DEST;
     // The gate page of some machines is the last line of every whole list.
     if (_sawGate) return KERN_INVALID_ADDRESS;
-    // A file of an address space that is gone reads as empty; a whole one still has its first line.
-    char byte;
-    if (::pread(file.get(), &byte, 1, 0) > 0) return KERN_INVALID_ADDRESS;
+    if (isAlive(file)) return KERN_INVALID_ADDRESS;
     if (_addressSpace->count() > 0) return MACH_SEND_INVALID_DEST;
     const auto stat = readStat(_request.directory);
     return stat && !stat->isZombie() ? KERN_INVALID_ADDRESS : MACH_SEND_INVALID_DEST;

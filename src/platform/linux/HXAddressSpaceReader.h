@@ -33,7 +33,7 @@ struct HXReadRequest {
 std::unique_ptr<HXAddressSpace> HXReadAddressSpace(const HXReadRequest &request,
                                                    const HXReaderSetting &setting);
 
-// Reads and parses the status of a process; none with errno set.
+// Reads and parses the status of a process; none with errno set, as for a text that is cut.
 std::optional<HXStatusRecord> HXReadStatus(int directory);
 
 // Counts the resident and swapped pages of all mappings by the process's page tables. False when they cannot

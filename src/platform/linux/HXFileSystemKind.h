@@ -7,6 +7,7 @@
 enum class HXFileSystemKind : uint8_t {
     unknown,
     remote,      // may wait for another machine or a user's process
+    layered,     // its files lie on other file systems, which may be remote
     local,       // reads end in bounded time
     swapBacked,  // tmpfs: its pages leave memory only for swap
     deviceNodes, // devtmpfs: a tmpfs of device files, whose mappings need not be its pages

@@ -7,7 +7,6 @@
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 
-#include <mutex>
 #include <string>
 
 uint32_t HXFileSystems::sharedMemoryDevice() {
@@ -28,23 +27,31 @@ HXFileSystemKind HXFileSystems::known(uint32_t device) const {
 }
 
 HXFileSystemKind HXFileSystems::kindOf(uint32_t device, HXFileSystemLookup *lookup) {
-    constexpr uint32_t firstWithMajor = HXDeviceNumber(1, 0);
-    if (device >= firstWithMajor) return HXFileSystemKind::local; // a block device
     if (device == lookup->lastDevice) return lookup->lastKind;
     HXFileSystemKind kind = known(device);
     if (kind == HXFileSystemKind::unknown && !lookup->readMounts) {
         lookup->readMounts = true;
-        readMounts(lookup->directory);
+        readMounts(lookup->directory, "mountinfo");
         kind = known(device);
     }
+    if (kind == HXFileSystemKind::unknown) {
+        // The file may have come from another mount namespace.
+        std::call_once(_commonMountsOnce, [&] {
+            readMounts(lookup->directory, "../1/mountinfo");
+            readMounts(lookup->directory, "../self/mountinfo");
+        });
+        kind = known(device);
+    }
+    constexpr uint32_t firstBlockDevice = HXDeviceNumber(1, 0);
+    if (kind == HXFileSystemKind::unknown && device >= firstBlockDevice) kind = HXFileSystemKind::local;
     lookup->lastDevice = device;
     lookup->lastKind = kind;
     return kind;
 }
 
-void HXFileSystems::readMounts(int directory) {
+void HXFileSystems::readMounts(int directory, const char *name) {
     constexpr size_t limit = 16 << 20;
-    const auto text = HXReadText(directory, "mountinfo", limit);
+    const auto text = HXReadText(directory, name, limit);
     if (!text) return;
     const std::unique_lock lock(_mutex);
     HXParseMountInfo(*text, [this](uint32_t device, std::string_view type) {

@@ -6,6 +6,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <mutex>
 #include <shared_mutex>
 #include <unordered_map>
 
@@ -29,11 +30,12 @@ class HXFileSystems {
     HXFileSystemKind kindOf(uint32_t device, HXFileSystemLookup *lookup);
 
   private:
-    void readMounts(int directory);
+    void readMounts(int directory, const char *name);
     HXFileSystemKind known(uint32_t device) const;
 
     std::atomic<uint32_t> _sharedMemoryDevice;
     std::atomic<bool> _lookedForSharedMemory = false;
     mutable std::shared_mutex _mutex;
     std::unordered_map<uint32_t, HXFileSystemKind> _kinds;
+    std::once_flag _commonMountsOnce;
 };

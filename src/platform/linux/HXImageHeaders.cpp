@@ -1,14 +1,11 @@
 #include "platform/linux/HXImageHeaders.h"
 
+#include "platform/linux/HXMappedFile.h"
 #include "platform/linux/HXProcFile.h"
 
 #include <fcntl.h>
-#include <linux/openat2.h>
-#include <sys/stat.h>
-#include <sys/syscall.h>
+#include <unistd.h>
 
-#include <cinttypes>
-#include <cstdio>
 #include <functional>
 #include <optional>
 #include <string>
@@ -38,21 +35,6 @@ std::optional<std::string> readExactly(int file, uint64_t position, uint64_t len
     if (::pread(file, bytes.data(), length, static_cast<off_t>(position)) != static_cast<ssize_t>(length))
         return std::nullopt;
     return bytes;
-}
-
-std::string mapFileName(const HXMapping &mapping) {
-    char name[64];
-    std::snprintf(name, sizeof name, "map_files/%" PRIx64 "-%" PRIx64, mapping.start, mapping.end);
-    return name;
-}
-
-// Never waits for a server: the attributes may be old ones, but not the identity.
-bool isFileOf(const HXMapping &mapping, int descriptor) {
-    struct statx status;
-    if (::statx(descriptor, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_TYPE | STATX_INO, &status) != 0)
-        return false;
-    // The device is not compared: file systems with subvolumes tell another one here than in maps.
-    return S_ISREG(status.stx_mode) && status.stx_ino == mapping.inode;
 }
 
 // The file system's own page, where it is in memory anyway, read through the process. A page that the process
@@ -93,35 +75,24 @@ Outcome readThroughProcess(const HXMapping &mapping, int directory, uint64_t pag
         readHeaders([&](uint64_t offset, uint64_t length) { return reader.read(offset, length); });
     if (!outcome.isRead) return outcome;
     // Was it that file, or has the process mapped another one there meanwhile? Only root may ask.
-    const HXDescriptor file(::openat(directory, mapFileName(mapping).c_str(), O_PATH | O_CLOEXEC));
-    if (file && !isFileOf(mapping, file.get())) return {};
+    const HXDescriptor file = HXLocateMapped(directory, mapping);
+    if (file && !HXIsMappedFile(mapping, file.get())) return {};
     return outcome;
 }
 
-// A path by its cached entries alone, which waits for nothing. A mapped file's path is in the cache.
-HXDescriptor openCached(int directory, const std::string &path) {
-    open_how how{};
-    how.flags = O_PATH | O_CLOEXEC;
-    how.resolve = RESOLVE_CACHED | RESOLVE_NO_MAGICLINKS;
-    return HXDescriptor(static_cast<int>(::syscall(SYS_openat2, directory, path.c_str(), &how, sizeof how)));
-}
-
-HXDescriptor openByPath(const HXMapping &mapping, const std::string &path, int directory) {
-    if (path.empty() || path.front() != '/') return {};
-    const std::string relative = "." + path;
-    const HXDescriptor root(::openat(directory, "root", O_PATH | O_DIRECTORY | O_CLOEXEC));
-    HXDescriptor file = openCached(root.get(), relative);
-    if (file && isFileOf(mapping, file.get())) return file;
-    file = openCached(AT_FDCWD, path);
-    return file && isFileOf(mapping, file.get()) ? std::move(file) : HXDescriptor();
+// The mapping's file by its path, in the process's root or else, for a process that left its root, in ours.
+HXDescriptor locateByPath(const HXMapping &mapping, const std::string &path, int directory) {
+    HXDescriptor place = HXLocateBelowRoot(directory, path);
+    if (place && HXIsMappedFile(mapping, place.get())) return place;
+    const HXDescriptor self(::open("/proc/self", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    return HXLocateBelowRoot(self.get(), path);
 }
 
 Outcome readFile(const HXMapping &mapping, const std::string &path, int directory) {
-    HXDescriptor place(::openat(directory, mapFileName(mapping).c_str(), O_PATH | O_CLOEXEC));
-    if (!place) place = openByPath(mapping, path, directory);
-    if (!place || !isFileOf(mapping, place.get())) return {};
-    const std::string name = "/proc/self/fd/" + std::to_string(place.get());
-    const HXDescriptor file = HXOpenAt(AT_FDCWD, name.c_str());
+    HXDescriptor place = HXLocateMapped(directory, mapping);
+    if (!place) place = locateByPath(mapping, path, directory);
+    if (!place || !HXIsMappedFile(mapping, place.get())) return {};
+    const HXDescriptor file = HXOpenLocated(place);
     if (!file) return {};
     return readHeaders([&](uint64_t offset, uint64_t length) -> std::optional<std::string> {
         return readExactly(file.get(), offset, length);

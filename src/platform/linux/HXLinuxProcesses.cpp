@@ -6,6 +6,7 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -75,19 +76,43 @@ std::optional<HXAuxiliaryVector> readAuxiliaryVector(int process, const char *na
     return bytes ? HXParseAuxiliaryVector(*bytes) : std::nullopt;
 }
 
+// Whether a page is in memory and no file's: reading another one might wait for a file system that the
+// process mapped there, or for the process itself.
+bool isPresentAndOwn(int pagemap, uint64_t page) {
+    constexpr uint64_t present = uint64_t{1} << 63, ofFile = uint64_t{1} << 61;
+    uint64_t entry = 0;
+    const auto position = static_cast<off_t>(page * sizeof entry);
+    if (::pread(pagemap, &entry, sizeof entry, position) != sizeof entry) return false;
+    return (entry & (present | ofFile)) == present;
+}
+
+// The text at `address` of the process's memory up to its zero byte.
+std::optional<std::string> readPresentText(int process, uint64_t address) {
+    const HXDescriptor memory = HXOpenAt(process, "mem");
+    const HXDescriptor pagemap = HXOpenAt(process, "pagemap");
+    if (!memory || !pagemap) return std::nullopt;
+    const auto pageSize = static_cast<uint64_t>(::sysconf(_SC_PAGESIZE));
+    std::string text;
+    char piece[PATH_MAX];
+    while (text.size() < PATH_MAX) {
+        if (!isPresentAndOwn(pagemap.get(), address / pageSize)) return std::nullopt;
+        const size_t length = std::min<uint64_t>(pageSize - address % pageSize, sizeof piece);
+        const ssize_t got = ::pread(memory.get(), piece, length, static_cast<off_t>(address));
+        if (got <= 0) return std::nullopt;
+        const std::string_view read(piece, static_cast<size_t>(got));
+        const size_t end = read.find('\0');
+        text += read.substr(0, end);
+        if (end != std::string_view::npos) return text;
+        address += read.size();
+    }
+    return std::nullopt;
+}
+
 // The path that was executed, from the process's own memory.
 std::optional<std::string> readExecutedPath(int process) {
     const auto vector = readAuxiliaryVector(process, "auxv");
     if (!vector || vector->execFileName == 0) return std::nullopt;
-    const HXDescriptor memory = HXOpenAt(process, "mem");
-    if (!memory) return std::nullopt;
-    char path[PATH_MAX];
-    // It lies at the very end of the stack: a read beyond that answers what there is.
-    const ssize_t got = ::pread(memory.get(), path, sizeof path, static_cast<off_t>(vector->execFileName));
-    if (got <= 0) return std::nullopt;
-    const void *end = std::memchr(path, '\0', static_cast<size_t>(got));
-    if (end == nullptr) return std::nullopt;
-    return std::string(path, static_cast<size_t>(static_cast<const char *>(end) - path));
+    return readPresentText(process, vector->execFileName);
 }
 
 bool isNamed(std::string_view path, std::string_view comm) {

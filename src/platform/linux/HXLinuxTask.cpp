@@ -1,8 +1,10 @@
 #include "platform/linux/HXLinuxTask.h"
 
 const HXAddressSpace &HXLinuxTask::addressSpace(const HXReaderSetting &setting, bool needsDirtyPages) {
-    if (!_addressSpace || (needsDirtyPages && !_addressSpace->knowsDirtyPages))
+    if (!_addressSpace || (needsDirtyPages && !_addressSpace->knowsDirtyPages)) {
         _addressSpace = HXReadAddressSpace({directory(), _status, needsDirtyPages, _opened}, setting);
+        _pages.reset();
+    }
     return *_addressSpace;
 }
 

@@ -1,6 +1,8 @@
 #include "platform/linux/HXPageReader.h"
 
+#include "platform/linux/HXMappedFile.h"
 #include "platform/linux/HXProcFile.h"
+#include "platform/linux/HXProcText.h"
 #include "platform/linux/HXSharedSwap.h"
 
 #include <algorithm>
@@ -26,6 +28,21 @@ uint8_t factsOfEntry(uint64_t entry) {
 
 bool isKernelHalf(uint64_t address) {
     return address >> 63 != 0; // the gate page, which the page tables of the process do not show
+}
+
+// Whether the process executed another program since its mappings were read: its stack then begins elsewhere.
+bool isReplaced(const HXAddressSpace &addressSpace, int directory) {
+    char buffer[2048];
+    const auto text = HXReadOnce(directory, "stat", buffer);
+    const auto stat = text ? HXParseStat(*text) : std::nullopt;
+    if (!stat || stat->startStack == 0) return false;
+    for (size_t i = addressSpace.count(); i-- > 0;) {
+        const HXMapping &mapping = addressSpace[i];
+        // The kernel gives this name to the mapping where the stack began, be it at its very end.
+        if (mapping.kind == static_cast<uint8_t>(HXPathKind::stack))
+            return stat->startStack < mapping.start || stat->startStack > mapping.end;
+    }
+    return false;
 }
 
 } // namespace
@@ -61,12 +78,31 @@ kern_return_t HXPageReader::query(const HXAddressSpace &addressSpace, uint64_t a
             return KERN_INVALID_ADDRESS;
         const HXMapping &mapping = addressSpace[index++];
         const uint64_t pages = std::min<uint64_t>((mapping.end - address) >> _pageShift, dispositions.size());
-        const kern_return_t error = queryMapping(mapping, address, dispositions.first(pages));
+        kern_return_t error = KERN_SUCCESS;
+        if (!_pagemap && !isKernelHalf(address)) error = openPagemap(addressSpace);
+        if (error == KERN_SUCCESS) error = queryMapping(mapping, address, dispositions.first(pages));
         if (error != KERN_SUCCESS) return error;
         dispositions = dispositions.subspan(pages);
         address += pages << _pageShift;
     }
     return KERN_SUCCESS;
+}
+
+void HXPageReader::reset() {
+    _pagemap.reset();
+    _swapFile.reset();
+    _runs.clear();
+    _run = 0;
+    _windowStart = _windowEnd = 0;
+    _mappingStart = UINT64_MAX;
+}
+
+kern_return_t HXPageReader::openPagemap(const HXAddressSpace &addressSpace) {
+    _pagemap = HXOpenAt(_directory, "pagemap");
+    if (!_pagemap) return errno == EACCES || errno == EPERM ? KERN_NO_ACCESS : KERN_INVALID_ARGUMENT;
+    if (!isReplaced(addressSpace, _directory)) return KERN_SUCCESS;
+    _pagemap.reset();
+    return KERN_INVALID_ARGUMENT;
 }
 
 kern_return_t HXPageReader::queryMapping(const HXMapping &mapping, uint64_t start,
@@ -116,8 +152,6 @@ kern_return_t HXPageReader::queryMapping(const HXMapping &mapping, uint64_t star
 }
 
 kern_return_t HXPageReader::readRuns(uint64_t start, uint64_t end) {
-    if (!_pagemap) _pagemap = HXOpenAt(_directory, "pagemap");
-    if (!_pagemap) return errno == EACCES || errno == EPERM ? KERN_NO_ACCESS : KERN_INVALID_ARGUMENT;
     _runs.clear();
     _run = 0;
     _windowStart = start;

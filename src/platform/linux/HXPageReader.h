@@ -28,14 +28,19 @@ class HXPageReader {
     HXPageReader(int directory, uint32_t pageShift) : _directory(directory), _pageShift(pageShift) {}
 
     // The dispositions of the pages from `address` on, which lies on a page's border. KERN_INVALID_ADDRESS
-    // when a page lies in no mapping, KERN_INVALID_ARGUMENT when the process is gone.
+    // when a page lies in no mapping, KERN_INVALID_ARGUMENT when the process is gone or executes another
+    // program.
     kern_return_t query(const HXAddressSpace &addressSpace, uint64_t address,
                         std::span<int32_t> dispositions);
+
+    // Forgets what has been read, for an address space that has been read anew.
+    void reset();
 
     // Leaves newer kernel interfaces unused. For tests.
     void useOnlyPagemap() { _mayScan = false; }
 
   private:
+    kern_return_t openPagemap(const HXAddressSpace &addressSpace);
     kern_return_t queryMapping(const HXMapping &mapping, uint64_t start, std::span<int32_t> dispositions);
     kern_return_t readRuns(uint64_t start, uint64_t end);
     bool scan(uint64_t start, uint64_t end);

@@ -4,13 +4,31 @@
 
 #include <algorithm>
 #include <array>
+#include <cerrno>
 #include <span>
+
+namespace {
+
+// The line behind all figures: a text that lacks it was cut.
+bool isWholeStatus(std::string_view text) {
+    const size_t last = text.find("\nThreads:");
+    return last != std::string_view::npos && text.find('\n', last + 1) != std::string_view::npos;
+}
+
+} // namespace
 
 std::optional<HXStatusRecord> HXReadStatus(int directory) {
     char buffer[8192];
     const auto text = HXReadOnce(directory, "status", buffer);
     if (!text) return std::nullopt;
-    return HXParseStatus(*text);
+    if (isWholeStatus(*text)) return HXParseStatus(*text);
+    // A process may have 65536 groups, whose numbers come before the figures.
+    constexpr size_t limit = 2 << 20;
+    const auto longText = HXReadText(directory, "status", limit);
+    if (!longText) return std::nullopt;
+    if (isWholeStatus(*longText)) return HXParseStatus(*longText);
+    errno = EIO;
+    return std::nullopt;
 }
 
 namespace {

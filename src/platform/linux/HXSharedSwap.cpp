@@ -1,13 +1,11 @@
 #include "platform/linux/HXSharedSwap.h"
 
 #include "platform/HXHostRecords.h"
-#include "platform/linux/HXProcFile.h"
 
 #include <sys/syscall.h>
+#include <unistd.h>
 
 #include <algorithm>
-#include <cinttypes>
-#include <cstdio>
 
 namespace {
 
@@ -66,12 +64,6 @@ class Marker {
 };
 
 } // namespace
-
-HXDescriptor HXOpenMappedFile(int directory, const HXMapping &mapping) {
-    char name[64];
-    std::snprintf(name, sizeof name, "map_files/%" PRIx64 "-%" PRIx64, mapping.start, mapping.end);
-    return HXOpenAt(directory, name);
-}
 
 uint64_t HXMarkSwapped(const HXCountSwapped &countSwapped, uint64_t first, uint64_t limit,
                        std::span<int32_t> dispositions) {

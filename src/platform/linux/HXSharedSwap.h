@@ -1,15 +1,9 @@
 // Which pages of shared memory are swapped out: no page table shows it.
 #pragma once
 
-#include "platform/linux/HXDescriptor.h"
-#include "platform/linux/HXMapping.h"
-
 #include <cstdint>
 #include <functional>
 #include <span>
-
-// Opens the file that a mapping maps; not open without the right to.
-HXDescriptor HXOpenMappedFile(int directory, const HXMapping &mapping);
 
 // How many of `count` pages from page `first` of the object on are swapped out; none when the kernel does not
 // tell.

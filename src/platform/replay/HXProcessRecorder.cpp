@@ -145,7 +145,19 @@ void HXProcessRecorder::recordFigures(int32_t pid) {
         _head.signedNumber(Process::pageTable, entries[*_pageTableIndex].lei_balance);
 }
 
+// Lets the host read what both values of the setting need before the first region is recorded: it may read a
+// process anew for the other value, and regions of two readings do not fit together.
+void HXProcessRecorder::readAtOnce() {
+    if (!_setting.found()) return;
+    _setting.set(0);
+    vm_region_submap_info_64 info{};
+    uint64_t address = 0, size = 0;
+    uint32_t depth = UINT32_MAX, words = VM_REGION_SUBMAP_INFO_COUNT_64;
+    (void)_host.mach_vm_region_recurse(_task, &address, &size, &depth, &info, &words);
+}
+
 bool HXProcessRecorder::recordMemory(int32_t pid) {
+    readAtOnce();
     _setting.set(1);
     recordOwned(pid);
     recordImages(pid);

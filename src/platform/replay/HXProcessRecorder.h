@@ -34,6 +34,7 @@ class HXProcessRecorder {
     bool recordProcess(int32_t pid, bool listed);
     void recordFigures(int32_t pid);
     void recordArguments(int32_t pid);
+    void readAtOnce();
     bool recordMemory(int32_t pid);
     bool recordRegions(int32_t pid);
     void recordRegion(int32_t pid, uint64_t address, uint64_t size, const vm_region_submap_info_64 &info,

@@ -117,6 +117,27 @@ TEST_F(HXLinuxPlatformTest, ListsAndDescribesProcesses) {
     EXPECT_EQ(errno, ESRCH);
 }
 
+TEST_F(HXLinuxPlatformTest, ReadsStatusBehindLongListsOfGroups) {
+    std::string groups;
+    for (int i = 0; i < 65536; i++)
+        groups += std::to_string(1000000 + i) + " ";
+    const std::string figures = "\nRssAnon:\t    8 kB\nVmPTE:\t    4 kB\n";
+    const struct {
+        std::string text;
+        int32_t result;
+    } cases[] = {
+        {"Groups:\t1 2" + figures + "Threads:\t1\n", 0},
+        {"Groups:\t" + groups + figures + "Threads:\t1\n", 0},
+        {"Groups:\t" + groups + figures, -1},
+    };
+    for (size_t i = 0; i < std::size(cases); i++) {
+        proc.write("300/status", cases[i].text);
+        rusage_info_v4 usage{};
+        EXPECT_EQ(platform.proc_pid_rusage(300, RUSAGE_INFO_V4, &usage), cases[i].result) << i;
+        EXPECT_EQ(usage.ri_phys_heft, cases[i].result == 0 ? 12288u : 0u) << i;
+    }
+}
+
 TEST_F(HXLinuxPlatformTest, NamesProcessesByWhatWasExecuted) {
     using namespace std::literals;
     const struct {
@@ -291,8 +312,8 @@ TEST_F(HXLinuxPlatformTest, PageTablesOfMadeUpProcess) {
 TEST_F(HXLinuxPlatformTest, FiguresAndLedger) {
     proc.process(10, "p", mapping);
     const auto status = [&](int pageTable) {
-        proc.write("10/status",
-                   "VmHWM: 900 kB\nRssAnon: 100 kB\nVmPTE: " + std::to_string(pageTable) + " kB\n");
+        proc.write("10/status", "VmHWM: 900 kB\nRssAnon: 100 kB\nVmPTE: " + std::to_string(pageTable) +
+                                    " kB\nThreads: 1\n");
     };
     status(8);
     const mach_port_t task = open(10);
