@@ -18,6 +18,7 @@ HXSubject::HXSubject(const SetUp &setUp) {
     const pid_t parent = getpid();
     _pid = fork();
     if (_pid == 0) {
+        setpgid(0, 0); // so that what it starts goes with it
         prctl(PR_SET_PDEATHSIG, SIGKILL);
         if (getppid() != parent) _exit(1);
         close(ends[0]);
@@ -43,6 +44,7 @@ HXSubject::HXSubject(const std::string &path, const std::vector<std::string> &ar
     const pid_t parent = getpid();
     _pid = fork();
     if (_pid == 0) {
+        setpgid(0, 0); // so that what it starts goes with it
         prctl(PR_SET_PDEATHSIG, SIGKILL);
         if (getppid() != parent) _exit(1);
         std::vector<char *> argv = {const_cast<char *>(path.c_str())};
@@ -63,6 +65,7 @@ void HXSubject::waitUntilStopped() {
 
 HXSubject::~HXSubject() {
     if (_pid <= 0) return;
+    kill(-_pid, SIGKILL);
     kill(_pid, SIGKILL);
     waitpid(_pid, nullptr, 0);
 }
