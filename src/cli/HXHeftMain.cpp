@@ -88,6 +88,8 @@ int HXHeftMain(int argc, char *const argv[]) {
     if (args->JSONOutputFile()) {
         json = HXOutputFormatterJSON::withPath(*args->JSONOutputFile());
         if (!json) return fileFailed(*args->JSONOutputFile(), errno);
+        // Whoever reads the text may stop reading: the document is completed all the same.
+        HXPlatform::current().signal(HX_SIGPIPE, HXSignalDisposition::ignored);
     }
 
     HXHeft heft(std::move(*targets));

@@ -47,6 +47,7 @@ class HXDispatchSource {
 
 enum class HXSignalDisposition { byDefault, ignored };
 inline constexpr int HX_SIGINT = 2;
+inline constexpr int HX_SIGPIPE = 13;
 
 // A file written beside its final place, readable by its owner alone, and renamed when it is complete.
 struct HXPendingFile {

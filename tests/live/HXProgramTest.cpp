@@ -81,10 +81,16 @@ TEST(HXProgram, SaysWhatIsWrongWithItsArguments) {
 }
 
 TEST(HXProgram, LeavesQuietlyWhenNobodyReads) {
-    const HXProgramRun run = HXRunProgram(
-        {"/bin/sh", "-c", std::string(HEFT_PROGRAM) + " -v " + std::to_string(getpid()) + " | head -c 1"});
-    EXPECT_EQ(run.status, 0);
-    EXPECT_EQ(run.err, "");
+    const Folder folder;
+    const std::string pid = std::to_string(getpid());
+    for (const std::string &json : {std::string(), " -j " + folder.file("json")}) {
+        const std::string line = std::string(HEFT_PROGRAM) + " -v " + pid + json + " | head -c 1";
+        const HXProgramRun run = HXRunProgram({"/bin/sh", "-c", line});
+        EXPECT_EQ(run.status, 0);
+        EXPECT_EQ(run.err, "");
+    }
+    EXPECT_EQ(HXRunProgram({"/usr/bin/env", "jq", "-c", ".\"bytes per unit\"", folder.file("json")}).out,
+              "1\n");
 }
 
 TEST(HXProgram, CompletesTheTextWhenTheDocumentCannotBeWritten) {
