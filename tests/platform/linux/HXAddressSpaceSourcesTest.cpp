@@ -1,6 +1,7 @@
 // The figures of a live process from both sources that the host has: smaps, and maps with the page tables.
 #include "platform/linux/HXLinuxPlatform.h"
 
+#include "support/HXBuilders.h"
 #include "support/HXSubject.h"
 
 #include <gtest/gtest.h>
@@ -15,7 +16,6 @@
 
 namespace {
 
-namespace fs = std::filesystem;
 constexpr size_t P = 4096;
 constexpr int readWrite = PROT_READ | PROT_WRITE;
 
@@ -65,24 +65,6 @@ std::vector<HXExpectedRegion> variety() {
     return {};
 }
 
-// A /proc with that process alone, on a machine where nobody has freed pages lazily.
-class OneProcess {
-  public:
-    explicit OneProcess(pid_t pid) {
-        std::string name = fs::temp_directory_path() / "heft-proc-XXXXXX";
-        if (mkdtemp(name.data()) == nullptr) abort();
-        _path = name;
-        fs::create_symlink("/proc/" + std::to_string(pid), _path / std::to_string(pid));
-        std::ofstream(_path / "vmstat") << "pglazyfree 0\n";
-    }
-    ~OneProcess() { fs::remove_all(_path); }
-    OneProcess(const OneProcess &) = delete;
-    std::string path() const { return _path; }
-
-  private:
-    fs::path _path;
-};
-
 // Every region's record and what its pages add up to, as text.
 std::string report(HXLinuxPlatform &platform, pid_t pid) {
     uint32_t charge = 1;
@@ -118,9 +100,14 @@ std::string report(HXLinuxPlatform &platform, pid_t pid) {
 TEST(HXAddressSpaceSources, Agree) {
     const HXSubject subject(variety);
     ASSERT_TRUE(subject.stopped());
-    const OneProcess proc(subject.pid());
+    // A /proc with that process alone, on a machine where nobody has freed pages lazily.
+    const std::filesystem::path proc = temporaryPath();
+    const std::string pid = std::to_string(subject.pid());
+    std::filesystem::create_directories(proc);
+    std::filesystem::create_symlink("/proc/" + pid, proc / pid);
+    std::ofstream(proc / "vmstat") << "pglazyfree 0\n";
     HXLinuxPlatform::Setting setting;
-    setting.procPath = proc.path();
+    setting.procPath = proc;
     HXLinuxPlatform scanning(setting);
     setting.mayScanPageTables = false;
     HXLinuxPlatform reading(setting);
