@@ -36,33 +36,28 @@ std::vector<std::string> split(const std::string &text, const char *separators) 
     return parts;
 }
 
-// Inputs, and the fields and numbers that mutations are made of.
+// Inputs, and the lines, fields and numbers that mutations are made of.
 struct Corpus {
-    std::vector<std::string> inputs;
-    std::vector<std::string> words = {
-        "0",
-        "1",
-        "-1",
-        "0x",
-        "4096",
-        "65535",
-        "2147483648",
-        "4294967296",
-        "18446744073709551615",
-        "0xffffffffffffffff",
-        "0xfffffffffffff000",
-        "144115188075855872",
-        "\\t",
-        "\\",
-        "\t",
-        "\n",
-        "=",
-        "1*1,",
-        "18446744073709551615*1",
-        std::string(1, '\0'),
-        "\xff",
-        "#",
-    };
+    std::vector<std::string> inputs, lines;
+    std::vector<std::string> words = {"0",
+                                      "-1",
+                                      "0x",
+                                      "4096",
+                                      "65535",
+                                      "2147483648",
+                                      "18446744073709551615",
+                                      "0xfffffffffffff000",
+                                      "144115188075855872",
+                                      "\\t",
+                                      "\\",
+                                      "\t",
+                                      "\n",
+                                      "=",
+                                      "1*1,",
+                                      "18446744073709551615*1",
+                                      std::string(1, '\0'),
+                                      "\xff",
+                                      "#"};
 
     explicit Corpus(const std::string &folder) {
         std::set<std::filesystem::path> paths; // in an order that does not depend on the file system
@@ -73,51 +68,31 @@ struct Corpus {
             inputs.emplace_back(std::istreambuf_iterator<char>(file), std::istreambuf_iterator<char>());
             for (std::string &word : split(inputs.back(), "\t\n"))
                 words.push_back("\t" + std::move(word));
+            for (std::string &line : split(inputs.back(), "\n"))
+                lines.push_back(std::move(line));
         }
     }
 };
 
-void mutateBytes(const Corpus &corpus, std::string &input) {
+void mutate(const Corpus &corpus, std::string &input) {
     const size_t place = below(input.size() + 1);
-    switch (below(4)) {
-    case 0: // another byte
-        if (place < input.size()) input[place] = static_cast<char>(below(256));
-        break;
-    case 1: // something less
+    const size_t lineEnd = input.find('\n', place), number = input.find('=', place);
+    const std::string &word = corpus.words[below(corpus.words.size())];
+    const size_t choice = below(25);
+    if (choice == 0) // truncated
+        input.resize(place);
+    else if (choice <= 4 && place < input.size()) // another byte
+        input[place] = static_cast<char>(below(256));
+    else if (choice <= 8) // something less
         input.erase(place, 1 + below(16));
-        break;
-    case 2: // truncated
-        if (below(8) == 0) input.resize(place);
-        break;
-    default: // a word more, or in place of a number
-        const std::string &word = corpus.words[below(corpus.words.size())];
-        const size_t number = input.find('=', place);
-        if (number != std::string::npos && below(2) == 0)
-            input.replace(number + 1,
-                          std::min(input.find_first_of("\t\n", number), input.size()) - number - 1, word);
-        else
-            input.insert(place, word);
-    }
-}
-
-void mutateLines(const Corpus &corpus, std::string &input) {
-    std::vector<std::string> lines = split(input, "\n");
-    if (lines.size() < 2) return;
-    const size_t from = 1 + below(lines.size() - 1), to = 1 + below(lines.size() - 1);
-    switch (below(3)) {
-    case 0: // a line twice
-        lines.insert(lines.begin() + static_cast<std::ptrdiff_t>(to), lines[from]);
-        break;
-    case 1: // two lines in each other's place
-        std::swap(lines[from], lines[to]);
-        break;
-    default: // a line of another input
-        const auto others = split(corpus.inputs[below(corpus.inputs.size())], "\n");
-        if (!others.empty()) lines[to] = others[below(others.size())];
-    }
-    input.clear();
-    for (const std::string &line : lines)
-        input += line + "\n";
+    else if (choice <= 16 && lineEnd != std::string::npos) // a line more, or in the next line's place
+        input.replace(lineEnd + 1, below(2) == 0 ? 0 : input.find('\n', lineEnd + 1) - lineEnd,
+                      corpus.lines[below(corpus.lines.size())] + "\n");
+    else if (choice <= 20 || number == std::string::npos) // a word more
+        input.insert(place, word);
+    else // a word in place of a number
+        input.replace(number + 1, std::min(input.find_first_of("\t\n", number), input.size()) - number - 1,
+                      word);
 }
 
 } // namespace
@@ -135,7 +110,7 @@ int main(int argc, char *argv[]) {
     for (; std::chrono::steady_clock::now() < end; runs++) {
         std::string input = corpus.inputs[below(corpus.inputs.size())];
         for (size_t i = below(4); i < 4; i++)
-            below(3) == 0 ? mutateLines(corpus, input) : mutateBytes(corpus, input);
+            mutate(corpus, input);
         run(input);
     }
     std::printf("%zu inputs and %zu mutations\n", corpus.inputs.size(), runs);

@@ -7,16 +7,13 @@
 
 namespace {
 
-constexpr size_t kAskedProcesses = 16;
-constexpr size_t kAskedRegions = 256;
-
 void require(bool holds) {
     if (!holds) std::abort();
 }
 
 void askRegions(HXReplayPlatform &host, int32_t pid, mach_port_t task) {
     uint64_t address = 0, size = 0;
-    for (size_t i = 0; i < kAskedRegions; i++, address += size) {
+    for (size_t i = 0; i < 256; i++, address += size) {
         vm_region_submap_info_64 info{};
         uint32_t depth = UINT32_MAX, words = VM_REGION_SUBMAP_INFO_COUNT_64;
         const uint64_t asked = address;
@@ -26,8 +23,6 @@ void askRegions(HXReplayPlatform &host, int32_t pid, mach_port_t task) {
         uint64_t count = 64;
         host.mach_vm_page_range_query(task, address, size, dispositions, &count);
         require(count <= 64);
-        int32_t purge = 0;
-        host.mach_vm_purgable_control(task, address, VM_PURGABLE_GET_STATE, &purge);
         char path[16];
         require(host.proc_regionfilename(pid, address, path, sizeof path) <= int32_t{sizeof path});
         vm_region_basic_info_64 basic{};
@@ -74,7 +69,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     if (!machine) return 0;
     static HXLinuxPlatform services; // never asked
     HXReplayPlatform host(*machine, services);
-    int32_t pids[kAskedProcesses];
+    int32_t pids[16];
     const int32_t count = host.proc_listallpids(pids, sizeof pids);
     for (int32_t i = 0; i < count; i++)
         askProcess(host, pids[i]);

@@ -14,9 +14,9 @@
 
 namespace {
 
+// The account's figures, and the same by the kernel's sums.
 struct Reading {
     uint64_t zonesDirtySize = 0, zonesReclaimableSize = 0, sitesDirtySize = 0;
-    // The same by the kernel's sums.
     uint64_t slabUnreclaimableSize = 0, slabReclaimableSize = 0, sitesSumSize = 0;
 };
 
@@ -35,17 +35,14 @@ class HXLinuxKernelMemoryLiveRootTest : public testing::Test {
         pageSize = static_cast<uint32_t>(sysconf(_SC_PAGESIZE));
     }
 
-    // The kernel counts slab pages per CPU and adds the counts up only now and then; reading this file makes
-    // it do so at once.
-    static void settleCounts() { HXReadKernelFile("/proc/sys/vm/stat_refresh"); }
-
     Reading read() {
         HXLinuxKernelMemory memory("/proc", "/sys", pageSize);
         mach_zone_name *names = nullptr;
         mach_zone_info *zones = nullptr;
         mach_memory_info_record *records = nullptr;
         uint32_t nameCount = 0, zoneCount = 0, recordCount = 0;
-        settleCounts();
+        // The kernel adds its counts per CPU up now and then; reading this file makes it do so at once.
+        HXReadKernelFile("/proc/sys/vm/stat_refresh");
         EXPECT_EQ(memory.mach_memory_info(0, &names, &nameCount, &zones, &zoneCount, &records, &recordCount),
                   KERN_SUCCESS);
         Reading reading;

@@ -1,6 +1,7 @@
 // Work queues, signals and the command line's own files on the live host.
-#include "platform/linux/HXLinuxDispatch.h"
 #include "platform/linux/HXLinuxPlatform.h"
+
+#include "support/HXBuilders.h"
 
 #include <gtest/gtest.h>
 
@@ -13,7 +14,6 @@
 #include <filesystem>
 #include <fstream>
 #include <future>
-#include <numeric>
 
 namespace {
 
@@ -30,10 +30,6 @@ TEST(HXLinuxDispatch, LoopCallsEachIterationOnce) {
             EXPECT_EQ(count, 1);
         platform.dispatch_apply(0, queue, [](size_t) { ADD_FAILURE(); });
     }
-    platform.setWorkerCount(1);
-    std::vector<size_t> order;
-    platform.dispatch_apply(5, {}, [&](size_t i) { order.push_back(i); });
-    EXPECT_EQ(order, (std::vector<size_t>{0, 1, 2, 3, 4}));
 }
 
 // In a process of its own, for signals are the whole process's.
@@ -76,15 +72,10 @@ TEST(HXLinuxDispatch, SignalsGoToTheSourceThenToTheDisposition) {
 
 class HXLinuxFiles : public testing::Test {
   protected:
-    HXLinuxFiles() {
-        std::string name = fs::temp_directory_path() / "heft-files-XXXXXX";
-        if (mkdtemp(name.data()) == nullptr) abort();
-        folder = name;
-    }
-    ~HXLinuxFiles() override { fs::remove_all(folder); }
+    HXLinuxFiles() { fs::create_directories(folder); }
 
     HXLinuxPlatform platform;
-    fs::path folder;
+    const fs::path folder = temporaryPath();
 };
 
 TEST_F(HXLinuxFiles, ReadsPlainFilesAlone) {
@@ -92,17 +83,14 @@ TEST_F(HXLinuxFiles, ReadsPlainFilesAlone) {
     mkfifo((folder / "fifo").c_str(), 0600);
     EXPECT_EQ(platform.readFile(folder / "plain", 100000)->size(), 100000u);
     EXPECT_GT(platform.readFile("/proc/self/status", 100000).value_or("").size(), 100u) << "of no size";
-    const struct {
-        std::string path;
-        int error;
-    } cases[] = {{folder / "plain", EFBIG},
-                 {folder / "fifo", EINVAL},
-                 {"/dev/zero", EINVAL},
-                 {folder, EISDIR},
-                 {folder / "none", ENOENT}};
+    const std::pair<std::string, int> cases[] = {{folder / "plain", EFBIG},
+                                                 {folder / "fifo", EINVAL},
+                                                 {"/dev/zero", EINVAL},
+                                                 {folder, EISDIR},
+                                                 {folder / "none", ENOENT}};
     for (const auto &item : cases) {
-        EXPECT_FALSE(platform.readFile(item.path, 99999)) << item.path;
-        EXPECT_EQ(errno, item.error) << item.path;
+        EXPECT_FALSE(platform.readFile(item.first, 99999)) << item.first;
+        EXPECT_EQ(errno, item.second) << item.first;
     }
 }
 
@@ -128,28 +116,6 @@ TEST_F(HXLinuxFiles, PendingFilesAppearWhole) {
     EXPECT_FALSE(platform.commitPendingFile(*lost));
     EXPECT_EQ(std::distance(fs::directory_iterator(folder), {}), 2) << "nothing is left over";
     EXPECT_EQ(std::distance(fs::directory_iterator(folder / "sub"), {}), 1);
-}
-
-TEST_F(HXLinuxFiles, OptionScannerBeginsAnew) {
-    int flag = 0;
-    const std::vector<HXLongOption> options = {
-        {"all", false, nullptr, 'a'}, {"wide", false, &flag, 1}, {"pid", true, nullptr, 'p'}};
-    for (int round = 0; round < 2; round++) {
-        char program[] = "heft", one[] = "name", all[] = "-a", pid[] = "--pid=12", wide[] = "--wide";
-        char *arguments[] = {program, one, all, pid, wide, nullptr};
-        flag = 0;
-        auto scan = platform.getopt_long(5, arguments, ":ap:", options, true);
-        EXPECT_EQ(scan.result, 'a');
-        scan = platform.getopt_long(5, arguments, ":ap:", options, false);
-        EXPECT_EQ(scan.result, 'p');
-        EXPECT_STREQ(scan.argument, "12");
-        scan = platform.getopt_long(5, arguments, ":ap:", options, false);
-        EXPECT_EQ(scan.result, 0);
-        EXPECT_EQ(flag, 1);
-        scan = platform.getopt_long(5, arguments, ":ap:", options, false);
-        EXPECT_EQ(scan.result, -1);
-        EXPECT_STREQ(arguments[scan.index], "name");
-    }
 }
 
 } // namespace

@@ -40,24 +40,22 @@ std::vector<Parsed> parse(const std::string &text, size_t piece = SIZE_MAX, uint
     return parsed;
 }
 
-std::string line(const std::string &label, uint64_t kilobytes) {
-    char text[64];
-    snprintf(text, sizeof text, "%-16s%8lu kB\n", (label + ":").c_str(),
-             static_cast<unsigned long>(kilobytes));
-    return text;
-}
-
-// A mapping's text as kernel 6.18 writes it.
+// A mapping's text as kernel 6.18 writes it, up to fields that nobody reads.
 std::string modern(const std::string &header, uint64_t rss, uint64_t anonymous, uint64_t lazy, uint64_t swap,
                    uint64_t huge, const std::string &flags) {
-    return header + "\n" + line("Size", 1024) + line("KernelPageSize", 4) + line("MMUPageSize", 4) +
-           line("Rss", rss) + line("Pss", rss) + line("Pss_Dirty", rss) + line("Shared_Clean", 0) +
-           line("Shared_Dirty", 8) + line("Private_Clean", 0) + line("Private_Dirty", 12) +
-           line("Referenced", rss) + line("Anonymous", anonymous) + line("KSM", 0) + line("LazyFree", lazy) +
-           line("AnonHugePages", 2048) + line("ShmemPmdMapped", 0) + line("FilePmdMapped", 0) +
-           line("Shared_Hugetlb", huge) + line("Private_Hugetlb", huge) + line("Swap", swap) +
-           line("SwapPss", swap) + line("Locked", 0) +
-           "THPeligible:           0\nProtectionKey:         0\nVmFlags: " + flags + " \n";
+    std::string text = header + "\n";
+    const std::pair<const char *, uint64_t> fields[] = {{"Size:", 1024},           {"Rss:", rss},
+                                                        {"Pss_Dirty:", rss},       {"Shared_Dirty:", 8},
+                                                        {"Private_Dirty:", 12},    {"Anonymous:", anonymous},
+                                                        {"LazyFree:", lazy},       {"AnonHugePages:", 2048},
+                                                        {"Shared_Hugetlb:", huge}, {"Private_Hugetlb:", huge},
+                                                        {"Swap:", swap},           {"SwapPss:", swap}};
+    for (const auto &[label, kilobytes] : fields) {
+        char line[64];
+        snprintf(line, sizeof line, "%-16s%8lu kB\n", label, static_cast<unsigned long>(kilobytes));
+        text += line;
+    }
+    return text + "THPeligible:           0\nVmFlags: " + flags + " \n";
 }
 
 const std::string sample =
@@ -77,24 +75,17 @@ TEST(HXMapsParser, ReadsSmapsWhereverItIsCut) {
     const auto whole = parse(sample);
     ASSERT_EQ(whole.size(), 4u);
     const HXMapping &code = whole[0].mapping;
-    EXPECT_EQ(code.start, 0x400000u);
-    EXPECT_EQ(code.end, 0x452000u);
-    EXPECT_EQ(code.offset, 0x1000u);
-    EXPECT_EQ(code.device, HXDeviceNumber(0xfe, 0x0a));
-    EXPECT_EQ(code.inode, 1835u);
+    EXPECT_EQ((std::vector<uint64_t>{code.start, code.end, code.offset, code.device, code.inode}),
+              (std::vector<uint64_t>{0x400000, 0x452000, 0x1000, HXDeviceNumber(0xfe, 0x0a), 1835}));
+    EXPECT_EQ((std::vector<uint32_t>{code.residentPages, code.anonymousPages, code.lazyFreePages,
+                                     code.swappedPages, code.dirtyPages}),
+              (std::vector<uint32_t>{82, 4, 1, 10, 5}));
     EXPECT_EQ(whole[0].path, "/usr/bin/dbus daemon (deleted)");
     EXPECT_EQ(code.flags, HXMappingReadable | HXMappingExecutable | HXMappingLocked | may);
-    EXPECT_EQ(code.residentPages, 82u);
-    EXPECT_EQ(code.anonymousPages, 4u);
-    EXPECT_EQ(code.lazyFreePages, 1u);
-    EXPECT_EQ(code.swappedPages, 10u);
-    EXPECT_EQ(code.dirtyPages, 5u);
     EXPECT_EQ(whole[1].mapping.hugePages, 512u);
     EXPECT_EQ(whole[1].mapping.flags, HXMappingReadable | HXMappingWritable | HXMappingShared |
                                           HXMappingHugePages | HXMappingNotInherited | may);
     EXPECT_EQ(whole[2].mapping.residentPages, UINT32_MAX);
-    EXPECT_EQ(whole[2].path, "");
-    EXPECT_EQ(whole[3].mapping.residentPages, 3u);
     EXPECT_EQ(whole[3].path, "[stack]");
     for (size_t piece = 1; piece < 1500; piece += 7)
         EXPECT_EQ(parse(sample, piece), whole) << piece;
@@ -110,11 +101,8 @@ TEST(HXMapsParser, ReadsOtherKernelsAndDamagedText) {
     const auto two = parse(old + "08056000-08057000 rw-p 0000d000 03:0c 64593\nRss:                  4 kB\n");
     ASSERT_EQ(two.size(), 2u);
     EXPECT_EQ(two[0].mapping.residentPages, 2u);
-    EXPECT_EQ(two[0].mapping.swappedPages, 0u);
     EXPECT_EQ(two[0].mapping.flags, HXMappingReadable | HXMappingExecutable | may);
     EXPECT_EQ(two[1].mapping.residentPages, 1u);
-    EXPECT_EQ(two[1].path, "");
-
     EXPECT_EQ(parse(header + header).size(), 2u) << "maps alone";
     EXPECT_EQ(parse(header.substr(0, header.size() - 1))[0].path, "/usr/sbin/gpm") << "no newline at the end";
     for (const std::string bad :

@@ -43,30 +43,19 @@ TEST(GXProcessObjectGraph, ReadsFactsAndRegions) {
     ASSERT_TRUE(graph) << reason;
     EXPECT_EQ(graph->pid(), 42);
     EXPECT_EQ(graph->processName(), "a'b");
-    EXPECT_EQ(graph->processDescriptionString(), "x, ARM64");
-    EXPECT_EQ(graph->vmPageSize(), 16384u);
     EXPECT_TRUE(graph->is64bit() && graph->showsPhysHeft() && graph->hasSharedRegion());
     const auto regions = regionsOf(*graph);
     ASSERT_EQ(regions.size(), 3u);
     EXPECT_EQ(regions[0].path, "/a?b");
     EXPECT_EQ(regions[0].user_tag, 110u);
-    EXPECT_EQ(regions[0].ref_count, 1u);
-    EXPECT_EQ(regions[0].share_mode, SM_PRIVATE);
-    EXPECT_EQ(regions[0].purgeable, VM_PURGABLE_DENY);
     const GXVMRegion &r = regions[1];
     EXPECT_EQ(r.type, "arena");
-    EXPECT_FALSE(r.path);
-    EXPECT_EQ(r.prot, -1);
     EXPECT_EQ(r.dirty_size, uint64_t{1} << 32);
     EXPECT_EQ((std::vector<uint64_t>{r.offset, r.resident_size, r.shared_now_private_size, r.swapped_out_size,
                                      r.reusable_size, r.ref_count, r.share_mode, r.is_submap, r.object_id}),
               (std::vector<uint64_t>{9, 1, 2, 3, 5, 6, 4, 7, 0xffffffff}));
     EXPECT_EQ(HXNamedTags::shared().nameForTag(r.user_tag), "arena");
     EXPECT_EQ(regions[2].user_tag, 201u);
-
-    size_t seen = 0;
-    graph->enumerateRegionsWithBlock([&](const GXVMRegion &, bool *stop) { *stop = ++seen == 2; });
-    EXPECT_EQ(seen, 2u);
 }
 
 TEST(GXProcessObjectGraph, NamesTheLineThatBreaksTheForm) {
@@ -75,22 +64,15 @@ TEST(GXProcessObjectGraph, NamesTheLineThatBreaksTheForm) {
         const char *reason; // its beginning
     } cases[] = {
         {"", "line 1: no process record"},
-        {"\n# none\n", "line 3: no process record"},
-        {"region|address=1|length=1|type=x\n", "line 2: a region before the process"},
         {kProcess + kProcess, "line 3: a second process record"},
         {"process|pid=1|name=x|page_size=4096\n", "line 2: missing field \"description\""},
-        {"process|pid=1|name=x|description=x|page_size=2048\n", "line 2: page_size"},
         {"process|pid=1|name=x|description=x|page_size=12288\n", "line 2: page_size"},
         {kProcess + "region|address=1|length=0|type=x\n", "line 3: a length of 0"},
         {kProcess + "region|address=1|length=0x200000000000001|type=x\n", "line 3: it is longer"},
         {kProcess + "region|address=0xffffffffffffffff|length=1|type=x\n", "line 3: it ends beyond"},
-        {kProcess + "region|address=0xfffffffffffffffe|length=1|type=x\n", ""},
         {kProcess + "region|address=4|length=4|type=x\nregion|address=7|length=1|type=x\n",
          "line 4: it overlaps"},
-        {kProcess + "region|address=4|length=4|type=x\nregion|address=8|length=1|type=x", ""},
-        {kProcess + "region|address=4|length=4\n", "line 3: missing field \"type\""},
         {kProcess + "region|address=4|length=4|type=x|share_mode=256\n", "line 3: share_mode"},
-        {kProcess + "region|address=4|length=4|type=x|purgeable=2147483648\n", "line 3: purgeable"},
         {kProcess + "host\n", "line 3: unknown record \"host\""},
     };
     for (const auto &test : cases) {
@@ -168,34 +150,27 @@ TEST(HXMemgraphRecorder, WritesWhatALiveWalkFinds) {
 }
 
 TEST(HXMemgraphRecorder, PutsPageTablesWhereTheyFit) {
-    const struct {
-        const char *regions;
-        const char *expected; // contained
-    } cases[] = {
+    const std::pair<const char *, const char *> cases[] = {
         {"", "\nregion|address=0x8000000000000000|length=0x3000|type=page table"},
         {"region|pid=5|address=0x7fffffffffffd000|size=0x4000\n", "address=0x8000000000001000|length=0x3000"},
         {"region|pid=5|address=0x8000000000002000|size=0x1000\n", "address=0x8000000000003000|length=0x3000"},
-        {"region|pid=5|address=0x8000000000003000|size=0x1000\n", "address=0x8000000000000000|length=0x3000"},
     };
-    for (const auto &test : cases) {
-        const std::string text = recorded(kHost + "process|pid=5|page_table=12288\n" + test.regions, true);
-        EXPECT_NE(text.find(test.expected), std::string::npos) << text;
+    for (const auto &[regions, expected] : cases) {
+        const std::string text = recorded(kHost + "process|pid=5|page_table=12288\n" + regions, true);
+        EXPECT_NE(text.find(expected), std::string::npos) << text;
     }
 }
 
 TEST(HXMemgraphRecorder, SaysWhyAProcessCannotBeRecorded) {
-    const struct {
-        const char *records;
-        const char *reason;
-    } cases[] = {
+    const std::pair<const char *, const char *> cases[] = {
         {"process|pid=4\n", "No such process"},
         {"process|pid=5|task_error=5\n", "(os/kern) failure"},
         {"process|pid=5|flags=1\n", "the kernel has no memory graph"},
         {"process|pid=5\nfault|pid=5|call=mach_vm_region_recurse|error=268435459|becomes=gone\n",
          "(ipc/send) invalid destination port"},
     };
-    for (const auto &test : cases)
-        EXPECT_EQ(recorded(test.records, true), test.reason);
+    for (const auto &[records, reason] : cases)
+        EXPECT_EQ(recorded(records, true), reason);
 }
 
 } // namespace

@@ -4,17 +4,14 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
+
 namespace {
 
-std::string replaced(std::string text, const std::string &what, const std::string &with) {
-    for (size_t at = 0; (at = text.find(what, at)) != std::string::npos; at += with.size())
-        text.replace(at, what.size(), with);
-    return text;
-}
-
 // The file's text, with a bar for each TAB.
-std::string file(const std::string &records) {
-    return "heft-machine 1\n" + replaced(records, "|", "\t");
+std::string file(std::string records) {
+    std::replace(records.begin(), records.end(), '|', '\t');
+    return "heft-machine 1\n" + records;
 }
 
 std::string reasonFor(const std::string &text) {
@@ -32,45 +29,26 @@ TEST(HXMachineReader, NamesTheLineThatBreaksTheForm) {
         const char *reason; // its beginning
     } cases[] = {
         {"", ""},
-        {"\n# comment|x=\n\nprocess|pid=1", ""},
         {"zone|name=tab\\tnewline\\nslash\\\\\n", ""},
-        {process + "fault|pid=1|call=mach_vm_region|error=-1\n", ""},
         {"host|page_size=4096\n" + process + "region|pid=1|address=4096|size=4096|pages=1*0x10\n", ""},
-        {"\nprocesses|pid=1\n", "line 3: unknown record \"processes\""},
-        {" process|pid=1\n", "line 2: unknown record"},
+        {"\n# x|x=\n\nprocesses|pid=1\n", "line 5: unknown record \"processes\""},
         {"|pid=1\n", "line 2: unknown record \"\""},
         {"process|pid=1|size=1\n", "line 2: unknown field \"size\""},
         {"process|pid=1|pid=1\n", "line 2: twice the field \"pid\""},
-        {"process|pid=1|\n", "line 2: a field without a value"},
         {"process|ppid=1\n", "line 2: missing field \"pid\""},
-        {"process\n", "line 2: missing field \"pid\""},
         {"process|pid=\n", "line 2: pid is no number"},
-        {"process|pid=+1\n", "line 2: pid is no number"},
-        {"process|pid=1 \n", "line 2: pid is no number"},
-        {"process|pid=0x\n", "line 2: pid is no number"},
         {"process|pid=0x-1\n", "line 2: pid is no number"},
         {"process|pid=2147483648\n", "line 2: pid is no number"},
-        {"process|pid=-2147483649\n", "line 2: pid is no number"},
         {"process|pid=-2147483648\n", ""},
-        {"process|pid=1|flags=-1\n", "line 2: flags is no number"},
-        {"process|pid=1|flags=0x100000000\n", "line 2: flags is no number"},
         {"process|pid=1|heft=18446744073709551616\n", "line 2: heft is no number"},
-        {"process|pid=1|page_table=-9223372036854775808\n", ""},
         {"process|pid=1|listed=2\n", "line 2: listed is not 0 or 1"},
         {"process|pid=1|comm=a\\xb\n", "line 2: a bad escape in comm"},
-        {"process|pid=1|comm=a\\\n", "line 2: a bad escape in comm"},
-        {region + "|shadow_depth=65536\n", "line 3: shadow_depth is no number"},
         {region + "|pager=256\n", "line 3: pager is no number"},
         {"region|pid=1|address=0|size=0x4000\n", "line 2: no process record before this one for pid 1"},
         {process + process, "line 3: a second process record of pid 1"},
         {process + "host|pid=2\n", "line 3: the host record comes after"},
-        {"host\nhost\n", "line 3: a second host record"},
         {"host|page_size=5000\n", "line 2: page_size"},
-        {"host|page_size=131072\n", "line 2: page_size"},
-        {"host|page_size=0\n", "line 2: page_size"},
         {region + "\nregion|pid=1|address=0xc000|size=0x4000\n", "line 4: it overlaps"},
-        {region + "\nregion|pid=1|address=0x4000|size=0x4000\n", "line 4: it overlaps"},
-        {region + "\nregion|pid=1|address=0x10000|size=0x4000\n", ""},
         {process + "region|pid=1|address=0x8000|size=0\n", "line 3: a length of 0"},
         {process + "region|pid=1|address=0x8000|size=0x1000\n", "line 3: address or size is no multiple"},
         {process + "region|pid=1|address=0|size=0x200000000004000\n", "line 3: it is longer than 2^57"},
@@ -81,15 +59,9 @@ TEST(HXMachineReader, NamesTheLineThatBreaksTheForm) {
         {process + "segment|pid=1|name=__TEXT|start=0|size=1\n", "line 3: a segment before an image"},
         {process + "image|pid=1|path=x|base=0\nsegment|pid=1|name=x|start=1|size=0\n",
          "line 4: a length of 0"},
-        {region + "|pages=2*1\n", ""},
-        {region + "|pages=\n", ""},
-        {region + "|pages=1*1,2*0\n", "line 3: more pages than the region has"},
         {region + "|pages=18446744073709551615*1\n", "line 3: more pages"},
         {region + "|pages=0*1\n", "line 3: a bad run of pages"},
         {region + "|pages=1*1,\n", "line 3: a bad run of pages"},
-        {region + "|pages=1*-1\n", "line 3: a bad run of pages"},
-        {region + "|pages=1*4294967296\n", "line 3: a bad run of pages"},
-        {region + "|pages=1\n", "line 3: a bad run of pages"},
         {region + "|pages=1*9\npages|pid=1|pages=1*8\n", ""},
         {region + "|pages=1*9\npages|pid=1|pages=2*8\n", "line 4: more pages"},
         {region + "\npages|pid=1|pages=2*8\n", "line 4: pages that do not continue"},
@@ -98,14 +70,10 @@ TEST(HXMachineReader, NamesTheLineThatBreaksTheForm) {
         {"process|pid=1|owned_none=1\nowned|pid=1|object_id=1\n", "line 3: an owned object"},
         {process + "fault|pid=1|call=mach_vm_region|error=0\n", "line 3: a fault with error 0"},
         {process + "fault|pid=1|call=mach_vm|error=1\n", "line 3: unknown call \"mach_vm\""},
-        {process + "fault|pid=1|call=mach_vm_region|error=1|becomes=x\n", "line 3: unknown fate \"x\""},
-        {"symbol|address=16|size=16\nsymbol|address=31|size=1\n", "line 3: a symbol that overlaps"},
-        {"symbol|address=16|size=16\nsymbol|address=8|size=9\n", "line 3: a symbol that overlaps"},
         {"symbol|address=16|size=16\nsymbol|address=0|size=0xffffffffffffffff\n", "line 3: a symbol that"},
         {"symbol|address=16|size=16\nsymbol|address=8|size=8\nsymbol|address=32|size=1\n", ""},
         {"tag|tag=110|name=a\ntag|tag=110|name=a\n", "line 3: a second record of tag 110"},
         {"zone|name=" + std::string((1 << 20) - 10, 'x'), ""},
-        {"#" + std::string(3 << 20, 'x') + "\nzones\n", "line 3: unknown record"},
         {"\nzone|name=" + std::string((1 << 20) - 9, 'x'), "line 3: the record is longer than 1 MiB"},
     };
     for (const auto &test : cases) {
@@ -114,8 +82,7 @@ TEST(HXMachineReader, NamesTheLineThatBreaksTheForm) {
         EXPECT_EQ(reason.substr(0, expected.empty() ? reason.size() : expected.size()), expected)
             << test.records.substr(0, 200) << ": " << reason;
     }
-    for (const char *text : {"", "\n", "heft-machine 2\n", "heft-machine 1 \n", "# x\nheft-machine 1\n",
-                             "heft-memgraph 1\n", "heft-machine"})
+    for (const char *text : {"", "heft-machine 2\n", "heft-machine 1 \n", "# x\nheft-machine 1\n"})
         EXPECT_EQ(reasonFor(text), "not a machine file") << text;
     EXPECT_EQ(reasonFor("heft-machine 1"), "");
 }
@@ -155,19 +122,16 @@ TEST(HXMachineReader, ReadsFilesInPiecesAsItReadsText) {
         EXPECT_EQ(machine->strings.text(read[i - 1].path),
                   "/" + std::string(i % 89, 'p') + std::to_string(i % 10));
     }
-    const struct {
-        std::string text;
-        const char *reason;
-    } broken[] = {
+    const std::pair<std::string, const char *> broken[] = {
         {text + "x\n", "line 10008: unknown record \"x\""},
         {text + "zone\tname=" + std::string(40 << 20, 'x'), "line 10008: the record is longer than 1 MiB"},
         {text + "#" + std::string(40 << 20, 'x') + "\nx", "line 10009: unknown record \"x\""},
         {std::string(40 << 20, 'x'), "not a machine file"},
     };
     for (const auto &test : broken) {
-        OneFile brokenHost(test.text);
+        OneFile brokenHost(test.first);
         EXPECT_FALSE(HXMachine::load(brokenHost, "", &reason));
-        EXPECT_EQ(reason, test.reason);
+        EXPECT_EQ(reason, test.second);
     }
     HXBarePlatform without;
     EXPECT_FALSE(HXMachine::load(without, "/nonexistent/machine", &reason));
