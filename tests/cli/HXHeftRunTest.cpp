@@ -73,14 +73,10 @@ TEST(HXHeftRunTest, ChoosesTargets) {
          "Unable to find pid for process matching 'launch'\nUnable to find pid for process matching "
          "'Launchd'\n"},
         {{"40x"}, {40}},
-        {{" +40"}, {40}},
         {{"7"}, {30}}, // a name of digits
         {{"--pid", "40", "--pid", "60"}, {60, 40}},
         {{"40", "60"}, {40}, "Unable to find pid for process matching '60'\n"},
         {{"40", "70"}, {40}, "Unable to find pid for process matching '70'\n"},
-        {{"99999999999999999999", "40"},
-         {40},
-         "Unable to find pid for process matching '99999999999999999999'\n"},
         {{"4294967336", "40"}, {40}, "Unable to find pid for process matching '4294967336'\n"},
         {{"40", "closed"},
          {40},
@@ -91,8 +87,6 @@ TEST(HXHeftRunTest, ChoosesTargets) {
          "task_for_pid: (os/kern) failure\n"
          "Unable to analyze process with pid 50 (try as root?)\n"},
         {{"40", "--pid", "77"}, {40}, "Unable to analyze process with pid 77 (try as root?)\n"},
-        {{"40", "-t", "--pid", "77"}, {40}, "Unable to analyze process with pid 77 (try as root?)\n"},
-        {{"worker", "-x", "21"}, {20}},
         {{"10", "worker", "-x", "worker", "-x", "nothing"}, {10}},
         {{"10", "1"}, {10}}, // never itself
         {{"-t", "21"}, {30, 21}},
@@ -141,7 +135,6 @@ TEST(HXHeftRunTest, EndsWithTheStatusAndTextOfEachFailure) {
          "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.\n",
          true},
         {"nothing to target", kTree, {}, 1, "Must specify at least one process or memgraph\n", true},
-        {"only an exclusion", kTree, {"-x", "1"}, 1, "Must specify at least one process or memgraph\n", true},
         {"a file that is no graph",
          kTree,
          {file},
@@ -159,7 +152,6 @@ TEST(HXHeftRunTest, EndsWithTheStatusAndTextOfEachFailure) {
         {"all without privilege", user, {"-a"}, 1, "Must run as root.\n", false},
         {"unmapped without privilege", user, {"--unmapped", "40"}, 1, "Must run as root.\n", false},
         {"no process list", blind, {"40"}, 1, unseen + kNobody, false},
-        {"no process list for all", blind, {"-a"}, 1, kNobody, false},
         {"no directory for the document",
          kTree,
          {"40", "--json", "/no such/file"},
@@ -173,9 +165,7 @@ TEST(HXHeftRunTest, EndsWithTheStatusAndTextOfEachFailure) {
         EXPECT_EQ(result.err, test.err) << test.title;
         EXPECT_EQ(result.out, test.usage ? usage() : "") << test.title;
     }
-    const HXRun own = run(user, {"40"});
-    EXPECT_EQ(own.status, 0);
-    EXPECT_EQ(shown(own.out), std::vector<int32_t>{40});
+    EXPECT_EQ(shown(run(user, {"40"}).out), std::vector<int32_t>{40});
     // A pid given as such needs no list; nor does a switch that privilege would be needed for but that is
     // off.
     EXPECT_EQ(shown(run(blind, {"--pid", "40"}).out), std::vector<int32_t>{40});
@@ -200,7 +190,6 @@ TEST(HXHeftRunTest, AKernelWithoutTheSettingIsAnalysedByObjects) {
     // Both see the whole file's two dirty pages; heap is dirty as far as it is resident: 16 + 3 swapped + 2.
     EXPECT_NE(without.out.find("alpha [100]: 64-bit\tHeft: 344064 B"), std::string::npos) << without.out;
 }
-
 TEST(HXHeftRunTest, TwoRunsPrintTheSameBytes) {
     for (const Words &words : {Words{"-a"}, Words{"-a", "-v"}, Words{"-a", "-w", "--sort", "regions"}}) {
         const HXRun first = report(kTwoWorkers, words), second = report(kTwoWorkers, words);

@@ -1,4 +1,5 @@
 // Captures of live processes tell what the processes themselves tell.
+#include "support/HXBuilders.h"
 #include "support/HXProgramRun.h"
 #include "support/HXSubject.h"
 
@@ -6,8 +7,6 @@
 
 #include <cstring>
 #include <filesystem>
-#include <fstream>
-#include <sstream>
 #include <sys/mman.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -20,16 +19,16 @@ class Captures : public testing::Test {
     void SetUp() override {
         folder = (std::filesystem::temp_directory_path() / "heft-XXXXXX").string();
         ASSERT_TRUE(mkdtemp(folder.data()));
+        ASSERT_EQ(ftruncate(memfd, 1 << 20), 0);
     }
-    void TearDown() override { std::filesystem::remove_all(folder); }
+    void TearDown() override {
+        std::filesystem::remove_all(folder);
+        close(memfd);
+    }
     std::string file(const std::string &name) const { return folder + "/" + name; }
-    static std::string contentOf(const std::string &path) {
-        std::ostringstream content;
-        content << std::ifstream(path).rdbuf();
-        return content.str();
-    }
 
     std::string folder;
+    const int memfd = static_cast<int>(syscall(SYS_memfd_create, "heft", 0));
 };
 
 // A process with anonymous memory, a shared memfd written in part, and a name for some of its memory.
@@ -47,8 +46,6 @@ HXSubject::SetUp sharing(int memfd, size_t from) {
 }
 
 TEST_F(Captures, ReplayToTheSameReports) {
-    const int memfd = static_cast<int>(syscall(SYS_memfd_create, "heft", 0));
-    ASSERT_EQ(ftruncate(memfd, 1 << 20), 0);
     const HXSubject first(sharing(memfd, 0));
     const HXSubject second(sharing(memfd, 1 << 18));
     const std::vector<std::string> pids = {std::to_string(first.pid()), std::to_string(second.pid())};
@@ -77,8 +74,6 @@ TEST_F(Captures, ReplayToTheSameReports) {
 }
 
 TEST_F(Captures, HideNamesButNotFiguresWhenAskedTo) {
-    const int memfd = static_cast<int>(syscall(SYS_memfd_create, "heft", 0));
-    ASSERT_EQ(ftruncate(memfd, 1 << 20), 0);
     const HXSubject subject(sharing(memfd, 0));
     const std::string pid = std::to_string(subject.pid());
     ASSERT_EQ(HXRunProgram({HEFT_RECORD_PROGRAM, "machine", "--anonymize", file("machine"), pid}).status, 0);
@@ -94,8 +89,6 @@ TEST_F(Captures, HideNamesButNotFiguresWhenAskedTo) {
 }
 
 TEST_F(Captures, OfOneProcessGiveItsHeftAndCategories) {
-    const int memfd = static_cast<int>(syscall(SYS_memfd_create, "heft", 0));
-    ASSERT_EQ(ftruncate(memfd, 1 << 20), 0);
     const HXSubject subject(sharing(memfd, 0));
     const std::string pid = std::to_string(subject.pid());
     const auto figures = [&](const std::string &target, const std::vector<std::string> &mode) {

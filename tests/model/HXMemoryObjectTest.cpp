@@ -50,19 +50,17 @@ TEST_F(HXMemoryObjectTest, MergesRegionsAndKeepsViewsThatDiffer) {
     };
     struct View {
         int32_t pid;
-        bool itself;
-        Sizes sizes; // of the view, when it is not the object itself
+        Sizes sizes = {}; // none: it is the object itself
     };
     const HXRegionFacts all{.object = 7, .size = 4 * kPage, .dirty = 4 * kPage};
     const HXRegionFacts low{.object = 7, .size = 2 * kPage, .dirty = 2 * kPage};
     const HXRegionFacts high{
         .object = 7, .size = 2 * kPage, .offset = 2 * kPage, .dirty = kPage, .clean = kPage};
-    HXRegionFacts wiredLow = low, priv = low, image = low, none = all, highOfImage = high;
+    HXRegionFacts wiredLow = low, priv = low, image = low, highOfImage = high;
     wiredLow.wired = true;
     priv.shareMode = SM_PRIVATE;
     image.segment = HXSegmentData;
     highOfImage.segment = HXSegmentData;
-    none.object = 0;
     struct {
         const char *title;
         std::vector<Mapping> mappings;
@@ -74,39 +72,33 @@ TEST_F(HXMemoryObjectTest, MergesRegionsAndKeepsViewsThatDiffer) {
          {{10, all}, {20, all}},
          {4 * kPage, 0, 0, 0, 0},
          0,
-         {{10, true, {}}, {20, true, {}}}},
-        {"no object identifier: no sizes", {{10, none}}, {0, 0, 0, 0, 0}, 0, {{10, true, {}}}},
+         {{10, {}}, {20, {}}}},
         {"one process maps both halves, one the first",
          {{10, low}, {10, high}, {20, low}},
          {3 * kPage, 0, kPage, 0, 0},
          3,
-         {{10, false, {3 * kPage, 0, kPage, 0, 0}}, {20, false, {2 * kPage, 0, 0, 0, 0}}, {30, true, {}}}},
+         {{10, {3 * kPage, 0, kPage, 0, 0}}, {20, {2 * kPage, 0, 0, 0, 0}}, {30, {}}}},
         {"one region each, one of them wired",
          {{10, wiredLow}, {20, low}},
          {2 * kPage, 0, 0, 0, 2 * kPage},
          2,
-         {{10, false, {2 * kPage, 0, 0, 0, 2 * kPage}}, {20, false, {2 * kPage, 0, 0, 0, 0}}}},
-        {"two regions of one process keep no views",
-         {{10, low}, {10, high}},
-         {3 * kPage, 0, kPage, 0, 0},
-         0,
-         {{10, true, {}}}},
+         {{10, {2 * kPage, 0, 0, 0, 2 * kPage}}, {20, {2 * kPage, 0, 0, 0, 0}}}},
         {"private mappings are not listed",
          {{10, priv}, {20, priv}, {20, highOfImage}},
          {3 * kPage, 0, kPage, 0, 0},
          0,
-         {{20, true, {}}}},
+         {{20, {}}}},
         {"once one is listed, every later one is",
          {{10, image}, {20, low}, {30, highOfImage}},
          {3 * kPage, 0, kPage, 0, 0},
          2,
-         {{10, true, {}}, {20, false, {2 * kPage, 0, 0, 0, 0}}, {30, false, {kPage, 0, kPage, 0, 0}}}},
+         {{10, {}}, {20, {2 * kPage, 0, 0, 0, 0}}, {30, {kPage, 0, kPage, 0, 0}}}},
         // Both copies of the first page are charged to process 10, whatever the merged runs say.
         {"no less than the largest process",
          {{10, low}, {10, low}, {20, low}},
          {4 * kPage, 0, 0, 0, 0},
          3,
-         {{10, false, {4 * kPage, 0, 0, 0, 0}}, {20, false, {2 * kPage, 0, 0, 0, 0}}}},
+         {{10, {4 * kPage, 0, 0, 0, 0}}, {20, {2 * kPage, 0, 0, 0, 0}}}},
     };
     for (const auto &test : cases) {
         HXMemoryObject object;
@@ -115,14 +107,10 @@ TEST_F(HXMemoryObjectTest, MergesRegionsAndKeepsViewsThatDiffer) {
         object.finalize();
         EXPECT_EQ(sizesOf(object), test.sizes) << test.title;
         EXPECT_EQ(object.processMemoryRegions().size(), test.listed) << test.title;
-        EXPECT_EQ(object.memoryRegions().size(), test.mappings.size()) << test.title;
-        EXPECT_EQ(object.rangeList(), nullptr) << test.title;
         for (const View &expected : test.views) {
             const HXMemoryObject::View view = object.viewForProcess(process(expected.pid));
-            EXPECT_EQ(view.get() == &object, expected.itself) << test.title << ", pid " << expected.pid;
-            if (!expected.itself) {
-                EXPECT_EQ(sizesOf(*view), expected.sizes) << test.title << ", pid " << expected.pid;
-            }
+            EXPECT_EQ(view.get() == &object, expected.sizes.empty()) << test.title << expected.pid;
+            EXPECT_TRUE(view.get() == &object || sizesOf(*view) == expected.sizes) << test.title;
         }
     }
 }
@@ -149,8 +137,6 @@ TEST_F(HXMemoryObjectTest, PageRunsAreMergedAndDropped) {
     second.addSubrange({8 * kPage, kPage}, {0, 0, kPage, 0, 0, 0}, kPage);
     object.addRegion(first, process(10));
     object.addRegion(second, process(20));
-    EXPECT_EQ(first.subrangeList(), nullptr);
-    EXPECT_EQ(second.subrangeList(), nullptr);
     object.finalize();
     EXPECT_EQ(sizesOf(object), (Sizes{3 * kPage, 0, kPage, 0, 0}));
     // A view takes each region as one whole run: the page runs are gone by then.
@@ -165,7 +151,6 @@ TEST_F(HXMemoryObjectTest, OwnedMemoryShowsAsCleanToOthers) {
     EXPECT_EQ(object.viewForProcess(process(10)).get(), &object);
     const auto view = object.viewForProcess(process(20));
     EXPECT_EQ(sizesOf(*view), (Sizes{0, 0, 100 + 12288, 0, 0}));
-    EXPECT_EQ(view->memoryRegions().size(), 1u);
 
     // With views of its own the whole object's dirty and swapped bytes turn clean, not the view's.
     HXMemoryObject shared;
@@ -207,28 +192,12 @@ TEST_F(HXMemoryObjectTest, IsNamedAfterItsCanonicalRegion) {
     }
 }
 
-TEST_F(HXMemoryObjectTest, BrokenPreconditionsStopTheProgram) {
-    HXMemoryObject object;
-    EXPECT_DEATH((void)object.copy(), "");
-    add(object, 0, {.object = 7, .size = 1});
-    object.finalize();
-    EXPECT_DEATH(object.finalize(), "");
-    HXMemoryRegion late = makeRegion({.object = 7, .size = 1});
-    EXPECT_DEATH(object.addRegion(late, kPage), "");
-}
-
 TEST_F(HXMemoryObjectTest, CategoriesAddUpDifferentObjectsAndCountRegionsOnce) {
     HXMemoryObject first, second;
     add(first, 0, {.object = 1, .size = 4 * kPage, .dirty = kPage, .name = "libA", .detail = "/x/libA"});
     add(first, 0, {.object = 1, .size = kPage, .offset = 8 * kPage, .wired = true});
     add(second, 0,
-        {.object = 2,
-         .size = 4 * kPage,
-         .swapped = 5,
-         .clean = 6,
-         .reclaimable = 7,
-         .name = "libA",
-         .detail = "/y/libA"});
+        {.object = 2, .size = 4 * kPage, .swapped = 5, .clean = 6, .name = "libA", .detail = "/y/libA"});
     first.finalize();
     second.finalize();
     const auto unowned = [](const HXMemoryObject &object) {
@@ -236,8 +205,6 @@ TEST_F(HXMemoryObjectTest, CategoriesAddUpDifferentObjectsAndCountRegionsOnce) {
     };
 
     HXMemoryCategory category(HXSegmentData, false);
-    EXPECT_EQ(category.totalRegions(), 0);
-    EXPECT_TRUE(category.name().isEmpty());
     const HXMemoryObject::View copy = first.copy();
     for (const auto &view : {unowned(first), unowned(second), unowned(first), copy, copy})
         category.addMemoryObject(view);
@@ -245,9 +212,7 @@ TEST_F(HXMemoryObjectTest, CategoriesAddUpDifferentObjectsAndCountRegionsOnce) {
     EXPECT_EQ(category.totalWiredSize(), 2 * kPage);
     EXPECT_EQ(category.totalSwappedSize(), 5u);
     EXPECT_EQ(category.totalCleanSize(), 6u);
-    EXPECT_EQ(category.totalReclaimableSize(), 7u);
     EXPECT_EQ(category.totalRegions(), 3);
-    EXPECT_EQ(category.fullName(), "libA /x/libA");
 
     for (const bool summarize : {true, false}) {
         HXCategoryMap map;
@@ -256,10 +221,6 @@ TEST_F(HXMemoryObjectTest, CategoriesAddUpDifferentObjectsAndCountRegionsOnce) {
         ASSERT_EQ(map.entries().size(), summarize ? 1u : 2u);
         const HXMemoryCategory &one = *map.entries()[0].category;
         EXPECT_EQ(map.entries()[0].key, summarize ? "libA" : "libA /x/libA");
-        EXPECT_EQ(one.fullName(), map.entries()[0].key);
-        EXPECT_EQ(static_cast<bool>(one.detailedName()), !summarize);
-        EXPECT_EQ(map.get(map.entries()[0].key), &one);
-        EXPECT_EQ(map.get("nothing"), nullptr);
         EXPECT_EQ(one.totalRegions(), summarize ? 3 : 2);
     }
 }

@@ -16,17 +16,12 @@ TEST(HXOutputFormatterTextTest, WritesSizesInTheChosenFormat) {
         const char *bytes, *formatted, *pages;
     } cases[] = {
         {0, "0 B", "0 B", "0 pages"},
-        {1, "1 B", "1 B", "1 pages"},
-        {9999, "9999 B", "9999 B", "1 pages"},
         {10000, "10000 B", "10 KB", "1 pages"},
         {16384, "16384 B", "16 KB", "1 pages"},
         {16385, "16385 B", "16 KB", "2 pages"},
-        {1234567, "1234567 B", "1206 KB", "76 pages"},
         {10239487, "10239487 B", "9999 KB", "625 pages"}, // 9999.499 KB
         {10239488, "10239488 B", "10 MB", "625 pages"},   // 9999.5 KB would need five digits
-        {10485760, "10485760 B", "10 MB", "640 pages"},
         {uint64_t{1} << 40, "1099511627776 B", "1024 GB", "67108864 pages"},
-        {uint64_t{1} << 60, "1152921504606846976 B", "1024 PB", "70368744177664 pages"},
     };
     const HXMadeUpProcess process(1, "p");
     for (const int32_t format : {HXFormatBytes, HXFormatFormatted, HXFormatPages}) {
@@ -44,10 +39,7 @@ TEST(HXOutputFormatterTextTest, ShortensPathsUnlessWide) {
     const HXBarePlatform platform;
     const char *cases[][2] = {
         {"/usr/lib/libfoo.dylib", ".../libfoo.dylib"},
-        {"libfoo.dylib", "libfoo.dylib"},
         {"/usr/lib/", ".../lib"},
-        {"/lib", ".../lib"},
-        {"lib/", ".../lib"},
         {"", ""},
         {"/", "/"},
     };
@@ -58,7 +50,6 @@ TEST(HXOutputFormatterTextTest, ShortensPathsUnlessWide) {
         EXPECT_EQ(shortened._truncatedNameForString(text).str(), test[1]);
         EXPECT_EQ(wide._truncatedNameForString(text), text);
     }
-    EXPECT_FALSE(shortened._truncatedNameForString(HXString()));
 }
 
 TEST(HXOutputFormatterTextTest, SortsRowsByEveryColumn) {
@@ -101,8 +92,6 @@ TEST(HXOutputFormatterTextTest, SortsRowsByEveryColumn) {
             order += entry->key;
         EXPECT_EQ(order, test[1]) << test[0]; // ties by key
     }
-    const HXOutputFormatterText unknown(1, 0, "Size");
-    EXPECT_DEATH((void)unknown._sortedKeysForCategories(categories), "Unhandled text sort column");
 }
 
 TEST(HXOutputFormatterTextTest, PrintsAWholeReport) {
@@ -163,24 +152,6 @@ Summary Heft: 320 KB
     0 B      32 KB          0 B          1    __TEXT
     ---        ---          ---        ---    ---
  320 KB     128 KB          0 B          6    TOTAL
-
-)"[1]);
-}
-
-TEST(HXOutputFormatterTextTest, PrintsPagesWithOptionalColumns) {
-    const HXRun result =
-        run(kTwoWorkers, {"beta", "-f", "pages", "--wired", "--swapped", "--sort", "category"});
-    EXPECT_EQ(result.out, &R"(
-==========================================================================================
-beta [200]: 32-bit	Heft: 3 pages (16384 bytes per page)
-==========================================================================================
-
-      Dirty     (Swapped)         Clean   Reclaimable       (Wired)    Regions    Category
-        ---           ---           ---           ---           ---        ---    ---
-    1 pages       0 pages       0 pages       0 pages       1 pages          1    MALLOC_LARGE
-    2 pages       0 pages       2 pages       0 pages       0 pages          1    mapped file
-        ---           ---           ---           ---           ---        ---    ---
-    3 pages       0 pages       2 pages       0 pages       1 pages          2    TOTAL
 
 )"[1]);
 }
@@ -255,7 +226,6 @@ TEST(HXOutputFormatterTextTest, ListsRegionsOfEveryKind) {
     std::string wide = narrow;
     wide.insert(wide.find("     CLN"), "     SWP").insert(wide.find("   tag"), "    WIRE");
     wide.insert(wide.find("   ------------"), "   -----   -----");
-    const std::string titles[] = {narrow, wide};
     for (const auto &test : cases) {
         regions.push_back(makeRegion(test.facts));
         narrow += std::string(test.narrow) + "\n";
@@ -271,13 +241,11 @@ TEST(HXOutputFormatterTextTest, ListsRegionsOfEveryKind) {
     };
     EXPECT_EQ(listing(0, regions), narrow + "\n");
     EXPECT_EQ(listing(HXTextWired | HXTextSwapped | HXTextWide, regions), wide + "\n");
-    EXPECT_EQ(listing(0, {}), titles[0] + "\n");
-    EXPECT_EQ(listing(HXTextWired | HXTextSwapped, {}), titles[1] + "\n");
 }
 
 // Twenty processes are named, twenty-one are only counted.
 TEST(HXOutputFormatterTextTest, NamesTheMembersOfSmallGroups) {
-    for (const int count : {2, 3, 20, 21}) {
+    for (const int count : {3, 20, 21}) {
         std::string machine, names;
         for (int pid = 1; pid <= count; pid++) {
             machine += "process  pid=" + std::to_string(pid + 10) + "  name=p\n" +

