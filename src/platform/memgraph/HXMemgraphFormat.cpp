@@ -4,7 +4,7 @@
 
 namespace {
 
-using F = HXFieldSpec;
+using F = HXFieldForm;
 using K = HXFieldKind;
 
 constexpr F regionFields[] = {
@@ -40,7 +40,7 @@ constexpr F processFields[] = {
     F::defaulted("shared_region", K::boolean, 1),
 };
 
-constexpr HXRecordSpec records[] = {{"region", regionFields}, {"process", processFields}};
+constexpr HXRecordForm records[] = {{"region", regionFields}, {"process", processFields}};
 
 static_assert(std::size(regionFields) == HXMemgraphFormat::Region::purgeable + 1);
 static_assert(std::size(processFields) == HXMemgraphFormat::Process::sharedRegion + 1);

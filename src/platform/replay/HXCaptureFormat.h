@@ -24,33 +24,33 @@ enum class HXFieldNeed : uint8_t {
     defaulted, // absent, the field has the default value
 };
 
-struct HXFieldSpec {
+struct HXFieldForm {
     std::string_view name;
     HXFieldKind kind;
     HXFieldNeed need;
     uint64_t defaultValue = 0; // signed values sign-extended
 
-    static constexpr HXFieldSpec required(std::string_view name, HXFieldKind kind) {
+    static constexpr HXFieldForm required(std::string_view name, HXFieldKind kind) {
         return {name, kind, HXFieldNeed::required};
     }
-    static constexpr HXFieldSpec optional(std::string_view name, HXFieldKind kind) {
+    static constexpr HXFieldForm optional(std::string_view name, HXFieldKind kind) {
         return {name, kind, HXFieldNeed::optional};
     }
     // A text's default is always empty.
-    static constexpr HXFieldSpec defaulted(std::string_view name, HXFieldKind kind, uint64_t value = 0) {
+    static constexpr HXFieldForm defaulted(std::string_view name, HXFieldKind kind, uint64_t value = 0) {
         return {name, kind, HXFieldNeed::defaulted, value};
     }
 };
 
-struct HXRecordSpec {
+struct HXRecordForm {
     std::string_view word;
-    std::span<const HXFieldSpec> fields; // at most kMaxCaptureFields
+    std::span<const HXFieldForm> fields; // at most kMaxCaptureFields
 };
 
 struct HXCaptureFormat {
     std::string_view header;        // the first line
     std::string_view headerProblem; // the reason given for any other first line
-    std::span<const HXRecordSpec> records;
+    std::span<const HXRecordForm> records;
 };
 
 inline constexpr size_t kMaxCaptureFields = 32;

@@ -140,20 +140,20 @@ bool HXCaptureReader::parseRecord(std::string_view line) {
     const size_t tab = line.find('\t');
     const std::string_view word = line.substr(0, tab);
     for (_kind = 0; _kind < _format.records.size(); _kind++) {
-        const HXRecordSpec &spec = _format.records[_kind];
-        if (spec.word == word)
-            return parseFields(tab == std::string_view::npos ? std::string_view() : line.substr(tab), spec);
+        const HXRecordForm &form = _format.records[_kind];
+        if (form.word == word)
+            return parseFields(tab == std::string_view::npos ? std::string_view() : line.substr(tab), form);
     }
     return fail("unknown record", word);
 }
 
 // `rest` is empty or begins with the TAB before the first field.
-bool HXCaptureReader::parseFields(std::string_view rest, const HXRecordSpec &spec) {
-    const size_t fieldCount = spec.fields.size();
+bool HXCaptureReader::parseFields(std::string_view rest, const HXRecordForm &form) {
+    const size_t fieldCount = form.fields.size();
     _seen = 0;
     _unescaped.clear();
     for (size_t i = 0; i < fieldCount; i++)
-        _values[i] = {spec.fields[i].defaultValue, {}};
+        _values[i] = {form.fields[i].defaultValue, {}};
 
     size_t field = 0; // fields mostly come in the table's order
     while (!rest.empty()) {
@@ -164,31 +164,31 @@ bool HXCaptureReader::parseFields(std::string_view rest, const HXRecordSpec &spe
         if (equals == std::string_view::npos) return fail("a field without a value:", part);
         const std::string_view name = part.substr(0, equals);
         size_t tries = 0;
-        for (; tries < fieldCount && spec.fields[field].name != name; tries++)
+        for (; tries < fieldCount && form.fields[field].name != name; tries++)
             field = field + 1 == fieldCount ? 0 : field + 1;
         if (tries == fieldCount) return fail("unknown field", name);
         if (has(field)) return fail("twice the field", name);
         _seen |= uint64_t{1} << field;
-        if (!parseValue(spec.fields[field], part.substr(equals + 1), &_values[field])) return false;
+        if (!parseValue(form.fields[field], part.substr(equals + 1), &_values[field])) return false;
     }
     for (size_t i = 0; i < fieldCount; i++)
-        if (spec.fields[i].need == HXFieldNeed::required && !has(i))
-            return fail("missing field", spec.fields[i].name);
+        if (form.fields[i].need == HXFieldNeed::required && !has(i))
+            return fail("missing field", form.fields[i].name);
     return true;
 }
 
-bool HXCaptureReader::parseValue(const HXFieldSpec &spec, std::string_view text, Value *value) {
-    if (spec.kind == HXFieldKind::text) return unescape(spec, text, &value->text);
-    if (spec.kind == HXFieldKind::boolean) {
-        if (text != "0" && text != "1") return fail(std::string(spec.name) + " is not 0 or 1:", text);
+bool HXCaptureReader::parseValue(const HXFieldForm &form, std::string_view text, Value *value) {
+    if (form.kind == HXFieldKind::text) return unescape(form, text, &value->text);
+    if (form.kind == HXFieldKind::boolean) {
+        if (text != "0" && text != "1") return fail(std::string(form.name) + " is not 0 or 1:", text);
         value->number = text == "1";
         return true;
     }
-    if (HXParseNumber(text, spec.kind, &value->number)) return true;
-    return fail(std::string(spec.name) + " is no number of its width:", text);
+    if (HXParseNumber(text, form.kind, &value->number)) return true;
+    return fail(std::string(form.name) + " is no number of its width:", text);
 }
 
-bool HXCaptureReader::unescape(const HXFieldSpec &spec, std::string_view text, std::string_view *result) {
+bool HXCaptureReader::unescape(const HXFieldForm &form, std::string_view text, std::string_view *result) {
     size_t backslash = text.find('\\');
     *result = text;
     if (backslash == std::string_view::npos) return true;
@@ -199,7 +199,7 @@ bool HXCaptureReader::unescape(const HXFieldSpec &spec, std::string_view text, s
         _unescaped += text.substr(0, backslash);
         const char escaped = backslash + 1 < text.size() ? text[backslash + 1] : '\0';
         if (escaped != 't' && escaped != 'n' && escaped != '\\')
-            return fail("a bad escape in " + std::string(spec.name) + ":", text);
+            return fail("a bad escape in " + std::string(form.name) + ":", text);
         _unescaped += escaped == 't' ? '\t' : escaped == 'n' ? '\n' : '\\';
         text.remove_prefix(backslash + 2);
         backslash = text.find('\\');

@@ -65,9 +65,9 @@ class HXCaptureReader {
     bool nextLine(std::string_view *line);
     bool refill();
     bool parseRecord(std::string_view line);
-    bool parseFields(std::string_view rest, const HXRecordSpec &spec);
-    bool parseValue(const HXFieldSpec &spec, std::string_view text, Value *value);
-    bool unescape(const HXFieldSpec &spec, std::string_view text, std::string_view *result);
+    bool parseFields(std::string_view rest, const HXRecordForm &form);
+    bool parseValue(const HXFieldForm &form, std::string_view text, Value *value);
+    bool unescape(const HXFieldForm &form, std::string_view text, std::string_view *result);
 
     const HXCaptureFormat &_format;
     std::FILE *_stream = nullptr; // null when all content is in memory

@@ -30,11 +30,11 @@ class HXCaptureWriter {
     void clear() { _text.clear(); }
 
   private:
-    bool isDefault(const HXFieldSpec &field, uint64_t value) const {
+    bool isDefault(const HXFieldForm &field, uint64_t value) const {
         return field.need == HXFieldNeed::defaulted && field.defaultValue == value;
     }
-    const HXFieldSpec &spec(size_t field) const { return _format.records[_record].fields[field]; }
-    void name(const HXFieldSpec &field);
+    const HXFieldForm &form(size_t field) const { return _format.records[_record].fields[field]; }
+    void name(const HXFieldForm &field);
 
     const HXCaptureFormat &_format;
     size_t _record = 0;

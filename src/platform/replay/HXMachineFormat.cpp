@@ -4,7 +4,7 @@
 
 namespace {
 
-using F = HXFieldSpec;
+using F = HXFieldForm;
 using K = HXFieldKind;
 
 constexpr F regionFields[] = {
@@ -116,7 +116,7 @@ constexpr F hostFields[] = {
     F::defaulted("memory_info_error", K::signed32),
 };
 
-constexpr HXRecordSpec records[] = {
+constexpr HXRecordForm records[] = {
     {"region", regionFields}, {"top", topFields},         {"pages", pagesFields}, {"process", processFields},
     {"image", imageFields},   {"segment", segmentFields}, {"owned", ownedFields}, {"fault", faultFields},
     {"zone", zoneFields},     {"site", siteFields},       {"kext", kextFields},   {"symbol", symbolFields},
