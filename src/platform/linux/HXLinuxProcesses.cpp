@@ -261,9 +261,10 @@ int32_t HXLinuxProcesses::proc_pidinfo(int32_t pid, int32_t flavor, void *buffer
         errno = ESRCH;
         return 0;
     }
-    const uint32_t flags = pid == 0                                           ? PROC_FLAG_SYSTEM
-                           : !stat->isZombie() && is64bit(*stat, directory()) ? PROC_FLAG_LP64
-                                                                              : 0;
+    // A 64-bit program runs on a 64-bit kernel alone.
+    constexpr uint32_t kernelFlags = PROC_FLAG_SYSTEM | (sizeof(void *) == 8 ? PROC_FLAG_LP64 : 0);
+    const bool isWide = pid != 0 && !stat->isZombie() && is64bit(*stat, directory());
+    const uint32_t flags = pid == 0 ? kernelFlags : isWide ? PROC_FLAG_LP64 : 0;
     if (isLong) return answer(bsdInfo(*stat, flags), buffer, bufferBytes);
     return answer(shortInfo(*stat, flags), buffer, bufferBytes);
 }

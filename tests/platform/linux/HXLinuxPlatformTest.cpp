@@ -104,7 +104,7 @@ TEST_F(HXLinuxPlatformTest, ListsAndDescribesProcesses) {
     EXPECT_EQ(info.pbi_flags, PROC_FLAG_LP64);
     ASSERT_EQ(platform.proc_pidinfo(0, 3, 0, &info, sizeof info), 136);
     EXPECT_STREQ(info.pbi_name, "kernel");
-    EXPECT_EQ(info.pbi_flags, PROC_FLAG_SYSTEM);
+    EXPECT_EQ(info.pbi_flags & PROC_FLAG_SYSTEM, PROC_FLAG_SYSTEM);
     for (const int32_t absent : {40, 2, 50, 99, -1}) {
         EXPECT_EQ(platform.proc_pidinfo(absent, 3, 0, &info, sizeof info), 0) << absent;
         EXPECT_EQ(errno, ESRCH) << absent;
