@@ -86,18 +86,20 @@ class HXLinuxKernelMemoryLiveRootTest : public testing::Test {
 };
 
 TEST_F(HXLinuxKernelMemoryLiveRootTest, zonesAndSitesAgreeWithTheKernelsSums) {
-    // Other processes run meanwhile: the best of a few readings counts.
+    // Other processes come and go meanwhile, and the kernel's sums lag: the best of many readings counts.
+    constexpr double tolerance = 0.02;
     double zonesDirty = 1, zonesReclaimable = 1, sites = 1;
-    for (int attempt = 0; attempt < 5; attempt++) {
+    for (int attempt = 0; attempt < 200 && std::max({zonesDirty, zonesReclaimable, sites}) >= tolerance;
+         attempt++) {
         const Reading reading = read();
         zonesDirty = std::min(zonesDirty, deviation(reading.zonesDirtySize, reading.slabUnreclaimableSize));
         zonesReclaimable =
             std::min(zonesReclaimable, deviation(reading.zonesReclaimableSize, reading.slabReclaimableSize));
         sites = std::min(sites, deviation(reading.sitesDirtySize, reading.sitesSumSize));
     }
-    EXPECT_LT(zonesDirty, 0.02);
-    EXPECT_LT(zonesReclaimable, 0.02);
-    EXPECT_LT(sites, 0.02);
+    EXPECT_LT(zonesDirty, tolerance);
+    EXPECT_LT(zonesReclaimable, tolerance);
+    EXPECT_LT(sites, tolerance);
 }
 
 } // namespace
