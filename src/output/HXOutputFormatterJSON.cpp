@@ -47,20 +47,24 @@ void HXOutputFormatterJSON::noteFailure() {
     if (_writeError == 0) _writeError = errno != 0 ? errno : EIO;
 }
 
-void HXOutputFormatterJSON::key(const char *literal) {
+void HXOutputFormatterJSON::separate() {
     if (_needsComma) fputc(',', _stream);
+}
+
+void HXOutputFormatterJSON::key(const char *literal) {
+    separate();
     fputs(literal, _stream);
     _needsComma = false;
 }
 
 void HXOutputFormatterJSON::keyNamed(const std::string &name) {
-    if (_needsComma) fputc(',', _stream);
+    separate();
     fprintf(_stream, "\"%s\":", name.c_str());
     _needsComma = false;
 }
 
 void HXOutputFormatterJSON::open(char bracket) {
-    if (_needsComma) fputc(',', _stream);
+    separate();
     fputc(bracket, _stream);
     _needsComma = false;
 }
@@ -89,7 +93,7 @@ void HXOutputFormatterJSON::texts(const char *literal, const std::vector<std::st
     key(literal);
     open('[');
     for (const std::string &value : values) {
-        if (_needsComma) fputc(',', _stream);
+        separate();
         text(value);
     }
     close(']');
@@ -216,7 +220,7 @@ void HXOutputFormatterJSON::sharedEntry(const SharedEntry &entry) {
     key("\"pids\":");
     open('[');
     for (const int32_t pid : entry.pids) {
-        if (_needsComma) fputc(',', _stream);
+        separate();
         signedNumber(pid);
     }
     close(']');

@@ -48,6 +48,7 @@ class HXOutputFormatterJSON : public HXOutputFormatter {
 
     explicit HXOutputFormatterJSON(std::FILE *stream);
     // The writer's four steps. A key comes with its quotes and colon.
+    void separate(); // the comma before the next key or element, where one is needed
     void key(const char *literal);
     void keyNamed(const std::string &name);
     void open(char bracket);
