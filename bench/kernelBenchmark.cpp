@@ -1,6 +1,6 @@
 // Reading the kernel's own memory record, beside reading the files that it is made from. Needs root.
-#include "platform/linux/HXLinuxKernelFile.h"
 #include "platform/linux/HXLinuxPlatform.h"
+#include "platform/linux/kernel/HXLinuxKernelFile.h"
 
 #include <benchmark/benchmark.h>
 

@@ -1,7 +1,7 @@
 // The parsers: an address space as the kernel prints it, and a machine file.
-#include "platform/linux/HXMapsParser.h"
-#include "platform/linux/HXProcText.h"
-#include "platform/replay/HXMachine.h"
+#include "platform/capture/HXMachine.h"
+#include "platform/linux/procfs/HXMapsParser.h"
+#include "platform/linux/procfs/HXProcText.h"
 
 #include <benchmark/benchmark.h>
 

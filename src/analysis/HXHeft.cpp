@@ -16,21 +16,21 @@ HXHeft::HXHeft(ProcessList processes)
 HXHeft::~HXHeft() = default;
 
 std::unique_ptr<HXDispatchSource> HXHeft::installCancelHandler(std::function<void()> callback) {
-    HXPlatform &platform = HXPlatform::current();
-    if (platform.isatty(1)) return nullptr;
-    auto source = platform.dispatch_source_create(HX_SIGINT);
+    HXServices &services = HXPlatform::current().services();
+    if (services.isatty(1)) return nullptr;
+    auto source = services.dispatch_source_create(HX_SIGINT);
     if (!source) return nullptr;
-    platform.dispatch_source_set_event_handler(*source, std::move(callback));
-    platform.signal(HX_SIGINT, HXSignalDisposition::ignored);
-    platform.dispatch_resume(*source);
+    services.dispatch_source_set_event_handler(*source, std::move(callback));
+    services.signal(HX_SIGINT, HXSignalDisposition::ignored);
+    services.dispatch_resume(*source);
     return source;
 }
 
 void HXHeft::gatherProcesses() {
-    HXPlatform &platform = HXPlatform::current();
-    const HXDispatchQueue queue = platform.dispatch_queue_create(kQueueLabel, QOS_CLASS_UTILITY);
+    HXServices &services = HXPlatform::current().services();
+    const HXDispatchQueue queue = services.dispatch_queue_create(kQueueLabel, QOS_CLASS_UTILITY);
     const std::vector<HXProcess *> ordered = _processesBySortingPidDesc(_processes);
-    platform.dispatch_apply(ordered.size(), queue, [&](size_t i) {
+    services.dispatch_apply(ordered.size(), queue, [&](size_t i) {
         if (!_earlyExit.load(std::memory_order_relaxed)) ordered[i]->gatherData();
     });
 }

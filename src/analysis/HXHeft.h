@@ -3,10 +3,10 @@
 #pragma once
 
 #include "analysis/HXHeftSharingData.h"
-#include "analysis/HXHeftSwitches.h"
+#include "analysis/HXOutputFormatter.h"
+#include "model/HXHeftSwitches.h"
 #include "model/HXMemoryCategory.h"
 #include "model/HXMemoryObject.h"
-#include "output/HXOutputFormatter.h"
 #include "platform/HXPlatform.h"
 #include "process/HXProcess.h"
 

@@ -105,7 +105,7 @@ GroupedObjects groupObjects(const HXHeft &heft, MemberSets &sets) {
 }
 
 void indexGroupByProcess(const HXProcessGroup &group, HXHeftSharingData &sharing) {
-    for (const HXProcess *process : group.processes()) {
+    for (const HXRegionOwner *process : group.processes()) {
         HXHeftSharingData::Groups &groups = sharing.processToProcessGroups[process->pid()];
         if (group.processes().size() == 1)
             groups.insert(groups.begin(), &group);

@@ -1,8 +1,8 @@
 // Who shares what with whom.
 #pragma once
 
-#include "analysis/HXProcessGroup.h"
 #include "model/HXMemoryObject.h"
+#include "model/HXProcessGroup.h"
 
 #include <cstdint>
 #include <deque>

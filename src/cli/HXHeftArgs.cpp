@@ -76,7 +76,7 @@ std::unique_ptr<HXHeftArgs> HXHeftArgs::withArgc(int argc, char *const argv[], H
     const std::vector<HXLongOption> options = parse.options();
     HXOptionScan scan;
     for (bool restart = true;; restart = false) {
-        scan = HXPlatform::current().getopt_long(argc, argv, kShortOptions, options, restart);
+        scan = HXPlatform::current().services().getopt_long(argc, argv, kShortOptions, options, restart);
         if (scan.result == -1) break;
         if (!args->takeOption(scan.result, scan.argument, parse, error)) return nullptr;
     }

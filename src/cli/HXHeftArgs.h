@@ -1,7 +1,7 @@
 // The options of a run, and the choice of the processes that they target.
 #pragma once
 
-#include "process/HXError.h"
+#include "model/HXError.h"
 #include "process/HXProcess.h"
 
 #include <cstdint>

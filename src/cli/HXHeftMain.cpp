@@ -50,15 +50,15 @@ int fileFailed(const std::string &path, int failure) {
 
 // An interrupt from the keyboard ends gathering early, if standard output is no terminal.
 void gatherInterruptibly(HXHeft &heft) {
-    HXPlatform &platform = HXPlatform::current();
+    HXServices &services = HXPlatform::current().services();
     const auto source = HXHeft::installCancelHandler([&heft] {
         heft.cancel();
         fputs("Exiting early due to SIGINT\n", stderr);
     });
     heft.gatherData();
     if (!source) return;
-    platform.dispatch_source_cancel(*source);
-    platform.signal(HX_SIGINT, HXSignalDisposition::byDefault);
+    services.dispatch_source_cancel(*source);
+    services.signal(HX_SIGINT, HXSignalDisposition::byDefault);
 }
 
 } // namespace
@@ -89,7 +89,7 @@ int HXHeftMain(int argc, char *const argv[]) {
         json = HXOutputFormatterJSON::withPath(*args->JSONOutputFile());
         if (!json) return fileFailed(*args->JSONOutputFile(), errno);
         // Whoever reads the text may stop reading: the document is completed all the same.
-        HXPlatform::current().signal(HX_SIGPIPE, HXSignalDisposition::ignored);
+        HXPlatform::current().services().signal(HX_SIGPIPE, HXSignalDisposition::ignored);
     }
 
     HXHeft heft(std::move(*targets));

@@ -45,7 +45,7 @@ bool HXHeftArgs::takeMemgraph(const std::string &path, Memgraphs &memgraphs, HXE
 bool HXHeftArgs::loadMemgraphs(Memgraphs &memgraphs, HXError *error) {
     const std::vector<std::string> descriptions = _potentialTargetProcesses.strings();
     for (const std::string &description : descriptions) {
-        if (!HXPlatform::current().stat(description)) continue;
+        if (!HXPlatform::current().services().stat(description)) continue;
         if (!takeMemgraph(description, memgraphs, error)) return false;
         _potentialTargetProcesses.remove(description);
     }

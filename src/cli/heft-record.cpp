@@ -1,9 +1,9 @@
 // heft-record: writes captures of the live machine.
 #include "model/HXMemoryRegion.h"
 #include "platform/linux/HXLinuxPlatform.h"
-#include "platform/memgraph/HXMemgraphRecorder.h"
-#include "platform/replay/HXMachineRecorder.h"
 #include "process/HXProcess.h"
+#include "record/HXMachineRecorder.h"
+#include "record/HXMemgraphRecorder.h"
 
 #include <cerrno>
 #include <charconv>
@@ -63,14 +63,14 @@ bool parsePid(HXPlatform &host, std::string_view word, int32_t *pid) {
 }
 
 // Writes `path` with `write`, which tells itself what fails; the file appears only when all succeeds.
-int writeFile(HXPlatform &host, const std::string &path, const std::function<bool(std::FILE *)> &write) {
-    std::optional<HXPendingFile> file = host.createPendingFile(path);
+int writeFile(HXServices &services, const std::string &path, const std::function<bool(std::FILE *)> &write) {
+    std::optional<HXPendingFile> file = services.createPendingFile(path);
     if (!file) return fail(path, std::strerror(errno));
     if (!write(file->stream)) {
-        host.discardPendingFile(*file);
+        services.discardPendingFile(*file);
         return 1;
     }
-    return host.commitPendingFile(*file) ? 0 : fail(path, std::strerror(errno));
+    return services.commitPendingFile(*file) ? 0 : fail(path, std::strerror(errno));
 }
 
 int recordMachine(HXPlatform &host, Words words) {
@@ -80,7 +80,7 @@ int recordMachine(HXPlatform &host, Words words) {
     std::vector<int32_t> pids;
     for (size_t i = 1; i < words.size(); i++)
         if (!parsePid(host, words[i], &pids.emplace_back())) return 1;
-    return writeFile(host, path, [&](std::FILE *out) {
+    return writeFile(host.services(), path, [&](std::FILE *out) {
         HXMachineRecorder recorder(host, out, anonymize);
         if (!recorder.record(pids)) {
             fail(path, std::strerror(errno));
@@ -100,7 +100,7 @@ int recordMemgraph(HXPlatform &host, Words words) {
     proc_bsdinfo info{};
     if (host.proc_pidinfo(pid, PROC_PIDTBSDINFO, 0, &info, sizeof info) != int32_t{sizeof info})
         return fail(words[0], std::strerror(errno));
-    return writeFile(host, std::string(words[1]), [&](std::FILE *out) {
+    return writeFile(host.services(), std::string(words[1]), [&](std::FILE *out) {
         HXMemgraphRecorder recorder(
             host, out, [](uint32_t tag) { return HXMemoryRegion::categoryNameForTag(tag).str(); });
         std::string reason;

@@ -28,12 +28,12 @@ int main(int argc, char *argv[]) {
     live.prepareProcess();
     std::string reason;
     static std::unique_ptr<HXMachine> machine;
-    machine = HXMachine::load(live, argv[1], &reason);
+    machine = HXMachine::load(live.services(), argv[1], &reason);
     if (!machine) {
         std::fprintf(stderr, "%s: %s\n", argv[1], reason.c_str());
         return 1;
     }
-    static HXReplayPlatform replay(*machine, live);
+    static HXReplayPlatform replay(*machine, live.services());
     HXPlatform::setCurrent(&replay);
 
     std::vector<char *> arguments = {argv[0]};

@@ -1,7 +1,7 @@
 #include "model/HXMemoryObject.h"
 
-#include "analysis/HXHeftSwitches.h"
-#include "process/HXProcess.h"
+#include "model/HXHeftSwitches.h"
+#include "model/HXRegionOwner.h"
 
 #include <algorithm>
 
@@ -25,7 +25,7 @@ std::span<const HXMemoryObject::ProcessRegion> HXMemoryObject::processMemoryRegi
     return *_processMemoryRegions;
 }
 
-void HXMemoryObject::addRegion(HXMemoryRegion &region, const HXProcess &process) {
+void HXMemoryObject::addRegion(HXMemoryRegion &region, const HXRegionOwner &process) {
     _addRegion(region, process.pageSize(), &process);
 }
 
@@ -33,7 +33,7 @@ void HXMemoryObject::addRegion(HXMemoryRegion &region, uint32_t pageSize) {
     _addRegion(region, pageSize, nullptr);
 }
 
-void HXMemoryObject::_addRegion(HXMemoryRegion &region, uint32_t pageSize, const HXProcess *process) {
+void HXMemoryObject::_addRegion(HXMemoryRegion &region, uint32_t pageSize, const HXRegionOwner *process) {
     HXRequire(!_accurateSizes, "HXMemoryObject addRegion", "!_accurateSizes");
     _memoryRegions.add(&region);
     if (region.object_id() == 0) return; // remembered, but without a share in the sizes
@@ -188,7 +188,7 @@ std::span<const HXMemoryObject::ProcessRegion> HXMemoryObject::regionsOfProcess(
 
 // Each region enters as one whole run: the page runs are gone by now.
 std::unique_ptr<HXMemoryObject> HXMemoryObject::viewOfRegions(std::span<const ProcessRegion> regions,
-                                                              const HXProcess &process) const {
+                                                              const HXRegionOwner &process) const {
     auto view = std::make_unique<HXMemoryObject>();
     view->_ownerPid = _ownerPid;
     view->_index = _index;
@@ -205,7 +205,7 @@ void HXMemoryObject::showAsClean(const HXMemoryObject &whole) {
     _totalCleanSize += whole._totalDirtySize + whole._totalSwappedSize;
 }
 
-HXMemoryObject::View HXMemoryObject::viewForProcess(const HXProcess &process) const {
+HXMemoryObject::View HXMemoryObject::viewForProcess(const HXRegionOwner &process) const {
     const View itself(std::shared_ptr<void>(), this); // not owned
     std::unique_ptr<HXMemoryObject> view;
     if (_processMemoryRegions) {

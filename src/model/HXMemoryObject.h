@@ -12,7 +12,7 @@
 #include <string>
 #include <vector>
 
-class HXProcess;
+class HXRegionOwner;
 
 // The regions of an object, in the order in which they were added. Most objects have one: it takes no
 // allocation.
@@ -74,7 +74,7 @@ class HXMemoryObject {
 
     // Adds a region of a process, or of none in particular. The region's page runs are handed over. Not after
     // finalisation.
-    void addRegion(HXMemoryRegion &region, const HXProcess &process);
+    void addRegion(HXMemoryRegion &region, const HXRegionOwner &process);
     void addRegion(HXMemoryRegion &region, uint32_t pageSize);
 
     // Fixes the sizes. With `useRegionSizes` dirty and swapped are the regions' own, added up; otherwise
@@ -90,7 +90,7 @@ class HXMemoryObject {
     // The part of the object that a process maps, or the whole as clean memory when another process owns it;
     // the object itself where there is no difference. Compare addresses to tell. This object must outlive the
     // view.
-    View viewForProcess(const HXProcess &process) const;
+    View viewForProcess(const HXRegionOwner &process) const;
 
     bool containsFakeRegion() const;
     // Those of the region that names the object.
@@ -101,7 +101,7 @@ class HXMemoryObject {
     const HXMemoryRegion *_canonicalRegion() const;
 
   private:
-    void _addRegion(HXMemoryRegion &region, uint32_t pageSize, const HXProcess *process);
+    void _addRegion(HXMemoryRegion &region, uint32_t pageSize, const HXRegionOwner *process);
     void addRuns(HXMemoryRegion &region, uint32_t pageSize);
     HXMemoryTotal sumOfRuns() const;
     void raiseToLargestProcess();
@@ -112,7 +112,7 @@ class HXMemoryObject {
     void forEachProcess(Each each) const;
     std::span<const ProcessRegion> regionsOfProcess(int32_t pid) const;
     std::unique_ptr<HXMemoryObject> viewOfRegions(std::span<const ProcessRegion> regions,
-                                                  const HXProcess &process) const;
+                                                  const HXRegionOwner &process) const;
     void showAsClean(const HXMemoryObject &whole);
 
     uint64_t _totalDirtySize = 0;

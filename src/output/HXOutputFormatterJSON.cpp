@@ -1,6 +1,6 @@
 #include "output/HXOutputFormatterJSON.h"
 
-#include "analysis/HXHeftSwitches.h"
+#include "model/HXHeftSwitches.h"
 #include "platform/HXPlatform.h"
 
 #include <cerrno>
@@ -20,7 +20,7 @@ std::string escaped(const std::string &text) {
 } // namespace
 
 std::unique_ptr<HXOutputFormatterJSON> HXOutputFormatterJSON::withPath(const std::string &path) {
-    std::FILE *stream = HXPlatform::current().fopen(path, "w+");
+    std::FILE *stream = HXPlatform::current().services().fopen(path, "w+");
     if (!stream) return nullptr;
     return std::unique_ptr<HXOutputFormatterJSON>(new HXOutputFormatterJSON(stream));
 }
@@ -168,7 +168,7 @@ void HXOutputFormatterJSON::printSharedCategories(const std::shared_ptr<const HX
     // Groups reach the report frozen: equal groups are the same group.
     if (!hasProcessView && !_addedProcessGroups.insert(&group).second) return;
     SharedEntry entry{.pids = {}, .categories = categories, .specificToPid = std::nullopt};
-    for (const HXProcess *member : group.processes())
+    for (const HXRegionOwner *member : group.processes())
         entry.pids.push_back(member->asNumber());
     if (hasProcessView) entry.specificToPid = process.asNumber();
     _shared.push_back(std::move(entry));

@@ -1,7 +1,7 @@
 // The report as one JSON document without white space, written to a file as it arrives.
 #pragma once
 
-#include "output/HXOutputFormatter.h"
+#include "analysis/HXOutputFormatter.h"
 
 #include <cstdio>
 #include <optional>

@@ -1,6 +1,6 @@
 #include "output/HXOutputFormatterText.h"
 
-#include "analysis/HXHeftSwitches.h"
+#include "model/HXHeftSwitches.h"
 #include "platform/HXInternalError.h"
 #include "platform/HXPlatform.h"
 
@@ -216,7 +216,7 @@ void HXOutputFormatterText::printSharedCategories(const std::shared_ptr<const HX
     if (members <= mostNamed) {
         fputs("Shared with", _output);
         size_t printed = 0;
-        for (const HXProcess *member : group.processes()) {
+        for (const HXRegionOwner *member : group.processes()) {
             if (member->isEqual(process)) continue;
             fprintf(_output, " %s", member->displayString().c_str());
             if (++printed < members - 1) fputc(',', _output);

@@ -1,7 +1,7 @@
 // The report as text.
 #pragma once
 
-#include "output/HXOutputFormatter.h"
+#include "analysis/HXOutputFormatter.h"
 
 #include <cstdio>
 

@@ -2,10 +2,7 @@
 
 #include "platform/HXInternalError.h"
 
-namespace {
-HXPlatform *currentPlatform = nullptr;
-uint64_t currentGeneration = 0;
-} // namespace
+static HXPlatform *currentPlatform = nullptr;
 
 HXPlatform &HXPlatform::current() {
     HXRequire(currentPlatform != nullptr, "HXPlatform current", "a platform was set");
@@ -14,17 +11,6 @@ HXPlatform &HXPlatform::current() {
 
 void HXPlatform::setCurrent(HXPlatform *platform) {
     currentPlatform = platform;
-    currentGeneration++;
-}
-
-uint64_t HXPlatform::generation() {
-    return currentGeneration;
-}
-
-std::optional<std::string> HXPlatform::readFileStart(const std::string &path, size_t bytes) {
-    auto content = readFile(path, UINT64_MAX);
-    if (content && content->size() > bytes) content->resize(bytes);
-    return content;
 }
 
 std::string HXPlatform::hostDescription() {

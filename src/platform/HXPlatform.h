@@ -8,52 +8,25 @@
 #pragma once
 
 #include "platform/HXHostRecords.h"
+#include "platform/HXRegionTags.h"
+#include "platform/HXServices.h"
 
+#include <atomic>
 #include <cstdint>
-#include <cstdio>
 #include <functional>
-#include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
 
-// One entry of the option table given to `getopt_long`.
-struct HXLongOption {
-    const char *name; // may be empty: such an option has no long form
-    bool hasArgument;
-    int *flag; // when not null, set to `value` and `getopt_long` returns 0
-    int value;
-};
-
-// The scanner's state after a step of `getopt_long`.
-struct HXOptionScan {
-    int result = 0;                 // the option's value, 0, '?' or ':'; -1 at the end
-    const char *argument = nullptr; // the option's argument, if it has one
-    int index = 1;                  // at the end: the index of the first argument that is no option
-};
-
-// A concurrent work queue; made by `dispatch_queue_create`.
-struct HXDispatchQueue {
-    std::string label;
-    uint32_t qualityOfService = 0;
-};
-inline constexpr uint32_t QOS_CLASS_UTILITY = 0x11;
-
-// A source of signal events, live until `dispatch_source_cancel`.
-class HXDispatchSource {
-  public:
-    virtual ~HXDispatchSource() = default;
-};
-
-enum class HXSignalDisposition { byDefault, ignored };
-inline constexpr int HX_SIGINT = 2;
-inline constexpr int HX_SIGPIPE = 13;
-
-// A file written beside its final place, readable by its owner alone, and renamed when it is complete.
-struct HXPendingFile {
-    std::FILE *stream = nullptr; // owned by the platform until commit or discard
-    std::string path;
-    std::string temporaryPath;
+// Answers of a host that hold for the whole run, kept by those who asked.
+struct HXHostCache {
+    // "vm.self_region_heft": 0 or 1; −1 while it must be asked for.
+    std::atomic<int32_t> selfRegionHeft = -1;
+    // Where "page_table" stands in every task's ledger (−1: nowhere), and of how many entries.
+    std::once_flag ledgerTemplate;
+    int64_t pageTableIndex = -1;
+    int64_t ledgerEntryCount = 0;
 };
 
 class HXPlatform {
@@ -64,11 +37,8 @@ class HXPlatform {
     // and keeps the platform alive while it is current. `current` without one is an internal error.
     static HXPlatform &current();
     static void setCurrent(HXPlatform *platform);
-    // Counts the calls of `setCurrent`: what is cached of a platform holds while this stays the same.
-    static uint64_t generation();
 
-    // ---- Tasks and virtual memory
-    // -------------------------------------------------------------------------------
+    // Tasks and virtual memory.
 
     // The program's own task.
     virtual mach_port_t mach_task_self() = 0;
@@ -122,9 +92,7 @@ class HXPlatform {
     // The kernel's text for an error; never null, lives for ever.
     const char *mach_error_string(kern_return_t error);
 
-    // ---- Processes
-    // ---------------------------------------------------------------------------------------------- These
-    // answer −1 with errno set when they fail, unless they say otherwise.
+    // Processes. These answer −1 with errno set when they fail, unless they say otherwise.
 
     // Fills `pids` with the pids of all processes, as many as there is room for, and answers how many were
     // filled. With a null buffer: how many there are about. Kernel threads are no processes; the kernel
@@ -168,8 +136,7 @@ class HXPlatform {
     // entries filled. 0 on success.
     virtual int32_t ledger(int32_t command, int32_t pid, void *buffer, int64_t *count) = 0;
 
-    // ---- Images and symbols
-    // -------------------------------------------------------------------------------------
+    // Images and symbols.
 
     virtual uint32_t RVSymbolicatorGetFlagsForNoSymbolOrSourceInfoData() { return 0; }
     virtual uint32_t RVSymbolicatorGetFlagsForNListOnlyData() { return 0; }
@@ -195,8 +162,7 @@ class HXPlatform {
     // Releases a symbolicator; null is allowed.
     virtual void RVRelease(RVSymbolicator *symbolicator) = 0;
 
-    // ---- The kernel's own memory
-    // --------------------------------------------------------------------------------
+    // The kernel's own memory.
 
     virtual mach_port_t mach_host_self() = 0;
 
@@ -213,8 +179,7 @@ class HXPlatform {
     // All loaded kernel extensions.
     virtual std::vector<OSKextInfo> OSKextCopyLoadedKextInfo() = 0;
 
-    // ---- Region types
-    // -------------------------------------------------------------------------------------------
+    // Region types.
 
     // What the host calls memory of a user tag that the program has no name for; none when it has no name
     // either.
@@ -223,60 +188,15 @@ class HXPlatform {
                                                                                       int32_t protection,
                                                                                       uint8_t pager) = 0;
 
-    // ---- Command line, files, streams
-    // --------------------------------------------------------------------------- These are the real
-    // machine's on every platform, a replayed one included.
+    // The names that programs gave their memory, on this host and in memory graphs read beside it.
+    HXNamedTags &namedTags() { return _namedTags; }
+    const HXNamedTags &namedTags() const { return _namedTags; }
+    HXHostCache &cache() { return _cache; }
 
-    // One step of the option scanner, as getopt_long(3) does it: `shortOptions` in its notation; a first call
-    // with `restart` begins at the argument after the program's name. Options and other arguments may mix;
-    // the others are moved behind. What is wrong with an option is printed to standard error. Main thread
-    // only.
-    virtual HXOptionScan getopt_long(int argc, char *const argv[], const char *shortOptions,
-                                     const std::vector<HXLongOption> &options, bool restart) = 0;
+    // The real machine's, on every platform, a replayed one included. Lives as long as the platform.
+    virtual HXServices &services() = 0;
 
-    // Whether a file system object exists at `path`; links are followed.
-    virtual bool stat(const std::string &path) = 0;
-
-    // fopen(3): a stream, which the caller closes with std::fclose, or null with errno set.
-    virtual std::FILE *fopen(const std::string &path, const char *mode) = 0;
-
-    // The whole content of a file that exists when the call begins; none with errno set when it cannot be
-    // read or is longer than `limit` bytes (EFBIG). Never waits on a fifo or a device (EINVAL).
-    virtual std::optional<std::string> readFile(const std::string &path, uint64_t limit) = 0;
-    // The first `bytes` of such a file, or all of a shorter one.
-    virtual std::optional<std::string> readFileStart(const std::string &path, size_t bytes);
-
-    // Begins a file that becomes visible at `path` only as a whole; none with errno set.
-    virtual std::optional<HXPendingFile> createPendingFile(const std::string &path) = 0;
-    // Closes and renames it; false with errno set (the temporary file is then removed).
-    virtual bool commitPendingFile(HXPendingFile &file) = 0;
-    // Closes and removes it.
-    virtual void discardPendingFile(HXPendingFile &file) = 0;
-
-    // Whether the stream of that descriptor (1: standard output) is a terminal.
-    virtual bool isatty(int descriptor) = 0;
-
-    // ---- Work queues and signals
-    // -------------------------------------------------------------------------------- These are the real
-    // machine's on every platform, too.
-
-    virtual HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) = 0;
-
-    // Calls `work` with 0 … iterations − 1, starting them in that order, several at once; returns when all
-    // have returned.
-    virtual void dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
-                                const std::function<void(size_t)> &work) = 0;
-
-    // A source of events for a signal, not yet running; null when there can be none. From here until `signal`
-    // sets the disposition anew the signal reaches no other thread.
-    virtual std::unique_ptr<HXDispatchSource> dispatch_source_create(int signal) = 0;
-    virtual void dispatch_source_set_event_handler(HXDispatchSource &source,
-                                                   std::function<void()> handler) = 0;
-    virtual void dispatch_resume(HXDispatchSource &source) = 0;
-    // No handler runs after this has returned.
-    virtual void dispatch_source_cancel(HXDispatchSource &source) = 0;
-
-    // Sets a signal's disposition. A signal that came between `dispatch_source_cancel` and this call is not
-    // lost.
-    virtual void signal(int signal, HXSignalDisposition disposition) = 0;
+  private:
+    HXNamedTags _namedTags;
+    HXHostCache _cache;
 };

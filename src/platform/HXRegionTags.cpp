@@ -9,11 +9,6 @@ std::optional<std::string_view> HXHostTagName(uint32_t tag) {
     return names[tag - HXHostTagHeap];
 }
 
-HXNamedTags &HXNamedTags::shared() {
-    static HXNamedTags tags;
-    return tags;
-}
-
 std::optional<uint32_t> HXNamedTags::tagForName(std::string_view name) {
     const std::lock_guard lock(_mutex);
     const auto found = _tags.find(name);
@@ -29,10 +24,4 @@ std::optional<std::string> HXNamedTags::nameForTag(uint32_t tag) const {
     const std::lock_guard lock(_mutex);
     if (tag < HXHostTagFirstNamed || tag - HXHostTagFirstNamed >= _names.size()) return std::nullopt;
     return _names[tag - HXHostTagFirstNamed];
-}
-
-void HXNamedTags::clear() {
-    const std::lock_guard lock(_mutex);
-    _tags.clear();
-    _names.clear();
 }

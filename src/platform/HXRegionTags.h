@@ -29,18 +29,13 @@ enum HXHostTag : uint32_t {
 std::optional<std::string_view> HXHostTagName(uint32_t tag);
 
 // The tags 110 to 239, given to the names by which programs call their memory in the order in which the names
-// appear in a run. One table serves the live host, a replayed one and memory graphs, so that a tag means one
-// name.
+// appear in a run.
 class HXNamedTags {
   public:
-    static HXNamedTags &shared();
-
     // The tag of `name` (safe text), taking a free one for a new name; none when all are taken.
     std::optional<uint32_t> tagForName(std::string_view name);
     // The name that was given `tag`; none when the tag is free.
     std::optional<std::string> nameForTag(uint32_t tag) const;
-    // Forgets all names. For tests.
-    void clear();
 
   private:
     mutable std::mutex _mutex;

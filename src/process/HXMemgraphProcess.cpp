@@ -38,9 +38,9 @@ std::unique_ptr<HXMemgraphProcess> HXMemgraphProcess::processWithMemgraph(const 
 bool HXMemgraphProcess::initWithMemgraph(const std::string &path, HXError *error) {
     if (error) *error = HXError();
     // What does not begin as a graph is not read on: it may be a core dump or a disk image.
-    auto data = HXPlatform::current().readFileStart(path, GXProcessObjectGraph::header.size());
+    auto data = HXPlatform::current().services().readFileStart(path, GXProcessObjectGraph::header.size());
     if (data && *data == GXProcessObjectGraph::header)
-        data = HXPlatform::current().readFile(path, kLongestFile);
+        data = HXPlatform::current().services().readFile(path, kLongestFile);
     if (!data) {
         const int failure = errno;
         if (error)
@@ -49,7 +49,7 @@ bool HXMemgraphProcess::initWithMemgraph(const std::string &path, HXError *error
         return false;
     }
     std::string reason;
-    _graph = GXProcessObjectGraph::directedGraphWithData(*data, &reason);
+    _graph = GXProcessObjectGraph::directedGraphWithData(*data, HXPlatform::current().namedTags(), &reason);
     if (!_graph)
         return fail(error, initializationFailed,
                     reason.empty() ? "memgraph initialization failed with unknown error" : reason.c_str());

@@ -2,8 +2,8 @@
 // goes through the pipeline of a live process; only the sources of the data differ.
 #pragma once
 
-#include "platform/memgraph/GXProcessObjectGraph.h"
-#include "process/HXError.h"
+#include "model/HXError.h"
+#include "platform/capture/GXProcessObjectGraph.h"
 #include "process/HXUserProcess.h"
 
 #include <memory>

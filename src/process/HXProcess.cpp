@@ -1,6 +1,6 @@
 #include "process/HXProcess.h"
 
-#include "analysis/HXHeftSwitches.h"
+#include "model/HXHeftSwitches.h"
 #include "platform/HXPlatform.h"
 #include "process/HXKernelProcess.h"
 #include "process/HXUserProcess.h"
@@ -82,12 +82,12 @@ std::unique_ptr<HXProcess> HXProcess::processWithPid(int32_t pid) {
 }
 
 bool HXProcess::initWithBsdInfo(const proc_bsdinfo &info) {
-    _pid = info.pbi_pid;
+    setPid(info.pbi_pid);
     _is64bit = (info.pbi_flags & PROC_FLAG_LP64) != 0;
     if (!_populateTask()) return false;
     _name = _nameForBsdInfo(info);
-    _displayString = _name + " [" + std::to_string(_pid) + "]";
-    _pageSize = _gatherPageSize();
+    _displayString = _name + " [" + std::to_string(pid()) + "]";
+    setPageSize(_gatherPageSize());
     return true;
 }
 
@@ -97,10 +97,6 @@ uint32_t HXProcess::_gatherPageSize() {
 
 bool HXProcess::breakDownPhysHeft() const {
     return HXHeftSwitches::breakDownPhysHeft();
-}
-
-std::string HXProcess::description() const {
-    return "HXProcess[" + std::to_string(_pid) + "]";
 }
 
 void HXProcess::_addGlobalError(std::string error) {

@@ -3,6 +3,7 @@
 
 #include "model/HXAuxData.h"
 #include "model/HXMemoryRegion.h"
+#include "model/HXRegionOwner.h"
 #include "platform/HXHostRecords.h"
 
 #include <cstdint>
@@ -42,15 +43,10 @@ enum HXIdleExitStatus : int32_t {
     HXIdleExitDirty = 3,
 };
 
-// Gathered once by one worker; read afterwards. Records compare and hash by pid.
-class HXProcess {
+// Gathered once by one worker; read afterwards.
+class HXProcess : public HXRegionOwner {
   public:
     using Map = std::map<int32_t, std::unique_ptr<HXProcess>>;
-
-    HXProcess() = default;
-    virtual ~HXProcess() = default;
-    HXProcess(const HXProcess &) = delete;
-    HXProcess &operator=(const HXProcess &) = delete;
 
     // A new record of the right kind, or null when the process cannot be examined (a global error then says
     // why). Main thread only.
@@ -65,8 +61,6 @@ class HXProcess {
     // Fills `memoryRegions`, the figures, errors and warnings. Never fails otherwise.
     virtual void gatherData() {}
 
-    int32_t pid() const { return _pid; }
-    void setPid(int32_t pid) { _pid = pid; }
     bool is64bit() const { return _is64bit; }
     void setIs64bit(bool is64bit) { _is64bit = is64bit; }
     HXIdleExitStatus idleExitStatus() const { return _idleExitStatus; }
@@ -75,33 +69,21 @@ class HXProcess {
     void setHiddenFromDisplay(bool hidden) { _hiddenFromDisplay = hidden; }
     const std::string &name() const { return _name; }
     void setName(std::string_view name) { _name = name; }
-    // How reports name the process: "NAME [PID]".
-    const std::string &displayString() const { return _displayString; }
-    void setDisplayString(std::string_view text) { _displayString = text; }
-    // Bytes in a page of the process, a power of two.
-    uint32_t pageSize() const { return _pageSize; }
-    void setPageSize(uint32_t size) { _pageSize = size; }
     // The regions in the order in which the source found them; empty until gathered.
     const HXMemoryRegionList &memoryRegions() const { return _memoryRegions; }
     HXMemoryRegionList &memoryRegions() { return _memoryRegions; }
     void setMemoryRegions(HXMemoryRegionList regions) { _memoryRegions = std::move(regions); }
 
-    uint64_t hash() const { return static_cast<uint64_t>(static_cast<int64_t>(_pid)); }
-    bool isEqual(const HXProcess &other) const { return _pid == other._pid; }
-    // The pid, as the key in maps of processes.
-    int32_t asNumber() const { return _pid; }
     // A copy, as of now.
     std::vector<std::string> errors() const { return _errors; }
     // The list itself, which may still grow.
     const std::vector<std::string> &warnings() const { return _warnings; }
     bool hasErrors() const { return !_errors.empty(); }
-    // "HXProcess[PID]".
-    std::string description() const;
 
     // The process's auxiliary figures; null when there are none.
     virtual HXAuxTree auxData() const { return std::make_shared<HXAuxDictionary>(); }
-    // Whether dirty sizes of this process's regions are the kernel's charge.
-    virtual bool breakDownPhysHeft() const;
+    // Unless the source of the process says otherwise, the run's mode.
+    bool breakDownPhysHeft() const override;
 
     // ---- The run's list of global errors. Main thread only. ----
     static void _addGlobalError(std::string error);
@@ -137,14 +119,11 @@ class HXProcess {
 
     HXMemoryRegionList _memoryRegions;
     std::string _name;
-    std::string _displayString;
     std::vector<std::string> _errors;
     std::vector<std::string> _warnings;
     HXIdleExitStatus _idleExitStatus = HXIdleExitUnknown;
 
   private:
-    int32_t _pid = 0;
-    uint32_t _pageSize = 0;
     bool _is64bit = false;
     bool _hiddenFromDisplay = false;
 };

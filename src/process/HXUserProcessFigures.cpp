@@ -4,52 +4,26 @@
 
 #include <cerrno>
 #include <cstring>
-#include <mutex>
 #include <system_error>
 
 namespace {
 
-// Where "page_table" stands among the entries of every task's ledger.
-struct LedgerPosition {
-    int64_t index = -1; // −1: the kernel keeps no such entry
-    int64_t count = 0;
-};
-
-LedgerPosition findLedgerPosition() {
+// Asks where "page_table" stands among the entries of every task's ledger.
+void findLedgerPosition(HXPlatform &platform, HXHostCache &cache) {
     std::vector<ledger_template_info> entries;
     int64_t count = 0;
-    int64_t n = 40;
-    for (;; n *= 2) {
-        entries.resize(static_cast<size_t>(2 * n));
-        count = 2 * n;
-        if (HXPlatform::current().ledger(LEDGER_TEMPLATE_INFO, 0, entries.data(), &count) < 0) {
-            std::perror("Unable to retrieve ledger template info");
-            return {};
-        }
-        if (count < 2 * n) break; // a full buffer may not hold the whole template
+    for (int64_t room = 80;; room *= 2) {
+        entries.resize(static_cast<size_t>(room));
+        count = room;
+        if (platform.ledger(LEDGER_TEMPLATE_INFO, 0, entries.data(), &count) < 0)
+            return std::perror("Unable to retrieve ledger template info");
+        if (count < room) break; // a full buffer may not hold the whole template
     }
-    LedgerPosition position{.count = count};
-    for (int64_t i = 0; i < count; i++) {
+    cache.ledgerEntryCount = count;
+    for (int64_t i = 0; i < count && cache.pageTableIndex < 0; i++) {
         const ledger_template_info &entry = entries[static_cast<size_t>(i)];
-        if (strncmp(entry.lti_name, "page_table", sizeof entry.lti_name) == 0) {
-            position.index = i;
-            break;
-        }
+        if (strncmp(entry.lti_name, "page_table", sizeof entry.lti_name) == 0) cache.pageTableIndex = i;
     }
-    return position;
-}
-
-// Kept once for each host: a run has one, tests have several.
-LedgerPosition ledgerPosition() {
-    static std::mutex mutex;
-    static uint64_t host = 0;
-    static LedgerPosition position;
-    const std::lock_guard lock(mutex);
-    if (host != HXPlatform::generation()) {
-        position = findLedgerPosition();
-        host = HXPlatform::generation();
-    }
-    return position;
 }
 
 } // namespace
@@ -64,14 +38,16 @@ void HXUserProcess::_gatherPhysHeft() {
 
 void HXUserProcess::_gatherLedgers() {
     if (!breakDownPhysHeft() || !_isAlive()) return;
-    const LedgerPosition position = ledgerPosition();
-    if (position.index < 0) return;
-    std::vector<ledger_entry_info> entries(static_cast<size_t>(position.count));
-    int64_t count = position.count;
-    if (HXPlatform::current().ledger(LEDGER_ENTRY_INFO, pid(), entries.data(), &count) < 0)
+    HXPlatform &platform = HXPlatform::current();
+    HXHostCache &cache = platform.cache();
+    std::call_once(cache.ledgerTemplate, [&] { findLedgerPosition(platform, cache); });
+    if (cache.pageTableIndex < 0) return;
+    int64_t count = cache.ledgerEntryCount;
+    std::vector<ledger_entry_info> entries(static_cast<size_t>(count));
+    if (platform.ledger(LEDGER_ENTRY_INFO, pid(), entries.data(), &count) < 0)
         return _addErrnoWarningWithDescription("Unable to retrieve ledger entry info");
-    if (position.index >= count) return; // a reply shorter than the template tells nothing
-    const int64_t balance = entries[static_cast<size_t>(position.index)].lei_balance;
+    if (cache.pageTableIndex >= count) return; // a reply shorter than the template tells nothing
+    const int64_t balance = entries[static_cast<size_t>(cache.pageTableIndex)].lei_balance;
     _ledgers[0] = balance > 0 ? static_cast<uint64_t>(balance) : 0;
 }
 

@@ -1,5 +1,5 @@
 // From the walk to the list of regions.
-#include "analysis/HXHeftSwitches.h"
+#include "model/HXHeftSwitches.h"
 #include "platform/HXPlatform.h"
 #include "process/HXUserProcess.h"
 

@@ -51,7 +51,7 @@ Groups groupsOf(const HXHeftSharingData &sharing, int32_t pid) {
     Groups groups;
     for (const HXProcessGroup *group : *sharing.groupsOfProcess(pid)) {
         groups.emplace_back();
-        for (const HXProcess *member : group->processes())
+        for (const HXRegionOwner *member : group->processes())
             groups.back().push_back(member->pid());
     }
     return groups;

@@ -1,6 +1,6 @@
 // Fuzz target: any bytes as a machine file, and all questions to the machine that they make.
 #include "platform/HXRegionTags.h"
-#include "platform/linux/HXLinuxPlatform.h"
+#include "platform/linux/HXLinuxServices.h"
 #include "platform/replay/HXReplayPlatform.h"
 
 #include <cstdlib>
@@ -65,9 +65,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     std::string reason;
     const auto machine = HXMachine::loadText({reinterpret_cast<const char *>(data), size}, &reason);
     require((machine != nullptr) == reason.empty());
-    HXNamedTags::shared().clear();
     if (!machine) return 0;
-    static HXLinuxPlatform services; // never asked
+    static HXLinuxServices services; // never asked
     HXReplayPlatform host(*machine, services);
     int32_t pids[16];
     const int32_t count = host.proc_listallpids(pids, sizeof pids);

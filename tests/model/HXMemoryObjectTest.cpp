@@ -2,7 +2,7 @@
 #include "support/HXBarePlatform.h"
 #include "support/HXBuilders.h"
 
-#include "analysis/HXHeftSwitches.h"
+#include "model/HXHeftSwitches.h"
 
 #include <gtest/gtest.h>
 

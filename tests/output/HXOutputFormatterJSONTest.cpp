@@ -5,7 +5,7 @@
 #include "support/HXRun.h"
 #include "support/HXTwoWorkers.h"
 
-#include "analysis/HXHeftSwitches.h"
+#include "model/HXHeftSwitches.h"
 
 #include <cerrno>
 #include <filesystem>

@@ -1,7 +1,7 @@
 // Gathering of live processes, over made-up machines.
 #include "process/HXUserProcess.h"
 
-#include "analysis/HXHeftSwitches.h"
+#include "model/HXHeftSwitches.h"
 #include "support/HXBuilders.h"
 #include "support/HXMadeUpMachine.h"
 #include "support/HXRun.h"

@@ -11,13 +11,13 @@ HXMadeUpParts::HXMadeUpParts(const std::string &text) {
         file += isTab ? '\t' : text[i];
         i += isTab;
     }
-    services.setWorkerCount(3);
+    realServices.setWorkerCount(3);
     machine = HXMachine::loadText(file, &reason);
     if (!machine) throw std::runtime_error("bad machine file: " + reason);
 }
 
 HXMadeUpMachine::HXMadeUpMachine(const std::string &text)
-    : HXMadeUpParts(text), HXReplayPlatform(*machine, services) {
+    : HXMadeUpParts(text), HXReplayPlatform(*machine, realServices) {
     setCurrent(this);
     HXProcess::_clearGlobalErrors();
 }

@@ -1,7 +1,7 @@
 // A machine made up as text, with the real machine's command line, files, queues and signals.
 #pragma once
 
-#include "platform/linux/HXLinuxPlatform.h"
+#include "platform/linux/HXLinuxServices.h"
 #include "platform/replay/HXReplayPlatform.h"
 
 #include <memory>
@@ -9,7 +9,7 @@
 
 struct HXMadeUpParts {
     explicit HXMadeUpParts(const std::string &text);
-    HXLinuxPlatform services;
+    HXLinuxServices realServices;
     std::unique_ptr<const HXMachine> machine;
 };
 

@@ -3,8 +3,6 @@
 
 #include "platform/HXRegionTags.h"
 #include "platform/HXSafeText.h"
-#include "platform/linux/HXLinuxDispatch.h"
-#include "platform/linux/HXLinuxFiles.h"
 
 #include <fcntl.h>
 #include <malloc.h>
@@ -52,7 +50,7 @@ int32_t failed(int error) {
 
 HXLinuxPlatform::HXLinuxPlatform(const Setting &setting)
     : _pageSize(machinePageSize()), _fileSystems(setting.sharedMemoryDevice),
-      _machine(setting.procPath), _readerSetting{&_fileSystems, &_machine,
+      _machine(setting.procPath), _readerSetting{&_fileSystems, &_machine, &namedTags(),
                                                  static_cast<uint32_t>(std::countr_zero(_pageSize)),
                                                  setting.mayScanPageTables},
       _imageHeaders(_fileSystems, _pageSize), _processes(setting.procPath),
@@ -210,81 +208,5 @@ std::optional<std::string>
 HXLinuxPlatform::GXRegionTypeDescriptionForTagShareProtAndPager(uint32_t tag, uint8_t, int32_t, uint8_t) {
     const auto name = HXHostTagName(tag);
     if (name) return std::string(*name);
-    return HXNamedTags::shared().nameForTag(tag);
-}
-
-// ---- Command line, files, streams
-
-HXOptionScan HXLinuxPlatform::getopt_long(int argc, char *const argv[], const char *shortOptions,
-                                          const std::vector<HXLongOption> &options, bool restart) {
-    return HXScanOption(argc, argv, shortOptions, options, restart);
-}
-
-bool HXLinuxPlatform::stat(const std::string &path) {
-    struct ::stat status;
-    return ::stat(path.c_str(), &status) == 0;
-}
-
-std::FILE *HXLinuxPlatform::fopen(const std::string &path, const char *mode) {
-    const std::string closedOnExecution = std::string(mode) + "e";
-    return std::fopen(path.c_str(), closedOnExecution.c_str());
-}
-
-std::optional<std::string> HXLinuxPlatform::readFileStart(const std::string &path, size_t bytes) {
-    return HXReadRegularFileStart(path, bytes);
-}
-
-std::optional<std::string> HXLinuxPlatform::readFile(const std::string &path, uint64_t limit) {
-    return HXReadRegularFile(path, limit);
-}
-
-std::optional<HXPendingFile> HXLinuxPlatform::createPendingFile(const std::string &path) {
-    return HXBeginPendingFile(path);
-}
-
-bool HXLinuxPlatform::commitPendingFile(HXPendingFile &file) {
-    return HXCommitPendingFile(file);
-}
-
-void HXLinuxPlatform::discardPendingFile(HXPendingFile &file) {
-    HXDiscardPendingFile(file);
-}
-
-bool HXLinuxPlatform::isatty(int descriptor) {
-    return ::isatty(descriptor) == 1;
-}
-
-// ---- Work queues and signals
-
-HXDispatchQueue HXLinuxPlatform::dispatch_queue_create(const std::string &label, uint32_t qualityOfService) {
-    return {label, qualityOfService};
-}
-
-void HXLinuxPlatform::dispatch_apply(size_t iterations, const HXDispatchQueue &,
-                                     const std::function<void(size_t)> &work) {
-    HXConcurrentLoop(iterations, _workerCount == 0 ? HXUsableProcessorCount() : _workerCount, work);
-}
-
-std::unique_ptr<HXDispatchSource> HXLinuxPlatform::dispatch_source_create(int signal) {
-    return HXSignalSource::create(signal);
-}
-
-void HXLinuxPlatform::dispatch_source_set_event_handler(HXDispatchSource &source,
-                                                        std::function<void()> handler) {
-    static_cast<HXSignalSource &>(source).setHandler(std::move(handler));
-}
-
-void HXLinuxPlatform::dispatch_resume(HXDispatchSource &source) {
-    static_cast<HXSignalSource &>(source).resume();
-}
-
-void HXLinuxPlatform::dispatch_source_cancel(HXDispatchSource &source) {
-    static_cast<HXSignalSource &>(source).cancel();
-}
-
-void HXLinuxPlatform::signal(int signal, HXSignalDisposition disposition) {
-    // To ignore a signal that a source has blocked would throw away one that is pending for it; the block
-    // alone keeps it from acting.
-    if (disposition == HXSignalDisposition::ignored && HXIsSignalBlocked(signal)) return;
-    HXSetSignalDisposition(signal, disposition);
+    return namedTags().nameForTag(tag);
 }

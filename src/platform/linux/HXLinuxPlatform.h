@@ -2,11 +2,12 @@
 #pragma once
 
 #include "platform/HXPlatform.h"
-#include "platform/linux/HXFileSystems.h"
-#include "platform/linux/HXImageHeaders.h"
-#include "platform/linux/HXLinuxKernelMemory.h"
-#include "platform/linux/HXLinuxProcesses.h"
-#include "platform/linux/HXLinuxTask.h"
+#include "platform/linux/HXLinuxServices.h"
+#include "platform/linux/images/HXImageHeaders.h"
+#include "platform/linux/kernel/HXLinuxKernelMemory.h"
+#include "platform/linux/memory/HXFileSystems.h"
+#include "platform/linux/memory/HXLinuxTask.h"
+#include "platform/linux/procfs/HXLinuxProcesses.h"
 
 #include <atomic>
 #include <cstdint>
@@ -30,9 +31,6 @@ class HXLinuxPlatform final : public HXPlatform {
     // Readies the running process for examining thousands of others: as many open files as it may have, and
     // no file of its own on the descriptors of the standard streams, should one be closed. For main.
     static void prepareProcess();
-
-    // How many workers `dispatch_apply` has; 0: one for each usable processor.
-    void setWorkerCount(size_t count) { _workerCount = count; }
 
     mach_port_t mach_task_self() override;
     kern_return_t task_for_pid(mach_port_t self, int32_t pid, mach_port_t *task) override;
@@ -88,25 +86,7 @@ class HXLinuxPlatform final : public HXPlatform {
                                                                               int32_t protection,
                                                                               uint8_t pager) override;
 
-    HXOptionScan getopt_long(int argc, char *const argv[], const char *shortOptions,
-                             const std::vector<HXLongOption> &options, bool restart) override;
-    bool stat(const std::string &path) override;
-    std::FILE *fopen(const std::string &path, const char *mode) override;
-    std::optional<std::string> readFile(const std::string &path, uint64_t limit) override;
-    std::optional<std::string> readFileStart(const std::string &path, size_t bytes) override;
-    std::optional<HXPendingFile> createPendingFile(const std::string &path) override;
-    bool commitPendingFile(HXPendingFile &file) override;
-    void discardPendingFile(HXPendingFile &file) override;
-    bool isatty(int descriptor) override;
-
-    HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) override;
-    void dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
-                        const std::function<void(size_t)> &work) override;
-    std::unique_ptr<HXDispatchSource> dispatch_source_create(int signal) override;
-    void dispatch_source_set_event_handler(HXDispatchSource &source, std::function<void()> handler) override;
-    void dispatch_resume(HXDispatchSource &source) override;
-    void dispatch_source_cancel(HXDispatchSource &source) override;
-    void signal(int signal, HXSignalDisposition disposition) override;
+    HXLinuxServices &services() override { return _services; }
 
   private:
     const HXAddressSpace &addressSpaceOf(HXLinuxTask *task);
@@ -124,5 +104,5 @@ class HXLinuxPlatform final : public HXPlatform {
     HXLinuxKernelMemory _kernelMemory;
     HXTaskTable _tasks;
     std::atomic<uint32_t> _reportsCharge = 0; // "vm.self_region_heft"
-    size_t _workerCount = 0;
+    HXLinuxServices _services;
 };

@@ -1,7 +1,7 @@
 // Tasks, their mappings, their pages and their images.
-#include "platform/linux/HXImageLayout.h"
 #include "platform/linux/HXLinuxPlatform.h"
-#include "platform/linux/HXProcFile.h"
+#include "platform/linux/images/HXImageLayout.h"
+#include "platform/linux/procfs/HXProcFile.h"
 
 #include <algorithm>
 #include <cerrno>

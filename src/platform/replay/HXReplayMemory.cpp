@@ -31,8 +31,8 @@ size_t firstEndingAbove(const Mappings &mappings, uint64_t address, size_t hint)
 
 } // namespace
 
-HXReplayPlatform::HXReplayPlatform(const HXMachine &machine, HXPlatform &services)
-    : HXServicesPlatform(services), _machine(machine), _states(machine.processes.size()),
+HXReplayPlatform::HXReplayPlatform(const HXMachine &machine, HXServices &services)
+    : _machine(machine), _services(services), _states(machine.processes.size()),
       _selfRegionHeft(machine.host.selfRegionHeft.value_or(0)) {
     mapNamedTags();
 }
@@ -239,7 +239,7 @@ int32_t HXReplayPlatform::proc_regionfilename(int32_t pid, uint64_t address, cha
 void HXReplayPlatform::mapNamedTags() {
     for (const auto &[tag, name] : _machine.tagNames) {
         if (tag < HXHostTagFirstNamed || tag > HXHostTagLastNamed) continue;
-        const std::optional<uint32_t> own = HXNamedTags::shared().tagForName(name);
+        const std::optional<uint32_t> own = namedTags().tagForName(name);
         _namedTags[tag] = own.value_or(HXHostTagAnonymous);
     }
 }
@@ -255,7 +255,7 @@ uint32_t HXReplayPlatform::hostTag(const HXMachineRegionTraits &traits) const {
 std::optional<std::string>
 HXReplayPlatform::GXRegionTypeDescriptionForTagShareProtAndPager(uint32_t tag, uint8_t, int32_t, uint8_t) {
     // Memory graphs that are read beside the machine may have brought names of their own.
-    if (auto name = HXNamedTags::shared().nameForTag(tag)) return name;
+    if (auto name = namedTags().nameForTag(tag)) return name;
     const auto found = _machine.tagNames.find(tag);
     if (found == _machine.tagNames.end()) return std::nullopt;
     return found->second;

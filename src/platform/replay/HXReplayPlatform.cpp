@@ -1,7 +1,7 @@
 // HXReplayPlatform: processes, settings, images and the kernel's own memory.
 #include "platform/replay/HXReplayPlatform.h"
 
-#include "platform/replay/HXFixedText.h"
+#include "platform/capture/HXFixedText.h"
 
 #include <algorithm>
 #include <cerrno>

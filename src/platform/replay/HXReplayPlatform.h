@@ -1,18 +1,18 @@
 // A host answered from a machine file.
 #pragma once
 
-#include "platform/replay/HXMachine.h"
-#include "platform/replay/HXServicesPlatform.h"
+#include "platform/HXPlatform.h"
+#include "platform/capture/HXMachine.h"
 
 #include <array>
 #include <atomic>
 
 // Every answer is the machine's; what counts calls (faults) or can be set ("vm.self_region_heft") is kept
-// here, so that one machine can be replayed several times. The machine and `services`, the host that stands
-// for the real machine's files, streams and queues, must outlive the platform.
-class HXReplayPlatform : public HXServicesPlatform {
+// here, so that one machine can be replayed several times. The machine and `services` must outlive the
+// platform.
+class HXReplayPlatform : public HXPlatform {
   public:
-    HXReplayPlatform(const HXMachine &machine, HXPlatform &services);
+    HXReplayPlatform(const HXMachine &machine, HXServices &services);
     ~HXReplayPlatform() override;
 
     mach_port_t mach_task_self() override;
@@ -66,6 +66,7 @@ class HXReplayPlatform : public HXServicesPlatform {
     std::optional<std::string> GXRegionTypeDescriptionForTagShareProtAndPager(uint32_t tag, uint8_t shareMode,
                                                                               int32_t protection,
                                                                               uint8_t pager) override;
+    HXServices &services() override { return _services; }
 
   private:
     // What changes about a process while it is replayed.
@@ -91,6 +92,7 @@ class HXReplayPlatform : public HXServicesPlatform {
     void mapNamedTags();
 
     const HXMachine &_machine;
+    HXServices &_services;
     std::deque<State> _states; // by process index
     std::atomic<int32_t> _selfRegionHeft;
     std::map<uint32_t, uint32_t> _namedTags; // of the machine's named tags, those of this run

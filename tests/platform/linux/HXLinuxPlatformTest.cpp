@@ -198,7 +198,6 @@ TEST_F(HXLinuxPlatformTest, WalksMappings) {
                      smaps("40000-48000 rw-p 00000000 00:00 0 [stack]", 8, 8, 0));
     proc.write("10/mountinfo", "1 1 0:51 / /shm rw - tmpfs tmpfs rw\n2 1 0:52 / /nfs rw - nfs4 s:/x rw\n");
     setReportsCharge(1);
-    HXNamedTags::shared().clear();
     const mach_port_t task = open(10);
     static const struct {
         uint64_t start, end, dirtyPages;

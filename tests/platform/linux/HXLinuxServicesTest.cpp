@@ -1,5 +1,5 @@
 // Work queues, signals and the command line's own files on the live host.
-#include "platform/linux/HXLinuxPlatform.h"
+#include "platform/linux/HXLinuxServices.h"
 
 #include "support/HXBuilders.h"
 
@@ -20,15 +20,15 @@ namespace {
 namespace fs = std::filesystem;
 
 TEST(HXLinuxDispatch, LoopCallsEachIterationOnce) {
-    HXLinuxPlatform platform;
+    HXLinuxServices services;
     for (const size_t workers : {0, 1, 7}) {
-        platform.setWorkerCount(workers);
+        services.setWorkerCount(workers);
         std::vector<std::atomic<int>> calls(100);
-        const auto queue = platform.dispatch_queue_create("q", QOS_CLASS_UTILITY);
-        platform.dispatch_apply(calls.size(), queue, [&](size_t i) { calls[i]++; });
+        const auto queue = services.dispatch_queue_create("q", QOS_CLASS_UTILITY);
+        services.dispatch_apply(calls.size(), queue, [&](size_t i) { calls[i]++; });
         for (const auto &count : calls)
             EXPECT_EQ(count, 1);
-        platform.dispatch_apply(0, queue, [](size_t) { ADD_FAILURE(); });
+        services.dispatch_apply(0, queue, [](size_t) { ADD_FAILURE(); });
     }
 }
 
@@ -43,28 +43,28 @@ int statusOf(const std::function<int()> &body) {
 
 TEST(HXLinuxDispatch, SignalsGoToTheSourceThenToTheDisposition) {
     const int heard = statusOf([] {
-        HXLinuxPlatform platform;
+        HXLinuxServices services;
         std::promise<void> came;
-        const auto source = platform.dispatch_source_create(SIGINT);
-        platform.dispatch_source_set_event_handler(*source, [&] { came.set_value(); });
+        const auto source = services.dispatch_source_create(SIGINT);
+        services.dispatch_source_set_event_handler(*source, [&] { came.set_value(); });
         kill(getpid(), SIGINT); // before the source runs, and before the disposition changes
-        platform.signal(SIGINT, HXSignalDisposition::ignored);
-        platform.dispatch_resume(*source);
+        services.signal(SIGINT, HXSignalDisposition::ignored);
+        services.dispatch_resume(*source);
         came.get_future().wait();
-        platform.dispatch_source_cancel(*source);
-        platform.signal(SIGINT, HXSignalDisposition::byDefault);
+        services.dispatch_source_cancel(*source);
+        services.signal(SIGINT, HXSignalDisposition::byDefault);
         return 17;
     });
     EXPECT_TRUE(WIFEXITED(heard) && WEXITSTATUS(heard) == 17) << heard;
     const int ended = statusOf([] {
-        HXLinuxPlatform platform;
-        const auto source = platform.dispatch_source_create(SIGINT);
-        platform.dispatch_source_set_event_handler(*source, [] { _exit(1); });
-        platform.signal(SIGINT, HXSignalDisposition::ignored);
-        platform.dispatch_resume(*source);
-        platform.dispatch_source_cancel(*source);
+        HXLinuxServices services;
+        const auto source = services.dispatch_source_create(SIGINT);
+        services.dispatch_source_set_event_handler(*source, [] { _exit(1); });
+        services.signal(SIGINT, HXSignalDisposition::ignored);
+        services.dispatch_resume(*source);
+        services.dispatch_source_cancel(*source);
         kill(getpid(), SIGINT); // too late for the source, too early for the disposition
-        platform.signal(SIGINT, HXSignalDisposition::byDefault);
+        services.signal(SIGINT, HXSignalDisposition::byDefault);
         return 2;
     });
     EXPECT_TRUE(WIFSIGNALED(ended) && WTERMSIG(ended) == SIGINT) << ended;
@@ -74,46 +74,46 @@ class HXLinuxFiles : public testing::Test {
   protected:
     HXLinuxFiles() { fs::create_directories(folder); }
 
-    HXLinuxPlatform platform;
+    HXLinuxServices services;
     const fs::path folder = temporaryPath();
 };
 
 TEST_F(HXLinuxFiles, ReadsPlainFilesAlone) {
     std::ofstream(folder / "plain") << std::string(100000, 'x');
     mkfifo((folder / "fifo").c_str(), 0600);
-    EXPECT_EQ(platform.readFile(folder / "plain", 100000)->size(), 100000u);
-    EXPECT_GT(platform.readFile("/proc/self/status", 100000).value_or("").size(), 100u) << "of no size";
+    EXPECT_EQ(services.readFile(folder / "plain", 100000)->size(), 100000u);
+    EXPECT_GT(services.readFile("/proc/self/status", 100000).value_or("").size(), 100u) << "of no size";
     const std::pair<std::string, int> cases[] = {{folder / "plain", EFBIG},
                                                  {folder / "fifo", EINVAL},
                                                  {"/dev/zero", EINVAL},
                                                  {folder, EISDIR},
                                                  {folder / "none", ENOENT}};
     for (const auto &item : cases) {
-        EXPECT_FALSE(platform.readFile(item.first, 99999)) << item.first;
+        EXPECT_FALSE(services.readFile(item.first, 99999)) << item.first;
         EXPECT_EQ(errno, item.second) << item.first;
     }
 }
 
 TEST_F(HXLinuxFiles, PendingFilesAppearWhole) {
     const std::string path = folder / "report";
-    auto file = platform.createPendingFile(path);
+    auto file = services.createPendingFile(path);
     ASSERT_TRUE(file);
     std::fputs("text", file->stream);
-    EXPECT_FALSE(platform.stat(path));
-    EXPECT_TRUE(platform.commitPendingFile(*file));
-    EXPECT_EQ(platform.readFile(path, 10), "text");
+    EXPECT_FALSE(services.stat(path));
+    EXPECT_TRUE(services.commitPendingFile(*file));
+    EXPECT_EQ(services.readFile(path, 10), "text");
     struct stat status;
     ASSERT_EQ(::stat(path.c_str(), &status), 0);
     EXPECT_EQ(status.st_mode & 0777, 0600u);
 
-    auto discarded = platform.createPendingFile(path);
-    platform.discardPendingFile(*discarded);
-    auto lost = platform.createPendingFile(folder / "sub" / "x");
+    auto discarded = services.createPendingFile(path);
+    services.discardPendingFile(*discarded);
+    auto lost = services.createPendingFile(folder / "sub" / "x");
     EXPECT_FALSE(lost);
     fs::create_directory(folder / "sub");
-    lost = platform.createPendingFile(folder / "sub" / "x");
+    lost = services.createPendingFile(folder / "sub" / "x");
     fs::create_directory(folder / "sub" / "x"); // in the way
-    EXPECT_FALSE(platform.commitPendingFile(*lost));
+    EXPECT_FALSE(services.commitPendingFile(*lost));
     EXPECT_EQ(std::distance(fs::directory_iterator(folder), {}), 2) << "nothing is left over";
     EXPECT_EQ(std::distance(fs::directory_iterator(folder / "sub"), {}), 1);
 }

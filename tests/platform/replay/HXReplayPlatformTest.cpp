@@ -15,7 +15,6 @@ class HXReplay : public testing::Test {
     // Loads a machine; a bar stands for each TAB.
     void load(std::string records) {
         std::replace(records.begin(), records.end(), '|', '\t');
-        HXNamedTags::shared().clear();
         std::string reason;
         host.reset();
         machine = HXMachine::loadText("heft-machine 1\n" + records, &reason);
@@ -68,7 +67,7 @@ class HXReplay : public testing::Test {
         return bytes == sizeof info ? static_cast<int32_t>(info.pbsi_status) : -errno;
     }
 
-    HXBarePlatform services;
+    HXLinuxServices services;
     std::unique_ptr<HXMachine> machine;
     std::unique_ptr<HXReplayPlatform> host;
 };
@@ -234,13 +233,9 @@ TEST_F(HXReplay, FindsSymbolsOfTheKernel) {
 }
 
 TEST_F(HXReplay, NamesOfTagsKeepTheirMeaningBesideOtherNames) {
-    load(""); // clears the names
-    const uint32_t taken = *HXNamedTags::shared().tagForName("of a memory graph");
-    std::string reason;
-    machine = HXMachine::loadText("heft-machine 1\nprocess\tpid=1\ntag\ttag=110\tname=arena\n"
-                                  "region\tpid=1\taddress=0x4000\tsize=0x4000\ttag=110\n",
-                                  &reason);
-    host = std::make_unique<HXReplayPlatform>(*machine, services);
+    load("process|pid=1\ntag|tag=111|name=arena\nregion|pid=1|address=0x4000|size=0x4000|tag=111\n");
+    const uint32_t taken = *host->namedTags().tagForName("of a memory graph");
+    EXPECT_EQ(taken, 111u);
     const auto nameOf = [&](uint32_t tag) {
         return host->GXRegionTypeDescriptionForTagShareProtAndPager(tag, 0, 0, 0).value_or("none");
     };

@@ -1,0 +1,44 @@
+#include "model/HXHeftSwitches.h"
+
+#include "platform/HXPlatform.h"
+
+#include <atomic>
+#include <cerrno>
+#include <cstdio>
+
+namespace {
+
+constexpr char kSetting[] = "vm.self_region_heft";
+std::atomic<bool> sharingDisabled{false};
+
+} // namespace
+
+bool HXHeftSwitches::breakDownPhysHeft() {
+    HXPlatform &platform = HXPlatform::current();
+    const int32_t cached = platform.cache().selfRegionHeft.load();
+    if (cached >= 0) return cached != 0;
+    int32_t value = 0;
+    size_t size = sizeof value;
+    if (platform.sysctlbyname(kSetting, &value, &size, nullptr, 0) != 0) {
+        if (errno != ENOENT) std::perror("Unable to retrieve status of physical heft data collection");
+        value = 0;
+    }
+    platform.cache().selfRegionHeft = value != 0;
+    return value != 0;
+}
+
+void HXHeftSwitches::setBreakDownPhysHeft(bool breakDown) {
+    HXPlatform &platform = HXPlatform::current();
+    const int32_t value = breakDown ? 1 : 0;
+    if (platform.sysctlbyname(kSetting, nullptr, nullptr, &value, sizeof value) != 0 && errno != ENOENT)
+        std::perror("Unable to configure physical heft data collection");
+    platform.cache().selfRegionHeft = -1;
+}
+
+bool HXHeftSwitches::isSharingAnalysisDisabled() {
+    return sharingDisabled;
+}
+
+void HXHeftSwitches::setSharingAnalysisDisabled(bool disabled) {
+    sharingDisabled = disabled;
+}

@@ -1,0 +1,106 @@
+// What the program takes from the machine that it runs on, whatever machine it examines: its command line,
+// files, work queues and signals.
+//
+// Unless an operation says otherwise it may be called from any thread.
+#pragma once
+
+#include <cstdint>
+#include <cstdio>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+// One entry of the option table given to `getopt_long`.
+struct HXLongOption {
+    const char *name; // may be empty: such an option has no long form
+    bool hasArgument;
+    int *flag; // when not null, set to `value` and `getopt_long` returns 0
+    int value;
+};
+
+// The scanner's state after a step of `getopt_long`.
+struct HXOptionScan {
+    int result = 0;                 // the option's value, 0, '?' or ':'; -1 at the end
+    const char *argument = nullptr; // the option's argument, if it has one
+    int index = 1;                  // at the end: the index of the first argument that is no option
+};
+
+// A concurrent work queue; made by `dispatch_queue_create`.
+struct HXDispatchQueue {
+    std::string label;
+    uint32_t qualityOfService = 0;
+};
+inline constexpr uint32_t QOS_CLASS_UTILITY = 0x11;
+
+// A source of signal events, live until `dispatch_source_cancel`.
+class HXDispatchSource {
+  public:
+    virtual ~HXDispatchSource() = default;
+};
+
+enum class HXSignalDisposition { byDefault, ignored };
+inline constexpr int HX_SIGINT = 2;
+inline constexpr int HX_SIGPIPE = 13;
+
+// A file written beside its final place, readable by its owner alone, and renamed when it is complete.
+struct HXPendingFile {
+    std::FILE *stream = nullptr; // owned by the platform until commit or discard
+    std::string path;
+    std::string temporaryPath;
+};
+
+class HXServices {
+  public:
+    virtual ~HXServices() = default;
+
+    // One step of the option scanner, as getopt_long(3) does it: `shortOptions` in its notation; a first call
+    // with `restart` begins at the argument after the program's name. Options and other arguments may mix;
+    // the others are moved behind. What is wrong with an option is printed to standard error. Main thread
+    // only.
+    virtual HXOptionScan getopt_long(int argc, char *const argv[], const char *shortOptions,
+                                     const std::vector<HXLongOption> &options, bool restart) = 0;
+
+    // Whether a file system object exists at `path`; links are followed.
+    virtual bool stat(const std::string &path) = 0;
+
+    // fopen(3): a stream, which the caller closes with std::fclose, or null with errno set.
+    virtual std::FILE *fopen(const std::string &path, const char *mode) = 0;
+
+    // The whole content of a file that exists when the call begins; none with errno set when it cannot be
+    // read or is longer than `limit` bytes (EFBIG). Never waits on a fifo or a device (EINVAL).
+    virtual std::optional<std::string> readFile(const std::string &path, uint64_t limit) = 0;
+    // The first `bytes` of such a file, or all of a shorter one.
+    virtual std::optional<std::string> readFileStart(const std::string &path, size_t bytes) = 0;
+
+    // Begins a file that becomes visible at `path` only as a whole; none with errno set.
+    virtual std::optional<HXPendingFile> createPendingFile(const std::string &path) = 0;
+    // Closes and renames it; false with errno set (the temporary file is then removed).
+    virtual bool commitPendingFile(HXPendingFile &file) = 0;
+    // Closes and removes it.
+    virtual void discardPendingFile(HXPendingFile &file) = 0;
+
+    // Whether the stream of that descriptor (1: standard output) is a terminal.
+    virtual bool isatty(int descriptor) = 0;
+
+    virtual HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) = 0;
+
+    // Calls `work` with 0 … iterations − 1, starting them in that order, several at once; returns when all
+    // have returned.
+    virtual void dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
+                                const std::function<void(size_t)> &work) = 0;
+
+    // A source of events for a signal, not yet running; null when there can be none. From here until `signal`
+    // sets the disposition anew the signal reaches no other thread.
+    virtual std::unique_ptr<HXDispatchSource> dispatch_source_create(int signal) = 0;
+    virtual void dispatch_source_set_event_handler(HXDispatchSource &source,
+                                                   std::function<void()> handler) = 0;
+    virtual void dispatch_resume(HXDispatchSource &source) = 0;
+    // No handler runs after this has returned.
+    virtual void dispatch_source_cancel(HXDispatchSource &source) = 0;
+
+    // Sets a signal's disposition. A signal that came between `dispatch_source_cancel` and this call is not
+    // lost.
+    virtual void signal(int signal, HXSignalDisposition disposition) = 0;
+};

@@ -1,0 +1,85 @@
+// A memory graph: one process's facts and regions, as a file written earlier holds them.
+#pragma once
+
+#include "platform/HXRegionTags.h"
+#include "platform/capture/HXStringTable.h"
+
+#include <cstdint>
+#include <deque>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+class HXCaptureReader;
+
+// One region. Sizes are in bytes; the texts live as long as the graph.
+struct GXVMRegion {
+    uint64_t address;
+    uint64_t length;
+    std::string_view type;
+    std::optional<std::string_view> path;
+    uint64_t offset;
+    uint64_t resident_size;
+    uint64_t shared_now_private_size;
+    uint64_t swapped_out_size;
+    uint64_t dirty_size;
+    uint64_t reusable_size;
+    int32_t prot;
+    int32_t maxProt;
+    uint32_t user_tag;
+    uint32_t ref_count;
+    uint32_t is_submap;
+    uint32_t object_id;
+    int32_t purgeable;
+    uint8_t external_pager;
+    uint8_t share_mode;
+};
+
+class GXProcessObjectGraph {
+  public:
+    // How every memory-graph file begins.
+    static constexpr std::string_view header = "heft-memgraph 1";
+
+    // The graph that the content of a memory-graph file describes; null with the reason when it breaks the
+    // form. The content is not needed afterwards. Tags that programs name become those that `tags` has for
+    // the names.
+    static std::unique_ptr<GXProcessObjectGraph>
+    directedGraphWithData(std::string_view data, HXNamedTags &tags, std::string *reason);
+
+    int32_t pid() const { return _pid; }
+    const std::string &processName() const { return _processName; }
+    // Names the machine architecture.
+    const std::string &processDescriptionString() const { return _description; }
+    bool is64bit() const { return _is64bit; }
+    uint32_t vmPageSize() const { return _pageSize; } // bytes
+    uint64_t physicalHeft() const { return _physicalHeft; }
+    uint64_t physicalHeftPeak() const { return _physicalHeftPeak; }
+    // Whether the graph was gathered with the heft breakdown.
+    bool showsPhysHeft() const { return _showsPhysHeft; }
+    // Whether the host that it was written on has a shared region at all.
+    bool hasSharedRegion() const { return _hasSharedRegion; }
+
+    // Calls `each` for the regions in the graph's order until it sets *stop.
+    void enumerateRegionsWithBlock(const std::function<void(const GXVMRegion &, bool *stop)> &each) const;
+
+  private:
+    bool read(HXCaptureReader &reader, HXNamedTags &tags);
+    bool readProcess(HXCaptureReader &reader);
+    bool readRegion(HXCaptureReader &reader, HXNamedTags &tags);
+    std::string_view intern(std::string_view text);
+
+    bool _hasProcess = false;
+    int32_t _pid = 0;
+    std::string _processName;
+    std::string _description;
+    bool _is64bit = true;
+    bool _showsPhysHeft = true;
+    bool _hasSharedRegion = true;
+    uint32_t _pageSize = 0;
+    uint64_t _physicalHeft = 0;
+    uint64_t _physicalHeftPeak = 0;
+    std::deque<GXVMRegion> _regions; // ascending, without overlap
+    HXStringTable _strings;
+};

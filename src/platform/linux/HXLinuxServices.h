@@ -1,0 +1,34 @@
+// The running machine's files, work queues and signals.
+#pragma once
+
+#include "platform/HXServices.h"
+
+#include <cstddef>
+
+class HXLinuxServices : public HXServices {
+  public:
+    // How many workers `dispatch_apply` has; 0: one for each usable processor. They are batch-scheduled.
+    void setWorkerCount(size_t count) { _workerCount = count; }
+
+    HXOptionScan getopt_long(int argc, char *const argv[], const char *shortOptions,
+                             const std::vector<HXLongOption> &options, bool restart) override;
+    bool stat(const std::string &path) override;
+    std::FILE *fopen(const std::string &path, const char *mode) override;
+    std::optional<std::string> readFile(const std::string &path, uint64_t limit) override;
+    std::optional<std::string> readFileStart(const std::string &path, size_t bytes) override;
+    std::optional<HXPendingFile> createPendingFile(const std::string &path) override;
+    bool commitPendingFile(HXPendingFile &file) override;
+    void discardPendingFile(HXPendingFile &file) override;
+    bool isatty(int descriptor) override;
+    HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) override;
+    void dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
+                        const std::function<void(size_t)> &work) override;
+    std::unique_ptr<HXDispatchSource> dispatch_source_create(int signal) override;
+    void dispatch_source_set_event_handler(HXDispatchSource &source, std::function<void()> handler) override;
+    void dispatch_resume(HXDispatchSource &source) override;
+    void dispatch_source_cancel(HXDispatchSource &source) override;
+    void signal(int signal, HXSignalDisposition disposition) override;
+
+  private:
+    size_t _workerCount = 0;
+};

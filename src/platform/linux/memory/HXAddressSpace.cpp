@@ -1,0 +1,76 @@
+#include "platform/linux/memory/HXAddressSpace.h"
+
+#include "platform/HXRegionTags.h"
+#include "platform/HXSafeText.h"
+
+#include <algorithm>
+
+HXAddressSpace::HXAddressSpace() {
+    _paths.emplace_back();
+}
+
+size_t HXAddressSpace::find(uint64_t address, size_t hint) const {
+    for (size_t index = hint; index < std::min(hint + 2, _count); index++)
+        if ((*this)[index].end > address && (index == 0 || (*this)[index - 1].end <= address)) return index;
+    size_t low = 0;
+    size_t high = _count;
+    while (low < high) {
+        const size_t middle = low + (high - low) / 2;
+        if ((*this)[middle].end > address)
+            high = middle;
+        else
+            low = middle + 1;
+    }
+    return low;
+}
+
+void HXAddressSpace::append(HXMapping mapping) {
+    if (_count > 0) {
+        const uint64_t previousEnd = (*this)[_count - 1].end;
+        if (mapping.end <= previousEnd) return;
+        if (mapping.start < previousEnd) {
+            if (mapping.isFile()) mapping.offset += previousEnd - mapping.start;
+            mapping.start = previousEnd;
+        }
+    }
+    if (_count % chunkLength == 0)
+        _chunks.push_back(std::make_unique_for_overwrite<HXMapping[]>(chunkLength));
+    (*this)[_count++] = mapping;
+}
+
+namespace {
+
+// The kernel writes a newline in a path as \012.
+std::string plainPath(std::string_view path) {
+    std::string plain;
+    for (size_t i = 0; i < path.size(); i++) {
+        if (path.substr(i).starts_with("\\012")) {
+            plain += '\n';
+            i += 3;
+        } else {
+            plain += path[i];
+        }
+    }
+    return plain;
+}
+
+HXMappedPath mappedPath(std::string_view raw, HXNamedTags &tags) {
+    HXMappedPath path;
+    path.text = HXSafeText(raw.find('\\') == std::string_view::npos ? std::string(raw) : plainPath(raw));
+    path.kind = HXPathKindOf(raw);
+    const std::string_view name = HXGivenName(path.text);
+    if (!name.empty()) path.namedTag = static_cast<uint8_t>(tags.tagForName(name).value_or(0));
+    return path;
+}
+
+} // namespace
+
+uint32_t HXAddressSpace::intern(std::string_view path, HXNamedTags &tags) {
+    if (path.empty()) return 0;
+    if (path == _lastPath) return _lastPathIndex;
+    _lastPath = path;
+    const auto [found, isNew] = _pathIndexes.try_emplace(_lastPath, static_cast<uint32_t>(_paths.size()));
+    if (isNew) _paths.push_back(mappedPath(path, tags));
+    _lastPathIndex = found->second;
+    return _lastPathIndex;
+}

@@ -1,0 +1,61 @@
+// The mappings of one process as they were read: a snapshot, ascending and without overlaps.
+#pragma once
+
+#include "platform/HXRegionTags.h"
+#include "platform/linux/memory/HXMapping.h"
+#include "platform/linux/memory/HXMappingClass.h"
+
+#include <cstddef>
+#include <cstdint>
+#include <deque>
+#include <memory>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <vector>
+
+// A path that mappings name; `text` is safe.
+struct HXMappedPath {
+    std::string text;
+    HXPathKind kind = HXPathKind::none;
+    uint8_t namedTag = 0; // of the name that the program gave the memory
+};
+
+class HXAddressSpace {
+  public:
+    HXAddressSpace();
+
+    // What a query past the last mapping answers: KERN_INVALID_ADDRESS when all mappings were read, else why
+    // not: MACH_SEND_INVALID_DEST for a process that died or executed another program meanwhile.
+    kern_return_t endError = KERN_INVALID_ADDRESS;
+    bool knowsDirtyPages = false;
+    uint64_t ipcNamespace = 0; // read when there is System V memory
+
+    size_t count() const { return _count; }
+    HXMapping &operator[](size_t index) { return _chunks[index / chunkLength][index % chunkLength]; }
+    const HXMapping &operator[](size_t index) const {
+        return _chunks[index / chunkLength][index % chunkLength];
+    }
+
+    // The index of the first mapping that ends above `address`; `count()` when there is none. `hint`: where
+    // it is likely to be.
+    size_t find(uint64_t address, size_t hint = 0) const;
+
+    // Appends a mapping. What overlaps its predecessor is cut off: while the text is read piece by piece the
+    // process may have joined a mapping with one that has been read already.
+    void append(HXMapping mapping);
+    // The index of `path` (as the kernel wrote it), for HXMapping::path. A name that a program gave its
+    // memory gets its tag from `tags`.
+    uint32_t intern(std::string_view path, HXNamedTags &tags);
+    const HXMappedPath &path(uint32_t index) const { return _paths[index]; }
+
+  private:
+    static constexpr size_t chunkLength = 256;
+
+    std::vector<std::unique_ptr<HXMapping[]>> _chunks;
+    size_t _count = 0;
+    std::deque<HXMappedPath> _paths; // the first one is empty
+    std::unordered_map<std::string, uint32_t> _pathIndexes;
+    std::string _lastPath; // mappings of one file mostly follow each other
+    uint32_t _lastPathIndex = 0;
+};

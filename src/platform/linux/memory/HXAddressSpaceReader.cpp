@@ -1,0 +1,230 @@
+#include "platform/linux/memory/HXAddressSpaceReader.h"
+
+#include "platform/linux/memory/HXMappedFile.h"
+#include "platform/linux/memory/HXPageScan.h"
+#include "platform/linux/procfs/HXMapsParser.h"
+#include "platform/linux/procfs/HXProcFile.h"
+#include "platform/linux/procfs/HXProcText.h"
+#include "platform/linux/procfs/HXTextNumber.h"
+
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+namespace {
+
+class Reader {
+  public:
+    Reader(const HXReadRequest &request, const HXReaderSetting &setting)
+        : _request(request), _setting(setting) {
+        _lookup.directory = request.directory;
+    }
+
+    std::unique_ptr<HXAddressSpace> read();
+
+  private:
+    bool mapsMaySuffice();
+    bool mapsSuffice() const;
+    bool hasFreedLazily() const;
+    bool readMapsAndScan();
+    HXDescriptor readFile(const char *name);
+    void readMappings(const HXDescriptor &file);
+    void take(const HXMapsEntry &entry);
+    HXFileSystemKind fileSystemOf(const HXMapping &mapping, const HXMappedPath &path);
+    bool isDeviceFile(const HXMapping &mapping, const HXMappedPath &path) const;
+    bool mayHoldHugePages(const HXMapping &mapping, HXPathKind kind, HXFileSystemKind fileSystem) const;
+    kern_return_t endError(const HXDescriptor &file) const;
+    bool isSingleThreaded() const;
+
+    HXReadRequest _request;
+    const HXReaderSetting &_setting;
+    HXFileSystemLookup _lookup;
+    std::unique_ptr<HXAddressSpace> _addressSpace;
+    bool _readFailed = false;
+    bool _sawStack = false;
+    bool _sawGate = false;
+    bool _sawSwapBacked = false;
+    bool _mayHoldHugePages = false;
+};
+
+std::optional<HXStatRecord> readStat(int directory) {
+    char buffer[2048];
+    const auto text = HXReadOnce(directory, "stat", buffer);
+    return text ? HXParseStat(*text) : std::nullopt;
+}
+
+kern_return_t errorOfOpening(int error) {
+    static constexpr struct {
+        int error;
+        kern_return_t answer;
+    } answers[] = {
+        {EMFILE, KERN_RESOURCE_SHORTAGE}, {ENFILE, KERN_RESOURCE_SHORTAGE}, {ENOMEM, KERN_RESOURCE_SHORTAGE},
+        {EACCES, KERN_NO_ACCESS},         {EPERM, KERN_NO_ACCESS},
+    };
+    for (const auto &entry : answers)
+        if (entry.error == error) return entry.answer;
+    return MACH_SEND_INVALID_DEST;
+}
+
+uint64_t readIpcNamespace(int directory) {
+    char buffer[64];
+    const auto link = HXReadLink(directory, "ns/ipc", buffer);
+    if (!link) return 0;
+    HXTextCursor cursor{link->substr(std::min(link->find('[') + 1, link->size()))};
+    uint64_t number = 0;
+    cursor.number(&number);
+    return number;
+}
+
+// A file of an address space that is gone reads as empty; one that lives still has its first line.
+bool isAlive(const HXDescriptor &file) {
+    char byte;
+    return ::pread(file.get(), &byte, 1, 0) > 0;
+}
+
+std::unique_ptr<HXAddressSpace> Reader::read() {
+    if (!mapsMaySuffice() || !readMapsAndScan()) {
+        readFile("smaps");
+        _addressSpace->knowsDirtyPages = true;
+    }
+    if (_addressSpace->count() > 0 && (!_sawStack || !isSingleThreaded()))
+        HXTagThreadStacks(_request.directory, _addressSpace.get());
+    return std::move(_addressSpace);
+}
+
+// Locked mappings and dirty file pages show in smaps alone; pages of the huge-page pool are left to it, too.
+bool Reader::mapsMaySuffice() {
+    if (!_setting.mayScan || _request.needsDirtyPages || !HXPageScan::isComplete()) return false;
+    if (!_request.status) _request.status = HXReadStatus(_request.directory);
+    return _request.status && _request.status->lockedSize == 0 && _request.status->hugePageSize == 0;
+}
+
+bool Reader::readMapsAndScan() {
+    const HXDescriptor maps = readFile("maps");
+    if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return true;
+    if (!mapsSuffice() || !HXScanFigures(_request.directory, _setting.pageShift, _request.status->swapSize,
+                                         _addressSpace.get()))
+        return false;
+    // If the process executed another program before its page tables were opened, those are not of this.
+    if (!isAlive(maps)) _addressSpace->endError = MACH_SEND_INVALID_DEST;
+    return true;
+}
+
+bool Reader::mapsSuffice() const {
+    // The pool's mappings are told by their flags in smaps alone, even those that nobody has touched.
+    if (_mayHoldHugePages) return false;
+    // Page tables do not show which pages of shared memory are swapped out.
+    if (_sawSwapBacked && _setting.machine->usesSwap()) return false;
+    return !_setting.machine->hasFreedLazily(_request.opened) || !hasFreedLazily();
+}
+
+// Whether the process holds lazily freed pages, which look like others in the page tables; also true where
+// smaps costs less than to find out.
+bool Reader::hasFreedLazily() const {
+    constexpr uint64_t fewPagesPerMapping = 128;
+    const uint64_t pages = _request.status->residentSize >> _setting.pageShift;
+    if (pages > fewPagesPerMapping * _addressSpace->count()) return true;
+    char buffer[4096];
+    const auto text = HXReadOnce(_request.directory, "smaps_rollup", buffer);
+    return !text || HXParseLabelled(*text, "LazyFree:").value_or(1) != 0;
+}
+
+// Answers the open file.
+HXDescriptor Reader::readFile(const char *name) {
+    _addressSpace = std::make_unique<HXAddressSpace>();
+    _readFailed = _sawStack = _sawGate = _sawSwapBacked = _mayHoldHugePages = false;
+    HXDescriptor file = HXOpenAt(_request.directory, name);
+    if (!file) {
+        _addressSpace->endError = errorOfOpening(errno);
+        return file;
+    }
+    readMappings(file);
+    _addressSpace->endError = endError(file);
+    return file;
+}
+
+void Reader::readMappings(const HXDescriptor &file) {
+    HXMapsParser parser(_setting.pageShift);
+    HXMapsEntry entry;
+    const std::span<char> buffer = HXScratchBuffer();
+    size_t length = 0;
+    for (bool complete = false; !complete;) {
+        // The kernel hands out a page or so at a time; as much as fits is parsed together.
+        const ssize_t got = HXReadFully(file.get(), buffer.subspan(length));
+        _readFailed = got < 0;
+        complete = got <= 0 || length + static_cast<size_t>(got) < buffer.size();
+        length += static_cast<size_t>(std::max<ssize_t>(got, 0));
+        std::string_view text(buffer.data(), length);
+        while (parser.next(&text, complete, &entry))
+            take(entry);
+        if (text.size() == buffer.size()) text = {}; // no mapping's text is that long
+        std::memmove(buffer.data(), text.data(), text.size());
+        length = text.size();
+    }
+}
+
+void Reader::take(const HXMapsEntry &entry) {
+    HXMapping mapping = entry.mapping;
+    mapping.path = _addressSpace->intern(entry.path, *_setting.namedTags);
+    const HXMappedPath &path = _addressSpace->path(mapping.path);
+    const HXFileSystemKind fileSystem = fileSystemOf(mapping, path);
+    const uint32_t sharedMemory = !mapping.isFile() ? 0 : _setting.fileSystems->sharedMemoryDevice();
+    HXClassifyMapping(path.kind, fileSystem, sharedMemory, path.namedTag, &mapping);
+    if (mapping.has(HXMappingSwapBacked)) _sawSwapBacked = true;
+    if (mayHoldHugePages(mapping, path.kind, fileSystem)) _mayHoldHugePages = true;
+    if (path.kind == HXPathKind::stack) _sawStack = true;
+    if (path.kind == HXPathKind::special && path.text == "[vsyscall]") _sawGate = true;
+    if (path.kind == HXPathKind::systemV && _addressSpace->ipcNamespace == 0)
+        _addressSpace->ipcNamespace = readIpcNamespace(_request.directory);
+    _addressSpace->append(mapping);
+}
+
+HXFileSystemKind Reader::fileSystemOf(const HXMapping &mapping, const HXMappedPath &path) {
+    if (!mapping.isFile() || (path.kind != HXPathKind::file && path.kind != HXPathKind::deletedFile &&
+                              path.kind != HXPathKind::memfd && path.kind != HXPathKind::systemV))
+        return HXFileSystemKind::unknown;
+    if (mapping.device == _setting.fileSystems->sharedMemoryDevice() || path.text.front() != '/')
+        return HXFileSystemKind::unknown;
+    const HXFileSystemKind kind = _setting.fileSystems->kindOf(mapping.device, &_lookup);
+    if (kind != HXFileSystemKind::deviceNodes) return kind;
+    return isDeviceFile(mapping, path) ? HXFileSystemKind::unknown : HXFileSystemKind::swapBacked;
+}
+
+// Whether a path on a devtmpfs leads to a device (what its driver maps is no tmpfs page) and not to a plain
+// file.
+bool Reader::isDeviceFile(const HXMapping &mapping, const HXMappedPath &path) const {
+    HXDescriptor place = HXLocateMapped(_request.directory, mapping);
+    if (!place) place = HXLocateBelowRoot(_request.directory, path.text);
+    return !place || !HXIsMappedFile(mapping, place.get());
+}
+
+// By the path and the file system, which is all that maps tells of the huge-page pool.
+bool Reader::mayHoldHugePages(const HXMapping &mapping, HXPathKind kind, HXFileSystemKind fileSystem) const {
+    if (kind == HXPathKind::anonymousHuge || fileSystem == HXFileSystemKind::hugePages) return true;
+    return (kind == HXPathKind::memfd || kind == HXPathKind::systemV) &&
+           mapping.device != _setting.fileSystems->sharedMemoryDevice();
+}
+
+kern_return_t Reader::endError(const HXDescriptor &file) const {
+    if (_readFailed) return MACH_SEND_INVALID_DEST;
+    // The gate page of some machines is the last line of every whole list.
+    if (_sawGate) return KERN_INVALID_ADDRESS;
+    if (isAlive(file)) return KERN_INVALID_ADDRESS;
+    if (_addressSpace->count() > 0) return MACH_SEND_INVALID_DEST;
+    const auto stat = readStat(_request.directory);
+    return stat && !stat->isZombie() ? KERN_INVALID_ADDRESS : MACH_SEND_INVALID_DEST;
+}
+
+bool Reader::isSingleThreaded() const {
+    if (_request.status) return _request.status->threadCount <= 1;
+    const auto stat = readStat(_request.directory);
+    return !stat || stat->threadCount <= 1;
+}
+
+} // namespace
+
+std::unique_ptr<HXAddressSpace> HXReadAddressSpace(const HXReadRequest &request,
+                                                   const HXReaderSetting &setting) {
+    return Reader(request, setting).read();
+}

@@ -1,0 +1,46 @@
+// Reads the address space of a process.
+#pragma once
+
+#include "platform/linux/memory/HXAddressSpace.h"
+#include "platform/linux/memory/HXFileSystems.h"
+#include "platform/linux/memory/HXMachineFacts.h"
+#include "platform/linux/procfs/HXProcText.h"
+
+#include <chrono>
+#include <cstdint>
+#include <memory>
+#include <optional>
+
+// What the readings of all address spaces share.
+struct HXReaderSetting {
+    HXFileSystems *fileSystems;
+    HXMachineFacts *machine;
+    HXNamedTags *namedTags;
+    uint32_t pageShift;
+    // Whether figures may be counted from the page tables where that is enough, which is faster than smaps.
+    bool mayScan;
+};
+
+// What a reader of one process knows and wants.
+struct HXReadRequest {
+    int directory;                                  // of the process in /proc
+    std::optional<HXStatusRecord> status;           // where it has been read already
+    bool needsDirtyPages = true;                    // HXMapping::dirtyPages
+    std::chrono::steady_clock::time_point opened{}; // when the process was
+};
+
+// Reads the mappings of a process and classifies them. A process that vanishes leaves what was read until
+// then.
+std::unique_ptr<HXAddressSpace> HXReadAddressSpace(const HXReadRequest &request,
+                                                   const HXReaderSetting &setting);
+
+// Reads and parses the status of a process; none with errno set, as for a text that is cut.
+std::optional<HXStatusRecord> HXReadStatus(int directory);
+
+// Counts the resident and swapped pages of all mappings by the process's page tables. False when they cannot
+// tell: `swappedSize`, what the kernel has counted, is not what is found.
+bool HXScanFigures(int directory, uint32_t pageShift, uint64_t swappedSize, HXAddressSpace *addressSpace);
+
+// Gives the mappings that hold the stack pointers of threads the user tag of stacks. Threads that keep
+// running, and those beyond the first few thousand, are left out.
+void HXTagThreadStacks(int directory, HXAddressSpace *addressSpace);

@@ -1,0 +1,189 @@
+#include "platform/linux/memory/HXMappingClass.h"
+
+#include "platform/HXRegionTags.h"
+
+#include <algorithm>
+
+namespace {
+
+constexpr std::string_view deletedSuffix = " (deleted)";
+constexpr std::string_view anonymousPrefix = "[anon:";
+constexpr std::string_view sharedPrefix = "[anon_shmem:";
+
+// Finaliser of a 64-bit linear generator; every bit of the result depends on every bit of the value.
+uint64_t mix(uint64_t value) {
+    value += 0x9E3779B97F4A7C15;
+    value = (value ^ (value >> 30)) * 0xBF58476D1CE4E5B9;
+    value = (value ^ (value >> 27)) * 0x94D049BB133111EB;
+    return value ^ (value >> 31);
+}
+
+// Keep the identifiers of different kinds of objects apart.
+enum IdentifierClass : uint64_t { fileClass = 1, mappingClass, systemVClass, vdsoClass };
+
+uint64_t identifier(IdentifierClass kind, uint64_t first, uint64_t second) {
+    const uint64_t id = mix(mix(mix(kind) ^ first) ^ second);
+    return id == 0 || id == UINT64_MAX ? kind : id;
+}
+
+bool isAccessible(const HXMapping &mapping) {
+    return mapping.has(HXMappingReadable | HXMappingWritable | HXMappingExecutable);
+}
+
+bool isPrivateAnonymous(const HXMapping &mapping) {
+    if (mapping.has(HXMappingShared)) return false;
+    return !mapping.isFile() || mapping.kind == static_cast<uint8_t>(HXPathKind::anonymousHuge);
+}
+
+uint32_t saturated(uint64_t pages) {
+    return static_cast<uint32_t>(std::min<uint64_t>(pages, UINT32_MAX));
+}
+
+uint64_t difference(uint64_t whole, uint64_t part) {
+    return whole - std::min(whole, part);
+}
+
+uint8_t tagOf(const HXMapping &mapping, HXPathKind kind, uint8_t namedTag) {
+    if (kind == HXPathKind::stack) return HXHostTagStack;
+    if (!isAccessible(mapping)) return HXHostTagGuard;
+    if (namedTag != 0) return namedTag;
+    const bool huge = mapping.has(HXMappingHugePages);
+    const bool anonymous = mapping.has(HXMappingShared) || mapping.isFile();
+    switch (kind) {
+    case HXPathKind::heap:
+        return HXHostTagHeap;
+    case HXPathKind::systemV:
+        return HXHostTagSystemVSharedMemory;
+    case HXPathKind::memfd:
+        return HXHostTagMemfd;
+    case HXPathKind::deletedFile:
+        if (!huge && !mapping.has(HXMappingSwapBacked)) return 0;
+        if (!huge) return HXHostTagDeletedSharedMemory;
+        break;
+    case HXPathKind::file:
+        if (mapping.has(HXMappingHasPager)) return 0;
+        break;
+    default:
+        break;
+    }
+    if (huge) return HXHostTagHugePages;
+    if (anonymous) return HXHostTagSharedAnonymous;
+    return mapping.has(HXMappingExecutable) ? HXHostTagAnonymousCode : HXHostTagAnonymous;
+}
+
+// The kinds of shared memory that the kernel makes without a name on a file system.
+bool isNamelessSharedMemory(HXPathKind kind) {
+    return kind == HXPathKind::sharedAnonymous || kind == HXPathKind::systemV || kind == HXPathKind::memfd ||
+           kind == HXPathKind::namedShared || kind == HXPathKind::anonymousHuge;
+}
+
+bool hasPager(const HXMapping &mapping, HXPathKind kind) {
+    if (!mapping.isFile() || isNamelessSharedMemory(kind)) return false;
+    const bool nameIsGone = kind == HXPathKind::deletedFile;
+    return !(nameIsGone && mapping.has(HXMappingSwapBacked | HXMappingHugePages));
+}
+
+uint8_t shareModeOf(const HXMapping &mapping) {
+    if (!isAccessible(mapping) && HXResidentPages(mapping) == 0 && mapping.swappedPages == 0) return SM_EMPTY;
+    if (mapping.has(HXMappingShared)) return SM_SHARED;
+    if (mapping.kind == static_cast<uint8_t>(HXPathKind::vdso)) return SM_COW;
+    return isPrivateAnonymous(mapping) ? SM_PRIVATE : SM_COW;
+}
+
+uint32_t reportedDirtyPages(const HXMapping &mapping, bool reportsCharge) {
+    if (reportsCharge) return saturated(HXChargedPages(mapping));
+    if (mapping.has(HXMappingHasPager) && !mapping.has(HXMappingSwapBacked | HXMappingHugePages))
+        return mapping.dirtyPages;
+    return saturated(HXResidentPages(mapping));
+}
+
+int32_t protectionOf(const HXMapping &mapping, uint16_t read, uint16_t write, uint16_t execute) {
+    return (mapping.has(read) ? VM_PROT_READ : 0) | (mapping.has(write) ? VM_PROT_WRITE : 0) |
+           (mapping.has(execute) ? VM_PROT_EXECUTE : 0);
+}
+
+} // namespace
+
+HXPathKind HXPathKindOf(std::string_view path) {
+    if (path.empty()) return HXPathKind::none;
+    if (path.front() == '[') {
+        if (path == "[heap]") return HXPathKind::heap;
+        // Kernels before 4.5 tell the stacks of threads as [stack:TID].
+        if (path == "[stack]" || path.starts_with("[stack:")) return HXPathKind::stack;
+        if (path == "[vdso]") return HXPathKind::vdso;
+        if (path.starts_with(anonymousPrefix)) return HXPathKind::namedAnonymous;
+        if (path.starts_with(sharedPrefix)) return HXPathKind::namedShared;
+        return HXPathKind::special;
+    }
+    if (!path.ends_with(deletedSuffix)) return HXPathKind::file;
+    if (path == "/dev/zero (deleted)") return HXPathKind::sharedAnonymous;
+    if (path == "/anon_hugepage (deleted)") return HXPathKind::anonymousHuge;
+    if (path.starts_with("/SYSV")) return HXPathKind::systemV;
+    if (path.starts_with("/memfd:")) return HXPathKind::memfd;
+    return HXPathKind::deletedFile;
+}
+
+std::string_view HXGivenName(std::string_view path) {
+    if (!path.ends_with(']')) return {};
+    for (const std::string_view prefix : {anonymousPrefix, sharedPrefix})
+        if (path.starts_with(prefix)) return path.substr(prefix.size(), path.size() - prefix.size() - 1);
+    return {};
+}
+
+void HXClassifyMapping(HXPathKind kind, HXFileSystemKind fileSystem, uint32_t sharedMemoryDevice,
+                       uint8_t namedTag, HXMapping *mapping) {
+    const bool huge = mapping->has(HXMappingHugePages);
+    const bool kernelsOwn = mapping->isFile() && mapping->device == sharedMemoryDevice;
+    if (isNamelessSharedMemory(kind) && !kernelsOwn && !huge) kind = HXPathKind::deletedFile;
+    mapping->kind = static_cast<uint8_t>(kind);
+    if (!huge && (kernelsOwn || (mapping->isFile() && fileSystem == HXFileSystemKind::swapBacked)))
+        mapping->flags |= HXMappingSwapBacked;
+    if (hasPager(*mapping, kind)) mapping->flags |= HXMappingHasPager;
+    mapping->tag = tagOf(*mapping, kind, namedTag);
+}
+
+uint64_t HXChargedPages(const HXMapping &mapping) {
+    uint64_t pages = difference(mapping.anonymousPages, mapping.lazyFreePages) + mapping.hugePages;
+    if (mapping.has(HXMappingSwapBacked)) pages += difference(mapping.residentPages, mapping.anonymousPages);
+    return pages;
+}
+
+bool HXHoldsOwnPages(const HXMapping &mapping) {
+    if (mapping.has(HXMappingShared) || mapping.kind == static_cast<uint8_t>(HXPathKind::vdso)) return false;
+    return isPrivateAnonymous(mapping) || mapping.anonymousPages > 0 || mapping.swappedPages > 0 ||
+           mapping.hugePages > 0;
+}
+
+uint64_t HXObjectIdentifier(const HXMapping &mapping, const HXRegionContext &context) {
+    const auto kind = static_cast<HXPathKind>(mapping.kind);
+    if (HXHoldsOwnPages(mapping))
+        return identifier(mappingClass, static_cast<uint32_t>(context.pid), mapping.start);
+    if (kind == HXPathKind::vdso) return identifier(vdsoClass, 0, mapping.end - mapping.start);
+    // System V memory's inode number is its identifier, which says nothing outside its namespace and which
+    // other shared memory may have, too.
+    if (kind == HXPathKind::systemV)
+        return identifier(systemVClass, context.ipcNamespace, mapping.inode ^ uint64_t{mapping.device} << 32);
+    return identifier(fileClass, mapping.device, mapping.inode);
+}
+
+vm_region_submap_info_64 HXRegionInfo(const HXMapping &mapping, const HXRegionContext &context) {
+    constexpr uint32_t inheritCopy = 1, inheritNone = 2; // VM_INHERIT_…
+    vm_region_submap_info_64 info{};
+    info.protection = protectionOf(mapping, HXMappingReadable, HXMappingWritable, HXMappingExecutable);
+    info.max_protection = protectionOf(mapping, HXMappingMayRead, HXMappingMayWrite, HXMappingMayExecute);
+    info.inheritance = mapping.has(HXMappingNotInherited) ? inheritNone : inheritCopy;
+    info.offset = isPrivateAnonymous(mapping) ? 0 : mapping.offset;
+    info.user_tag = mapping.tag;
+    info.pages_resident = saturated(HXResidentPages(mapping));
+    info.pages_swapped_out = mapping.swappedPages;
+    info.pages_dirtied = reportedDirtyPages(mapping, context.reportsCharge);
+    info.ref_count = 1;
+    info.external_pager = mapping.has(HXMappingHasPager) ? 1 : 0;
+    info.share_mode = shareModeOf(mapping);
+    info.user_wired_count = mapping.has(HXMappingLocked | HXMappingHugePages) ? 1 : 0;
+    info.pages_reusable = mapping.lazyFreePages;
+    info.object_id_full = HXObjectIdentifier(mapping, context);
+    info.object_id = static_cast<uint32_t>(info.object_id_full ^ info.object_id_full >> 32);
+    if (info.object_id == 0) info.object_id = 1;
+    return info;
+}

@@ -1,0 +1,48 @@
+// Writes a machine file from any host.
+#pragma once
+
+#include "platform/HXPlatform.h"
+#include "platform/capture/HXCaptureWriter.h"
+#include "record/HXAnonymizer.h"
+
+#include <cstdio>
+#include <optional>
+#include <set>
+#include <string>
+#include <vector>
+
+// Holds at most one process's records in memory. The setting "vm.self_region_heft" is changed meanwhile and
+// then put back.
+class HXMachineRecorder {
+  public:
+    // Writes to `out`, which stays the caller's.
+    HXMachineRecorder(HXPlatform &host, std::FILE *out, bool anonymize);
+
+    // Records the host and the processes of `pids`, or all but the recording one. Processes that cannot be
+    // recorded (they vanished meanwhile) are left out and said so on standard error; the kernel's own memory
+    // is recorded with pid 0. False with errno set when writing failed.
+    bool record(const std::vector<int32_t> &pids);
+
+    size_t processCount() const { return _processCount; }
+
+  private:
+    void readLedgerTemplate();
+    void recordHost(const std::optional<int32_t> &selfRegionHeft);
+    void recordKernel();
+    void recordSymbols(const std::set<uint64_t> &addresses);
+    void recordTags(const std::set<uint32_t> &tags);
+    std::optional<std::vector<int32_t>> listedPids();
+    bool write(const std::string &text);
+
+    HXPlatform &_host;
+    std::FILE *const _out;
+    HXAnonymizer _anonymizer;
+    const bool _anonymize;
+    HXCaptureWriter _writer;
+    std::optional<std::vector<std::string>> _ledger;
+    std::optional<size_t> _pageTableIndex;
+    std::optional<std::vector<int32_t>> _listed; // none when the host cannot list its processes
+    std::vector<int32_t> _sorted;
+    kern_return_t _memoryInfoError = 0;
+    size_t _processCount = 0;
+};

@@ -1,0 +1,241 @@
+#include "record/HXMemgraphRecorder.h"
+
+#include "platform/HXRegionTags.h"
+#include "platform/capture/HXMemgraphFormat.h"
+#include "record/HXRegionHeftSetting.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+using namespace HXMemgraphFormat;
+
+namespace {
+
+constexpr size_t kFlushBytes = 1 << 16;
+// No process maps memory from here to the small area at the end of the address space: the page tables, which
+// have no address, are put into the first gap.
+constexpr uint64_t kPageTablePlace = uint64_t{1} << 63;
+constexpr char kPageTableType[] = "page table";
+constexpr uint32_t kPageTableObjectID = 0xFFFFFFFE;
+
+// The page tables are told as memory that is named by its user, under the last tag for such memory: readers
+// go by the name.
+constexpr uint32_t kPageTableTag = HXHostTagLastNamed;
+
+} // namespace
+
+HXMemgraphRecorder::HXMemgraphRecorder(HXPlatform &host, std::FILE *out, CategoryName categoryName)
+    : _host(host), _out(out), _categoryName(std::move(categoryName)), _pageSize(host.vm_kernel_page_size()),
+      _writer(format) {}
+
+bool HXMemgraphRecorder::record(int32_t pid, const std::string &name, bool breakDownPhysHeft,
+                                std::string *reason) {
+    proc_bsdinfo info{};
+    if (_host.proc_pidinfo(pid, PROC_PIDTBSDINFO, 0, &info, sizeof info) != int32_t{sizeof info}) {
+        *reason = std::strerror(errno);
+        return false;
+    }
+    if ((info.pbi_flags & PROC_FLAG_SYSTEM) != 0) {
+        *reason = "the kernel has no memory graph";
+        return false;
+    }
+    const kern_return_t error = _host.task_for_pid(_host.mach_task_self(), pid, &_task);
+    if (error != KERN_SUCCESS) {
+        *reason = _host.mach_error_string(error);
+        return false;
+    }
+    HXRegionHeftSetting setting(_host);
+    setting.set(breakDownPhysHeft ? 1 : 0);
+    const uint64_t pageTableBytes = breakDownPhysHeft ? pageTableSize(pid) : 0;
+    recordProcess(pid, info, name, breakDownPhysHeft);
+    gatherImages();
+    const bool whole = recordRegions(pid, pageTableBytes, reason);
+    _host.mach_port_deallocate(_host.mach_task_self(), _task);
+    if (!whole) return false;
+    if (flush() && std::fflush(_out) == 0) return true;
+    *reason = std::strerror(errno);
+    return false;
+}
+
+bool HXMemgraphRecorder::flush() {
+    const std::string &text = _writer.written();
+    const bool written = std::fwrite(text.data(), 1, text.size(), _out) == text.size();
+    _writer.clear();
+    return written;
+}
+
+void HXMemgraphRecorder::recordProcess(int32_t pid, const proc_bsdinfo &info, const std::string &name,
+                                       bool breakDownPhysHeft) {
+    rusage_info_v4 usage{};
+    if (_host.proc_pid_rusage(pid, RUSAGE_INFO_V4, &usage) != 0) usage = {};
+    _writer.header();
+    _writer.begin(processRecord);
+    _writer.signedNumber(Process::pid, pid);
+    _writer.text(Process::name, name);
+    _writer.text(Process::description, _host.hostDescription());
+    _writer.number(Process::is64bit, (info.pbi_flags & PROC_FLAG_LP64) != 0);
+    _writer.number(Process::pageSize, _pageSize);
+    _writer.number(Process::physHeft, usage.ri_phys_heft);
+    _writer.number(Process::physHeftPeak, usage.ri_lifetime_max_phys_heft);
+    _writer.number(Process::showsPhysHeft, breakDownPhysHeft);
+    // Leaf mappings are written, also where a shared region lies: nothing is left to be cut.
+    _writer.number(Process::sharedRegion, 0);
+    _writer.end();
+}
+
+// The balance of the ledger entry "page_table" in bytes, 0 when there is none.
+uint64_t HXMemgraphRecorder::pageTableSize(int32_t pid) {
+    constexpr int64_t room = 1024;
+    std::vector<ledger_template_info> names(room);
+    int64_t count = room;
+    if (_host.ledger(LEDGER_TEMPLATE_INFO, 0, names.data(), &count) < 0) return 0;
+    const auto end = names.begin() + count;
+    const auto found = std::find_if(names.begin(), end, [](const ledger_template_info &info) {
+        return std::strncmp(info.lti_name, "page_table", sizeof info.lti_name) == 0;
+    });
+    std::vector<ledger_entry_info> entries(static_cast<size_t>(count));
+    const auto index = found - names.begin();
+    if (found == end || _host.ledger(LEDGER_ENTRY_INFO, pid, entries.data(), &count) < 0 || index >= count)
+        return 0;
+    return static_cast<uint64_t>(std::max<int64_t>(entries[static_cast<size_t>(index)].lei_balance, 0));
+}
+
+void HXMemgraphRecorder::gatherImages() {
+    RVSymbolicator *const symbolicator = _host.RVSymbolicatorCreateWithTaskFlagsAndNotification(
+        _task, _host.RVSymbolicatorGetFlagsForNoSymbolOrSourceInfoData(), nullptr);
+    if (symbolicator == nullptr) return;
+    _host.RVSymbolicatorForeachSymbolOwnerAtTime(symbolicator, kRVNow, [&](const RVSymbolOwner &image) {
+        const std::string path = _host.stringByResolvingSymlinksInPath(image.path);
+        for (size_t i = 0; i < image.segmentCount; i++) {
+            const RVRegion &segment = image.segments[i];
+            const std::string_view raw = segment.name;
+            const std::string_view name = raw == "MACH_HEADER" ? "__TEXT" : raw.substr(0, raw.find(' '));
+            _segments.push_back({segment.start, segment.start + segment.length, std::string(name), path});
+        }
+    });
+    _host.RVRelease(symbolicator);
+    std::stable_sort(_segments.begin(), _segments.end(),
+                     [](const Segment &a, const Segment &b) { return a.start < b.start; });
+}
+
+// The segment that overlaps [start, end), or null; ranges are asked for in ascending order. The choice among
+// several is that of the walk over a live process.
+const HXMemgraphRecorder::Segment *HXMemgraphRecorder::nextSegment(uint64_t start, uint64_t end) {
+    for (; _segmentCursor < _segments.size(); _segmentCursor++) {
+        const Segment &segment = _segments[_segmentCursor];
+        const bool beginsWithin = start >= segment.start && start < segment.end;
+        const bool endsWithin = segment.start < end && segment.end >= end;
+        const bool holds = segment.end <= end && segment.start >= start;
+        if (beginsWithin || endsWithin || holds) return &segment;
+        if (segment.start >= start) return nullptr;
+    }
+    return nullptr;
+}
+
+bool HXMemgraphRecorder::recordRegions(int32_t pid, uint64_t pageTableBytes, std::string *reason) {
+    bool needsPageTable = pageTableBytes > 0;
+    // Puts the page tables between `from` and `to` if they are still to be put and fit.
+    const auto putPageTable = [&](uint64_t from, uint64_t to) {
+        const uint64_t place = std::max(from, kPageTablePlace);
+        if (!needsPageTable || to < place || to - place < pageTableBytes) return;
+        needsPageTable = false;
+        recordPageTable(place, pageTableBytes);
+    };
+    for (uint64_t address = 0, size = 0;; address += size) {
+        vm_region_submap_info_64 info{};
+        uint32_t depth = UINT32_MAX, words = VM_REGION_SUBMAP_INFO_COUNT_64;
+        const uint64_t asked = address;
+        const kern_return_t error =
+            _host.mach_vm_region_recurse(_task, &address, &size, &depth, &info, &words);
+        const bool isLast =
+            error == KERN_SUCCESS && (size == 0 || address > UINT64_MAX - size || address + size <= asked);
+        if (error == KERN_INVALID_ADDRESS || isLast) {
+            putPageTable(asked, UINT64_MAX);
+            return true;
+        }
+        if (error != KERN_SUCCESS) {
+            *reason = _host.mach_error_string(error);
+            return false;
+        }
+        if (words <= VM_REGION_SUBMAP_INFO_V1_COUNT_64) info.object_id_full = info.object_id;
+        putPageTable(asked, address);
+        recordRegion(pid, address, size, info);
+        if (_writer.written().size() > kFlushBytes && !flush()) {
+            *reason = std::strerror(errno);
+            return false;
+        }
+    }
+}
+
+void HXMemgraphRecorder::recordRegion(int32_t pid, uint64_t address, uint64_t size,
+                                      const vm_region_submap_info_64 &info) {
+    const Segment *const segment = nextSegment(address, address + size);
+    _writer.begin(regionRecord);
+    _writer.hex(Region::address, address);
+    _writer.hex(Region::length, size);
+    if (segment != nullptr) {
+        _writer.text(Region::type, segment->name);
+        _writer.text(Region::path, segment->path);
+    } else if (info.external_pager != 0) {
+        char path[1024];
+        const int32_t bytes = _host.proc_regionfilename(pid, address, path, sizeof path);
+        _writer.text(Region::type, "mapped file");
+        if (bytes > 0) _writer.text(Region::path, std::string_view(path, static_cast<size_t>(bytes)));
+    } else {
+        _writer.text(Region::type, _categoryName(info.user_tag));
+    }
+    _writer.signedNumber(Region::prot, info.protection);
+    _writer.signedNumber(Region::maxProt, info.max_protection);
+    _writer.hex(Region::offset, info.offset);
+    _writer.number(Region::userTag, info.user_tag);
+    _writer.number(Region::resident, uint64_t{info.pages_resident} * _pageSize);
+    _writer.number(Region::sharedNowPrivate, uint64_t{info.pages_shared_now_private} * _pageSize);
+    _writer.number(Region::swapped, uint64_t{info.pages_swapped_out} * _pageSize);
+    _writer.number(Region::dirty, uint64_t{info.pages_dirtied} * _pageSize);
+    _writer.number(Region::reusable, uint64_t{info.pages_reusable} * _pageSize);
+    _writer.number(Region::refCount, info.ref_count);
+    _writer.number(Region::externalPager, info.external_pager);
+    _writer.number(Region::shareMode, info.share_mode);
+    _writer.hex(Region::objectID, graphObjectID(info.object_id_full, info.object_id));
+    int32_t purge = VM_PURGABLE_DENY;
+    if (_host.mach_vm_purgable_control(_task, address, VM_PURGABLE_GET_STATE, &purge) != KERN_SUCCESS)
+        purge = VM_PURGABLE_DENY;
+    _writer.signedNumber(Region::purgeable, purge);
+    _writer.end();
+}
+
+// Under an object id that no other region has, as memory that was copied on write: such memory is never
+// merged with another process's.
+void HXMemgraphRecorder::recordPageTable(uint64_t address, uint64_t size) {
+    _writer.begin(regionRecord);
+    _writer.hex(Region::address, address);
+    _writer.hex(Region::length, size);
+    _writer.text(Region::type, kPageTableType);
+    _writer.number(Region::userTag, kPageTableTag);
+    _writer.number(Region::resident, size);
+    _writer.number(Region::dirty, size);
+    _writer.number(Region::shareMode, SM_COW);
+    _writer.hex(Region::objectID, freeObjectID(kPageTableObjectID));
+    _writer.end();
+}
+
+// An id of 32 bits for an object's full id: the host's own short id where no other object of the graph has
+// it, so that graphs of one host agree; else the next that is free. Without a full id (0) there is none; all
+// ones stand for an object of the region's own.
+uint32_t HXMemgraphRecorder::graphObjectID(uint64_t fullID, uint32_t preferred) {
+    if (fullID == 0) return 0;
+    if (fullID == UINT64_MAX) return freeObjectID(preferred);
+    const auto known = _objectIDs.find(fullID);
+    if (known != _objectIDs.end()) return known->second;
+    const uint32_t id = freeObjectID(preferred);
+    _objectIDs.emplace(fullID, id);
+    return id;
+}
+
+uint32_t HXMemgraphRecorder::freeObjectID(uint32_t preferred) {
+    uint32_t id = preferred;
+    while (id == 0 || id == UINT32_MAX || !_takenObjectIDs.insert(id).second)
+        id++;
+    return id;
+}

@@ -1,0 +1,58 @@
+// Writes the memory graph of a live process.
+#pragma once
+
+#include "platform/HXPlatform.h"
+#include "platform/capture/HXCaptureWriter.h"
+
+#include <cstdio>
+#include <functional>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <unordered_set>
+#include <vector>
+
+class HXMemgraphRecorder {
+  public:
+    // What the program calls memory of a user tag.
+    using CategoryName = std::function<std::string(uint32_t tag)>;
+
+    // Writes to `out`, which stays the caller's.
+    HXMemgraphRecorder(HXPlatform &host, std::FILE *out, CategoryName categoryName);
+
+    // Records the process `pid` under `name`: with the heft breakdown, or else with what the memory objects
+    // see. The setting "vm.self_region_heft" is changed meanwhile. False with the reason when the process
+    // cannot be examined, vanishes meanwhile, or writing fails.
+    bool record(int32_t pid, const std::string &name, bool breakDownPhysHeft, std::string *reason);
+
+  private:
+    struct Segment {
+        uint64_t start;
+        uint64_t end;
+        std::string name;
+        std::string path;
+    };
+
+    void recordProcess(int32_t pid, const proc_bsdinfo &info, const std::string &name,
+                       bool breakDownPhysHeft);
+    void gatherImages();
+    uint64_t pageTableSize(int32_t pid);
+    bool recordRegions(int32_t pid, uint64_t pageTableBytes, std::string *reason);
+    void recordRegion(int32_t pid, uint64_t address, uint64_t size, const vm_region_submap_info_64 &info);
+    void recordPageTable(uint64_t address, uint64_t size);
+    const Segment *nextSegment(uint64_t start, uint64_t end);
+    uint32_t graphObjectID(uint64_t fullID, uint32_t preferred);
+    uint32_t freeObjectID(uint32_t preferred);
+    bool flush();
+
+    HXPlatform &_host;
+    std::FILE *const _out;
+    const CategoryName _categoryName;
+    const uint32_t _pageSize;
+    mach_port_t _task = 0;
+    std::vector<Segment> _segments; // by start
+    size_t _segmentCursor = 0;
+    std::unordered_map<uint64_t, uint32_t> _objectIDs; // of the graph, by full id
+    std::unordered_set<uint32_t> _takenObjectIDs;
+    HXCaptureWriter _writer;
+};

@@ -1,0 +1,20 @@
+#include "record/HXRegionHeftSetting.h"
+
+namespace {
+constexpr char kName[] = "vm.self_region_heft";
+}
+
+HXRegionHeftSetting::HXRegionHeftSetting(HXPlatform &host) : _host(host) {
+    size_t bytes = sizeof _current;
+    if (_host.sysctlbyname(kName, &_current, &bytes, nullptr, 0) == 0 && bytes == sizeof _current)
+        _found = _current;
+}
+
+HXRegionHeftSetting::~HXRegionHeftSetting() {
+    if (_found) set(*_found);
+}
+
+void HXRegionHeftSetting::set(int32_t value) {
+    if (!_found || value == _current) return;
+    if (_host.sysctlbyname(kName, nullptr, nullptr, &value, sizeof value) == 0) _current = value;
+}

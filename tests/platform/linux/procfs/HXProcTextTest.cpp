@@ -1,0 +1,89 @@
+#include "platform/linux/procfs/HXProcText.h"
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <map>
+
+namespace {
+
+const std::string statTail = " S 1 77 77 0 -1 4194560 1 2 3 4 5 6 7 8 20 0 3 0 4242 1000 200 "
+                             "18446744073709551615 1 2 140724000000000 0 0\n";
+
+TEST(HXProcText, StatFindsTheNameWhateverItHolds) {
+    const std::pair<std::string, std::string> cases[] = {{"bash", "bash"},
+                                                         {"", ""},
+                                                         {"a b) R 99 (c", "a b) R 99 (c"},
+                                                         {"new\nline", "new\nline"},
+                                                         {std::string(100, 'x'), std::string(64, 'x')}};
+    for (const auto &item : cases) {
+        const auto stat = HXParseStat("42 (" + item.first + ")" + statTail);
+        ASSERT_TRUE(stat) << item.first;
+        EXPECT_EQ(stat->comm(), item.second);
+        EXPECT_EQ(stat->state, 'S');
+        EXPECT_EQ((std::vector<uint64_t>{stat->pgid, stat->threadCount, stat->startTime, stat->startStack}),
+                  (std::vector<uint64_t>{77, 3, 4242, 140724000000000}));
+        EXPECT_FALSE(stat->isKernelThread());
+    }
+    EXPECT_TRUE(HXParseStat("2 (kthreadd) S 0 0 0 0 -1 2129984 0 0 0 0 0 0 0 0 20 0 1 0 0 0 0 0 0 0 0 0 0\n")
+                    ->isKernelThread());
+    for (const char *bad :
+         {"", "42 bash S 1", "42 (bash", "42 )bash( S 1", "42 (a) S", "42 (a) S 1 2 3 4 5 6"})
+        EXPECT_FALSE(HXParseStat(bad)) << bad;
+}
+
+TEST(HXProcText, StatusAddsUpTheCharge) {
+    const HXStatusRecord status = HXParseStatus(
+        "Name:\tVmSwap:\t999 kB\nVmLck:\t    20 kB\nVmHWM:\t     100 kB\nVmRSS:\t 90 kB\nRssAnon:\t 10 kB\n"
+        "RssFile:\t 60 kB\nRssShmem:\t 20 kB\nVmPTE:\t 4 kB\nVmSwap:\t 8 kB\nHugetlbPages:\t 2048 kB\n"
+        "Threads:\t12\n");
+    EXPECT_EQ(status.heftSize(), (10u + 20 + 4 + 8 + 2048) * 1024);
+    EXPECT_EQ(status.peakHeftSize(), (100u + 4 + 2048) * 1024);
+    EXPECT_EQ(HXParseStatus("RssAnon: 500 kB\nVmHWM: 10 kB").peakHeftSize(), 500u * 1024);
+    EXPECT_EQ(HXParseStatus("").heftSize(), 0u);
+    EXPECT_EQ(HXParseLabelled("xLazyFree: 1\nLazyFree:\n", "LazyFree:"), std::nullopt);
+}
+
+TEST(HXProcText, MountInfo) {
+    std::map<uint32_t, std::string> types;
+    HXParseMountInfo("22 27 0:21 / /proc rw,relatime - proc proc rw\n"
+                     "bad line\n36 35 98:0 /mnt1 /a\\040-\\040b rw master:1 shared:2 - ext3 /dev/root rw\n"
+                     "37 1 0:1048575 / /x rw\n38 1 0:44 / /shm rw - tmpfs tmpfs rw",
+                     [&](uint32_t device, std::string_view type) { types[device] = type; });
+    const std::map<uint32_t, std::string> expected = {
+        {HXDeviceNumber(0, 21), "proc"}, {HXDeviceNumber(98, 0), "ext3"}, {HXDeviceNumber(0, 44), "tmpfs"}};
+    EXPECT_EQ(types, expected);
+}
+
+template <typename Word>
+std::string bytes(std::initializer_list<Word> words) {
+    return {reinterpret_cast<const char *>(words.begin()), words.size() * sizeof(Word)};
+}
+
+TEST(HXProcText, AuxiliaryVectorTellsTheWordSize) {
+    const auto wide = HXParseAuxiliaryVector(bytes<uint64_t>({33, 0x7fff0000, 31, 0x7fff1234, 0, 0, 31, 9}));
+    ASSERT_TRUE(wide);
+    EXPECT_TRUE(wide->is64bit);
+    EXPECT_EQ(wide->execFileName, 0x7fff1234u);
+    const auto narrow = HXParseAuxiliaryVector(bytes<uint32_t>({32, 0xf7f00000, 31, 0xfffe1234, 0, 0}));
+    ASSERT_TRUE(narrow);
+    EXPECT_FALSE(narrow->is64bit);
+    EXPECT_EQ(narrow->execFileName, 0xfffe1234u);
+    EXPECT_FALSE(HXParseAuxiliaryVector(bytes<uint64_t>({0, 0})));
+}
+
+TEST(HXProcText, StackPointersAndArguments) {
+    const std::pair<const char *, std::optional<uint64_t>> cases[] = {
+        {"running\n", std::nullopt},
+        {"-1 0x7ffd00001000 0x7f0000001234\n", 0x7ffd00001000},
+        {"7 0x1 0x2 0x3 0x4 0x5 0x6 0x7ffd00002000 0x7f0000001234\n", 0x7ffd00002000},
+        {"-1 7 8\n", std::nullopt},
+        {"-1 0x 0x1\n", std::nullopt}};
+    for (const auto &item : cases)
+        EXPECT_EQ(HXParseStackPointer(item.first), item.second) << item.first;
+    using namespace std::string_view_literals;
+    EXPECT_EQ(HXSplitArguments("a\0\0b c\0"sv), (std::vector{"a"sv, ""sv, "b c"sv}));
+    EXPECT_EQ(HXSplitArguments("a\0b"sv), (std::vector{"a"sv, "b"sv}));
+}
+
+} // namespace
