@@ -1,23 +1,10 @@
 #include "support/HXBuilders.h"
 
-#include <cstdlib>
-#include <filesystem>
+#include "support/HXTemporaryFolder.h"
+
 #include <unistd.h>
 
 namespace {
-// A directory of this run's files.
-struct Scratch {
-    std::string path;
-    Scratch() {
-        std::string name = std::filesystem::temp_directory_path() / "heft-tests-XXXXXX";
-        path = ::mkdtemp(name.data());
-    }
-    ~Scratch() {
-        std::error_code ignored;
-        std::filesystem::remove_all(path, ignored);
-    }
-};
-
 // Points a descriptor at a file until it is destroyed.
 class Redirection {
   public:
@@ -64,7 +51,7 @@ std::string contentOf(const std::string &path) {
 }
 
 std::string temporaryPath() {
-    static Scratch scratch;
+    static HXTemporaryFolder folder;
     static int count = 0;
-    return scratch.path + "/" + std::to_string(++count);
+    return folder / std::to_string(++count);
 }

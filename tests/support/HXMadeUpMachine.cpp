@@ -4,15 +4,20 @@
 
 #include <stdexcept>
 
-HXMadeUpParts::HXMadeUpParts(const std::string &text) {
-    std::string file = "heft-machine 1\n", reason;
-    for (size_t i = 0; i < text.size(); i++) {
-        const bool isTab = text.compare(i, 2, "  ") == 0;
-        file += isTab ? '\t' : text[i];
+std::unique_ptr<HXMachine> HXLoadMachine(const std::string &records, std::string *reason) {
+    std::string file = "heft-machine 1\n";
+    for (size_t i = 0; i < records.size(); i++) {
+        const bool isTab = records.compare(i, 2, "  ") == 0;
+        file += isTab ? '\t' : records[i];
         i += isTab;
     }
+    return HXMachine::loadText(file, reason);
+}
+
+HXMadeUpParts::HXMadeUpParts(const std::string &text) {
+    std::string reason;
     realServices.setWorkerCount(3);
-    machine = HXMachine::loadText(file, &reason);
+    machine = HXLoadMachine(text, &reason);
     if (!machine) throw std::runtime_error("bad machine file: " + reason);
 }
 

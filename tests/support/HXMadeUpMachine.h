@@ -7,14 +7,17 @@
 #include <memory>
 #include <string>
 
+// The machine that `records` describe: a machine file without its first line, in which two blanks stand for
+// the TAB before a field. Null with *reason set when it does not load.
+std::unique_ptr<HXMachine> HXLoadMachine(const std::string &records, std::string *reason);
+
 struct HXMadeUpParts {
     explicit HXMadeUpParts(const std::string &text);
     HXLinuxServices realServices;
     std::unique_ptr<const HXMachine> machine;
 };
 
-// The current platform while it lives. `text` is a machine file without its first line, in which two blanks
-// stand for the TAB before a field.
+// The current platform while it lives, loaded by HXLoadMachine.
 class HXMadeUpMachine : private HXMadeUpParts, public HXReplayPlatform {
   public:
     explicit HXMadeUpMachine(const std::string &text);
