@@ -64,17 +64,21 @@ TEST(HXLinuxKernelTextTest, vmallocAreas) {
 }
 
 TEST(HXLinuxKernelTextTest, meminfo) {
-    const auto found = HXParseKernelMeminfo(
+    const std::string whole =
         "MemTotal:       16332304 kB\nSReclaimable:     800000 kB\nSUnreclaim:       232304 kB\n"
-        "Percpu:  688 kB\nZswap: 12 kB\nZswapped: 40 kB\nSecPageTables: 8 kB\nHugePages_Total:       0\n");
+        "KernelStack: 0 kB\nZswap: 12 kB\nZswapped: 40 kB\nHugePages_Total:       0\n";
+    const auto found = HXParseKernelMeminfo(whole);
     ASSERT_TRUE(found);
     EXPECT_EQ(found->totalSize, 16332304ull * 1024);
     EXPECT_EQ(found->slabUnreclaimableSize, 232304u * 1024);
-    EXPECT_EQ(found->perCpuSize, 688u * 1024);
     EXPECT_EQ(found->zswapSize, 12u * 1024);
     EXPECT_EQ(found->kernelStackSize, 0u);
-    EXPECT_FALSE(HXParseKernelMeminfo(""));
-    EXPECT_FALSE(HXParseKernelMeminfo("MemTotal: many kB\n"));
+    EXPECT_EQ(found->perCpuSize, std::nullopt) << "a kernel that does not tell";
+    for (const std::string needed : {"MemTotal:", "SReclaimable:", "SUnreclaim:", "KernelStack:"}) {
+        std::string text = whole;
+        EXPECT_FALSE(HXParseKernelMeminfo(text.replace(text.find(needed), needed.size(), needed + "x")))
+            << needed;
+    }
 }
 
 TEST(HXLinuxKernelTextTest, modulesZonesAndZram) {
@@ -89,7 +93,17 @@ TEST(HXLinuxKernelTextTest, modulesZonesAndZram) {
         4008u);
 
     EXPECT_EQ(HXParseZramUsedSize("  4096000   74 1228800  0 2457600  0  0  0  0\n"), 1228800u);
-    EXPECT_EQ(HXParseZramUsedSize(""), 0u);
+    EXPECT_EQ(HXParseZramUsedSize("4096000   74 x\n"), std::nullopt);
+    EXPECT_EQ(HXParseZoneinfoPresentPages("present x\n"), std::nullopt);
+}
+
+TEST(HXLinuxKernelTextTest, allocationSites) {
+    const auto sites = HXParseAllocinfo("allocinfo - version: 1.0\n#     <size>  <calls> <tag info>\n"
+                                        " 99 9 nowhere func:f\n 98 9 a.c:x func:f\n 97 9 a.c:1 f\n"
+                                        " 96 x a.c:1 func:f\n 10 1 b.c:3 [m] func:g accurate:no\n");
+    ASSERT_EQ(sites.size(), 1u);
+    EXPECT_EQ(std::tuple(sites[0].size, sites[0].path, sites[0].line, sites[0].module, sites[0].function),
+              std::tuple(10u, "b.c", 3, "m", "g"));
 }
 
 } // namespace

@@ -39,8 +39,16 @@ TEST(HXProcText, StatusAddsUpTheCharge) {
         "Threads:\t12\n");
     EXPECT_EQ(status.heftSize(), (10u + 20 + 4 + 8 + 2048) * 1024);
     EXPECT_EQ(status.peakHeftSize(), (100u + 4 + 2048) * 1024);
-    EXPECT_EQ(HXParseStatus("RssAnon: 500 kB\nVmHWM: 10 kB").peakHeftSize(), 500u * 1024);
-    EXPECT_EQ(HXParseStatus("").heftSize(), 0u);
+    const std::string needed = "RssAnon: 500 kB\nRssShmem: 0 kB\nVmSwap: 0 kB\nVmPTE: 0 kB\n";
+    EXPECT_EQ(HXParseStatus(needed + "VmHWM: 10 kB").peakHeftSize(), 500u * 1024);
+    EXPECT_EQ(HXParseStatus("Threads: 1").heftSize(), 0u) << "a zombie";
+    EXPECT_EQ(HXParseStatus("Threads: 1").pageTablesHeld(), 0u);
+    EXPECT_EQ(HXParseStatus("VmRSS: 5 kB").pageTablesHeld(), std::nullopt);
+    for (const std::string figure : {"RssAnon:", "RssShmem:", "VmSwap:", "VmPTE:"}) {
+        std::string text = needed;
+        EXPECT_EQ(HXParseStatus(text.replace(text.find(figure), figure.size(), "x")).heftSize(), std::nullopt)
+            << figure;
+    }
     EXPECT_EQ(HXParseLabelled("xLazyFree: 1\nLazyFree:\n", "LazyFree:"), std::nullopt);
 }
 
