@@ -105,8 +105,8 @@ bool Reader::mapsMaySuffice() {
 bool Reader::readMapsAndScan() {
     const HXDescriptor maps = readFile("maps");
     if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return true;
-    if (!mapsSuffice() || !HXScanFigures(_request.directory, _setting.pageShift, _request.status->swapSize.value_or(0),
-                                         _addressSpace.get()))
+    if (!mapsSuffice() || !HXScanFigures(_request.directory, _setting.pageShift,
+                                         _request.status->swapSize.value_or(0), _addressSpace.get()))
         return false;
     // If the process executed another program before its page tables were opened, those are not of this.
     if (!isAlive(maps)) _addressSpace->endError = MACH_SEND_INVALID_DEST;
@@ -153,7 +153,7 @@ void Reader::readMappings(const HXDescriptor &file) {
     size_t length = 0;
     for (bool complete = false; !complete;) {
         // The kernel hands out a page or so at a time; as much as fits is parsed together.
-        const ssize_t got = HXReadFully(file.get(), buffer.subspan(length));
+        const ssize_t got = file.readFully(buffer.subspan(length));
         _readFailed = got < 0;
         complete = got <= 0 || length + static_cast<size_t>(got) < buffer.size();
         length += static_cast<size_t>(std::max<ssize_t>(got, 0));

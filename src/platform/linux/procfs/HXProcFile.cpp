@@ -19,13 +19,6 @@ HXDescriptor HXOpenAt(HXDirectoryView directory, const char *name, int flags) {
     return HXDescriptor(::openat(directory.get(), name, always | flags));
 }
 
-ssize_t HXReadFully(int descriptor, std::span<char> buffer) {
-    HXDescriptor borrowed(descriptor);
-    const ssize_t got = borrowed.readFully(buffer);
-    borrowed.release();
-    return got;
-}
-
 std::optional<std::string_view> HXReadOnce(HXDirectoryView directory, const char *name,
                                            std::span<char> buffer) {
     const HXDescriptor file = HXOpenAt(directory, name);

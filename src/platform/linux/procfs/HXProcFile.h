@@ -22,9 +22,6 @@ std::span<char> HXScratchBuffer();
 // `flags`: more of open(2), as O_DIRECTORY or O_PATH. Not open with errno set.
 HXDescriptor HXOpenAt(HXDirectoryView directory, const char *name, int flags = 0);
 
-// As HXDescriptor::readFully.
-ssize_t HXReadFully(int descriptor, std::span<char> buffer);
-
 // The content of a file that the kernel hands out by one read call if there is room (stat, status, comm).
 // The text lives in `buffer`, and is cut to it.
 std::optional<std::string_view> HXReadOnce(HXDirectoryView directory, const char *name,
