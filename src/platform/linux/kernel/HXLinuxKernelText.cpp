@@ -26,11 +26,13 @@ bool parseSlabCache(std::string_view line, HXSlabCache *cache) {
     if (tunables == std::string_view::npos || slabdata == std::string_view::npos) return false;
     HXTextCursor head{line.substr(0, tunables)};
     HXTextCursor tail{line.substr(slabdata + slabdataLabel.size())};
-    uint64_t activeSlabs = 0, objectsPerSlab = 0, objects = 0;
-    for (uint64_t *const number :
-         {&cache->pagesPerSlab, &objectsPerSlab, &cache->objectSize, &objects, &cache->activeObjects})
-        if (!HXIsNumber(head.lastWord(), number)) return false;
-    if (!takeNumber(tail, &activeSlabs) || !takeNumber(tail, &cache->slabs)) return false;
+    if (!HXIsNumber(head.lastWord(), &cache->pagesPerSlab)) return false;
+    head.lastWord(); // objects per slab
+    if (!HXIsNumber(head.lastWord(), &cache->objectSize)) return false;
+    head.lastWord(); // all objects
+    if (!HXIsNumber(head.lastWord(), &cache->activeObjects)) return false;
+    tail.word(); // active slabs
+    if (!takeNumber(tail, &cache->slabs)) return false;
     const size_t begin = head.rest.find_first_not_of(' ');
     if (begin == std::string_view::npos) return false;
     cache->name = head.rest.substr(begin, head.rest.find_last_not_of(' ') + 1 - begin);

@@ -58,11 +58,12 @@ const std::string sample =
     // A number that outgrows its column moves all that follows.
     modern("7f1000000000-7fff00000000 ---p 00000000 00:00 0 ", {0, 123456789012, 0, 0, 4, 0, 0, 0}, "mw me") +
     modern("7fff00000000-7fff00021000 rw-p 00000000 00:00 0                          [stack]",
-           {132, 12, 0, 0, 12, 0, 0, 0}, "rd wr mr mw me gd");
+           {132, 12, 0, 0, 12, 0, 0, 0}, "rd wr mr mw me gd") +
+    "ffffffffff600000-ffffffffff601000 --xp 00000000 00:00 0 [vsyscall]\n";
 
 TEST(HXMapsParser, ReadsSmapsWhereverItIsCut) {
     const auto whole = parse(sample);
-    ASSERT_EQ(whole.size(), 4u);
+    ASSERT_EQ(whole.size(), 5u);
     const HXMapping &code = whole[0].mapping;
     EXPECT_EQ((std::vector<uint64_t>{code.start, code.end, code.offset, code.device, code.inode}),
               (std::vector<uint64_t>{0x400000, 0x452000, 0x1000, HXDeviceNumber(0xfe, 0x0a), 1835}));

@@ -7,7 +7,7 @@
 
 namespace {
 
-const std::string statTail = " S 1 77 77 0 -1 4194560 1 2 3 4 5 6 7 8 20 0 3 0 4242 1000 200 "
+const std::string statTail = " S 1 77 78 0 -1 4194560 1 2 3 4 5 6 7 8 20 0 3 0 4242 1000 200 "
                              "18446744073709551615 1 2 140724000000000 0 0\n";
 
 TEST(HXProcText, StatFindsTheNameWhateverItHolds) {
