@@ -11,7 +11,7 @@
 namespace {
 // No function is longer; an address further behind the last symbol before it lies in no function, but in a
 // gap that modules or generated code have left.
-constexpr uint64_t kLongestFunctionSize = 256 * 1024;
+constexpr uint64_t kLongestFunctionSize = uint64_t{256} << 10;
 } // namespace
 
 void HXLinuxKernelSymbolicator::loadSymbols() {

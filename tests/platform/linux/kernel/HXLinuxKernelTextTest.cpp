@@ -13,30 +13,27 @@ std::string row(const Facts &...facts) {
     ((text << facts << ' '), ...);
     return text.str() + "|";
 }
-std::string slabs(const char *text) {
-    std::string rows;
-    for (const HXSlabCache &c : HXParseSlabinfo(text))
-        rows += row(c.name, c.activeObjects, c.objectSize, c.slabs, c.pagesPerSlab);
-    return rows;
+std::string show(const HXSlabCache &c) {
+    return row(c.name, c.activeObjects, c.objectSize, c.slabs, c.pagesPerSlab);
 }
-std::string areas(const char *text) {
-    std::string rows;
-    for (const HXVmallocArea &a : HXParseVmallocinfo(text))
-        rows += row(a.function, a.module, a.callerAddress, a.pages);
-    return rows;
+std::string show(const HXVmallocArea &a) {
+    return row(a.function, a.module, a.callerAddress, a.pages);
 }
-std::string modules(const char *text) {
-    std::string rows;
-    for (const HXKernelModule &module : HXParseModules(text))
-        rows += row(module.name, module.size);
-    return rows;
+std::string show(const HXKernelModule &m) {
+    return row(m.name, m.size);
 }
-std::string sites(const char *text) {
-    std::string rows;
-    for (const HXAllocationSite &s : HXParseAllocinfo(text))
-        rows += row(s.size, s.path, s.line, s.module, s.function);
-    return rows;
+std::string show(const HXAllocationSite &s) {
+    return row(s.size, s.path, s.line, s.module, s.function);
 }
+template <auto parse>
+std::string rows(const char *text) {
+    std::string all;
+    for (const auto &record : parse(text))
+        all += show(record);
+    return all;
+}
+constexpr auto slabs = rows<HXParseSlabinfo>, areas = rows<HXParseVmallocinfo>;
+constexpr auto modules = rows<HXParseModules>, sites = rows<HXParseAllocinfo>;
 
 TEST(HXLinuxKernelTextTest, linesOfManyKernels) {
     static const struct {
@@ -64,7 +61,7 @@ TEST(HXLinuxKernelTextTest, linesOfManyKernels) {
         {areas, "0x(ptrval)-0x(ptrval) 8192 f.part.34+0x2/0x1 pages=1 vmalloc", "f.part.34  0 1 |"},
         // callers without a symbol, or none at all; a module's name needs a letter
         {areas, "0xff-0xff   20480 0xffff pages=4 vmalloc N0=4", "  65535 4 |"},
-        {areas, "0xff-0xff   20480 [] [m pages=4 vmalloc", "  0 4 |"},
+        {areas, "0xff-0xff   20480 [] m] [m pages=4 vmalloc", "  0 4 |"},
         // no memory of their own, and broken lines
         {areas, "0x14-0xc3    8192 acpi_map+0x1bc/0x1e0 phys=0x00000000000a0000 ioremap", ""},
         {areas, "0xb7-0x14 1048576 pcpu_get_vm_areas+0x0/0x1050 vmalloc\n0xb7-0x14 20480 unpurged vm_area",
