@@ -65,7 +65,7 @@ HXStatRecord kernelStat() {
     return stat;
 }
 
-std::optional<HXAuxiliaryVector> readAuxiliaryVector(const HXDescriptor &directory, const char *name) {
+std::optional<HXAuxiliaryVector> readAuxiliaryVector(HXDirectoryView directory, const char *name) {
     char buffer[2048]; // some twenty entries of 16 bytes
     const auto bytes = HXReadOnce(directory, name, buffer);
     return bytes ? HXParseAuxiliaryVector(*bytes) : std::nullopt;
@@ -146,7 +146,7 @@ std::string_view HXExecutedPath(const HXProgramName &name) {
     return name.executable;
 }
 
-const HXDescriptor &HXLinuxProcesses::directory() {
+HXDirectoryView HXLinuxProcesses::directory() {
     const std::lock_guard lock(_mutex);
     if (!_directory) _directory = HXOpenAt(AT_FDCWD, _procPath.c_str(), O_DIRECTORY);
     return _directory;
@@ -217,7 +217,7 @@ namespace {
 
 // 64-bit programs have their stack far above what 32-bit ones can reach. Where the kernel does not tell the
 // stack, the width of the auxiliary vector's words does.
-bool is64bit(const HXStatRecord &stat, const HXDescriptor &directory) {
+bool is64bit(const HXStatRecord &stat, HXDirectoryView directory) {
     if (stat.startStack > UINT32_MAX) return true;
     const auto vector = readAuxiliaryVector(directory, (std::to_string(stat.pid) + "/auxv").c_str());
     return vector ? vector->is64bit : sizeof(void *) == 8;

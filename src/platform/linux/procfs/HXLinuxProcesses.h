@@ -37,7 +37,7 @@ class HXLinuxProcesses {
         bool isUsed = false;
     };
 
-    const HXDescriptor &directory();
+    HXDirectoryView directory();
     std::optional<HXStatRecord> readStat(int32_t pid);
     std::optional<HXStatRecord> takeListed(int32_t pid);
     std::optional<HXStatRecord> statOf(int32_t pid);

@@ -53,8 +53,8 @@ std::optional<uint64_t> HXStatusRecord::heftSize() const {
 
 std::optional<uint64_t> HXStatusRecord::peakHeftSize() const {
     const auto size = heftSize();
-    if (!size || !peakResidentSize) return size;
-    return std::max(*size, *peakResidentSize + pageTableSize.value_or(0) + hugePageSize.value_or(0));
+    if (!size || !peakResidentSize || !pageTableSize) return size;
+    return std::max(*size, *peakResidentSize + *pageTableSize + hugePageSize.value_or(0));
 }
 
 HXStatusRecord HXParseStatus(std::string_view text) {

@@ -25,6 +25,9 @@ std::string show(const HXKernelModule &m) {
 std::string show(const HXAllocationSite &s) {
     return row(s.size, s.path, s.line, s.module, s.function);
 }
+std::string show(const HXKernelSymbol &s) {
+    return row(s.address, s.name, s.module, s.isCode);
+}
 template <auto parse>
 std::string rows(const char *text) {
     std::string all;
@@ -34,6 +37,7 @@ std::string rows(const char *text) {
 }
 constexpr auto slabs = rows<HXParseSlabinfo>, areas = rows<HXParseVmallocinfo>;
 constexpr auto modules = rows<HXParseModules>, sites = rows<HXParseAllocinfo>;
+constexpr auto symbols = rows<HXParseKallsyms>;
 
 TEST(HXLinuxKernelTextTest, linesOfManyKernels) {
     static const struct {
@@ -61,7 +65,7 @@ TEST(HXLinuxKernelTextTest, linesOfManyKernels) {
         {areas, "0x(ptrval)-0x(ptrval) 8192 f.part.34+0x2/0x1 pages=1 vmalloc", "f.part.34  0 1 |"},
         // callers without a symbol, or none at all; a module's name needs a letter
         {areas, "0xff-0xff   20480 0xffff pages=4 vmalloc N0=4", "  65535 4 |"},
-        {areas, "0xff-0xff   20480 [] m] [m pages=4 vmalloc", "  0 4 |"},
+        {areas, "0xff-0xff   20480 [] mod] [mod pages=4 vmalloc", "  0 4 |"},
         // no memory of their own, and broken lines
         {areas, "0x14-0xc3    8192 acpi_map+0x1bc/0x1e0 phys=0x00000000000a0000 ioremap", ""},
         {areas, "0xb7-0x14 1048576 pcpu_get_vm_areas+0x0/0x1050 vmalloc\n0xb7-0x14 20480 unpurged vm_area",
@@ -71,6 +75,10 @@ TEST(HXLinuxKernelTextTest, linesOfManyKernels) {
         {modules,
          "nf_tables 303104 5 nft_ct, Live 0xffffffffc0a4b000\nbroken\nodd 16384 - - Unloading 0x0 (OE-)\n",
          "nf_tables 303104 |odd 16384 |"},
+        {symbols, "ff t b\t[m]\n0a T a\n0b W w\n0c w v\n0d D d\n",
+         "10 a  1 |11 w  1 |12 v  1 |13 d  0 |255 b m 1 |"},
+        {symbols, "0f T a\nx T b\n1 T\n1 T \n1T  c\n1 TTd\n", "15 a  1 |"},
+        {symbols, "00 T hidden\n00 T too\n", ""},
         {sites, "allocinfo - version: 1.0\n#     <size>  <calls> <tag info>\n 99 9 nowhere func:f\n", ""},
         {sites, " 98 9 a.c:x func:f\n 97 9 a.c:1 f\n 96 x a.c:1 func:f\n", ""},
         {sites, " 10 1 b.c:3 [m] func:g accurate:no\n 11 1 c.c:4 func:h", "10 b.c 3 m g |11 c.c 4  h |"},

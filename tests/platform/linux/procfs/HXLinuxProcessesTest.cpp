@@ -49,6 +49,8 @@ TEST(HXLinuxProcesses, AScriptIsNamedByItsOwnMemory) {
     EXPECT_EQ(info.pbi_flags, 0u);
     EXPECT_EQ(processes.proc_pidinfo(7, PROC_PIDTBSDINFO, &info, sizeof info - 1), 0);
     EXPECT_EQ(errno, ENOMEM);
+    ASSERT_EQ(processes.proc_pidinfo(0, PROC_PIDTBSDINFO, &info, sizeof info), 136);
+    EXPECT_EQ(info.pbi_flags, PROC_FLAG_SYSTEM | PROC_FLAG_LP64);
     EXPECT_EQ(processes.proc_pidinfo(7, 1, &info, sizeof info), 0);
     EXPECT_EQ(errno, EINVAL);
     EXPECT_EQ(HXLinuxProcesses(proc / "none").proc_listallpids(nullptr, 0), -1);

@@ -41,6 +41,7 @@ TEST(HXProcText, StatusAddsUpTheCharge) {
     EXPECT_EQ(status.peakHeftSize(), (100u + 4 + 2048) * 1024);
     const std::string needed = "RssAnon: 500 kB\nRssShmem: 0 kB\nVmSwap: 0 kB\nVmPTE: 0 kB\n";
     EXPECT_EQ(HXParseStatus(needed + "VmHWM: 10 kB").peakHeftSize(), 500u * 1024);
+    EXPECT_EQ(HXParseStatus(needed + "VmHWM: 900 kB").peakHeftSize(), 900u * 1024) << "no huge-page pool";
     EXPECT_EQ(HXParseStatus("Threads: 1").heftSize(), 0u) << "a zombie";
     EXPECT_EQ(HXParseStatus("Threads: 1").pageTablesHeld(), 0u);
     EXPECT_EQ(HXParseStatus("VmRSS: 5 kB").pageTablesHeld(), std::nullopt);
