@@ -1,8 +1,10 @@
 // Reading the kernel's own memory record, beside reading the files that it is made from. Needs root.
 #include "platform/linux/HXLinuxPlatform.h"
-#include "platform/linux/kernel/HXLinuxKernelFile.h"
+#include "platform/linux/procfs/HXProcFile.h"
 
 #include <benchmark/benchmark.h>
+
+#include <fcntl.h>
 
 namespace {
 
@@ -10,7 +12,7 @@ void readKernelFiles(benchmark::State &state) {
     for (auto _ : state)
         for (const char *path :
              {"/proc/slabinfo", "/proc/vmallocinfo", "/proc/meminfo", "/proc/zoneinfo", "/proc/modules"})
-            benchmark::DoNotOptimize(HXReadKernelFile(path));
+            benchmark::DoNotOptimize(HXReadText(AT_FDCWD, path));
 }
 BENCHMARK(readKernelFiles)->Unit(benchmark::kMillisecond);
 

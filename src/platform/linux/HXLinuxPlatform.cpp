@@ -86,9 +86,11 @@ int32_t HXLinuxPlatform::proc_pid_rusage(int32_t pid, int32_t flavor, rusage_inf
     if (flavor != RUSAGE_INFO_V4) return failed(EINVAL);
     const auto status = statusOf(pid, HXLinuxTask::StatusUse::usage);
     if (!status) return -1;
+    const auto size = status->heftSize(), peakSize = status->peakHeftSize();
+    if (!size || !peakSize) return failed(ENODATA);
     *info = {};
-    info->ri_phys_heft = status->heftSize();
-    info->ri_lifetime_max_phys_heft = status->peakHeftSize();
+    info->ri_phys_heft = *size;
+    info->ri_lifetime_max_phys_heft = *peakSize;
     return 0;
 }
 
@@ -122,8 +124,10 @@ int32_t HXLinuxPlatform::ledger(int32_t command, int32_t pid, void *buffer, int6
     } else {
         const auto status = statusOf(pid, HXLinuxTask::StatusUse::ledger);
         if (!status) return -1;
+        const auto pageTableSize = status->pageTablesHeld();
+        if (!pageTableSize) return failed(ENODATA);
         ledger_entry_info entry{};
-        entry.lei_balance = static_cast<int64_t>(status->pageTableSize);
+        entry.lei_balance = static_cast<int64_t>(*pageTableSize);
         std::memcpy(buffer, &entry, sizeof entry);
     }
     *count = 1;

@@ -57,7 +57,7 @@ std::optional<std::string> HXLinuxServices::readFileStart(const std::string &pat
     const HXDescriptor file = openRegularFile(path, &status);
     if (!file) return std::nullopt;
     std::string content(bytes, '\0');
-    const ssize_t got = HXReadFully(file.get(), std::span(content));
+    const ssize_t got = file.readFully(content);
     if (got < 0) return std::nullopt;
     content.resize(static_cast<size_t>(got));
     return content;
@@ -77,7 +77,7 @@ std::optional<std::string> HXLinuxServices::readFile(const std::string &path, ui
     for (size_t room = static_cast<size_t>(status.st_size) + 1;; room = std::max(step, content.size())) {
         const size_t length = content.size();
         content.resize(length + room);
-        const ssize_t got = HXReadFully(file.get(), std::span(content).subspan(length));
+        const ssize_t got = file.readFully(std::span(content).subspan(length));
         if (got < 0) return std::nullopt;
         content.resize(length + static_cast<size_t>(got));
         if (content.size() > limit) {

@@ -121,7 +121,7 @@ TEST_F(HXLinuxPlatformTest, ReadsStatusBehindLongListsOfGroups) {
     std::string groups;
     for (int i = 0; i < 65536; i++)
         groups += std::to_string(1000000 + i) + " ";
-    const std::string figures = "\nRssAnon:\t    8 kB\nVmPTE:\t    4 kB\n";
+    const std::string figures = "\nRssAnon:\t8 kB\nRssShmem:\t0 kB\nVmPTE:\t4 kB\nVmSwap:\t0 kB\n";
     const struct {
         std::string text;
         int32_t result;
@@ -311,8 +311,8 @@ TEST_F(HXLinuxPlatformTest, PageTablesOfMadeUpProcess) {
 TEST_F(HXLinuxPlatformTest, FiguresAndLedger) {
     proc.process(10, "p", mapping);
     const auto status = [&](int pageTable) {
-        proc.write("10/status", "VmHWM: 900 kB\nRssAnon: 100 kB\nVmPTE: " + std::to_string(pageTable) +
-                                    " kB\nThreads: 1\n");
+        proc.write("10/status", "VmHWM: 900 kB\nRssAnon: 100 kB\nRssShmem: 0 kB\nVmSwap: 0 kB\nVmPTE: " +
+                                    std::to_string(pageTable) + " kB\nThreads: 1\n");
     };
     status(8);
     const mach_port_t task = open(10);

@@ -18,8 +18,8 @@ struct HXLinuxKernelReadings {
     std::optional<std::vector<HXSlabCache>> caches;
     std::vector<HXVmallocArea> areas;
     std::vector<HXKernelModule> modules;
-    uint64_t presentPages = 0; // of RAM, managed or not; 0 when not known
-    uint64_t zramSize = 0;     // bytes that zram devices hold
+    std::optional<uint64_t> presentPages; // of RAM, managed or not
+    uint64_t zramSize = 0;                // bytes that zram devices hold
 };
 
 struct HXLinuxKernelAccount {

@@ -2,63 +2,62 @@
 
 #include "platform/HXSafeText.h"
 #include "platform/linux/kernel/HXLinuxKernelAccount.h"
-#include "platform/linux/kernel/HXLinuxKernelFile.h"
 #include "platform/linux/kernel/HXLinuxKernelSymbols.h"
+#include "platform/linux/procfs/HXProcFile.h"
+
+#include <fcntl.h>
 
 #include <cerrno>
 #include <cstring>
-#include <dirent.h>
-#include <fcntl.h>
-#include <unistd.h>
 
-// What the readings are views of.
+// What the readings are views of; none for files that there are not.
 struct HXLinuxKernelMemory::Texts {
-    std::string meminfo, zoneinfo, slabinfo, vmallocinfo, modules;
-    bool hasSlabinfo = false;
+    std::optional<std::string> slabinfo, vmallocinfo, meminfo, zoneinfo, modules;
 };
 
 kern_return_t HXLinuxKernelMemory::readTexts(Texts *texts) const {
-    const auto isDenied = [](int error) { return error == EACCES || error == EPERM; };
-    int slabError = 0, vmallocError = 0;
+    const HXDescriptor proc = HXOpenAt(AT_FDCWD, _procPath.c_str(), O_DIRECTORY);
+    bool isDenied = false;
+    const auto read = [&](const char *name) {
+        auto text = HXReadText(proc, name);
+        if (!text && (errno == EACCES || errno == EPERM)) isDenied = true;
+        return text;
+    };
     // One after the other without pause: the figures of these three are set against each other.
-    auto slabinfo = HXReadKernelFile(_procPath + "/slabinfo", &slabError);
-    auto vmallocinfo = HXReadKernelFile(_procPath + "/vmallocinfo", &vmallocError);
-    texts->meminfo = HXReadKernelFile(_procPath + "/meminfo");
-    if (isDenied(slabError) || isDenied(vmallocError)) return KERN_NO_ACCESS;
-    texts->hasSlabinfo = slabinfo.has_value();
-    texts->slabinfo = std::move(slabinfo).value_or(std::string());
-    texts->vmallocinfo = std::move(vmallocinfo).value_or(std::string());
-    texts->zoneinfo = HXReadKernelFile(_procPath + "/zoneinfo");
-    texts->modules = HXReadKernelFile(_procPath + "/modules");
+    texts->slabinfo = read("slabinfo");
+    texts->vmallocinfo = read("vmallocinfo");
+    texts->meminfo = HXReadText(proc, "meminfo");
+    if (isDenied) return KERN_NO_ACCESS;
+    texts->zoneinfo = HXReadText(proc, "zoneinfo");
+    texts->modules = HXReadText(proc, "modules");
     return KERN_SUCCESS;
 }
 
 // /sys/kernel/slab has a directory for every cache, and links to it for caches that were merged into it.
-void HXLinuxKernelMemory::readCacheKinds(HXLinuxKernelReadings *readings) const {
-    const int directory = open((_sysPath + "/kernel/slab").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (directory < 0) return;
-    for (HXSlabCache &cache : *readings->caches) {
+void HXLinuxKernelMemory::readCacheKinds(std::vector<HXSlabCache> &caches) const {
+    const HXDescriptor directory = HXOpenAt(AT_FDCWD, (_sysPath + "/kernel/slab").c_str(), O_DIRECTORY);
+    if (!directory) return;
+    for (HXSlabCache &cache : caches) {
         if (cache.slabs == 0 || cache.name.find('/') != std::string_view::npos || cache.name.front() == '.')
             continue;
-        const std::string path = std::string(cache.name) + "/reclaim_account";
-        const int file = openat(directory, path.c_str(), O_RDONLY | O_CLOEXEC);
-        if (file < 0) continue;
-        char kind = 0;
-        if (read(file, &kind, 1) == 1) cache.reclaimable = kind != '0';
-        close(file);
+        char buffer[4]; // "0\n" or "1\n"
+        const auto kind =
+            HXReadOnce(directory, (std::string(cache.name) + "/reclaim_account").c_str(), buffer);
+        if (kind && !kind->empty()) cache.reclaimable = kind->front() != '0';
     }
-    close(directory);
 }
 
 uint64_t HXLinuxKernelMemory::readZramSize() const {
-    const std::string path = _sysPath + "/block";
-    DIR *directory = opendir(path.c_str());
-    if (!directory) return 0;
+    const HXDescriptor directory = HXOpenAt(AT_FDCWD, (_sysPath + "/block").c_str(), O_DIRECTORY);
     uint64_t size = 0;
-    while (const dirent *entry = readdir(directory))
-        if (std::strncmp(entry->d_name, "zram", 4) == 0)
-            size += HXParseZramUsedSize(HXReadKernelFile(path + "/" + entry->d_name + "/mm_stat"));
-    closedir(directory);
+    HXForEachEntry(directory, [&](const char *name) {
+        char buffer[512]; // nine numbers
+        const bool isZram = std::string_view(name).starts_with("zram");
+        const auto text =
+            isZram ? HXReadOnce(directory, (std::string(name) + "/mm_stat").c_str(), buffer) : std::nullopt;
+        if (text) size += HXParseZramUsedSize(*text).value_or(0);
+        return true;
+    });
     return size;
 }
 
@@ -81,19 +80,19 @@ kern_return_t HXLinuxKernelMemory::mach_memory_info(mach_port_t, mach_zone_name 
                                                     uint32_t *recordCount) {
     Texts texts;
     if (const kern_return_t error = readTexts(&texts); error != KERN_SUCCESS) return error;
-    const auto meminfo = HXParseKernelMeminfo(texts.meminfo);
+    const auto meminfo = texts.meminfo ? HXParseKernelMeminfo(*texts.meminfo) : std::nullopt;
     if (!meminfo) return KERN_FAILURE;
 
     HXLinuxKernelReadings readings;
     readings.pageSize = _pageSize;
     readings.meminfo = *meminfo;
-    if (texts.hasSlabinfo) {
-        readings.caches = HXParseSlabinfo(texts.slabinfo);
-        readCacheKinds(&readings);
+    if (texts.slabinfo) {
+        readings.caches = HXParseSlabinfo(*texts.slabinfo);
+        readCacheKinds(*readings.caches);
     }
-    readings.areas = HXParseVmallocinfo(texts.vmallocinfo);
-    readings.modules = HXParseModules(texts.modules);
-    readings.presentPages = HXParseZoneinfoPresentPages(texts.zoneinfo);
+    if (texts.vmallocinfo) readings.areas = HXParseVmallocinfo(*texts.vmallocinfo);
+    if (texts.modules) readings.modules = HXParseModules(*texts.modules);
+    if (texts.zoneinfo) readings.presentPages = HXParseZoneinfoPresentPages(*texts.zoneinfo);
     readings.zramSize = readZramSize();
 
     const HXLinuxKernelAccount account = HXAccountForKernelMemory(readings);
@@ -114,7 +113,7 @@ kern_return_t HXLinuxKernelMemory::vm_deallocate(mach_port_t, const void *addres
 }
 
 std::vector<OSKextInfo> HXLinuxKernelMemory::OSKextCopyLoadedKextInfo() {
-    const std::string text = HXReadKernelFile(_procPath + "/modules");
+    const std::string text = HXReadText(AT_FDCWD, (_procPath + "/modules").c_str()).value_or("");
     std::vector<OSKextInfo> modules;
     for (const HXKernelModule &module : HXParseModules(text))
         modules.push_back({HXKernelLoadTagForModule(module.name), HXSafeName(module.name)});

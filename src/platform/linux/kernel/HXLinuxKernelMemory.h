@@ -11,7 +11,7 @@
 #include <string>
 #include <vector>
 
-struct HXLinuxKernelReadings;
+struct HXSlabCache;
 
 // Reads /proc and /sys anew for every call. May be called from any thread.
 class HXLinuxKernelMemory {
@@ -22,7 +22,7 @@ class HXLinuxKernelMemory {
         : _procPath(std::move(procPath)), _sysPath(std::move(sysPath)), _pageSize(pageSize) {}
 
     // As HXPlatform says. KERN_NO_ACCESS when slabinfo or vmallocinfo may not be read (both are root's),
-    // KERN_FAILURE when meminfo can't be.
+    // KERN_FAILURE when meminfo can't be, or lacks a needed figure.
     kern_return_t mach_memory_info(mach_port_t host, mach_zone_name **names, uint32_t *nameCount,
                                    mach_zone_info **zones, uint32_t *zoneCount,
                                    mach_memory_info_record **records, uint32_t *recordCount);
@@ -48,7 +48,7 @@ class HXLinuxKernelMemory {
   private:
     struct Texts;
     kern_return_t readTexts(Texts *texts) const;
-    void readCacheKinds(HXLinuxKernelReadings *readings) const;
+    void readCacheKinds(std::vector<HXSlabCache> &caches) const;
     uint64_t readZramSize() const;
     template <typename Record>
     void handOut(const std::vector<Record> &from, Record **records, uint32_t *count);

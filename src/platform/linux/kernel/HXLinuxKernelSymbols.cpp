@@ -2,23 +2,25 @@
 
 #include "platform/HXSafeText.h"
 #include "platform/linux/kernel/HXLinuxKernelAccount.h"
-#include "platform/linux/kernel/HXLinuxKernelFile.h"
+#include "platform/linux/procfs/HXProcFile.h"
+
+#include <fcntl.h>
 
 #include <algorithm>
 
 namespace {
 // No function is longer; an address further behind the last symbol before it lies in no function, but in a
 // gap that modules or generated code have left.
-constexpr uint64_t kLongestFunctionSize = 256 * 1024;
+constexpr uint64_t kLongestFunctionSize = uint64_t{256} << 10;
 } // namespace
 
 void HXLinuxKernelSymbolicator::loadSymbols() {
-    _symbolText = HXReadKernelFile(_procPath + "/kallsyms");
+    _symbolText = HXReadText(AT_FDCWD, (_procPath + "/kallsyms").c_str()).value_or("");
     _symbols = HXParseKallsyms(_symbolText);
 }
 
 void HXLinuxKernelSymbolicator::loadSources() {
-    const std::string text = HXReadKernelFile(_procPath + "/allocinfo");
+    const std::string text = HXReadText(AT_FDCWD, (_procPath + "/allocinfo").c_str()).value_or("");
     for (const HXAllocationSite &site : HXParseAllocinfo(text)) {
         Source &source = _sources[HXKernelSiteForFunction(site.function, site.module)];
         if (source.path.empty() || site.size > source.size)

@@ -1,66 +1,15 @@
 #include "platform/linux/kernel/HXLinuxKernelText.h"
 
+#include "platform/linux/procfs/HXTextNumber.h"
+
 #include <algorithm>
 #include <array>
-#include <charconv>
-#include <cstring>
 
 namespace {
 
-// Takes the next line off `text`, without its newline.
-std::string_view takeLine(std::string_view &text) {
-    const char *newline = static_cast<const char *>(std::memchr(text.data(), '\n', text.size()));
-    const size_t length = newline ? static_cast<size_t>(newline - text.data()) : text.size();
-    const std::string_view line = text.substr(0, length);
-    text.remove_prefix(std::min(length + 1, text.size()));
-    return line;
-}
-
-// Takes the next word off `line`; empty at its end.
-std::string_view takeWord(std::string_view &line) {
-    const auto isBlank = [](char c) { return c == ' ' || c == '\t'; };
-    size_t begin = 0;
-    while (begin < line.size() && isBlank(line[begin]))
-        begin++;
-    size_t end = begin;
-    while (end < line.size() && !isBlank(line[end]))
-        end++;
-    const std::string_view word = line.substr(begin, end - begin);
-    line.remove_prefix(end);
-    return word;
-}
-
-// The last word of `line`, taken off its end.
-std::string_view takeLastWord(std::string_view &line) {
-    while (!line.empty() && line.back() == ' ')
-        line.remove_suffix(1);
-    const size_t blank = line.rfind(' ');
-    const size_t begin = blank == std::string_view::npos ? 0 : blank + 1;
-    const std::string_view word = line.substr(begin);
-    line.remove_suffix(word.size());
-    return word;
-}
-
-std::string_view trimmed(std::string_view text) {
-    while (!text.empty() && text.back() == ' ')
-        text.remove_suffix(1);
-    while (!text.empty() && text.front() == ' ')
-        text.remove_prefix(1);
-    return text;
-}
-
-bool startsWith(std::string_view text, std::string_view prefix) {
-    return text.substr(0, prefix.size()) == prefix;
-}
-
-template <typename Number>
-bool parseNumber(std::string_view word, Number *number, int base = 10) {
-    const auto [end, error] = std::from_chars(word.data(), word.data() + word.size(), *number, base);
-    return error == std::errc() && end == word.data() + word.size() && !word.empty();
-}
-
-bool takeNumber(std::string_view &line, uint64_t *number) {
-    return parseNumber(takeWord(line), number);
+// The next word of `line`, if that is a number.
+bool takeNumber(HXTextCursor &line, uint64_t *number) {
+    return HXIsNumber(line.word(), number);
 }
 
 // "[ext4]" gives "ext4"; anything else nothing.
@@ -71,80 +20,68 @@ std::string_view moduleInBrackets(std::string_view word) {
 
 // A cache's name may hold blanks and colons (its module chose it), so the line is read from its fixed parts.
 bool parseSlabCache(std::string_view line, HXSlabCache *cache) {
+    constexpr std::string_view slabdataLabel = " : slabdata ";
     const size_t tunables = line.find(" : tunables ");
-    const size_t slabdata = line.find(" : slabdata ");
+    const size_t slabdata = line.find(slabdataLabel);
     if (tunables == std::string_view::npos || slabdata == std::string_view::npos) return false;
-    std::string_view head = line.substr(0, tunables);
-    std::string_view tail = line.substr(slabdata + std::strlen(" : slabdata "));
-    uint64_t activeSlabs = 0, objectsPerSlab = 0, objects = 0;
-    const bool whole = parseNumber(takeLastWord(head), &cache->pagesPerSlab) &&
-                       parseNumber(takeLastWord(head), &objectsPerSlab) &&
-                       parseNumber(takeLastWord(head), &cache->objectSize) &&
-                       parseNumber(takeLastWord(head), &objects) &&
-                       parseNumber(takeLastWord(head), &cache->activeObjects) &&
-                       takeNumber(tail, &activeSlabs) && takeNumber(tail, &cache->slabs);
-    cache->name = trimmed(head);
-    return whole && !cache->name.empty();
+    HXTextCursor head{line.substr(0, tunables)};
+    HXTextCursor tail{line.substr(slabdata + slabdataLabel.size())};
+    if (!HXIsNumber(head.lastWord(), &cache->pagesPerSlab)) return false;
+    head.lastWord(); // objects per slab
+    if (!HXIsNumber(head.lastWord(), &cache->objectSize)) return false;
+    head.lastWord(); // all objects
+    if (!HXIsNumber(head.lastWord(), &cache->activeObjects)) return false;
+    tail.word(); // active slabs
+    if (!takeNumber(tail, &cache->slabs)) return false;
+    const size_t begin = head.rest.find_first_not_of(' ');
+    if (begin == std::string_view::npos) return false;
+    cache->name = head.rest.substr(begin, head.rest.find_last_not_of(' ') + 1 - begin);
+    return true;
 }
 
 // The caller of an area, "function+0xOFFSET/0xSIZE", or its address when the kernel has no symbol for it.
 void parseCaller(std::string_view word, HXVmallocArea *area) {
     const size_t plus = word.find("+0x");
+    HXTextCursor address{word};
     if (plus != std::string_view::npos)
         area->function = word.substr(0, plus);
-    else if (startsWith(word, "0x"))
-        parseNumber(word.substr(2), &area->callerAddress, 16);
+    else if (address.skip("0x"))
+        HXIsNumber(address.rest, &area->callerAddress, 16);
 }
 
 // "START-END SIZE CALLER [MODULE] pages=N …"; the addresses are hashed or hidden and not needed.
-bool parseVmallocArea(std::string_view line, HXVmallocArea *area) {
-    if (line.find(" pages=") == std::string_view::npos) return false;
+bool parseVmallocArea(std::string_view text, HXVmallocArea *area) {
+    if (text.find(" pages=") == std::string_view::npos) return false;
+    HXTextCursor line{text};
     uint64_t size = 0;
-    takeWord(line);
+    line.word();
     if (!takeNumber(line, &size)) return false;
-    for (std::string_view word = takeWord(line); !word.empty(); word = takeWord(line)) {
-        if (startsWith(word, "pages=")) return parseNumber(word.substr(6), &area->pages) && area->pages > 0;
-        if (const std::string_view module = moduleInBrackets(word); !module.empty())
+    for (HXTextCursor word{line.word()}; !word.rest.empty(); word.rest = line.word()) {
+        if (word.skip("pages=")) return HXIsNumber(word.rest, &area->pages) && area->pages > 0;
+        if (const std::string_view module = moduleInBrackets(word.rest); !module.empty())
             area->module = module;
         else
-            parseCaller(word, area);
+            parseCaller(word.rest, area);
     }
     return false;
 }
 
-bool parseAllocationSite(std::string_view line, HXAllocationSite *site) {
+// "SIZE CALLS PATH:LINE [MODULE] func:FUNCTION …"
+bool parseAllocationSite(std::string_view text, HXAllocationSite *site) {
+    HXTextCursor line{text};
     uint64_t calls = 0;
     if (!takeNumber(line, &site->size) || !takeNumber(line, &calls)) return false;
-    const std::string_view position = takeWord(line);
+    const std::string_view position = line.word();
     const size_t colon = position.rfind(':');
-    if (colon == std::string_view::npos || !parseNumber(position.substr(colon + 1), &site->line))
-        return false;
+    if (colon == std::string_view::npos || !HXIsNumber(position.substr(colon + 1), &site->line)) return false;
     site->path = position.substr(0, colon);
-    std::string_view word = takeWord(line);
-    site->module = moduleInBrackets(word);
-    if (!site->module.empty()) word = takeWord(line);
-    if (!startsWith(word, "func:")) return false;
-    site->function = word.substr(5);
+    HXTextCursor word{line.word()};
+    site->module = moduleInBrackets(word.rest);
+    if (!site->module.empty()) word.rest = line.word();
+    if (!word.skip("func:")) return false;
+    site->function = word.rest;
     return true;
 }
-
-constexpr struct {
-    std::string_view name;
-    uint64_t HXKernelMeminfo::*field;
-} kMeminfoFields[] = {
-    {"MemTotal:", &HXKernelMeminfo::totalSize},
-    {"SReclaimable:", &HXKernelMeminfo::slabReclaimableSize},
-    {"SUnreclaim:", &HXKernelMeminfo::slabUnreclaimableSize},
-    {"KernelStack:", &HXKernelMeminfo::kernelStackSize},
-    {"PageTables:", &HXKernelMeminfo::pageTableSize},
-    {"SecPageTables:", &HXKernelMeminfo::secondaryPageTableSize},
-    {"VmallocUsed:", &HXKernelMeminfo::vmallocUsedSize},
-    {"Percpu:", &HXKernelMeminfo::perCpuSize},
-    {"Mlocked:", &HXKernelMeminfo::mlockedSize},
-    {"Zswap:", &HXKernelMeminfo::zswapSize},
-    {"HardwareCorrupted:", &HXKernelMeminfo::hardwareCorruptedSize},
-    {"Balloon:", &HXKernelMeminfo::balloonSize},
-};
 
 // The value of a hexadecimal digit, or above 15.
 constexpr std::array<uint8_t, 256> hexDigitValues() {
@@ -174,20 +111,24 @@ bool parseSymbol(std::string_view line, HXKernelSymbol *symbol) {
     return true;
 }
 
-// The records of all lines that `parse` accepts.
-template <typename Record>
-std::vector<Record> parseLines(std::string_view text, bool (*parse)(std::string_view, Record *)) {
-    std::vector<Record> records;
-    while (!text.empty()) {
-        Record record;
-        if (parse(takeLine(text), &record)) records.push_back(record);
-    }
-    return records;
+// "NAME SIZE …"
+bool parseModule(std::string_view text, HXKernelModule *module) {
+    HXTextCursor line{text};
+    module->name = line.word();
+    return takeNumber(line, &module->size);
 }
 
-bool parseModule(std::string_view line, HXKernelModule *module) {
-    module->name = takeWord(line);
-    return takeNumber(line, &module->size);
+// The records of all lines that `parse` accepts.
+template <typename Record>
+std::vector<Record> parseLines(std::string_view text, bool (*parse)(std::string_view, Record *),
+                               size_t expectedCount = 0) {
+    std::vector<Record> records;
+    records.reserve(expectedCount);
+    for (HXTextCursor cursor{text}; !cursor.rest.empty();) {
+        Record record;
+        if (parse(cursor.line(), &record)) records.push_back(record);
+    }
+    return records;
 }
 
 } // namespace
@@ -207,36 +148,45 @@ std::vector<HXKernelModule> HXParseModules(std::string_view text) {
 }
 
 std::optional<HXKernelMeminfo> HXParseKernelMeminfo(std::string_view text) {
-    HXKernelMeminfo meminfo;
-    while (!text.empty()) {
-        std::string_view line = takeLine(text);
-        const std::string_view name = takeWord(line);
-        uint64_t kibibytes = 0;
-        if (!takeNumber(line, &kibibytes)) continue;
-        for (const auto &field : kMeminfoFields)
-            if (field.name == name) meminfo.*field.field = kibibytes * 1024;
-    }
-    if (meminfo.totalSize == 0) return std::nullopt;
-    return meminfo;
+    using Meminfo = HXKernelMeminfo;
+    static constexpr HXLabelledFigure<Meminfo> figures[] = {
+        {"MemTotal:", &Meminfo::totalSize},
+        {"SReclaimable:", &Meminfo::slabReclaimableSize},
+        {"SUnreclaim:", &Meminfo::slabUnreclaimableSize},
+        {"KernelStack:", &Meminfo::kernelStackSize},
+        {"PageTables:", &Meminfo::pageTableSize},
+        {"SecPageTables:", &Meminfo::secondaryPageTableSize},
+        {"VmallocUsed:", &Meminfo::vmallocUsedSize},
+        {"Percpu:", &Meminfo::perCpuSize},
+        {"Mlocked:", &Meminfo::mlockedSize},
+        {"Zswap:", &Meminfo::zswapSize},
+        {"HardwareCorrupted:", &Meminfo::hardwareCorruptedSize},
+        {"Balloon:", &Meminfo::balloonSize},
+    };
+    const Meminfo meminfo = HXParseLabelledFigures(text, figures);
+    const bool isWhole = meminfo.totalSize && meminfo.slabReclaimableSize && meminfo.slabUnreclaimableSize &&
+                         meminfo.kernelStackSize;
+    return isWhole ? std::optional(meminfo) : std::nullopt;
 }
 
-uint64_t HXParseZoneinfoPresentPages(std::string_view text) {
-    uint64_t presentPages = 0;
-    while (!text.empty()) {
-        std::string_view line = takeLine(text);
+std::optional<uint64_t> HXParseZoneinfoPresentPages(std::string_view text) {
+    std::optional<uint64_t> presentPages;
+    for (HXTextCursor cursor{text}; !cursor.rest.empty();) {
+        HXTextCursor line{cursor.line()};
         uint64_t pages = 0;
-        if (takeWord(line) == "present" && takeNumber(line, &pages)) presentPages += pages;
+        if (line.word() == "present" && takeNumber(line, &pages))
+            presentPages = presentPages.value_or(0) + pages;
     }
     return presentPages;
 }
 
-uint64_t HXParseZramUsedSize(std::string_view text) {
+std::optional<uint64_t> HXParseZramUsedSize(std::string_view text) {
     // orig_data_size compr_data_size mem_used_total … (the kernel's zram document)
-    uint64_t original = 0, compressed = 0, used = 0;
-    std::string_view line = takeLine(text);
-    const bool whole =
-        takeNumber(line, &original) && takeNumber(line, &compressed) && takeNumber(line, &used);
-    return whole ? used : 0;
+    HXTextCursor line{text};
+    uint64_t used = 0;
+    line.word();
+    line.word();
+    return takeNumber(line, &used) ? std::optional(used) : std::nullopt;
 }
 
 std::vector<HXAllocationSite> HXParseAllocinfo(std::string_view text) {
@@ -244,16 +194,10 @@ std::vector<HXAllocationSite> HXParseAllocinfo(std::string_view text) {
 }
 
 std::vector<HXKernelSymbol> HXParseKallsyms(std::string_view text) {
-    std::vector<HXKernelSymbol> symbols;
-    symbols.reserve(text.size() / 40);
-    bool anyAddress = false;
-    while (!text.empty()) {
-        HXKernelSymbol symbol;
-        if (!parseSymbol(takeLine(text), &symbol)) continue;
-        anyAddress |= symbol.address != 0;
-        symbols.push_back(symbol);
-    }
-    if (!anyAddress) return {};
+    constexpr size_t usualLineLength = 40;
+    auto symbols = parseLines(text, parseSymbol, text.size() / usualLineLength);
+    const auto isHidden = [](const HXKernelSymbol &symbol) { return symbol.address == 0; };
+    if (std::all_of(symbols.begin(), symbols.end(), isHidden)) return {};
     const auto before = [](const HXKernelSymbol &a, const HXKernelSymbol &b) {
         return a.address < b.address;
     };

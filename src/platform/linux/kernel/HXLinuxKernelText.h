@@ -41,31 +41,29 @@ struct HXKernelModule {
 };
 std::vector<HXKernelModule> HXParseModules(std::string_view text);
 
-// The fields of /proc/meminfo that describe the kernel's memory, in bytes; 0 for those that this kernel
-// lacks.
+// The figures of /proc/meminfo that describe the kernel's memory, in bytes (proc(5)).
 struct HXKernelMeminfo {
-    uint64_t totalSize = 0;
-    uint64_t slabReclaimableSize = 0;
-    uint64_t slabUnreclaimableSize = 0;
-    uint64_t kernelStackSize = 0;
-    uint64_t pageTableSize = 0;
-    uint64_t secondaryPageTableSize = 0; // of virtual machines (since 6.1)
-    uint64_t vmallocUsedSize = 0;        // 0 before 5.3, which did not count it
-    uint64_t perCpuSize = 0;             // since 4.20
-    uint64_t mlockedSize = 0;
-    uint64_t zswapSize = 0; // the pool's pages (since 5.19)
-    uint64_t hardwareCorruptedSize = 0;
-    uint64_t balloonSize = 0; // since 6.15
+    // Needed: every kernel since 2.6.32 has them.
+    std::optional<uint64_t> totalSize, slabReclaimableSize, slabUnreclaimableSize, kernelStackSize;
+    // None for those that this kernel lacks.
+    std::optional<uint64_t> pageTableSize;
+    std::optional<uint64_t> secondaryPageTableSize; // of virtual machines (since 6.1)
+    std::optional<uint64_t> vmallocUsedSize;        // 0 before 5.3, which did not count it
+    std::optional<uint64_t> perCpuSize;             // since 4.20
+    std::optional<uint64_t> mlockedSize;
+    std::optional<uint64_t> zswapSize; // the pool's pages (since 5.19)
+    std::optional<uint64_t> hardwareCorruptedSize;
+    std::optional<uint64_t> balloonSize; // since 6.15
 };
-// None when the text has no MemTotal.
+// None when the text lacks a needed figure.
 std::optional<HXKernelMeminfo> HXParseKernelMeminfo(std::string_view text);
 
 // Pages of RAM that the kernel found, whether or not it manages them: the `present` figures of /proc/zoneinfo
-// added up.
-uint64_t HXParseZoneinfoPresentPages(std::string_view text);
+// added up; none when the text has no such figure.
+std::optional<uint64_t> HXParseZoneinfoPresentPages(std::string_view text);
 
-// Bytes that a zram device holds (`mem_used_total` of its mm_stat); 0 when there is no such figure.
-uint64_t HXParseZramUsedSize(std::string_view text);
+// Bytes that a zram device holds (`mem_used_total` of its mm_stat); none when there is no such figure.
+std::optional<uint64_t> HXParseZramUsedSize(std::string_view text);
 
 // One allocation site of /proc/allocinfo (kernels with memory allocation profiling, since 6.10).
 struct HXAllocationSite {

@@ -97,14 +97,16 @@ std::unique_ptr<HXAddressSpace> Reader::read() {
 bool Reader::mapsMaySuffice() {
     if (!_setting.mayScan || _request.needsDirtyPages || !HXPageScan::isComplete()) return false;
     if (!_request.status) _request.status = HXReadStatus(_request.directory);
-    return _request.status && _request.status->lockedSize == 0 && _request.status->hugePageSize == 0;
+    if (!_request.status) return false;
+    const HXStatusRecord &status = *_request.status;
+    return status.lockedSize.value_or(0) == 0 && status.hugePageSize.value_or(0) == 0;
 }
 
 bool Reader::readMapsAndScan() {
     const HXDescriptor maps = readFile("maps");
     if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return true;
-    if (!mapsSuffice() || !HXScanFigures(_request.directory, _setting.pageShift, _request.status->swapSize,
-                                         _addressSpace.get()))
+    if (!mapsSuffice() || !HXScanFigures(_request.directory, _setting.pageShift,
+                                         _request.status->swapSize.value_or(0), _addressSpace.get()))
         return false;
     // If the process executed another program before its page tables were opened, those are not of this.
     if (!isAlive(maps)) _addressSpace->endError = MACH_SEND_INVALID_DEST;
@@ -123,7 +125,7 @@ bool Reader::mapsSuffice() const {
 // smaps costs less than to find out.
 bool Reader::hasFreedLazily() const {
     constexpr uint64_t fewPagesPerMapping = 128;
-    const uint64_t pages = _request.status->residentSize >> _setting.pageShift;
+    const uint64_t pages = _request.status->residentSize.value_or(0) >> _setting.pageShift;
     if (pages > fewPagesPerMapping * _addressSpace->count()) return true;
     char buffer[4096];
     const auto text = HXReadOnce(_request.directory, "smaps_rollup", buffer);
@@ -151,7 +153,7 @@ void Reader::readMappings(const HXDescriptor &file) {
     size_t length = 0;
     for (bool complete = false; !complete;) {
         // The kernel hands out a page or so at a time; as much as fits is parsed together.
-        const ssize_t got = HXReadFully(file.get(), buffer.subspan(length));
+        const ssize_t got = file.readFully(buffer.subspan(length));
         _readFailed = got < 0;
         complete = got <= 0 || length + static_cast<size_t>(got) < buffer.size();
         length += static_cast<size_t>(std::max<ssize_t>(got, 0));

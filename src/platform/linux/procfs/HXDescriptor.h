@@ -3,6 +3,8 @@
 
 #include <unistd.h>
 
+#include <cstdint>
+#include <span>
 #include <utility>
 
 class HXDescriptor {
@@ -23,6 +25,25 @@ class HXDescriptor {
     // Keeps errno.
     void reset(int descriptor = -1);
 
+    // One read(2), begun anew when a signal interrupts it: bytes read, 0 at the end, -1 with errno set.
+    ssize_t read(std::span<char> buffer) const;
+    // Reads from the descriptor's place until `buffer` is full or the file ends: bytes read. -1 with errno
+    // set when a read fails, the first or a later one: what came before it is no answer.
+    ssize_t readFully(std::span<char> buffer) const;
+    // Whether `buffer` could be filled from `position`, in bytes, which leaves the descriptor's place alone.
+    bool readAt(uint64_t position, std::span<char> buffer) const;
+
   private:
     int _descriptor = -1;
+};
+
+// An open directory that names are relative to: a look at a descriptor, or AT_FDCWD.
+class HXDirectoryView {
+  public:
+    HXDirectoryView(int descriptor) : _descriptor(descriptor) {}
+    HXDirectoryView(const HXDescriptor &directory) : _descriptor(directory.get()) {}
+    int get() const { return _descriptor; }
+
+  private:
+    int _descriptor;
 };

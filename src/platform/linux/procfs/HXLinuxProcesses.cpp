@@ -5,31 +5,26 @@
 #include "platform/linux/procfs/HXTextNumber.h"
 
 #include <fcntl.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
+#include <bit>
 #include <cerrno>
 #include <climits>
-#include <cstdio>
 #include <cstring>
 #include <vector>
 
 namespace {
 
-constexpr std::string_view deletedSuffix = " (deleted)";
-constexpr size_t commLength = 15; // what the kernel keeps of a program's name
+constexpr std::string_view kDeletedSuffix = " (deleted)";
+constexpr size_t kCommLength = 15; // what the kernel keeps of a program's name
 
-struct PidText {
-    char text[32];
-    explicit PidText(int32_t pid, const char *file = "") {
-        std::snprintf(text, sizeof text, "%d%s", pid, file);
-    }
-};
-
+// The pid that an entry of /proc is named by.
 std::optional<int32_t> pidOf(const char *name) {
-    if (*name < '1' || *name > '9') return std::nullopt;
-    return HXWholeNumber<int32_t>(name);
+    int32_t pid = 0;
+    if (*name < '1' || *name > '9' || !HXIsNumber(name, &pid)) return std::nullopt;
+    return pid;
 }
 
 // Fills a field that needs no zero at its end.
@@ -70,53 +65,51 @@ HXStatRecord kernelStat() {
     return stat;
 }
 
-std::optional<HXAuxiliaryVector> readAuxiliaryVector(int process, const char *name) {
-    char buffer[2048];
-    const auto bytes = HXReadOnce(process, name, buffer);
+std::optional<HXAuxiliaryVector> readAuxiliaryVector(HXDirectoryView directory, const char *name) {
+    char buffer[2048]; // some twenty entries of 16 bytes
+    const auto bytes = HXReadOnce(directory, name, buffer);
     return bytes ? HXParseAuxiliaryVector(*bytes) : std::nullopt;
 }
 
 // Whether a page is in memory and no file's: reading another one might wait for a file system that the
 // process mapped there, or for the process itself.
-bool isPresentAndOwn(int pagemap, uint64_t page) {
-    constexpr uint64_t present = uint64_t{1} << 63, ofFile = uint64_t{1} << 61;
-    uint64_t entry = 0;
-    const auto position = static_cast<off_t>(page * sizeof entry);
-    if (::pread(pagemap, &entry, sizeof entry, position) != sizeof entry) return false;
-    return (entry & (present | ofFile)) == present;
+bool isPresentAndOwn(const HXDescriptor &pagemap, uint64_t page) {
+    constexpr uint64_t present = uint64_t{1} << 63, ofFile = uint64_t{1} << 61; // pagemap of proc(5)
+    std::array<char, sizeof(uint64_t)> bytes;
+    if (!pagemap.readAt(page * bytes.size(), bytes)) return false;
+    return (std::bit_cast<uint64_t>(bytes) & (present | ofFile)) == present;
 }
 
 // The text at `address` of the process's memory up to its zero byte.
-std::optional<std::string> readPresentText(int process, uint64_t address) {
+std::optional<std::string> readPresentText(const HXDescriptor &process, uint64_t address) {
     const HXDescriptor memory = HXOpenAt(process, "mem");
     const HXDescriptor pagemap = HXOpenAt(process, "pagemap");
     if (!memory || !pagemap) return std::nullopt;
     const auto pageSize = static_cast<uint64_t>(::sysconf(_SC_PAGESIZE));
     std::string text;
-    char piece[PATH_MAX];
+    char buffer[PATH_MAX];
     while (text.size() < PATH_MAX) {
-        if (!isPresentAndOwn(pagemap.get(), address / pageSize)) return std::nullopt;
-        const size_t length = std::min<uint64_t>(pageSize - address % pageSize, sizeof piece);
-        const ssize_t got = ::pread(memory.get(), piece, length, static_cast<off_t>(address));
-        if (got <= 0) return std::nullopt;
-        const std::string_view read(piece, static_cast<size_t>(got));
-        const size_t end = read.find('\0');
-        text += read.substr(0, end);
+        const size_t length = std::min<uint64_t>(pageSize - address % pageSize, sizeof buffer);
+        if (!isPresentAndOwn(pagemap, address / pageSize) || !memory.readAt(address, {buffer, length}))
+            return std::nullopt;
+        const std::string_view piece(buffer, length);
+        const size_t end = piece.find('\0');
+        text += piece.substr(0, end);
         if (end != std::string_view::npos) return text;
-        address += read.size();
+        address += length;
     }
     return std::nullopt;
 }
 
 // The path that was executed, from the process's own memory.
-std::optional<std::string> readExecutedPath(int process) {
+std::optional<std::string> readExecutedPath(const HXDescriptor &process) {
     const auto vector = readAuxiliaryVector(process, "auxv");
-    if (!vector || vector->execFileName == 0) return std::nullopt;
-    return readPresentText(process, vector->execFileName);
+    if (!vector || !vector->execFileName) return std::nullopt;
+    return readPresentText(process, *vector->execFileName);
 }
 
 bool isNamed(std::string_view path, std::string_view comm) {
-    return HXBaseName(path).substr(0, commLength) == comm;
+    return HXBaseName(path).substr(0, kCommLength) == comm;
 }
 
 // The area in the layout that HXPlatform::sysctl tells.
@@ -153,21 +146,19 @@ std::string_view HXExecutedPath(const HXProgramName &name) {
     return name.executable;
 }
 
-int HXLinuxProcesses::directory() {
+HXDirectoryView HXLinuxProcesses::directory() {
     const std::lock_guard lock(_mutex);
-    if (!_directory) _directory = HXDescriptor(::open(_procPath.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    return _directory.get();
+    if (!_directory) _directory = HXOpenAt(AT_FDCWD, _procPath.c_str(), O_DIRECTORY);
+    return _directory;
 }
 
 HXDescriptor HXLinuxProcesses::open(int32_t pid) {
-    return HXDescriptor(::openat(directory(), PidText(pid).text, O_PATH | O_DIRECTORY | O_CLOEXEC));
+    return HXOpenAt(directory(), std::to_string(pid).c_str(), O_PATH | O_DIRECTORY);
 }
 
-std::optional<HXStatRecord> HXLinuxProcesses::readStat(const char *pid) {
-    char name[32];
-    std::snprintf(name, sizeof name, "%.16s/stat", pid);
-    char buffer[2048];
-    const auto text = HXReadOnce(directory(), name, buffer);
+std::optional<HXStatRecord> HXLinuxProcesses::readStat(int32_t pid) {
+    char buffer[2048]; // 52 numbers and a short name
+    const auto text = HXReadOnce(directory(), (std::to_string(pid) + "/stat").c_str(), buffer);
     if (!text) {
         if (errno == ENOENT) errno = ESRCH;
         return std::nullopt;
@@ -187,12 +178,12 @@ std::optional<HXStatRecord> HXLinuxProcesses::takeListed(int32_t pid) {
 
 std::optional<HXStatRecord> HXLinuxProcesses::statOf(int32_t pid) {
     const auto listed = takeListed(pid);
-    return listed ? listed : readStat(PidText(pid).text);
+    return listed ? listed : readStat(pid);
 }
 
 int32_t HXLinuxProcesses::proc_listallpids(int32_t *pids, uint32_t bufferBytes) {
     // A descriptor of its own: the place in the directory belongs to it.
-    const HXDescriptor list(::open(_procPath.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    const HXDescriptor list = HXOpenAt(AT_FDCWD, _procPath.c_str(), O_DIRECTORY);
     if (!list) return -1;
     const uint32_t room = pids == nullptr ? UINT32_MAX : bufferBytes / sizeof(int32_t);
     uint32_t count = 0;
@@ -201,12 +192,12 @@ int32_t HXLinuxProcesses::proc_listallpids(int32_t *pids, uint32_t bufferBytes) 
         if (pids != nullptr) pids[0] = 0;
         count = 1;
     }
-    const bool done = HXForEachEntry(list.get(), [&](const char *name) {
+    const bool done = HXForEachEntry(list, [&](const char *name) {
         const auto pid = pidOf(name);
         if (!pid) return true;
         if (count >= room) return false;
         if (pids != nullptr) {
-            const auto stat = readStat(name);
+            const auto stat = readStat(*pid);
             if (!stat || stat->isKernelThread()) return true;
             pids[count] = *pid;
             listed.emplace(*pid, Listed{*stat});
@@ -226,9 +217,9 @@ namespace {
 
 // 64-bit programs have their stack far above what 32-bit ones can reach. Where the kernel does not tell the
 // stack, the width of the auxiliary vector's words does.
-bool is64bit(const HXStatRecord &stat, int directory) {
+bool is64bit(const HXStatRecord &stat, HXDirectoryView directory) {
     if (stat.startStack > UINT32_MAX) return true;
-    const auto vector = readAuxiliaryVector(directory, PidText(stat.pid, "/auxv").text);
+    const auto vector = readAuxiliaryVector(directory, (std::to_string(stat.pid) + "/auxv").c_str());
     return vector ? vector->is64bit : sizeof(void *) == 8;
 }
 
@@ -255,7 +246,7 @@ int32_t HXLinuxProcesses::proc_pidinfo(int32_t pid, int32_t flavor, void *buffer
         return 0;
     }
     // The short record tells whether a process has ended, so it is always read anew.
-    const auto stat = pid == 0 ? kernelStat() : isLong ? statOf(pid) : readStat(PidText(pid).text);
+    const auto stat = pid == 0 ? kernelStat() : isLong ? statOf(pid) : readStat(pid);
     if (!stat) return 0;
     if (stat->isKernelThread() || (isLong && stat->isZombie())) {
         errno = ESRCH;
@@ -269,7 +260,7 @@ int32_t HXLinuxProcesses::proc_pidinfo(int32_t pid, int32_t flavor, void *buffer
     return answer(shortInfo(*stat, flags), buffer, bufferBytes);
 }
 
-std::string HXLinuxProcesses::commOf(int32_t pid, int process) {
+std::string HXLinuxProcesses::commOf(int32_t pid, const HXDescriptor &process) {
     {
         const std::lock_guard lock(_mutex);
         const auto found = _listed.find(pid);
@@ -288,15 +279,15 @@ int32_t HXLinuxProcesses::copyArguments(int32_t pid, void *old, size_t *oldBytes
         return -1;
     }
     char link[PATH_MAX];
-    const auto executable = HXReadLink(process.get(), "exe", link);
+    const auto executable = HXReadLink(process, "exe", link);
     if (!executable) return -1;
     HXProgramName name{*executable, {}, {}};
-    if (name.executable.ends_with(deletedSuffix)) name.executable.remove_suffix(deletedSuffix.size());
-    const std::string comm = commOf(pid, process.get());
+    if (name.executable.ends_with(kDeletedSuffix)) name.executable.remove_suffix(kDeletedSuffix.size());
+    const std::string comm = commOf(pid, process);
     name.comm = comm;
     const std::span<char> scratch = HXScratchBuffer();
-    name.arguments = HXReadOnce(process.get(), "cmdline", scratch).value_or(std::string_view());
-    if (HXMayBeScript(name)) name.executedPath = readExecutedPath(process.get());
+    name.arguments = HXReadOnce(process, "cmdline", scratch).value_or(std::string_view());
+    if (HXMayBeScript(name)) name.executedPath = readExecutedPath(process);
     const std::string area = argumentArea(HXExecutedPath(name), name.arguments);
     const size_t length = std::min(area.size(), *oldBytes);
     if (old != nullptr) std::memcpy(old, area.data(), length);

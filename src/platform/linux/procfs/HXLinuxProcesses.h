@@ -37,11 +37,11 @@ class HXLinuxProcesses {
         bool isUsed = false;
     };
 
-    int directory();
-    std::optional<HXStatRecord> readStat(const char *pid);
+    HXDirectoryView directory();
+    std::optional<HXStatRecord> readStat(int32_t pid);
     std::optional<HXStatRecord> takeListed(int32_t pid);
     std::optional<HXStatRecord> statOf(int32_t pid);
-    std::string commOf(int32_t pid, int process);
+    std::string commOf(int32_t pid, const HXDescriptor &process);
 
     const std::string _procPath;
     std::mutex _mutex;

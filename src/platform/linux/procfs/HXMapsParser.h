@@ -29,7 +29,7 @@ class HXMapsParser {
         uint16_t position;
         uint8_t field;
     };
-    static constexpr size_t maximumColumns = 9;
+    static constexpr size_t maximumColumns = 8; // as many as fields
 
     bool parseFields(std::string_view *text, bool complete, HXMapping *mapping);
     bool parseColumns(std::string_view *text, HXMapping *mapping) const;

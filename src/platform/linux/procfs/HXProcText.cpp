@@ -21,101 +21,72 @@ std::optional<HXStatRecord> HXParseStat(std::string_view text) {
     const std::string_view state = cursor.word();
     if (state.size() != 1) return std::nullopt;
     record.state = state.front();
-    cursor.skipBlanks();
-    if (!cursor.number(&record.ppid)) return std::nullopt;
-    // Fields are numbered as in proc(5); the fourth, ppid, has just been read.
-    for (int field = 5; field <= 28; field++) {
-        cursor.skipBlanks();
-        bool found = true;
-        switch (field) {
-        case 5: {
-            int32_t group = 0;
-            found = cursor.number(&group);
-            record.pgid = static_cast<uint32_t>(group);
-            break;
-        }
-        case 9:
-            found = cursor.number(&record.flags);
-            break;
-        case 20:
-            found = cursor.number(&record.threadCount);
-            break;
-        case 22:
-            found = cursor.number(&record.startTime);
-            break;
-        case 28:
-            found = cursor.number(&record.startStack);
-            break;
-        default:
+    // Fields are numbered as in proc(5); the third, state, has just been read.
+    int next = 4;
+    const auto take = [&](int field, auto *value) {
+        for (; next < field; next++)
             cursor.word();
-        }
-        if (!found) return std::nullopt;
-    }
+        next++;
+        return cursor.field(value);
+    };
+    int32_t group = 0; // -1 while the process is being taken down
+    if (!take(4, &record.ppid) || !take(5, &group) || !take(9, &record.flags) ||
+        !take(20, &record.threadCount) || !take(22, &record.startTime) || !take(28, &record.startStack))
+        return std::nullopt;
+    record.pgid = static_cast<uint32_t>(group);
     return record;
 }
 
-uint64_t HXStatusRecord::peakHeftSize() const {
-    return std::max(heftSize(), peakResidentSize + pageTableSize + hugePageSize);
+bool HXStatusRecord::hasNoMemory() const {
+    return !residentSize && !rssAnonSize && !rssShmemSize && !swapSize && !pageTableSize;
+}
+
+std::optional<uint64_t> HXStatusRecord::pageTablesHeld() const {
+    return hasNoMemory() ? 0 : pageTableSize;
+}
+
+std::optional<uint64_t> HXStatusRecord::heftSize() const {
+    if (hasNoMemory()) return 0;
+    if (!rssAnonSize || !rssShmemSize || !swapSize || !pageTableSize) return std::nullopt;
+    return *rssAnonSize + *rssShmemSize + *swapSize + *pageTableSize + hugePageSize.value_or(0);
+}
+
+std::optional<uint64_t> HXStatusRecord::peakHeftSize() const {
+    const auto size = heftSize();
+    if (!size || !peakResidentSize || !pageTableSize) return size;
+    return std::max(*size, *peakResidentSize + *pageTableSize + hugePageSize.value_or(0));
 }
 
 HXStatusRecord HXParseStatus(std::string_view text) {
-    static constexpr struct {
-        std::string_view label;
-        uint64_t HXStatusRecord::*field;
-        uint64_t unitSize;
-    } fields[] = {
-        {"RssAnon:", &HXStatusRecord::rssAnonSize, 1024},
-        {"RssShmem:", &HXStatusRecord::rssShmemSize, 1024},
-        {"VmSwap:", &HXStatusRecord::swapSize, 1024},
-        {"VmPTE:", &HXStatusRecord::pageTableSize, 1024},
-        {"VmHWM:", &HXStatusRecord::peakResidentSize, 1024},
-        {"HugetlbPages:", &HXStatusRecord::hugePageSize, 1024},
+    // The name of the process comes first, newlines escaped; no line of it can begin with a label.
+    static constexpr HXLabelledFigure<HXStatusRecord> figures[] = {
+        {"RssAnon:", &HXStatusRecord::rssAnonSize},       {"RssShmem:", &HXStatusRecord::rssShmemSize},
+        {"VmSwap:", &HXStatusRecord::swapSize},           {"VmPTE:", &HXStatusRecord::pageTableSize},
+        {"VmHWM:", &HXStatusRecord::peakResidentSize},    {"VmRSS:", &HXStatusRecord::residentSize},
+        {"HugetlbPages:", &HXStatusRecord::hugePageSize}, {"VmLck:", &HXStatusRecord::lockedSize},
         {"Threads:", &HXStatusRecord::threadCount, 1},
-        {"VmRSS:", &HXStatusRecord::residentSize, 1024},
-        {"VmLck:", &HXStatusRecord::lockedSize, 1024},
     };
-    HXStatusRecord record;
-    HXTextCursor cursor{text};
-    while (!cursor.rest.empty()) {
-        HXTextCursor line{cursor.line()};
-        // The name of the process comes first, newlines escaped; no line of it can begin with a label.
-        for (const auto &field : fields) {
-            if (!line.rest.starts_with(field.label)) continue;
-            line.rest.remove_prefix(field.label.size());
-            line.skipBlanks();
-            uint64_t value = 0;
-            if (line.number(&value)) record.*field.field = value * field.unitSize;
-            break;
-        }
-    }
-    return record;
+    return HXParseLabelledFigures(text, figures);
 }
 
 std::optional<uint64_t> HXParseLabelled(std::string_view text, std::string_view label) {
-    HXTextCursor cursor{text};
-    while (!cursor.rest.empty()) {
+    for (HXTextCursor cursor{text}; !cursor.rest.empty();) {
         HXTextCursor line{cursor.line()};
-        if (!line.rest.starts_with(label)) continue;
-        line.rest.remove_prefix(label.size());
-        line.skipBlanks();
         uint64_t value = 0;
-        if (line.number(&value)) return value;
+        if (line.skip(label) && line.field(&value)) return value;
     }
     return std::nullopt;
 }
 
 void HXParseMountInfo(std::string_view text,
                       const std::function<void(uint32_t device, std::string_view type)> &each) {
-    HXTextCursor cursor{text};
-    while (!cursor.rest.empty()) {
+    for (HXTextCursor cursor{text}; !cursor.rest.empty();) {
         // ID PARENT MAJOR:MINOR ROOT POINT OPTIONS [TAG…] - TYPE SOURCE OPTIONS; blanks in paths are escaped.
         HXTextCursor line{cursor.line()};
         line.word();
         line.word();
-        line.skipBlanks();
-        uint32_t major = 0;
-        uint32_t minor = 0;
-        if (!line.number(&major) || !line.skip(':') || !line.number(&minor)) continue;
+        uint32_t major = 0, minor = 0;
+        if (!line.field(&major) || !line.skip(':') || !line.number(&minor)) continue;
         const size_t separator = line.rest.find(" - ");
         if (separator == std::string_view::npos) continue;
         line.rest.remove_prefix(separator + 3);
@@ -165,16 +136,11 @@ std::vector<std::string_view> HXSplitArguments(std::string_view text) {
 
 std::optional<uint64_t> HXParseStackPointer(std::string_view text) {
     // "running", "-1 SP PC" or "NUMBER ARG1 … ARG6 SP PC", addresses with 0x.
-    while (!text.empty() && (text.back() == '\n' || text.back() == ' '))
-        text.remove_suffix(1);
-    const size_t pc = text.rfind(' ');
-    if (pc == std::string_view::npos) return std::nullopt;
-    text = text.substr(0, pc);
-    const size_t sp = text.rfind(' ');
-    if (sp == std::string_view::npos || !text.substr(sp + 1).starts_with("0x")) return std::nullopt;
-    HXTextCursor cursor{text.substr(sp + 3)};
+    HXTextCursor line{text};
+    line.lastWord();
+    HXTextCursor pointer{line.lastWord()};
     uint64_t address = 0;
-    if (!cursor.number(&address, 16) || !cursor.rest.empty()) return std::nullopt;
+    if (!pointer.skip("0x") || !HXIsNumber(pointer.rest, &address, 16)) return std::nullopt;
     return address;
 }
 

@@ -30,21 +30,25 @@ struct HXStatRecord {
 // None when the text is no stat line. The name may hold blanks, parentheses and newlines.
 std::optional<HXStatRecord> HXParseStat(std::string_view text);
 
-// /proc/PID/status, as far as it is read; sizes in bytes. What the text lacks is 0.
+// /proc/PID/status, as far as it is read; sizes in bytes. What the text lacks is none: kernel threads and
+// processes that have ended show no memory at all, and kernels lack lines that came later.
 struct HXStatusRecord {
-    uint64_t rssAnonSize = 0;
-    uint64_t rssShmemSize = 0;
-    uint64_t swapSize = 0;
-    uint64_t pageTableSize = 0;
-    uint64_t hugePageSize = 0;
-    uint64_t peakResidentSize = 0;
-    uint64_t residentSize = 0;
-    uint64_t lockedSize = 0;
-    uint64_t threadCount = 0;
+    // The charge is made of these. All but the huge pages are needed: kernels from 4.5 on show them for every
+    // process that has memory, those without a huge-page pool leave HugetlbPages out.
+    std::optional<uint64_t> rssAnonSize, rssShmemSize, swapSize, pageTableSize;
+    std::optional<uint64_t> hugePageSize;
+    std::optional<uint64_t> residentSize, peakResidentSize, lockedSize;
+    std::optional<uint64_t> threadCount;
 
-    uint64_t heftSize() const { return rssAnonSize + rssShmemSize + swapSize + pageTableSize + hugePageSize; }
-    // The kernel keeps no peak of the charge itself.
-    uint64_t peakHeftSize() const;
+    // 0 for a process without memory; none when it has some and a needed figure is missing.
+    std::optional<uint64_t> heftSize() const;
+    // The kernel keeps no peak of the charge itself. None as above.
+    std::optional<uint64_t> peakHeftSize() const;
+    // The page tables, 0 for a process without memory; none as above.
+    std::optional<uint64_t> pageTablesHeld() const;
+
+  private:
+    bool hasNoMemory() const;
 };
 HXStatusRecord HXParseStatus(std::string_view text);
 
@@ -63,8 +67,8 @@ void HXParseMountInfo(std::string_view text,
 
 // /proc/PID/auxv.
 struct HXAuxiliaryVector {
-    bool is64bit = true;       // width of its words
-    uint64_t execFileName = 0; // AT_EXECFN: address of the path that was executed; 0 when it is missing
+    bool is64bit = true;                  // width of its words
+    std::optional<uint64_t> execFileName; // AT_EXECFN: address of the path that was executed
 };
 // None when the bytes hold no entry.
 std::optional<HXAuxiliaryVector> HXParseAuxiliaryVector(std::string_view bytes);

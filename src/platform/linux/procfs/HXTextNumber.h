@@ -1,4 +1,4 @@
-// Numbers in the kernel's text.
+// The tokeniser of the kernel's text: numbers, words, lines and labels.
 #pragma once
 
 #include <charconv>
@@ -7,7 +7,7 @@
 #include <string_view>
 
 // A cursor over one line or file of the kernel's text. A step that does not find what it wants leaves the
-// rest as it is.
+// rest as it is, but for blanks.
 struct HXTextCursor {
     std::string_view rest;
 
@@ -22,6 +22,12 @@ struct HXTextCursor {
         rest.remove_prefix(1);
         return true;
     }
+    bool skip(std::string_view text) {
+        if (!rest.starts_with(text)) return false;
+        rest.remove_prefix(text.size());
+        return true;
+    }
+    // The digits at the front, whatever follows them. False when there is none or the value does not fit.
     template <typename Number>
     bool number(Number *value, int base = 10) {
         const auto result = std::from_chars(rest.data(), rest.data() + rest.size(), *value, base);
@@ -29,14 +35,25 @@ struct HXTextCursor {
         rest.remove_prefix(static_cast<size_t>(result.ptr - rest.data()));
         return true;
     }
-    // The text up to the next blank or the end.
+    // The same behind blanks.
+    template <typename Number>
+    bool field(Number *value) {
+        skipBlanks();
+        return number(value);
+    }
+    // The text up to the next blank or the end of the line; empty at the end.
     std::string_view word() {
         skipBlanks();
-        size_t n = 0;
-        while (n < rest.size() && rest[n] != ' ' && rest[n] != '\t' && rest[n] != '\n')
-            n++;
-        const std::string_view found = rest.substr(0, n);
-        rest.remove_prefix(n);
+        const std::string_view found = rest.substr(0, rest.find_first_of(" \t\n"));
+        rest.remove_prefix(found.size());
+        return found;
+    }
+    // The word at the end, taken off; the same for a line without tabs.
+    std::string_view lastWord() {
+        while (rest.ends_with(' ') || rest.ends_with('\n'))
+            rest.remove_suffix(1);
+        const std::string_view found = rest.substr(rest.rfind(' ') + 1); // none found: all of it
+        rest.remove_suffix(found.size());
         return found;
     }
     // The text up to the next newline, which is passed over.
@@ -48,11 +65,34 @@ struct HXTextCursor {
     }
 };
 
-// `text` as a whole decimal number of at least one digit; none for anything else.
+// Whether all of `text` is a number of at least one digit, which goes to *value.
 template <typename Number>
-std::optional<Number> HXWholeNumber(std::string_view text) {
+bool HXIsNumber(std::string_view text, Number *value, int base = 10) {
     HXTextCursor cursor{text};
-    Number value{};
-    if (!cursor.number(&value) || !cursor.rest.empty()) return std::nullopt;
-    return value;
+    return cursor.number(value, base) && cursor.rest.empty();
+}
+
+// One line of a file of labelled figures (status, meminfo, smaps_rollup): a label with its colon, blanks, a
+// number and perhaps its unit. `unitSize`: bytes that 1 stands for.
+template <typename Record>
+struct HXLabelledFigure {
+    std::string_view label;
+    std::optional<uint64_t> Record::*figure;
+    uint64_t unitSize = 1024;
+};
+
+// The figures of a record that the text has; those of lines that it lacks stay none.
+template <typename Record, size_t Count>
+Record HXParseLabelledFigures(std::string_view text, const HXLabelledFigure<Record> (&table)[Count]) {
+    Record record;
+    for (HXTextCursor cursor{text}; !cursor.rest.empty();) {
+        HXTextCursor line{cursor.line()};
+        for (const HXLabelledFigure<Record> &entry : table) {
+            if (!line.skip(entry.label)) continue;
+            uint64_t value = 0;
+            if (line.field(&value)) record.*entry.figure = value * entry.unitSize;
+            break;
+        }
+    }
+    return record;
 }

@@ -7,7 +7,7 @@
 
 namespace {
 
-const std::string statTail = " S 1 77 77 0 -1 4194560 1 2 3 4 5 6 7 8 20 0 3 0 4242 1000 200 "
+const std::string statTail = " S 1 77 78 0 -1 4194560 1 2 3 4 5 6 7 8 20 0 3 0 4242 1000 200 "
                              "18446744073709551615 1 2 140724000000000 0 0\n";
 
 TEST(HXProcText, StatFindsTheNameWhateverItHolds) {
@@ -39,8 +39,17 @@ TEST(HXProcText, StatusAddsUpTheCharge) {
         "Threads:\t12\n");
     EXPECT_EQ(status.heftSize(), (10u + 20 + 4 + 8 + 2048) * 1024);
     EXPECT_EQ(status.peakHeftSize(), (100u + 4 + 2048) * 1024);
-    EXPECT_EQ(HXParseStatus("RssAnon: 500 kB\nVmHWM: 10 kB").peakHeftSize(), 500u * 1024);
-    EXPECT_EQ(HXParseStatus("").heftSize(), 0u);
+    const std::string needed = "RssAnon: 500 kB\nRssShmem: 0 kB\nVmSwap: 0 kB\nVmPTE: 0 kB\n";
+    EXPECT_EQ(HXParseStatus(needed + "VmHWM: 10 kB").peakHeftSize(), 500u * 1024);
+    EXPECT_EQ(HXParseStatus(needed + "VmHWM: 900 kB").peakHeftSize(), 900u * 1024) << "no huge-page pool";
+    EXPECT_EQ(HXParseStatus("Threads: 1").heftSize(), 0u) << "a zombie";
+    EXPECT_EQ(HXParseStatus("Threads: 1").pageTablesHeld(), 0u);
+    EXPECT_EQ(HXParseStatus("VmRSS: 5 kB").pageTablesHeld(), std::nullopt);
+    for (const std::string figure : {"RssAnon:", "RssShmem:", "VmSwap:", "VmPTE:"}) {
+        std::string text = needed;
+        EXPECT_EQ(HXParseStatus(text.replace(text.find(figure), figure.size(), "x")).heftSize(), std::nullopt)
+            << figure;
+    }
     EXPECT_EQ(HXParseLabelled("xLazyFree: 1\nLazyFree:\n", "LazyFree:"), std::nullopt);
 }
 

@@ -1,0 +1,35 @@
+#include "platform/linux/procfs/HXDescriptor.h"
+
+#include <cerrno>
+
+void HXDescriptor::reset(int descriptor) {
+    if (_descriptor >= 0) {
+        const int kept = errno;
+        ::close(_descriptor);
+        errno = kept;
+    }
+    _descriptor = descriptor;
+}
+
+ssize_t HXDescriptor::read(std::span<char> buffer) const {
+    for (;;) {
+        const ssize_t got = ::read(_descriptor, buffer.data(), buffer.size());
+        if (got >= 0 || errno != EINTR) return got;
+    }
+}
+
+ssize_t HXDescriptor::readFully(std::span<char> buffer) const {
+    size_t length = 0;
+    while (length < buffer.size()) {
+        const ssize_t got = read(buffer.subspan(length));
+        if (got < 0) return -1;
+        if (got == 0) break;
+        length += static_cast<size_t>(got);
+    }
+    return static_cast<ssize_t>(length);
+}
+
+bool HXDescriptor::readAt(uint64_t position, std::span<char> buffer) const {
+    const ssize_t got = ::pread(_descriptor, buffer.data(), buffer.size(), static_cast<off_t>(position));
+    return got == static_cast<ssize_t>(buffer.size());
+}
