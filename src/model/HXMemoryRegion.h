@@ -1,7 +1,6 @@
 // One virtual-memory region of one process.
 #pragma once
 
-#include "model/HXMemoryTotal.h"
 #include "model/HXRangeList.h"
 #include "model/HXString.h"
 #include "platform/HXHostRecords.h"
@@ -96,6 +95,9 @@ class HXMemoryRegion {
     uint64_t cleanNonSpecSize() const { return _cleanNonSpecSize; }
     void setCleanNonSpecSize(uint64_t size) { _cleanNonSpecSize = size; }
     uint64_t wiredSize() const { return _wired ? _size : 0; }
+    HXSizes sizes() const {
+        return {_dirtySize, _swappedSize, _cleanNonSpecSize, _reclaimableSize, wiredSize()};
+    }
 
     // Identifier of the VM object; 0 when there is none.
     uint64_t object_id() const { return _object_id; }
@@ -103,8 +105,8 @@ class HXMemoryRegion {
 
     // The region's page runs, where page queries split it; null otherwise. Exists only until the merge.
     const HXRangeList *subrangeList() const { return _subrangeList.get(); }
-    // Adds a run, located by its offset in the VM object, with the amounts of `total`.
-    void addSubrange(HXRange range, const HXMemoryTotal &total, uint32_t pageSize);
+    // Adds a run, located by its offset in the VM object.
+    void addSubrange(HXRange range, const HXSizes &sizes, uint32_t pageSize);
     void freeSubrangeList() { _subrangeList.reset(); }
     // Hands the page runs over; the region has none afterwards.
     std::unique_ptr<HXRangeList> takeSubrangeList() { return std::move(_subrangeList); }

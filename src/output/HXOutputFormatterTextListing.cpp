@@ -11,13 +11,13 @@ void HXOutputFormatterText::printAtlasLikeOutputForProcess(const HXProcess &proc
     fprintf(_output,
             "           start                end  [objectid]      VRT     DRT%*s     CLN     RCL%*s   tag "
             "(detail)\n",
-            width(showsSwapped()), optional(showsSwapped(), "     SWP"), width(showsWired()),
-            optional(showsWired(), "    WIRE"));
+            width(shows(HXTextSwapped)), optional(shows(HXTextSwapped), "     SWP"),
+            width(shows(HXTextWired)), optional(shows(HXTextWired), "    WIRE"));
     fprintf(_output,
             "      ----------         ----------  ----------    -----   -----%*s   -----   -----%*s   "
             "------------\n",
-            width(showsSwapped()), optional(showsSwapped(), "   -----"), width(showsWired()),
-            optional(showsWired(), "   -----"));
+            width(shows(HXTextSwapped)), optional(shows(HXTextSwapped), "   -----"),
+            width(shows(HXTextWired)), optional(shows(HXTextWired), "   -----"));
     for (const HXMemoryRegion &region : regions)
         printRegion(region, process.pageSize());
     fputc('\n', _output);
@@ -32,12 +32,11 @@ void HXOutputFormatterText::printRegion(const HXMemoryRegion &region, uint64_t p
     else
         fprintf(_output, "%16" PRIx64 " - %16" PRIx64 " [%10" PRIx64 "]", region.start(),
                 region.start() + region.size(), id);
-    fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.size()),
-            pages(region.dirtySize() + region.swappedSize()));
-    if (showsSwapped()) fprintf(_output, " %7" PRIu64, pages(region.swappedSize()));
+    fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.size()), pages(region.sizes().heft()));
+    if (shows(HXTextSwapped)) fprintf(_output, " %7" PRIu64, pages(region.swappedSize()));
     fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.cleanNonSpecSize()),
             pages(region.reclaimableSize()));
-    if (showsWired()) fprintf(_output, " %7" PRIu64, pages(region.wiredSize()));
+    if (shows(HXTextWired)) fprintf(_output, " %7" PRIu64, pages(region.wiredSize()));
     fprintf(_output, "   %s", region.name().c_str());
     if (const HXString detail = _truncatedNameForString(region.detailedName()))
         fprintf(_output, " %s", detail.c_str());
