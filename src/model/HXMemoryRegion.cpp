@@ -90,12 +90,6 @@ bool HXMemoryRegion::eligibleForSubrangesUsingPageSize(uint32_t pageSize) const 
     return anyNonZero;
 }
 
-int HXMemoryRegion::compare(const HXMemoryRegion &other) const {
-    if (_start != other._start) return _start < other._start ? -1 : 1;
-    if (_size != other._size) return _size > other._size ? -1 : 1;
-    return 0;
-}
-
 HXString HXMemoryRegion::categoryNameForTag(uint32_t tag) {
     static const NameTable table = makeNameTable();
     if (tag < table.size() && table[tag]) return table[tag];

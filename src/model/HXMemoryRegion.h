@@ -118,9 +118,6 @@ class HXMemoryRegion {
     // Whether splitting the region into page runs can tell anything new.
     bool eligibleForSubrangesUsingPageSize(uint32_t pageSize) const;
 
-    // By start; of equal starts the larger region first. Negative: this region sorts first.
-    int compare(const HXMemoryRegion &other) const;
-
     // What memory of a user tag is called. Never none. Any thread.
     static HXString categoryNameForTag(uint32_t tag);
 

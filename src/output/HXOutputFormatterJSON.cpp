@@ -4,7 +4,6 @@
 #include "platform/HXPlatform.h"
 
 #include <cerrno>
-#include <cinttypes>
 
 namespace {
 
@@ -51,8 +50,7 @@ void HXOutputFormatterJSON::separate() {
 }
 
 void HXOutputFormatterJSON::key(std::string_view name) {
-    separate();
-    fputc('"', _stream);
+    fputs(_needsComma ? ",\"" : "\"", _stream);
     fwrite(name.data(), 1, name.size(), _stream);
     fputs("\":", _stream);
     _needsComma = false;
@@ -74,19 +72,8 @@ void HXOutputFormatterJSON::raw(std::string_view json) {
     _needsComma = true;
 }
 
-void HXOutputFormatterJSON::number(uint64_t value) {
-    fprintf(_stream, "%" PRIu64, value);
-    _needsComma = true;
-}
-
-void HXOutputFormatterJSON::signedNumber(int64_t value) {
-    fprintf(_stream, "%" PRId64, value);
-    _needsComma = true;
-}
-
 void HXOutputFormatterJSON::text(const std::string &value) {
-    fprintf(_stream, "\"%s\"", value.c_str());
-    _needsComma = true;
+    raw('"' + value + '"');
 }
 
 void HXOutputFormatterJSON::texts(std::string_view name, const std::vector<std::string> &values) {
@@ -101,7 +88,7 @@ void HXOutputFormatterJSON::texts(std::string_view name, const std::vector<std::
 
 void HXOutputFormatterJSON::member(std::string_view name, uint64_t value) {
     key(name);
-    number(value);
+    raw(std::to_string(value));
 }
 
 // A total's dirty bytes include the swapped ones.
@@ -140,7 +127,7 @@ void HXOutputFormatterJSON::printProcessHeader(const HXProcess &process) {
     key("name");
     text(escaped(process.name()));
     key("pid");
-    signedNumber(process.pid());
+    raw(std::to_string(process.pid()));
     if (process.hasErrors()) texts("errors", process.errors());
     if (!process.warnings().empty()) texts("warnings", process.warnings());
     if (_verbose) {
@@ -221,12 +208,12 @@ void HXOutputFormatterJSON::sharedEntry(const SharedEntry &entry) {
     open('[');
     for (const int32_t pid : entry.pids) {
         separate();
-        signedNumber(pid);
+        raw(std::to_string(pid));
     }
     close(']');
     if (entry.specificToPid) {
         key("specific_to_pid");
-        signedNumber(*entry.specificToPid);
+        raw(std::to_string(*entry.specificToPid));
     }
     key("categories");
     open('{');

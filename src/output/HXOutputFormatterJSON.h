@@ -53,9 +53,7 @@ class HXOutputFormatterJSON : public HXOutputFormatter {
     void key(std::string_view name);
     void open(char bracket);
     void close(char bracket);
-    void raw(std::string_view json);
-    void number(uint64_t value);
-    void signedNumber(int64_t value);
+    void raw(std::string_view json); // a value as it stands
     void text(const std::string &value);
     void texts(std::string_view name, const std::vector<std::string> &values);
     void member(std::string_view name, uint64_t value);
