@@ -45,17 +45,6 @@ class HXHeftTest : public testing::Test {
     HXHeft::ProcessList _targets;
     std::unique_ptr<HXHeft> _heft;
 };
-
-using Groups = std::vector<std::vector<int32_t>>;
-Groups groupsOf(const HXHeftSharingData &sharing, int32_t pid) {
-    Groups groups;
-    for (const HXProcessGroup *group : *sharing.groupsOfProcess(pid)) {
-        groups.emplace_back();
-        for (const HXRegionOwner *member : group->processes())
-            groups.back().push_back(member->pid());
-    }
-    return groups;
-}
 } // namespace
 
 TEST_F(HXHeftTest, RegionsOfOneKeyShareAnObject) {
@@ -139,28 +128,6 @@ TEST_F(HXHeftTest, AnInterruptLeavesOutWhatHasNotBegun) {
     EXPECT_EQ(
         HXProcess::globalErrors(),
         std::vector<std::string>{"Heft exited early due to SIGINT and did not finish gathering all data"});
-}
-
-TEST_F(HXHeftTest, GroupsPartitionObjectsByWhoMapsThem) {
-    const HXRegionFacts fake{.object = 5, .start = kNoAddress, .tag = kFakeRegionTag, .owned = true};
-    HXRegionFacts owned = object(7);
-    owned.owned = true;
-    add(10, {object(1), object(2), object(3), fake, owned});
-    add(20, {object(2), object(1), object(4)});
-    add(30, {object(2), object(1)});
-    // A hidden process counts only for what a shown process owns and shows no mapping of.
-    add(40, {object(1), object(5), object(6), object(7)}).setHiddenFromDisplay(true);
-    HXHeft &heft = gather();
-    const HXHeftSharingData sharing = heft._sharingData();
-    EXPECT_EQ(groupsOf(sharing, 10), (Groups{{10}, {10, 20, 30}, {10, 40}}));
-    EXPECT_EQ(groupsOf(sharing, 20), (Groups{{20}, {10, 20, 30}}));
-    EXPECT_EQ(groupsOf(sharing, 30), (Groups{{10, 20, 30}}));
-    EXPECT_EQ(groupsOf(sharing, 40), (Groups{{10, 40}}));
-    std::vector<size_t> objects;
-    for (const auto &group : sharing.groups)
-        objects.push_back(sharing.objectsOfGroup(group).size());
-    // Of the objects of process 40 only the unmapped one: not 6, nor 7, which process 10 maps.
-    EXPECT_EQ(objects, (std::vector<size_t>{2, 2, 1, 1}));
 }
 
 TEST_F(HXHeftTest, AnAnalysisSwitchThatCannotBeReadOrSetIsTold) {
