@@ -2,6 +2,7 @@
 #pragma once
 
 #include "model/HXRangeList.h"
+#include "model/HXSizes.h"
 #include "model/HXString.h"
 #include "platform/HXHostRecords.h"
 #include "platform/HXInternalError.h"

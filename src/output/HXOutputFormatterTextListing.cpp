@@ -5,19 +5,16 @@
 
 void HXOutputFormatterText::printAtlasLikeOutputForProcess(const HXProcess &process,
                                                            const HXMemoryRegionList &regions) {
-    const auto optional = [](bool shown, const char *text) { return shown ? text : ""; };
-    const auto width = [](bool shown) { return shown ? 8 : 0; };
+    const auto optional = [this](int32_t option, const char *text) { return shows(option) ? text : ""; };
     fprintf(_output, "%s\n\n", process.displayString().c_str());
     fprintf(_output,
-            "           start                end  [objectid]      VRT     DRT%*s     CLN     RCL%*s   tag "
+            "           start                end  [objectid]      VRT     DRT%s     CLN     RCL%s   tag "
             "(detail)\n",
-            width(shows(HXTextSwapped)), optional(shows(HXTextSwapped), "     SWP"),
-            width(shows(HXTextWired)), optional(shows(HXTextWired), "    WIRE"));
+            optional(HXTextSwapped, "     SWP"), optional(HXTextWired, "    WIRE"));
     fprintf(_output,
-            "      ----------         ----------  ----------    -----   -----%*s   -----   -----%*s   "
+            "      ----------         ----------  ----------    -----   -----%s   -----   -----%s   "
             "------------\n",
-            width(shows(HXTextSwapped)), optional(shows(HXTextSwapped), "   -----"),
-            width(shows(HXTextWired)), optional(shows(HXTextWired), "   -----"));
+            optional(HXTextSwapped, "   -----"), optional(HXTextWired, "   -----"));
     for (const HXMemoryRegion &region : regions)
         printRegion(region, process.pageSize());
     fputc('\n', _output);
