@@ -10,8 +10,7 @@ constexpr char kQueueLabel[] = "org.heft.gatherdata";
 } // namespace
 
 HXHeft::HXHeft(ProcessList processes)
-    : _processes(std::move(processes)), _objects(std::make_unique<HXMemoryObjects>()),
-      _maps(std::make_unique<ObjectMaps>()) {}
+    : _processes(std::move(processes)), _maps(std::make_unique<ObjectMaps>()) {}
 
 HXHeft::~HXHeft() = default;
 
@@ -42,6 +41,7 @@ void HXHeft::gatherData() {
     reserveMaps();
     for (const auto &process : _processes)
         _addProcess(*process);
+    _maps.reset();
     finalizeObjects();
     _buildProcessToHeftMap();
 }
@@ -68,13 +68,13 @@ HXHeft::ObjectMap &HXHeft::mapForRegion(const HXMemoryRegion &region, const HXPr
 HXMemoryObject &HXHeft::objectForRegion(const HXMemoryRegion &region, const HXProcess &process) {
     constexpr uint64_t noKey = UINT64_MAX;
     uint64_t key = region.inSharedCache() ? region.start() : region.object_id();
-    if (key == noKey) return _objects->add();
+    if (key == noKey) return _objects.add();
     // What a process has copied on write is its own, whoever else maps the object.
     if (region.share_mode() == SM_COW && (region.dirtySize() != 0 || region.swappedSize() != 0))
         key ^= uint64_t{static_cast<uint32_t>(process.pid())} << 32;
-    if (key == 0 || key == noKey) return _objects->add();
+    if (key == 0 || key == noKey) return _objects.add();
     HXMemoryObject *&object = mapForRegion(region, process)[key];
-    if (!object) object = &_objects->add();
+    if (!object) object = &_objects.add();
     return *object;
 }
 
@@ -94,6 +94,6 @@ void HXHeft::_addProcess(HXProcess &process) {
 
 // Every object lives in exactly one of the maps or shares with nothing; together they are all objects.
 void HXHeft::finalizeObjects() {
-    for (HXMemoryObject &object : *_objects)
+    for (HXMemoryObject &object : _objects)
         object.finalize();
 }

@@ -40,7 +40,7 @@ class HXHeft : public HXHeftSwitches {
     // Formatters are not owned and must outlive the report.
     void addOutputFormatter(HXOutputFormatter &formatter) { _outputFormatters.push_back(&formatter); }
     // Writes the report, with `verbose` after the full region listings; with `summarize` categories have no
-    // detail. Once: the memory objects are gone afterwards.
+    // detail. Not before gathering.
     void printOutputVerbose(bool verbose, bool summarize);
     void printAtlasLikeOutputForProcesses(const Processes &processes);
 
@@ -62,10 +62,11 @@ class HXHeft : public HXHeftSwitches {
                                         bool *hasProcessView, bool summarize) const;
     // Each object that a shown process maps once, whole.
     HXCategoryMap _categoriesForAllProcessesShouldSummarize(bool summarize) const;
-    static void _totalForCategories(const HXCategoryMap &categories, HXMemoryTotal *outTotal);
+    static HXMemoryTotal _totalForCategories(const HXCategoryMap &categories);
 
-    // The objects of the analysis, in the order in which they were made.
-    const HXMemoryObjects &memoryObjects() const { return *_objects; }
+    // The objects of the analysis, in the order in which they were made: those of the maps, and those that
+    // share with nothing.
+    const HXMemoryObjects &memoryObjects() const { return _objects; }
 
   private:
     // A key's low bits tell little: object identifiers are often numbered or aligned.
@@ -89,9 +90,8 @@ class HXHeft : public HXHeftSwitches {
 
     ProcessList _processes;
     std::unordered_map<int32_t, uint64_t> _pidToHeft;
-    std::unique_ptr<HXMemoryObjects>
-        _objects; // all objects: those of the maps, and those that share with nothing
-    // The maps only grow, and go together.
+    HXMemoryObjects _objects;
+    // What merging looks objects up in. The maps only grow, and go together once all processes are merged.
     struct ObjectMaps {
         std::pmr::monotonic_buffer_resource memory;
         ObjectMap _memoryObjects{&memory};

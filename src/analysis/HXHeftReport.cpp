@@ -20,10 +20,9 @@ void HXHeft::reportGroups(const HXProcess &process, const HXHeftSharingData::Gro
         bool hasProcessView = false;
         const auto categories = std::make_shared<const HXCategoryMap>(
             _categoriesForObjects(sharing.objectsOfGroup(*group), process, &hasProcessView, summarize));
-        HXMemoryTotal total;
-        _totalForCategories(*categories, &total);
+        const HXMemoryTotal total = _totalForCategories(*categories);
         for (HXOutputFormatter *formatter : _outputFormatters) {
-            if (group->processes().size() == 1)
+            if (group->isPrivate())
                 formatter->printProcessCategories(*categories, total);
             else
                 formatter->printSharedCategories(categories, *group, process, hasProcessView, total);
@@ -61,11 +60,7 @@ void HXHeft::printOutputVerbose(bool verbose, bool summarize) {
     const Processes inOrder = _processesBySortingHeft(_notHiddenProcesses());
     if (verbose) printAtlasLikeOutputForProcesses(inOrder);
 
-    HXHeftSharingData sharing = _sharingData();
-    // The report reads the objects through the sharing data; the maps are not needed any more.
-    sharing.objects = std::move(_objects);
-    _maps.reset();
-
+    const HXHeftSharingData sharing = _sharingData();
     Report report;
     for (const HXProcess *process : inOrder)
         reportProcess(*process, report, sharing, summarize);
@@ -74,8 +69,7 @@ void HXHeft::printOutputVerbose(bool verbose, bool summarize) {
     for (HXOutputFormatter *formatter : _outputFormatters)
         formatter->printProcessesWithWarnings(report.withWarnings, report.withErrors, globalErrors);
     const HXCategoryMap summary = _categoriesForAllProcessesShouldSummarize(summarize);
-    HXMemoryTotal total;
-    _totalForCategories(summary, &total);
+    const HXMemoryTotal total = _totalForCategories(summary);
     const bool hadErrors = !globalErrors.empty() || !report.withErrors.empty();
     for (HXOutputFormatter *formatter : _outputFormatters) {
         formatter->printSummaryCategories(summary, total, hadErrors);

@@ -30,13 +30,13 @@ class MemberSets {
         return next->second;
     }
 
-    // Adds the members to an open group, in the order in which they came.
-    void addMembers(uint32_t set, HXProcessGroup &group) const {
-        std::vector<const HXProcess *> members;
+    // The members in the order in which they came.
+    HXProcessGroup::Processes members(uint32_t set) const {
+        HXProcessGroup::Processes members;
         for (; set != kEmpty; set = _sets[set].without)
             members.push_back(_sets[set].last);
-        for (auto member = members.rbegin(); member != members.rend(); ++member)
-            group.addProcess(**member);
+        std::reverse(members.begin(), members.end());
+        return members;
     }
 
     size_t size() const { return _sets.size(); }
@@ -107,7 +107,7 @@ GroupedObjects groupObjects(const HXHeft &heft, MemberSets &sets) {
 void indexGroupByProcess(const HXProcessGroup &group, HXHeftSharingData &sharing) {
     for (const HXRegionOwner *process : group.processes()) {
         HXHeftSharingData::Groups &groups = sharing.processToProcessGroups[process->pid()];
-        if (group.processes().size() == 1)
+        if (group.isPrivate())
             groups.insert(groups.begin(), &group);
         else
             groups.push_back(&group);
@@ -125,12 +125,9 @@ HXHeftSharingData HXHeft::_sharingData() const {
         const uint32_t set = sets.unified(grouped.setOf[object->index()]);
         auto &[group, objects] = bySet[set];
         if (!group) {
-            HXProcessGroup &made = sharing.groups.emplace_back();
-            sets.addMembers(set, made);
-            made.freeze();
-            indexGroupByProcess(made, sharing);
-            group = &made;
-            objects = &sharing.processGroupToObjects[&made];
+            group = &sharing.groups.emplace_back(sets.members(set));
+            indexGroupByProcess(*group, sharing);
+            objects = &sharing.processGroupToObjects[group];
         }
         objects->push_back(object);
     }

@@ -6,7 +6,6 @@
 
 #include <cstdint>
 #include <deque>
-#include <memory>
 #include <memory_resource>
 #include <unordered_map>
 #include <vector>
@@ -47,6 +46,4 @@ class HXHeftSharingData {
     std::unordered_map<const HXProcessGroup *, Objects> processGroupToObjects;
     // All groups, by their first object.
     std::deque<HXProcessGroup> groups;
-    // The objects themselves, once the report has taken them from the analysis.
-    std::unique_ptr<HXMemoryObjects> objects;
 };

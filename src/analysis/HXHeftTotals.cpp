@@ -2,12 +2,13 @@
 #include "analysis/HXHeft.h"
 
 #include <algorithm>
+#include <unordered_set>
 
 uint64_t HXHeft::_calculateHeftForProcess(const HXProcess &process) const {
     uint64_t heft = 0;
     if (breakDownPhysHeft()) {
         for (const HXMemoryRegion &region : process.memoryRegions())
-            heft += region.dirtySize() + region.swappedSize();
+            heft += region.sizes().heft();
         return heft;
     }
     // Whole objects, each once.
@@ -15,8 +16,7 @@ uint64_t HXHeft::_calculateHeftForProcess(const HXProcess &process) const {
     counted.reserve(process.memoryRegions().size());
     for (const HXMemoryRegion &region : process.memoryRegions()) {
         const HXMemoryObject *object = region.memoryObject();
-        if (object && counted.insert(object).second)
-            heft += object->totalDirtySize() + object->totalSwappedSize();
+        if (object && counted.insert(object).second) heft += object->sizes().heft();
     }
     return heft;
 }
@@ -59,43 +59,34 @@ HXHeft::Processes HXHeft::_processesBySortingHeft(Processes processes) const {
 HXCategoryMap HXHeft::_categoriesForObjects(const HXHeftSharingData::Objects &objects,
                                             const HXProcess &viewedBy, bool *hasProcessView,
                                             bool summarize) const {
-    HXCategoryMap categories;
+    HXCategoryMap categories(summarize);
     bool anyView = false;
     for (const HXMemoryObject *object : objects) {
-        const HXSegment segment = object->memoryRegions().front()->segment();
-        HXMemoryCategory &category = categories.categoryForObject(*object, segment, summarize);
-        HXMemoryObject::View view = object->viewForProcess(viewedBy);
-        anyView = anyView || view.get() != object;
-        category.addMemoryObject(std::move(view));
+        const HXMemoryObjectView view = object->viewForProcess(viewedBy);
+        anyView = anyView || !view.isWhole;
+        categories.categoryForObject(*object).addMemoryObject(view);
     }
     if (hasProcessView) *hasProcessView = anyView;
     return categories;
 }
 
 HXCategoryMap HXHeft::_categoriesForAllProcessesShouldSummarize(bool summarize) const {
-    HXCategoryMap categories;
-    std::vector<bool> counted;
+    HXCategoryMap categories(summarize);
+    std::vector<bool> counted(_objects.size());
     for (const HXProcess *process : _notHiddenProcesses()) {
         for (const HXMemoryRegion &region : process->memoryRegions()) {
-            const HXMemoryObject *object = region.memoryObject();
-            if (object->index() >= counted.size()) counted.resize(2 * size_t{object->index()} + 1);
-            if (counted[object->index()]) continue;
-            counted[object->index()] = true;
-            HXMemoryCategory &category = categories.categoryForObject(*object, region.segment(), summarize);
-            category.addMemoryObject(HXMemoryObject::View(std::shared_ptr<void>(), object));
+            const HXMemoryObject &object = *region.memoryObject();
+            if (counted[object.index()]) continue;
+            counted[object.index()] = true;
+            categories.categoryForObject(object).addMemoryObject(object.wholeView());
         }
     }
     return categories;
 }
 
-void HXHeft::_totalForCategories(const HXCategoryMap &categories, HXMemoryTotal *outTotal) {
-    *outTotal = {};
-    for (const auto &[key, category] : categories.entries()) {
-        outTotal->dirty += category->totalDirtySize();
-        outTotal->swapped += category->totalSwappedSize();
-        outTotal->clean += category->totalCleanSize();
-        outTotal->reclaimable += category->totalReclaimableSize();
-        outTotal->wired += category->totalWiredSize();
-        outTotal->regionCount += static_cast<uint32_t>(category->totalRegions());
-    }
+HXMemoryTotal HXHeft::_totalForCategories(const HXCategoryMap &categories) {
+    HXMemoryTotal total;
+    for (const HXMemoryCategory &category : categories.categories())
+        total += category.total();
+    return total;
 }

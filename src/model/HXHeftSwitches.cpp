@@ -9,7 +9,7 @@
 namespace {
 
 constexpr char kSetting[] = "vm.self_region_heft";
-std::atomic<bool> sharingDisabled{false};
+std::atomic<bool> isDisabled{false};
 
 } // namespace
 
@@ -36,9 +36,9 @@ void HXHeftSwitches::setBreakDownPhysHeft(bool breakDown) {
 }
 
 bool HXHeftSwitches::isSharingAnalysisDisabled() {
-    return sharingDisabled;
+    return isDisabled;
 }
 
 void HXHeftSwitches::setSharingAnalysisDisabled(bool disabled) {
-    sharingDisabled = disabled;
+    isDisabled = disabled;
 }

@@ -5,6 +5,39 @@
 
 #include <algorithm>
 
+namespace {
+
+using ProcessRegion = HXMemoryObject::ProcessRegion;
+
+bool byPid(const ProcessRegion &a, const ProcessRegion &b) {
+    return a.pid < b.pid;
+}
+
+// The regions' own amounts, added up.
+HXSizes sumOfRegions(std::span<const ProcessRegion> regions) {
+    HXSizes sum;
+    for (const auto &[pid, region] : regions)
+        sum += region->sizes();
+    return sum;
+}
+
+// Each region enters as one whole run: the page runs are gone by now.
+HXSizes sizesOfView(std::span<const ProcessRegion> regions, const HXRegionOwner &process) {
+    if (regions.size() == 1) return regions.front().region->sizes();
+    HXRangeList runs;
+    for (const auto &[pid, region] : regions)
+        runs.addRegion(*region, process.pageSize());
+    HXSizes sizes = runs.sum();
+    if (process.breakDownPhysHeft()) {
+        const HXSizes charged = sumOfRegions(regions);
+        sizes.dirty = charged.dirty;
+        sizes.swapped = charged.swapped;
+    }
+    return sizes;
+}
+
+} // namespace
+
 void HXRegionSet::add(HXMemoryRegion *region) {
     if (!_first) {
         _first = region;
@@ -15,7 +48,6 @@ void HXRegionSet::add(HXMemoryRegion *region) {
 }
 
 std::span<HXMemoryRegion *const> HXRegionSet::regions() const {
-    if (_borrowed) return _borrowed->regions();
     if (_all) return *_all;
     return {&_first, _first ? 1U : 0U};
 }
@@ -42,7 +74,6 @@ void HXMemoryObject::_addRegion(HXMemoryRegion &region, uint32_t pageSize, const
         _processMemoryRegions->push_back({process->pid(), &region});
     }
     addRuns(region, pageSize);
-    region.freeSubrangeList();
 }
 
 void HXMemoryObject::addRuns(HXMemoryRegion &region, uint32_t pageSize) {
@@ -59,16 +90,12 @@ void HXMemoryObject::addRuns(HXMemoryRegion &region, uint32_t pageSize) {
         _onlyRun = nullptr;
     }
     _rangeList->addRegion(region, pageSize);
+    region.freeSubrangeList();
 }
 
-HXMemoryTotal HXMemoryObject::sumOfRuns() const {
+HXSizes HXMemoryObject::sumOfRuns() const {
     if (_rangeList) return _rangeList->sum();
-    if (!_onlyRun) return {};
-    return {.dirty = _onlyRun->dirtySize(),
-            .swapped = _onlyRun->swappedSize(),
-            .clean = _onlyRun->cleanNonSpecSize(),
-            .reclaimable = _onlyRun->reclaimableSize(),
-            .wired = _onlyRun->wiredSize()};
+    return _onlyRun ? _onlyRun->sizes() : HXSizes{};
 }
 
 template <typename Each>
@@ -84,14 +111,9 @@ void HXMemoryObject::forEachProcess(Each each) const {
 // With the kernel's charge for each region, an object holds at least what any one process is charged for it.
 void HXMemoryObject::raiseToLargestProcess() {
     forEachProcess([this](std::span<const ProcessRegion> regions) {
-        uint64_t dirty = 0;
-        uint64_t swapped = 0;
-        for (const ProcessRegion &entry : regions) {
-            dirty += entry.region->dirtySize();
-            swapped += entry.region->swappedSize();
-        }
-        _totalDirtySize = std::max(_totalDirtySize, dirty);
-        _totalSwappedSize = std::max(_totalSwappedSize, swapped);
+        const HXSizes charged = sumOfRegions(regions);
+        _sizes.dirty = std::max(_sizes.dirty, charged.dirty);
+        _sizes.swapped = std::max(_sizes.swapped, charged.swapped);
     });
 }
 
@@ -100,37 +122,21 @@ bool HXMemoryObject::processRegionsTellMore() const {
     bool anyDiffers = false;
     forEachProcess([&](std::span<const ProcessRegion> regions) {
         processes++;
-        const HXMemoryRegion &region = *regions.front().region;
-        anyDiffers =
-            anyDiffers || regions.size() > 1 || region.dirtySize() != _totalDirtySize ||
-            region.swappedSize() != _totalSwappedSize || region.cleanNonSpecSize() != _totalCleanSize ||
-            region.reclaimableSize() != _totalReclaimableSize || region.wiredSize() != _totalWiredSize;
+        anyDiffers = anyDiffers || regions.size() > 1 || regions.front().region->sizes() != _sizes;
     });
     return processes >= 2 && anyDiffers;
 }
 
-void HXMemoryObject::finalizeUsingRegionDirtySize(bool useRegionSizes) {
+void HXMemoryObject::finalize() {
     HXRequire(!_accurateSizes, "HXMemoryObject finalize", "!_accurateSizes");
-    const HXMemoryTotal total = sumOfRuns();
-    _totalCleanSize = total.clean;
-    _totalReclaimableSize = total.reclaimable;
-    _totalWiredSize = total.wired;
-    if (_processMemoryRegions)
-        std::stable_sort(_processMemoryRegions->begin(), _processMemoryRegions->end(),
-                         [](const ProcessRegion &a, const ProcessRegion &b) { return a.pid < b.pid; });
-    if (useRegionSizes) {
-        for (const HXMemoryRegion *region : memoryRegions()) {
-            _totalDirtySize += region->dirtySize();
-            _totalSwappedSize += region->swappedSize();
-        }
-    } else {
-        _totalDirtySize = total.dirty;
-        _totalSwappedSize = total.swapped;
+    _sizes = sumOfRuns();
+    if (_processMemoryRegions) {
+        std::stable_sort(_processMemoryRegions->begin(), _processMemoryRegions->end(), byPid);
         if (HXHeftSwitches::breakDownPhysHeft()) raiseToLargestProcess();
+        if (!processRegionsTellMore()) _processMemoryRegions.reset();
     }
     _rangeList.reset();
     _onlyRun = nullptr;
-    if (!processRegionsTellMore()) _processMemoryRegions.reset();
     nameFakeRegions();
     _accurateSizes = true;
 }
@@ -163,59 +169,30 @@ const HXMemoryRegion *HXMemoryObject::_canonicalRegion() const {
     return found == regions.end() ? first : *found;
 }
 
-std::unique_ptr<HXMemoryObject> HXMemoryObject::copy() const {
-    HXRequire(_accurateSizes, "HXMemoryObject copy", "_accurateSizes");
-    auto copied = std::make_unique<HXMemoryObject>();
-    copied->_totalDirtySize = _totalDirtySize;
-    copied->_totalCleanSize = _totalCleanSize;
-    copied->_totalSwappedSize = _totalSwappedSize;
-    copied->_totalReclaimableSize = _totalReclaimableSize;
-    copied->_totalWiredSize = _totalWiredSize;
-    copied->_memoryRegions.borrow(_memoryRegions);
-    copied->_ownerPid = _ownerPid;
-    copied->_index = _index;
-    copied->_accurateSizes = true;
-    return copied;
-}
-
 std::span<const HXMemoryObject::ProcessRegion> HXMemoryObject::regionsOfProcess(int32_t pid) const {
     const auto all = processMemoryRegions();
-    const auto range =
-        std::equal_range(all.begin(), all.end(), ProcessRegion{pid, nullptr},
-                         [](const ProcessRegion &a, const ProcessRegion &b) { return a.pid < b.pid; });
+    const auto range = std::equal_range(all.begin(), all.end(), ProcessRegion{pid, nullptr}, byPid);
     return {range.first, range.second};
 }
 
-// Each region enters as one whole run: the page runs are gone by now.
-std::unique_ptr<HXMemoryObject> HXMemoryObject::viewOfRegions(std::span<const ProcessRegion> regions,
-                                                              const HXRegionOwner &process) const {
-    auto view = std::make_unique<HXMemoryObject>();
-    view->_ownerPid = _ownerPid;
-    view->_index = _index;
-    for (const ProcessRegion &entry : regions)
-        view->addRegion(*entry.region, process.pageSize());
-    view->finalizeUsingRegionDirtySize(process.breakDownPhysHeft());
-    return view;
+HXMemoryObjectView HXMemoryObject::wholeView() const {
+    HXRequire(_accurateSizes, "HXMemoryObject view", "_accurateSizes");
+    return {{_sizes, static_cast<uint32_t>(memoryRegions().size())}};
 }
 
-// The charge of the whole object is its owner's: to others its dirty and swapped bytes are clean.
-void HXMemoryObject::showAsClean(const HXMemoryObject &whole) {
-    _totalDirtySize = 0;
-    _totalSwappedSize = 0;
-    _totalCleanSize += whole._totalDirtySize + whole._totalSwappedSize;
-}
-
-HXMemoryObject::View HXMemoryObject::viewForProcess(const HXRegionOwner &process) const {
-    const View itself(std::shared_ptr<void>(), this); // not owned
-    std::unique_ptr<HXMemoryObject> view;
+HXMemoryObjectView HXMemoryObject::viewForProcess(const HXRegionOwner &process) const {
+    HXMemoryObjectView view = wholeView();
     if (_processMemoryRegions) {
         const auto regions = regionsOfProcess(process.pid());
-        if (regions.empty()) return itself;
-        view = viewOfRegions(regions, process);
+        if (regions.empty()) return view;
+        view = {{sizesOfView(regions, process), static_cast<uint32_t>(regions.size())}, false};
     }
     if (_ownerPid != kNoOwner && _ownerPid != process.pid()) {
-        if (!view) view = copy();
-        view->showAsClean(*this);
+        // The charge of the whole object is its owner's: to others its dirty and swapped bytes are clean.
+        view.clean += _sizes.heft();
+        view.dirty = 0;
+        view.swapped = 0;
+        view.isWhole = false;
     }
-    return view ? View(std::move(view)) : itself;
+    return view;
 }

@@ -11,7 +11,7 @@ struct TagName {
     const char *name;
 };
 
-constexpr TagName tagNames[] = {
+constexpr TagName kTagNames[] = {
     {0, "untagged (\"VM_ALLOCATE\")"},
     {1, "malloc metadata"},
     {2, "MALLOC_SMALL"},
@@ -54,7 +54,7 @@ using NameTable = std::array<HXString, 256>;
 
 NameTable makeNameTable() {
     NameTable table;
-    for (const TagName &entry : tagNames)
+    for (const TagName &entry : kTagNames)
         table[entry.tag] = HXString::intern(entry.name);
     for (uint32_t tag = kFirstAppTag; tag <= kLastAppTag; tag++)
         table[tag] = HXString::intern("app-specific tag " + std::to_string(tag - kFirstAppTag + 1));
@@ -68,9 +68,9 @@ std::string HXMemoryRegion::fullName() const {
     return _name.str() + " " + _detailedName.str();
 }
 
-void HXMemoryRegion::addSubrange(HXRange range, const HXMemoryTotal &total, uint32_t pageSize) {
+void HXMemoryRegion::addSubrange(HXRange range, const HXSizes &sizes, uint32_t pageSize) {
     if (!_subrangeList) _subrangeList = std::make_unique<HXRangeList>();
-    _subrangeList->addRange(range, pageSize, total);
+    _subrangeList->addRange(range, pageSize, sizes);
 }
 
 bool HXMemoryRegion::eligibleForProcessView() const {
@@ -88,12 +88,6 @@ bool HXMemoryRegion::eligibleForSubrangesUsingPageSize(uint32_t pageSize) const 
         anyNonZero = anyNonZero || part != 0;
     }
     return anyNonZero;
-}
-
-int HXMemoryRegion::compare(const HXMemoryRegion &other) const {
-    if (_start != other._start) return _start < other._start ? -1 : 1;
-    if (_size != other._size) return _size > other._size ? -1 : 1;
-    return 0;
 }
 
 HXString HXMemoryRegion::categoryNameForTag(uint32_t tag) {

@@ -1,8 +1,8 @@
 // One virtual-memory region of one process.
 #pragma once
 
-#include "model/HXMemoryTotal.h"
 #include "model/HXRangeList.h"
+#include "model/HXSizes.h"
 #include "model/HXString.h"
 #include "platform/HXHostRecords.h"
 #include "platform/HXInternalError.h"
@@ -96,6 +96,9 @@ class HXMemoryRegion {
     uint64_t cleanNonSpecSize() const { return _cleanNonSpecSize; }
     void setCleanNonSpecSize(uint64_t size) { _cleanNonSpecSize = size; }
     uint64_t wiredSize() const { return _wired ? _size : 0; }
+    HXSizes sizes() const {
+        return {_dirtySize, _swappedSize, _cleanNonSpecSize, _reclaimableSize, wiredSize()};
+    }
 
     // Identifier of the VM object; 0 when there is none.
     uint64_t object_id() const { return _object_id; }
@@ -103,8 +106,8 @@ class HXMemoryRegion {
 
     // The region's page runs, where page queries split it; null otherwise. Exists only until the merge.
     const HXRangeList *subrangeList() const { return _subrangeList.get(); }
-    // Adds a run, located by its offset in the VM object, with the amounts of `total`.
-    void addSubrange(HXRange range, const HXMemoryTotal &total, uint32_t pageSize);
+    // Adds a run, located by its offset in the VM object.
+    void addSubrange(HXRange range, const HXSizes &sizes, uint32_t pageSize);
     void freeSubrangeList() { _subrangeList.reset(); }
     // Hands the page runs over; the region has none afterwards.
     std::unique_ptr<HXRangeList> takeSubrangeList() { return std::move(_subrangeList); }
@@ -115,9 +118,6 @@ class HXMemoryRegion {
     bool eligibleForProcessView() const;
     // Whether splitting the region into page runs can tell anything new.
     bool eligibleForSubrangesUsingPageSize(uint32_t pageSize) const;
-
-    // By start; of equal starts the larger region first. Negative: this region sorts first.
-    int compare(const HXMemoryRegion &other) const;
 
     // What memory of a user tag is called. Never none. Any thread.
     static HXString categoryNameForTag(uint32_t tag);

@@ -3,39 +3,24 @@
 
 #include "model/HXRegionOwner.h"
 
-#include <cstdint>
-#include <string>
-#include <unordered_set>
+#include <utility>
 #include <vector>
 
-// Open while members are added, then frozen. Two records with one pid are the same member. Members are not
-// owned.
+// Members are not owned, and no two have one pid. Groups are compared by identity: an analysis makes one for
+// each set of processes.
 class HXProcessGroup {
   public:
-    HXProcessGroup() = default;
+    using Processes = std::vector<const HXRegionOwner *>;
+
+    explicit HXProcessGroup(Processes processes) : _processes(std::move(processes)) {}
     HXProcessGroup(const HXProcessGroup &) = delete;
     HXProcessGroup &operator=(const HXProcessGroup &) = delete;
 
-    bool immutable() const { return _immutable; }
-    // The members, in the order in which they were added.
-    const std::vector<const HXRegionOwner *> &processes() const { return _processes; }
-    // Running hash of the members' pids: it depends on the order in which they were added.
-    uint32_t hashValue() const { return _hashValue; }
-    uint32_t hash() const { return _hashValue; }
-
-    // Not after freezing.
-    void addProcess(const HXRegionOwner &process);
-    void freeze() { _immutable = true; }
-    // A frozen group equals only itself among frozen ones; with an open one members are compared. An open
-    // group is never asked about a frozen one.
-    bool isEqual(const HXProcessGroup &other) const;
-    bool holds(int32_t pid) const { return _pids.contains(pid); }
-    // "HXProcessGroup" and the members' descriptions.
-    std::string description() const;
+    // The members, in target order.
+    const Processes &processes() const { return _processes; }
+    // Whether the memory is one process's alone.
+    bool isPrivate() const { return _processes.size() == 1; }
 
   private:
-    bool _immutable = false;
-    std::vector<const HXRegionOwner *> _processes;
-    std::unordered_set<int32_t> _pids;
-    uint32_t _hashValue = 19;
+    Processes _processes;
 };

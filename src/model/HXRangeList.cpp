@@ -14,12 +14,13 @@ struct PageExtent {
     uint64_t end;
 };
 
-PageExtent pageExtent(uint64_t location, uint64_t length, uint32_t pageSize) {
+PageExtent pageExtent(const HXRange &range, uint32_t pageSize) {
     const uint64_t mask = ~(uint64_t{pageSize} - 1);
     uint64_t end = 0;
-    if (__builtin_add_overflow(location, length, &end) || __builtin_add_overflow(end, pageSize - 1, &end))
+    if (__builtin_add_overflow(range.location, range.length, &end) ||
+        __builtin_add_overflow(end, pageSize - 1, &end))
         end = UINT64_MAX;
-    return {location & mask, end & mask};
+    return {range.location & mask, end & mask};
 }
 
 uint64_t overlapOf(const PageExtent &a, const PageExtent &b) {
@@ -36,28 +37,17 @@ uint64_t merged(uint64_t a, uint64_t b, uint64_t overlap) {
 }
 
 void absorb(HXRangeListNode &run, const HXRangeListNode &other, uint64_t overlap) {
-    run.clean = merged(run.clean, other.clean, overlap);
     run.dirty = merged(run.dirty, other.dirty, overlap);
     run.swapped = merged(run.swapped, other.swapped, overlap);
+    run.clean = merged(run.clean, other.clean, overlap);
     run.reclaimable = merged(run.reclaimable, other.reclaimable, overlap);
     run.wired = merged(run.wired, other.wired, overlap);
-    const uint64_t end = std::max(run.location + run.length, other.location + other.length);
+    const uint64_t end = std::max(run.end(), other.end());
     run.location = std::min(run.location, other.location);
     run.length = end - run.location;
 }
 
 } // namespace
-
-void HXRangeList::addRange(HXRange range, uint32_t pageSize, const HXMemoryTotal &total) {
-    insert({.location = range.location,
-            .length = range.length,
-            .clean = total.clean,
-            .dirty = total.dirty,
-            .swapped = total.swapped,
-            .reclaimable = total.reclaimable,
-            .wired = total.wired},
-           pageSize);
-}
 
 void HXRangeList::_addRangeList(const HXRangeList &other, uint32_t pageSize) {
     for (const auto &[location, node] : other._nodes)
@@ -66,21 +56,12 @@ void HXRangeList::_addRangeList(const HXRangeList &other, uint32_t pageSize) {
 
 void HXRangeList::addRegion(const HXMemoryRegion &region, uint32_t pageSize) {
     if (const HXRangeList *runs = region.subrangeList()) return _addRangeList(*runs, pageSize);
-    insert({.location = region.offset(),
-            .length = region.size(),
-            .clean = region.cleanNonSpecSize(),
-            .dirty = region.dirtySize(),
-            .swapped = region.swappedSize(),
-            .reclaimable = region.reclaimableSize(),
-            .wired = region.wiredSize()},
-           pageSize);
+    addRange({region.offset(), region.size()}, pageSize, region.sizes());
 }
 
 void HXRangeList::insert(HXRangeListNode run, uint32_t pageSize) {
-    const PageExtent added = pageExtent(run.location, run.length, pageSize);
-    const auto extentOf = [&](const HXRangeListNode &node) {
-        return pageExtent(node.location, node.length, pageSize);
-    };
+    const PageExtent added = pageExtent(run, pageSize);
+    const auto extentOf = [&](const HXRangeListNode &node) { return pageExtent(node, pageSize); };
 
     // The first run that overlaps or touches the new one. Runs ascend, so those that end before it come
     // first.
@@ -103,12 +84,7 @@ void HXRangeList::insert(HXRangeListNode run, uint32_t pageSize) {
 
 HXMemoryTotal HXRangeList::sum() const {
     HXMemoryTotal total;
-    for (const auto &[location, node] : _nodes) {
-        total.dirty += node.dirty;
-        total.swapped += node.swapped;
-        total.clean += node.clean;
-        total.reclaimable += node.reclaimable;
-        total.wired += node.wired;
-    }
+    for (const auto &[location, node] : _nodes)
+        total.HXSizes::operator+=(node);
     return total;
 }

@@ -12,18 +12,13 @@ class HXMemoryRegion;
 struct HXRange {
     uint64_t location = 0; // first byte
     uint64_t length = 0;   // bytes
+
+    uint64_t end() const { return location + length; }
+    bool operator==(const HXRange &) const = default;
 };
 
-// One merged run with the amounts counted for it, all in bytes.
-struct HXRangeListNode {
-    uint64_t location = 0;
-    uint64_t length = 0;
-    uint64_t clean = 0;
-    uint64_t dirty = 0;
-    uint64_t swapped = 0;
-    uint64_t reclaimable = 0;
-    uint64_t wired = 0;
-
+// One merged run with the amounts counted for it.
+struct HXRangeListNode : HXRange, HXSizes {
     bool operator==(const HXRangeListNode &) const = default;
 };
 
@@ -37,8 +32,10 @@ class HXRangeList {
   public:
     using Nodes = std::map<uint64_t, HXRangeListNode>;
 
-    // Adds a run with the amounts of `total` (its region count is not used). `pageSize` is a power of two.
-    void addRange(HXRange range, uint32_t pageSize, const HXMemoryTotal &total);
+    // Adds a run with its amounts. `pageSize` is a power of two.
+    void addRange(HXRange range, uint32_t pageSize, const HXSizes &sizes) {
+        insert({range, sizes}, pageSize);
+    }
 
     // Adds each run of `other`, in order.
     void _addRangeList(const HXRangeList &other, uint32_t pageSize);

@@ -5,7 +5,7 @@
 #include <string>
 #include <string_view>
 
-// The owner of regions: one analysed process, whatever its source. Owners compare and hash by pid.
+// The owner of regions: one analysed process, whatever its source. Owners of one pid are equal.
 class HXRegionOwner {
   public:
     HXRegionOwner() = default;
@@ -24,12 +24,7 @@ class HXRegionOwner {
     const std::string &displayString() const { return _displayString; }
     void setDisplayString(std::string_view text) { _displayString = text; }
 
-    uint64_t hash() const { return static_cast<uint64_t>(static_cast<int64_t>(_pid)); }
     bool isEqual(const HXRegionOwner &other) const { return _pid == other._pid; }
-    // The pid, as the key in maps of processes.
-    int32_t asNumber() const { return _pid; }
-    // "HXProcess[PID]".
-    std::string description() const { return "HXProcess[" + std::to_string(_pid) + "]"; }
 
   protected:
     std::string _displayString;

@@ -4,7 +4,6 @@
 #include "platform/HXPlatform.h"
 
 #include <cerrno>
-#include <cinttypes>
 
 namespace {
 
@@ -27,15 +26,14 @@ std::unique_ptr<HXOutputFormatterJSON> HXOutputFormatterJSON::withPath(const std
 
 HXOutputFormatterJSON::HXOutputFormatterJSON(std::FILE *stream) : _stream(stream) {
     open('{');
-    key("\"unit\":");
+    key("unit");
     text("byte");
-    member("\"bytes per unit\":", 1);
+    member("bytes per unit", 1);
     if (!HXHeftSwitches::breakDownPhysHeft()) {
-        key("\"vm_object_dirty_analysis\":");
-        fputs("true", _stream);
-        _needsComma = true;
+        key("vm_object_dirty_analysis");
+        raw("true");
     }
-    key("\"processes\":");
+    key("processes");
     open('[');
 }
 
@@ -51,15 +49,10 @@ void HXOutputFormatterJSON::separate() {
     if (_needsComma) fputc(',', _stream);
 }
 
-void HXOutputFormatterJSON::key(const char *literal) {
-    separate();
-    fputs(literal, _stream);
-    _needsComma = false;
-}
-
-void HXOutputFormatterJSON::keyNamed(const std::string &name) {
-    separate();
-    fprintf(_stream, "\"%s\":", name.c_str());
+void HXOutputFormatterJSON::key(std::string_view name) {
+    fputs(_needsComma ? ",\"" : "\"", _stream);
+    fwrite(name.data(), 1, name.size(), _stream);
+    fputs("\":", _stream);
     _needsComma = false;
 }
 
@@ -74,23 +67,17 @@ void HXOutputFormatterJSON::close(char bracket) {
     _needsComma = true;
 }
 
-void HXOutputFormatterJSON::number(uint64_t value) {
-    fprintf(_stream, "%" PRIu64, value);
-    _needsComma = true;
-}
-
-void HXOutputFormatterJSON::signedNumber(int64_t value) {
-    fprintf(_stream, "%" PRId64, value);
+void HXOutputFormatterJSON::raw(std::string_view json) {
+    fwrite(json.data(), 1, json.size(), _stream);
     _needsComma = true;
 }
 
 void HXOutputFormatterJSON::text(const std::string &value) {
-    fprintf(_stream, "\"%s\"", value.c_str());
-    _needsComma = true;
+    raw('"' + value + '"');
 }
 
-void HXOutputFormatterJSON::texts(const char *literal, const std::vector<std::string> &values) {
-    key(literal);
+void HXOutputFormatterJSON::texts(std::string_view name, const std::vector<std::string> &values) {
+    key(name);
     open('[');
     for (const std::string &value : values) {
         separate();
@@ -99,50 +86,52 @@ void HXOutputFormatterJSON::texts(const char *literal, const std::vector<std::st
     close(']');
 }
 
-void HXOutputFormatterJSON::member(const char *literal, uint64_t value) {
-    key(literal);
-    number(value);
+void HXOutputFormatterJSON::member(std::string_view name, uint64_t value) {
+    key(name);
+    raw(std::to_string(value));
 }
 
-void HXOutputFormatterJSON::sizes(uint64_t dirty, uint64_t swapped, uint64_t clean, uint64_t reclaimable,
-                                  uint64_t wired, uint32_t regions) {
-    member("\"dirty\":", dirty + swapped);
-    member("\"swapped\":", swapped);
-    member("\"clean\":", clean);
-    member("\"reclaimable\":", reclaimable);
-    member("\"wired\":", wired);
-    member("\"regions\":", regions);
+// A total's dirty bytes include the swapped ones.
+void HXOutputFormatterJSON::sizes(const HXMemoryTotal &total) {
+    open('{');
+    member("dirty", total.heft());
+    member("swapped", total.swapped);
+    member("clean", total.clean);
+    member("reclaimable", total.reclaimable);
+    member("wired", total.wired);
+    member("regions", total.regionCount);
+    close('}');
 }
 
 void HXOutputFormatterJSON::region(const HXMemoryRegion &region) {
-    const auto unlessZero = [this](const char *literal, uint64_t value) {
-        if (value != 0) member(literal, value);
+    const auto unlessZero = [this](std::string_view name, uint64_t value) {
+        if (value != 0) member(name, value);
     };
     open('{');
-    member("\"id\":", region.object_id());
-    key("\"name\":");
+    member("id", region.object_id());
+    key("name");
     text(escaped(region.fullName()));
-    if (region.start() != kNoAddress) member("\"addr\":", region.start());
-    member("\"vsize\":", region.size());
-    unlessZero("\"offset\":", region.offset());
-    unlessZero("\"dirty\":", region.dirtySize());
-    unlessZero("\"swapped\":", region.swappedSize());
-    unlessZero("\"clean\":", region.cleanNonSpecSize());
-    unlessZero("\"reclaimable\":", region.reclaimableSize());
-    unlessZero("\"wired\":", region.wiredSize());
+    if (region.start() != kNoAddress) member("addr", region.start());
+    member("vsize", region.size());
+    unlessZero("offset", region.offset());
+    unlessZero("dirty", region.dirtySize());
+    unlessZero("swapped", region.swappedSize());
+    unlessZero("clean", region.cleanNonSpecSize());
+    unlessZero("reclaimable", region.reclaimableSize());
+    unlessZero("wired", region.wiredSize());
     close('}');
 }
 
 void HXOutputFormatterJSON::printProcessHeader(const HXProcess &process) {
     open('{');
-    key("\"name\":");
+    key("name");
     text(escaped(process.name()));
-    key("\"pid\":");
-    signedNumber(process.pid());
-    if (process.hasErrors()) texts("\"errors\":", process.errors());
-    if (!process.warnings().empty()) texts("\"warnings\":", process.warnings());
+    key("pid");
+    raw(std::to_string(process.pid()));
+    if (process.hasErrors()) texts("errors", process.errors());
+    if (!process.warnings().empty()) texts("warnings", process.warnings());
     if (_verbose) {
-        key("\"regions\":");
+        key("regions");
         open('[');
         for (const HXMemoryRegion &each : process.memoryRegions())
             region(each);
@@ -152,11 +141,11 @@ void HXOutputFormatterJSON::printProcessHeader(const HXProcess &process) {
 }
 
 void HXOutputFormatterJSON::printProcessTotal(uint64_t heft, const HXProcess &) {
-    member("\"heft\":", heft);
+    member("heft", heft);
 }
 
 void HXOutputFormatterJSON::printProcessCategories(const HXCategoryMap &categories, const HXMemoryTotal &) {
-    key("\"categories\":");
+    key("categories");
     open('{');
     JSONForCategories(categories);
     close('}');
@@ -169,13 +158,13 @@ void HXOutputFormatterJSON::printSharedCategories(const std::shared_ptr<const HX
     if (!hasProcessView && !_addedProcessGroups.insert(&group).second) return;
     SharedEntry entry{.pids = {}, .categories = categories, .specificToPid = std::nullopt};
     for (const HXRegionOwner *member : group.processes())
-        entry.pids.push_back(member->asNumber());
-    if (hasProcessView) entry.specificToPid = process.asNumber();
+        entry.pids.push_back(member->pid());
+    if (hasProcessView) entry.specificToPid = process.pid();
     _shared.push_back(std::move(entry));
 }
 
 void HXOutputFormatterJSON::printProcessAuxData(const HXAuxDictionary *data) {
-    key("\"auxiliary\":");
+    key("auxiliary");
     errno = 0;
     JSONForAuxData(data);
     close('}');
@@ -193,42 +182,40 @@ void HXOutputFormatterJSON::printProcessesWithWarnings(const Processes &withWarn
     std::vector<std::string> warnings;
     for (const HXProcess *process : withWarnings)
         warnings.insert(warnings.end(), process->warnings().begin(), process->warnings().end());
-    texts("\"errors\":", errors);
-    texts("\"warnings\":", warnings);
+    texts("errors", errors);
+    texts("warnings", warnings);
 }
 
 void HXOutputFormatterJSON::printSummaryCategories(const HXCategoryMap &categories,
                                                    const HXMemoryTotal &total, bool) {
-    key("\"summary\":");
+    key("summary");
     open('{');
     JSONForCategories(categories);
-    key("\"total\":");
-    open('{');
-    sizes(total.dirty, total.swapped, total.clean, total.reclaimable, total.wired, total.regionCount);
+    key("total");
+    sizes(total);
     close('}');
-    close('}');
-    member("\"total heft\":", total.dirty + total.swapped);
+    member("total heft", total.heft());
 }
 
 void HXOutputFormatterJSON::printGlobalAuxData(const HXAuxDictionary *data) {
-    key("\"auxiliary\":");
+    key("auxiliary");
     JSONForAuxData(data);
 }
 
 void HXOutputFormatterJSON::sharedEntry(const SharedEntry &entry) {
     open('{');
-    key("\"pids\":");
+    key("pids");
     open('[');
     for (const int32_t pid : entry.pids) {
         separate();
-        signedNumber(pid);
+        raw(std::to_string(pid));
     }
     close(']');
     if (entry.specificToPid) {
-        key("\"specific_to_pid\":");
-        signedNumber(*entry.specificToPid);
+        key("specific_to_pid");
+        raw(std::to_string(*entry.specificToPid));
     }
-    key("\"categories\":");
+    key("categories");
     open('{');
     JSONForCategories(*entry.categories);
     close('}');
@@ -236,13 +223,13 @@ void HXOutputFormatterJSON::sharedEntry(const SharedEntry &entry) {
 }
 
 void HXOutputFormatterJSON::end() {
-    key("\"shared\":");
+    key("shared");
     open('[');
     for (const SharedEntry &entry : _shared)
         sharedEntry(entry);
     close(']');
     if (_pageSize == 0) _pageSize = HXPlatform::current().vm_kernel_page_size();
-    member("\"page size\":", _pageSize);
+    member("page size", _pageSize);
     close('}');
     errno = 0;
     if (fflush(_stream) != 0 || ferror(_stream)) noteFailure();
@@ -251,23 +238,12 @@ void HXOutputFormatterJSON::end() {
 }
 
 void HXOutputFormatterJSON::JSONForCategories(const HXCategoryMap &categories) {
-    for (const auto &[name, category] : categories.entries()) {
-        keyNamed(escaped(category->fullName()));
-        open('{');
-        sizes(category->totalDirtySize(), category->totalSwappedSize(), category->totalCleanSize(),
-              category->totalReclaimableSize(), category->totalWiredSize(),
-              static_cast<uint32_t>(category->totalRegions()));
-        close('}');
+    for (const HXMemoryCategory &category : categories.categories()) {
+        key(escaped(category.fullName()));
+        sizes(category.total());
     }
 }
 
-void HXOutputFormatterJSON::JSONForAuxData(const HXAuxDataType *data) {
-    if (!data || !data->isContainer())
-        return signedNumber(data ? static_cast<const HXAuxData *>(data)->value() : 0);
-    open('{');
-    for (const auto &[name, node] : static_cast<const HXAuxDictionary *>(data)->entries()) {
-        keyNamed(name);
-        JSONForAuxData(node.get());
-    }
-    close('}');
+void HXOutputFormatterJSON::JSONForAuxData(const HXAuxDictionary *data) {
+    raw(data ? data->jsonRepresentation() : "0");
 }

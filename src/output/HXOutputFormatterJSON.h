@@ -5,6 +5,8 @@
 
 #include <cstdio>
 #include <optional>
+#include <string_view>
+#include <unordered_set>
 
 class HXOutputFormatterJSON : public HXOutputFormatter {
   public:
@@ -34,7 +36,7 @@ class HXOutputFormatterJSON : public HXOutputFormatter {
     }
 
     void JSONForCategories(const HXCategoryMap &categories);
-    void JSONForAuxData(const HXAuxDataType *data);
+    void JSONForAuxData(const HXAuxDictionary *data);
 
     // The errno of the first write that failed, known after `end`; 0 when all is written.
     int writeError() const { return _writeError; }
@@ -47,19 +49,15 @@ class HXOutputFormatterJSON : public HXOutputFormatter {
     };
 
     explicit HXOutputFormatterJSON(std::FILE *stream);
-    // The writer's four steps. A key comes with its quotes and colon.
     void separate(); // the comma before the next key or element, where one is needed
-    void key(const char *literal);
-    void keyNamed(const std::string &name);
+    void key(std::string_view name);
     void open(char bracket);
     void close(char bracket);
-    void number(uint64_t value);
-    void signedNumber(int64_t value);
+    void raw(std::string_view json); // a value as it stands
     void text(const std::string &value);
-    void texts(const char *literal, const std::vector<std::string> &values);
-    void member(const char *literal, uint64_t value);
-    void sizes(uint64_t dirty, uint64_t swapped, uint64_t clean, uint64_t reclaimable, uint64_t wired,
-               uint32_t regions);
+    void texts(std::string_view name, const std::vector<std::string> &values);
+    void member(std::string_view name, uint64_t value);
+    void sizes(const HXMemoryTotal &total);
     void region(const HXMemoryRegion &region);
     void sharedEntry(const SharedEntry &entry);
     void noteFailure();

@@ -10,64 +10,55 @@
 
 namespace {
 
-constexpr char kRulePart[] = "==========";
+using Figure = uint64_t (*)(const HXMemoryTotal &);
 
-// A category table's size columns, in order.
-enum Column { dirtyColumn, swappedColumn, cleanColumn, reclaimableColumn, wiredColumn, sizeColumns };
-
-struct ColumnWidths {
-    int formatted;
-    int others; // bytes and pages
-};
-constexpr ColumnWidths columnWidths[sizeColumns] = {{7, 11}, {11, 14}, {11, 14}, {13, 14}, {11, 14}};
-
-using Key = uint64_t (*)(const HXMemoryCategory &);
-
-uint64_t dirtyAndSwapped(const HXMemoryCategory &c) {
-    return c.totalDirtySize() + c.totalSwappedSize();
+uint64_t clean(const HXMemoryTotal &total) {
+    return total.clean;
 }
-
-struct SortColumn {
-    const char *name;
-    std::vector<Key> keys; // larger first, each deciding among equals of those before
-};
-
-const std::vector<SortColumn> &sortColumns() {
-    static const std::vector<SortColumn> columns = {
-        {"Dirty",
-         {dirtyAndSwapped, [](const HXMemoryCategory &c) { return c.totalReclaimableSize(); },
-          [](const HXMemoryCategory &c) { return c.totalCleanSize(); }}},
-        {"Swapped", {[](const HXMemoryCategory &c) { return c.totalSwappedSize(); }}},
-        {"Clean", {[](const HXMemoryCategory &c) { return c.totalCleanSize(); }}},
-        {"Reclaimable", {[](const HXMemoryCategory &c) { return c.totalReclaimableSize(); }}},
-        {"Wired", {[](const HXMemoryCategory &c) { return c.totalWiredSize(); }}},
-        {"Regions", {[](const HXMemoryCategory &c) { return static_cast<uint64_t>(c.totalRegions()); }}},
-        {"Category", {}},
-    };
-    return columns;
+uint64_t reclaimable(const HXMemoryTotal &total) {
+    return total.reclaimable;
+}
+uint64_t regions(const HXMemoryTotal &total) {
+    return total.regionCount;
 }
 
 std::string humanized(int64_t size) {
-    char buffer[8];
+    char buffer[8]; // up to four digits, a blank, a prefix, "B" and the end
     if (humanize_number(buffer, sizeof buffer, size, "B", HN_AUTOSCALE, 0) < 0) return "?";
     return buffer;
 }
 
+std::vector<std::string> namesOf(const HXOutputFormatter::Processes &processes) {
+    std::vector<std::string> names;
+    for (const HXProcess *process : processes)
+        names.push_back(process->name());
+    return names;
+}
+
 } // namespace
 
-// One line of a category table below the titles.
-struct HXOutputFormatterText::Row {
-    uint64_t sizes[sizeColumns];
-    int32_t regions;
-    const std::string &name;
-    HXString detail;
+// A column of a category table, the last one aside.
+struct HXOutputFormatterText::Column {
+    const char *name; // what it is sorted by
+    const char *title;
+    int formattedWidth;
+    int otherWidth; // of bytes and pages
+    int32_t option; // that shows it
+    Figure figure;
+};
+
+// The dirty column includes the swapped bytes.
+const HXOutputFormatterText::Column HXOutputFormatterText::kColumns[] = {
+    {"Dirty", "Dirty", 7, 11, 0, [](const HXMemoryTotal &total) { return total.heft(); }},
+    {"Swapped", "(Swapped)", 11, 14, HXTextSwapped, [](const HXMemoryTotal &total) { return total.swapped; }},
+    {"Clean", "Clean", 11, 14, 0, clean},
+    {"Reclaimable", "Reclaimable", 13, 14, 0, reclaimable},
+    {"Wired", "(Wired)", 11, 14, HXTextWired, [](const HXMemoryTotal &total) { return total.wired; }},
+    {"Regions", "Regions", 11, 11, 0, regions},
 };
 
 HXOutputFormatterText::HXOutputFormatterText(int32_t summaryFormat, int32_t options, std::string sort)
-    : _summaryFormat(summaryFormat), _options(options), _sort(std::move(sort)), _output(stdout) {
-    if (showsSwapped()) _swappedColumnName = "(Swapped)";
-    if (showsWired()) _wiredColumnName = "(Wired)";
-}
+    : _summaryFormat(summaryFormat), _options(options), _sort(std::move(sort)), _output(stdout) {}
 
 std::string HXOutputFormatterText::formattedStringForSize(uint64_t size) const {
     const auto asSigned = static_cast<int64_t>(size);
@@ -84,96 +75,82 @@ HXString HXOutputFormatterText::_truncatedNameForString(HXString text) const {
 }
 
 void HXOutputFormatterText::printRule(const char *lineEnd) {
-    const auto part = [](bool shown) { return shown ? kRulePart : ""; };
-    const auto width = [](bool shown) { return shown ? 10 : 0; };
-    fprintf(_output, "%s%s%s%*s%s%s%*s%s%s%s", kRulePart, kRulePart, kRulePart, width(showsSwapped()),
-            part(showsSwapped()), kRulePart, kRulePart, width(showsWired()), part(showsWired()), kRulePart,
-            kRulePart, lineEnd);
+    const size_t width = 70 + (shows(HXTextSwapped) ? 10 : 0) + (shows(HXTextWired) ? 10 : 0);
+    fprintf(_output, "%s%s", std::string(width, '=').c_str(), lineEnd);
 }
 
-// A line of seven texts under the columns: titles or dashes.
-void HXOutputFormatterText::printTitleLike(const char *const titles[7]) {
-    for (int column = 0; column < sizeColumns; column++) {
-        const bool hidden =
-            (column == swappedColumn && !showsSwapped()) || (column == wiredColumn && !showsWired());
-        const ColumnWidths &widths = columnWidths[column];
-        const int width = _summaryFormat == HXFormatFormatted ? widths.formatted : widths.others;
-        fprintf(_output, "%*s", hidden ? 0 : width, hidden ? "" : titles[column]);
-    }
-    fprintf(_output, " %10s    %s", titles[5], titles[6]);
+template <typename Text>
+void HXOutputFormatterText::printLine(Text text, const std::string &category) {
+    for (const Column &column : kColumns)
+        if (shows(column.option))
+            fprintf(_output, "%*s",
+                    _summaryFormat == HXFormatFormatted ? column.formattedWidth : column.otherWidth,
+                    std::string(text(column)).c_str());
+    fprintf(_output, "    %s\n", category.c_str());
 }
 
-void HXOutputFormatterText::printRow(const Row &row) {
-    std::string sizes[sizeColumns];
-    const char *texts[7];
-    for (int column = 0; column < sizeColumns; column++) {
-        sizes[column] = formattedStringForSize(row.sizes[column]);
-        texts[column] = sizes[column].c_str();
-    }
-    const std::string regions = std::to_string(row.regions);
-    texts[5] = regions.c_str();
-    texts[6] = row.name.c_str();
-    printTitleLike(texts);
-    // One blank, then the text, whatever its letters.
-    if (row.detail) fprintf(_output, " %s", row.detail.c_str());
-    fputc('\n', _output);
+void HXOutputFormatterText::printDashes() {
+    printLine([](const Column &) { return "---"; }, "---");
 }
 
-static constexpr const char *kDashes[7] = {"---", "---", "---", "---", "---", "---", "---"};
+void HXOutputFormatterText::printRow(const HXMemoryTotal &total, const std::string &category) {
+    printLine(
+        [&](const Column &column) {
+            const uint64_t figure = column.figure(total);
+            return column.figure == regions ? std::to_string(figure) : formattedStringForSize(figure);
+        },
+        category);
+}
 
 void HXOutputFormatterText::printTable(const HXCategoryMap &categories, const HXMemoryTotal &total) {
-    const char *titles[7] = {"Dirty",       _swappedColumnName.c_str(), "Clean",
-                             "Reclaimable", _wiredColumnName.c_str(),   "Regions",
-                             "Category"};
-    printTitleLike(titles);
-    fputc('\n', _output);
-    printTitleLike(kDashes);
-    fputc('\n', _output);
+    printLine([](const Column &column) { return column.title; }, "Category");
+    printDashes();
     _printCategories(categories);
     _printTotalFooter(total);
 }
 
-std::vector<const HXCategoryMap::Entry *>
+std::vector<const HXMemoryCategory *>
 HXOutputFormatterText::_sortedKeysForCategories(const HXCategoryMap &categories) const {
-    const auto &columns = sortColumns();
-    const auto column =
-        std::find_if(columns.begin(), columns.end(), [this](const SortColumn &c) { return c.name == _sort; });
-    HXRequire(column != columns.end(), "_sortedKeysForCategories", "Unhandled text sort column");
-    std::vector<const HXCategoryMap::Entry *> sorted;
-    for (const HXCategoryMap::Entry &entry : categories.entries())
-        sorted.push_back(&entry);
-    std::sort(sorted.begin(), sorted.end(),
-              [&](const HXCategoryMap::Entry *a, const HXCategoryMap::Entry *b) {
-                  for (const Key key : column->keys) {
-                      const uint64_t keyOfA = key(*a->category);
-                      const uint64_t keyOfB = key(*b->category);
-                      if (keyOfA != keyOfB) return keyOfA > keyOfB;
-                  }
-                  return a->key < b->key;
-              });
+    std::vector<Figure> keys; // larger first, each deciding among equals of those before
+    const auto column = std::find_if(std::begin(kColumns), std::end(kColumns),
+                                     [this](const Column &each) { return each.name == _sort; });
+    if (column != std::end(kColumns))
+        keys.push_back(column->figure);
+    else
+        HXRequire(_sort == "Category", "_sortedKeysForCategories", "Unhandled text sort column");
+    if (column == kColumns) keys.insert(keys.end(), {reclaimable, clean});
+
+    std::vector<const HXMemoryCategory *> sorted;
+    for (const HXMemoryCategory &category : categories.categories())
+        sorted.push_back(&category);
+    std::sort(sorted.begin(), sorted.end(), [&](const HXMemoryCategory *a, const HXMemoryCategory *b) {
+        for (const Figure key : keys) {
+            const uint64_t keyOfA = key(a->total());
+            const uint64_t keyOfB = key(b->total());
+            if (keyOfA != keyOfB) return keyOfA > keyOfB;
+        }
+        return a->fullName() < b->fullName();
+    });
     return sorted;
 }
 
 void HXOutputFormatterText::_printCategories(const HXCategoryMap &categories) {
-    for (const HXCategoryMap::Entry *entry : _sortedKeysForCategories(categories)) {
-        const HXMemoryCategory &category = *entry->category;
-        const HXString name = category.name();
-        printRow({{dirtyAndSwapped(category), category.totalSwappedSize(), category.totalCleanSize(),
-                   category.totalReclaimableSize(), category.totalWiredSize()},
-                  category.totalRegions(),
-                  name ? name.str() : entry->key,
-                  _truncatedNameForString(category.detailedName())});
+    for (const HXMemoryCategory *category : _sortedKeysForCategories(categories)) {
+        const HXString detail = _truncatedNameForString(category->detailedName());
+        printRow(category->total(), category->name().str() + (detail ? " " + detail.str() : ""));
     }
 }
 
 void HXOutputFormatterText::_printTotalFooter(const HXMemoryTotal &total) {
-    static const std::string name = "TOTAL";
-    printTitleLike(kDashes);
-    fputc('\n', _output);
-    printRow({{total.dirty + total.swapped, total.swapped, total.clean, total.reclaimable, total.wired},
-              static_cast<int32_t>(total.regionCount),
-              name,
-              HXString()});
+    printDashes();
+    printRow(total, "TOTAL");
+}
+
+void HXOutputFormatterText::printList(const char *heading, const std::vector<std::string> &texts) {
+    if (texts.empty()) return;
+    fprintf(_output, "\n%s\n", heading);
+    for (const std::string &text : texts)
+        fprintf(_output, "\t%s\n", text.c_str());
 }
 
 void HXOutputFormatterText::printProcessHeader(const HXProcess &process) {
@@ -181,16 +158,8 @@ void HXOutputFormatterText::printProcessHeader(const HXProcess &process) {
     _pageSize = process.pageSize();
     printRule("\n");
     fprintf(_output, "%s: %s-bit", process.displayString().c_str(), process.is64bit() ? "64" : "32");
-    if (!process.warnings().empty()) {
-        fputs("\nWarnings were encountered while examining the process.\n", _output);
-        for (const std::string &warning : process.warnings())
-            fprintf(_output, "\t%s\n", warning.c_str());
-    }
-    if (process.hasErrors()) {
-        fputs("\nErrors were encountered while examining the process. No results gathered.\n", _output);
-        for (const std::string &error : process.errors())
-            fprintf(_output, "\t%s\n", error.c_str());
-    }
+    printList("Warnings were encountered while examining the process.", process.warnings());
+    printList("Errors were encountered while examining the process. No results gathered.", process.errors());
 }
 
 void HXOutputFormatterText::printProcessTotal(uint64_t heft, const HXProcess &process) {
@@ -238,21 +207,9 @@ void HXOutputFormatterText::printProcessAuxData(const HXAuxDictionary *data) {
 void HXOutputFormatterText::printProcessesWithWarnings(const Processes &withWarnings,
                                                        const Processes &withErrors,
                                                        const std::vector<std::string> &globalErrors) {
-    if (!withWarnings.empty()) {
-        fputs("\nWarnings were encountered while examining the following processes:\n", _output);
-        for (const HXProcess *process : withWarnings)
-            fprintf(_output, "\t%s\n", process->name().c_str());
-    }
-    if (!withErrors.empty()) {
-        fputs("\nErrors were encountered while examining the following processes:\n", _output);
-        for (const HXProcess *process : withErrors)
-            fprintf(_output, "\t%s\n", process->name().c_str());
-    }
-    if (!globalErrors.empty()) {
-        fputs("\nErrors were encountered:\n", _output);
-        for (const std::string &error : globalErrors)
-            fprintf(_output, "\t%s\n", error.c_str());
-    }
+    printList("Warnings were encountered while examining the following processes:", namesOf(withWarnings));
+    printList("Errors were encountered while examining the following processes:", namesOf(withErrors));
+    printList("Errors were encountered:", globalErrors);
     if (!withErrors.empty() || !globalErrors.empty())
         fputs("\nDue to errors, summary results may be invalid\n", _output);
 }
@@ -266,7 +223,7 @@ void HXOutputFormatterText::printSummaryCategories(const HXCategoryMap &categori
     _printPhysHeftBreakdownEnabled();
     if (_processCount == 1) return; // the one process's own tables say it all
     printRule("\n");
-    fprintf(_output, "Summary Heft: %s%s\n", formattedStringForSize(total.dirty + total.swapped).c_str(),
+    fprintf(_output, "Summary Heft: %s%s\n", formattedStringForSize(total.heft()).c_str(),
             hadErrors ? " (may be invalid due to errors)" : "");
     printRule("\n\n");
     printTable(categories, total);

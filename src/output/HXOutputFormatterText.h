@@ -36,33 +36,36 @@ class HXOutputFormatterText : public HXOutputFormatter {
     std::string formattedStringForSize(uint64_t size) const;
     // "…/" and the last path component unless the output is wide; none stays none.
     HXString _truncatedNameForString(HXString text) const;
-    // The keys in print order.
-    std::vector<const HXCategoryMap::Entry *> _sortedKeysForCategories(const HXCategoryMap &categories) const;
+    // The categories in print order.
+    std::vector<const HXMemoryCategory *> _sortedKeysForCategories(const HXCategoryMap &categories) const;
     void _printCategories(const HXCategoryMap &categories);
     void _printTotalFooter(const HXMemoryTotal &total);
     void printAuxData(const HXAuxDictionary &data);
     void _printAuxData(const HXAuxDictionary &data, uint32_t indent);
     void _printPhysHeftBreakdownEnabled();
 
-    std::FILE *output() const { return _output; }
     // Not owned.
     void setOutput(std::FILE *output) { _output = output; }
 
   private:
-    struct Row;
+    struct Column;
+    static const Column kColumns[];
 
     void printTable(const HXCategoryMap &categories, const HXMemoryTotal &total);
-    void printRow(const Row &row);
-    void printTitleLike(const char *const titles[7]);
+    // A line of a table: `text(column)` in each column, then the category.
+    template <typename Text>
+    void printLine(Text text, const std::string &category);
+    void printDashes();
+    void printRow(const HXMemoryTotal &total, const std::string &category);
     void printRule(const char *lineEnd);
+    // A heading and a line for each text; nothing without texts.
+    void printList(const char *heading, const std::vector<std::string> &texts);
     void printRegion(const HXMemoryRegion &region, uint64_t pageSize);
-    bool showsSwapped() const { return _options & HXTextSwapped; }
-    bool showsWired() const { return _options & HXTextWired; }
+    // Whether a column that needs the option is shown; 0 is always shown.
+    bool shows(int32_t option) const { return option == 0 || (_options & option) != 0; }
 
     uint8_t _processCount = 0; // 0, 1, or 2 for two and more
     uint32_t _pageSize = 0;
-    std::string _swappedColumnName; // empty: the column is hidden
-    std::string _wiredColumnName;
     int32_t _summaryFormat;
     int32_t _options;
     std::string _sort;

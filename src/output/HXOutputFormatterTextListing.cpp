@@ -5,19 +5,16 @@
 
 void HXOutputFormatterText::printAtlasLikeOutputForProcess(const HXProcess &process,
                                                            const HXMemoryRegionList &regions) {
-    const auto optional = [](bool shown, const char *text) { return shown ? text : ""; };
-    const auto width = [](bool shown) { return shown ? 8 : 0; };
+    const auto optional = [this](int32_t option, const char *text) { return shows(option) ? text : ""; };
     fprintf(_output, "%s\n\n", process.displayString().c_str());
     fprintf(_output,
-            "           start                end  [objectid]      VRT     DRT%*s     CLN     RCL%*s   tag "
+            "           start                end  [objectid]      VRT     DRT%s     CLN     RCL%s   tag "
             "(detail)\n",
-            width(showsSwapped()), optional(showsSwapped(), "     SWP"), width(showsWired()),
-            optional(showsWired(), "    WIRE"));
+            optional(HXTextSwapped, "     SWP"), optional(HXTextWired, "    WIRE"));
     fprintf(_output,
-            "      ----------         ----------  ----------    -----   -----%*s   -----   -----%*s   "
+            "      ----------         ----------  ----------    -----   -----%s   -----   -----%s   "
             "------------\n",
-            width(showsSwapped()), optional(showsSwapped(), "   -----"), width(showsWired()),
-            optional(showsWired(), "   -----"));
+            optional(HXTextSwapped, "   -----"), optional(HXTextWired, "   -----"));
     for (const HXMemoryRegion &region : regions)
         printRegion(region, process.pageSize());
     fputc('\n', _output);
@@ -32,12 +29,11 @@ void HXOutputFormatterText::printRegion(const HXMemoryRegion &region, uint64_t p
     else
         fprintf(_output, "%16" PRIx64 " - %16" PRIx64 " [%10" PRIx64 "]", region.start(),
                 region.start() + region.size(), id);
-    fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.size()),
-            pages(region.dirtySize() + region.swappedSize()));
-    if (showsSwapped()) fprintf(_output, " %7" PRIu64, pages(region.swappedSize()));
+    fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.size()), pages(region.sizes().heft()));
+    if (shows(HXTextSwapped)) fprintf(_output, " %7" PRIu64, pages(region.swappedSize()));
     fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.cleanNonSpecSize()),
             pages(region.reclaimableSize()));
-    if (showsWired()) fprintf(_output, " %7" PRIu64, pages(region.wiredSize()));
+    if (shows(HXTextWired)) fprintf(_output, " %7" PRIu64, pages(region.wiredSize()));
     fprintf(_output, "   %s", region.name().c_str());
     if (const HXString detail = _truncatedNameForString(region.detailedName()))
         fprintf(_output, " %s", detail.c_str());

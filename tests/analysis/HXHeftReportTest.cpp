@@ -1,4 +1,4 @@
-// Whole reports of several processes.
+// Whatever a machine is like, its report adds up.
 #include "support/HXRun.h"
 
 #include <gtest/gtest.h>
@@ -7,64 +7,6 @@
 namespace {
 using Words = std::vector<std::string>;
 
-bool holds(const std::string &text, const std::string &part) {
-    return text.find(part) != std::string::npos;
-}
-} // namespace
-
-TEST(HXHeftReportTest, TheSearchForUnmappedMemoryNamesItAfterWhoMapsIt) {
-    const std::string machine =
-        "host  self_region_heft=0  ledger=other\nprocess  pid=1010  name=target\n"
-        "owned  pid=1010  object_id=5  virtual=0x8000  resident=0x8000\n" +
-        region(1010, 0x4000, 0x4000, "tag=2  resident=1  dirtied=1  object_id=1") +
-        "process  pid=1020  name=mapper\n" +
-        region(1020, 0x4000, 0x4000, "tag=2  resident=1  dirtied=1  object_id=1") +
-        region(1020, 0x8000, 0x8000, "tag=3  share_mode=4  resident=2  dirtied=2  object_id=5") +
-        region(1020, 0x10000, 0x4000, "tag=7  resident=1  dirtied=1  object_id=6");
-    const HXRun alone = report(machine, {"target"});
-    EXPECT_TRUE(holds(
-        alone.out, "    32768 B           0 B           0 B          1    Owned physical heft (unmapped)\n"))
-        << alone.out;
-    const HXRun searched = report(machine, {"target", "--unmapped"});
-    EXPECT_TRUE(holds(searched.out, "Shared with mapper [1020]:\n"));
-    EXPECT_TRUE(holds(searched.out, "    32768 B           0 B           0 B          2    MALLOC_LARGE\n"))
-        << searched.out;
-    EXPECT_TRUE(holds(searched.out, "Heft: 49152 B"));
-    EXPECT_FALSE(holds(searched.out, "Owned physical") || holds(searched.out, "mapper [1020]: 64-bit"));
-    // Both shown, the mapper sees the owner's memory as clean, beside what it is charged for itself.
-    const HXRun both = report(machine, {"target", "mapper"});
-    EXPECT_TRUE(holds(
-        both.json,
-        R"({"pids":[1010,1020],"specific_to_pid":1020,"categories":{)"
-        R"("MALLOC_SMALL":{"dirty":16384,"swapped":0,"clean":0,"reclaimable":0,"wired":0,"regions":2},)"
-        R"("MALLOC_LARGE":{"dirty":0,"swapped":0,"clean":32768,"reclaimable":0,"wired":0,"regions":2}}})"))
-        << both.json;
-}
-
-TEST(HXHeftReportTest, ProcessesWithErrorsTakeNoPartInTheAuxiliaryData) {
-    const std::string bad = "process  pid=1010  name=bad  heft=5\n" +
-                            region(1010, 0x4000, 0x4000, "resident=1  dirtied=1  object_id=1") +
-                            "fault  pid=1010  call=mach_vm_region_recurse  from=2  error=5\n";
-    const std::string json = report(bad, {"bad"}).json;
-    EXPECT_TRUE(
-        holds(json, R"({"name":"bad","pid":1010,"errors":["bad [1010]: (os/kern) failure"],"categories":{},)"
-                    R"("auxiliary":{"phys_heft":5,"phys_heft_peak":0}}])"))
-        << json;
-    EXPECT_TRUE(holds(json, R"("total heft":16384,"auxiliary":0,"shared":[])")) << json;
-}
-
-// A process name or path is whatever its owner likes: the report stays one line a line and parses.
-TEST(HXHeftReportTest, HostileNamesBreakNothing) {
-    const std::string machine =
-        "process  pid=1010  name=a\"b\\\\c\\nd\x1b[2J\xff\n" +
-        region(1010, 0x4000, 0x4000, "pager=1  path=/x\"\\\\\\n\x7f/\xc3\xa9\"  resident=1  object_id=1");
-    const HXRun result = report(machine, {"1010", "-v", "-w"});
-    EXPECT_TRUE(holds(result.json, R"({"name":"a'b?c?d?[2J?","pid":1010,)")) << result.json;
-    EXPECT_TRUE(holds(result.json, "\"mapped file /x\\\"\?\?\?/\xc3\xa9\\\"\"")) << result.json;
-    EXPECT_TRUE(holds(result.out, "   mapped file /x\"\?\?\?/\xc3\xa9\"\n")) << result.out;
-}
-
-namespace {
 // Machines of a few processes whose mappings meet in a handful of objects, in every state.
 class RandomMachine {
   public:

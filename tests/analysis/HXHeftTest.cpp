@@ -45,17 +45,6 @@ class HXHeftTest : public testing::Test {
     HXHeft::ProcessList _targets;
     std::unique_ptr<HXHeft> _heft;
 };
-
-using Groups = std::vector<std::vector<int32_t>>;
-Groups groupsOf(const HXHeftSharingData &sharing, int32_t pid) {
-    Groups groups;
-    for (const HXProcessGroup *group : *sharing.groupsOfProcess(pid)) {
-        groups.emplace_back();
-        for (const HXRegionOwner *member : group->processes())
-            groups.back().push_back(member->pid());
-    }
-    return groups;
-}
 } // namespace
 
 TEST_F(HXHeftTest, RegionsOfOneKeyShareAnObject) {
@@ -101,13 +90,12 @@ TEST_F(HXHeftTest, RegionsOfOneKeyShareAnObject) {
         const auto &second = add(20, {test.second}, test.both64bit);
         gather();
         EXPECT_EQ(objectOf(first) == objectOf(second), test.shared) << test.title;
-        EXPECT_TRUE(objectOf(first)->accurateSizes() && objectOf(second)->accurateSizes()) << test.title;
     }
     // Two regions of one process with no identifier to go by never share.
     const auto &alone = add(10, {object(0), object(0), object(UINT64_MAX), object(UINT64_MAX)});
     EXPECT_EQ(gather().memoryObjects().size(), 4u);
-    EXPECT_EQ(objectOf(alone, 1)->totalDirtySize(), 0u);
-    EXPECT_EQ(objectOf(alone, 2)->totalDirtySize(), kPage);
+    EXPECT_EQ(objectOf(alone, 1)->sizes().dirty, 0u);
+    EXPECT_EQ(objectOf(alone, 2)->sizes().dirty, kPage);
 }
 
 TEST_F(HXHeftTest, OwnersAndViewsFollowTheSwitches) {
@@ -125,50 +113,6 @@ TEST_F(HXHeftTest, OwnersAndViewsFollowTheSwitches) {
         }
 }
 
-TEST_F(HXHeftTest, HeftIsTheKernelsChargeOrTheWholeObjects) {
-    const HXRegionFacts fake{.object = 9,
-                             .start = kNoAddress,
-                             .size = 5,
-                             .dirty = 3,
-                             .swapped = 2,
-                             .tag = kFakeRegionTag,
-                             .owned = true};
-    for (const bool breakDown : {true, false}) {
-        HXHeftSwitches::setBreakDownPhysHeft(breakDown);
-        HXRegionFacts mixed = object(8);
-        mixed.swapped = 100, mixed.clean = 1000, mixed.reclaimable = 1000, mixed.wired = true;
-        const auto &first = add(10, {object(7), object(7), mixed, fake});
-        const auto &second = add(20, {object(7), object(0)});
-        const auto &none = add(30, {});
-        add(40, {object(7)}).setHiddenFromDisplay(true);
-        HXHeft &heft = gather();
-        // Without breakdown each object counts once and whole; the object without an identifier has no size.
-        EXPECT_EQ(heft._calculateHeftForProcess(first), (breakDown ? 3 : 2) * kPage + 105);
-        EXPECT_EQ(heft._calculateHeftForProcess(second), (breakDown ? 2 : 1) * kPage);
-        EXPECT_EQ(heft._calculateHeftForProcess(none), 0u);
-        HXMemoryTotal total;
-        HXHeft::_totalForCategories(heft._categoriesForAllProcessesShouldSummarize(true), &total);
-        // The page of object 7 that process 10 maps twice: with breakdown it is charged twice.
-        EXPECT_EQ(total.dirty, (breakDown ? 3 : 2) * kPage + 3);
-        EXPECT_EQ(total.swapped, 102u);
-        EXPECT_EQ(total.wired, kPage);
-        EXPECT_EQ(total.regionCount, 7u); // the hidden process's region belongs to a shown object
-    }
-}
-
-TEST_F(HXHeftTest, ProcessesAreOrderedByHeftThenPid) {
-    add(10, {object(1)});
-    add(30, {object(2), object(3)});
-    add(20, {object(4)});
-    add(40, {});
-    add(50, {object(5), object(6), object(7)}).setHiddenFromDisplay(true);
-    HXHeft &heft = gather();
-    std::vector<int32_t> reported, order{30, 20, 10, 40};
-    for (const HXProcess *process : heft._processesBySortingHeft(heft._notHiddenProcesses()))
-        reported.push_back(process->pid());
-    EXPECT_EQ(reported, order);
-}
-
 TEST_F(HXHeftTest, AnInterruptLeavesOutWhatHasNotBegun) {
     HXHeft *heft = nullptr;
     HXHeft::ProcessList targets;
@@ -184,52 +128,6 @@ TEST_F(HXHeftTest, AnInterruptLeavesOutWhatHasNotBegun) {
     EXPECT_EQ(
         HXProcess::globalErrors(),
         std::vector<std::string>{"Heft exited early due to SIGINT and did not finish gathering all data"});
-}
-
-TEST_F(HXHeftTest, GroupsPartitionObjectsByWhoMapsThem) {
-    const HXRegionFacts fake{.object = 5, .start = kNoAddress, .tag = kFakeRegionTag, .owned = true};
-    HXRegionFacts owned = object(7);
-    owned.owned = true;
-    add(10, {object(1), object(2), object(3), fake, owned});
-    add(20, {object(2), object(1), object(4)});
-    add(30, {object(2), object(1)});
-    // A hidden process counts only for what a shown process owns and shows no mapping of.
-    add(40, {object(1), object(5), object(6), object(7)}).setHiddenFromDisplay(true);
-    HXHeft &heft = gather();
-    const HXHeftSharingData sharing = heft._sharingData();
-    EXPECT_EQ(groupsOf(sharing, 10), (Groups{{10}, {10, 20, 30}, {10, 40}}));
-    EXPECT_EQ(groupsOf(sharing, 20), (Groups{{20}, {10, 20, 30}}));
-    EXPECT_EQ(groupsOf(sharing, 30), (Groups{{10, 20, 30}}));
-    EXPECT_EQ(groupsOf(sharing, 40), (Groups{{10, 40}}));
-    size_t objects = 0;
-    for (const auto &group : sharing.groups)
-        objects += sharing.objectsOfGroup(group).size();
-    EXPECT_EQ(sharing.objectsOfGroup(*sharing.groupsOfProcess(40)->front()).size(), 1u); // not object 7
-    EXPECT_EQ(sharing.groups.size(), 4u);
-    EXPECT_EQ(objects, 6u); // not object 6
-}
-
-TEST_F(HXHeftTest, CategoriesTellWhetherAViewDiffers) {
-    HXRegionFacts first = object(1), second = object(2), owned = object(3);
-    first.name = second.name = "libA", first.detail = "/x/libA", second.detail = "/y/libA";
-    owned.name = "owned", owned.owned = true;
-    add(10, {first, second, owned});
-    const auto &viewer = add(20, {object(3)});
-    HXHeft &heft = gather();
-    HXHeftSharingData::Objects objects;
-    for (const auto &each : heft.memoryObjects())
-        objects.push_back(&each);
-    for (const bool summarize : {true, false}) {
-        bool hasView = true;
-        const HXCategoryMap own =
-            heft._categoriesForObjects(objects, *heft.processes()[0], &hasView, summarize);
-        EXPECT_FALSE(hasView);
-        EXPECT_EQ(own.entries().size(), summarize ? 2u : 3u);
-        const HXCategoryMap seen = heft._categoriesForObjects(objects, viewer, &hasView, summarize);
-        EXPECT_TRUE(hasView);
-        EXPECT_EQ(seen.get("owned")->totalDirtySize(), 0u);
-        EXPECT_EQ(seen.get("owned")->totalCleanSize(), kPage);
-    }
 }
 
 TEST_F(HXHeftTest, AnAnalysisSwitchThatCannotBeReadOrSetIsTold) {

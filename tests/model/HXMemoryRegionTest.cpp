@@ -56,13 +56,3 @@ TEST(HXMemoryRegionTest, TellsWhichRegionsAreWorthViewsAndPageRuns) {
         EXPECT_EQ(region.eligibleForSubrangesUsingPageSize(page), test.subranges) << test.title;
     }
 }
-
-TEST(HXMemoryRegionTest, OrdersByStartThenDescendingSize) {
-    const auto at = [](uint64_t start, uint64_t size) { return makeRegion({.start = start, .size = size}); };
-    EXPECT_LT(at(0x1000, 0x4000).compare(at(0x1000, 0x1000)), 0);
-    EXPECT_LT(at(0, 1).compare(at(0x1000, 0x4000)), 0);
-    EXPECT_LT(at(0x1000, 1).compare(at(0xFFFFFFFF00000000, 1)), 0);
-    EXPECT_EQ(at(0x1000, 0x4000).compare(at(0x1000, 0x4000)), 0);
-    EXPECT_EQ(at(0x1000, 0x4000).end(), 0x5000u);
-    EXPECT_EQ(at(kNoAddress, 0x4000).end(), kNoAddress);
-}

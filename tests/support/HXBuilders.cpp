@@ -2,37 +2,14 @@
 
 #include "support/HXTemporaryFolder.h"
 
-#include <unistd.h>
-
-namespace {
-// Points a descriptor at a file until it is destroyed.
-class Redirection {
-  public:
-    Redirection(int descriptor, std::FILE *stream)
-        : _descriptor(descriptor), _stream(stream), _saved(::dup(descriptor)), _file(std::tmpfile()) {
-        std::fflush(stream);
-        ::dup2(::fileno(_file), descriptor);
-    }
-    std::string finish() {
-        std::fflush(_stream);
-        ::dup2(_saved, _descriptor);
-        ::close(_saved);
-        return contentOf(_file);
-    }
-
-  private:
-    int _descriptor;
-    std::FILE *_stream;
-    int _saved;
-    std::FILE *_file;
-};
-} // namespace
+#include <gtest/gtest.h>
 
 HXPrinted printedBy(const std::function<void()> &work) {
-    Redirection out(1, stdout);
-    Redirection err(2, stderr);
+    testing::internal::CaptureStdout();
+    testing::internal::CaptureStderr();
     work();
-    return {out.finish(), err.finish()};
+    const std::string err = testing::internal::GetCapturedStderr();
+    return {testing::internal::GetCapturedStdout(), err};
 }
 
 std::string contentOf(std::FILE *file) {

@@ -67,12 +67,9 @@ class HXMadeUpProcess : public HXProcess {
         if (whenGathered) whenGathered();
         _memoryRegions = std::move(_found);
     }
-    HXAuxTree auxData() const override { return aux; }
     void addError(const std::string &text) { _errors.push_back(text); }
-    void addWarning(const std::string &text) { _warnings.push_back(text); }
 
     std::function<void()> whenGathered;
-    HXAuxTree aux;
 
   private:
     HXMemoryRegionList _found;

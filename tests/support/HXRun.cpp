@@ -24,7 +24,7 @@ HXRun run(const std::string &machine, const std::vector<std::string> &arguments)
 HXRun report(const std::string &machine, const std::vector<std::string> &arguments) {
     const std::string path = temporaryPath();
     std::vector<std::string> all = arguments;
-    all.insert(all.end(), {"-f", "bytes", "--json", path});
+    all.insert(all.end(), {"-w", "-f", "bytes", "--json", path});
     HXRun result = run(machine, all);
     EXPECT_EQ(result.status, 0) << result.err;
     result.json = contentOf(path);

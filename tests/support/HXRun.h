@@ -14,7 +14,7 @@ struct HXRun {
 // One run of the driver over a machine, with the arguments after the program's name.
 HXRun run(const std::string &machine, const std::vector<std::string> &arguments);
 
-// The same in bytes format and with a JSON document beside the text; fails the test unless the run exits 0
+// The same, wide, in bytes and with a JSON document beside the text; fails the test unless the run exits 0
 // and checkReport() holds for both.
 HXRun report(const std::string &machine, const std::vector<std::string> &arguments);
 
