@@ -3,6 +3,8 @@
 
 #include <unistd.h>
 
+#include <cstddef>
+#include <cstdint>
 #include <utility>
 
 class HXDescriptor {
@@ -26,3 +28,8 @@ class HXDescriptor {
   private:
     int _descriptor = -1;
 };
+
+// Reads up to `length` bytes from `position` of the file on: bytes read, or -1 with errno.
+inline ssize_t HXReadAt(const HXDescriptor &file, uint64_t position, void *buffer, size_t length) {
+    return ::pread(file.get(), buffer, length, static_cast<off_t>(position));
+}

@@ -93,26 +93,26 @@ TEST(HXElfHeaders, AcceptsSenseAlone) {
 struct Place {
     const char *access;
     uint64_t start, end, offset;
-    bool isFile = true;
     const char *path = "/lib/x.so";
 };
 
 // "NAME START-END" of every segment of every image, an image's base before.
-std::string layoutOf(const std::vector<Place> &places, const std::vector<Header> &headers) {
+std::string layoutOf(const std::vector<Place> &places, const std::vector<Header> &headers = library) {
     HXAddressSpace addressSpace;
     for (const Place &place : places) {
         HXMapping mapping;
+        HXNamedTags tags;
         mapping.start = place.start;
         mapping.end = place.end;
         mapping.offset = place.offset;
-        mapping.inode = mapping.device = place.isFile ? 99 : 0;
-        HXNamedTags tags;
-        mapping.path = place.isFile || place.path[0] == '[' ? addressSpace.intern(place.path, tags) : 0;
-        mapping.kind = static_cast<uint8_t>(addressSpace.path(mapping.path).kind);
-        if (strchr(place.access, 'r')) mapping.flags |= HXMappingReadable;
-        if (strchr(place.access, 'w')) mapping.flags |= HXMappingWritable;
-        if (strchr(place.access, 'x')) mapping.flags |= HXMappingExecutable;
-        if (strchr(place.access, 's')) mapping.flags |= HXMappingShared;
+        mapping.inode = mapping.device = place.path[0] == '/' ? 99 : 0;
+        mapping.path = addressSpace.intern(place.path, tags);
+        mapping.kind = addressSpace.path(mapping.path).kind;
+        for (const auto &[letter, flag] : {std::pair('r', HXMappingReadable),
+                                           {'w', HXMappingWritable},
+                                           {'x', HXMappingExecutable},
+                                           {'s', HXMappingShared}})
+            if (strchr(place.access, letter)) mapping.flags |= flag;
         addressSpace.append(mapping);
     }
     const auto parsed = parse(wide(headers));
@@ -132,45 +132,46 @@ TEST(HXImageLayout, NamesSegmentsByTheHeaders) {
     const std::vector<Place> loaded = {
         {"r", 0x100000, 0x102000, 0},       {"rx", 0x102000, 0x105000, 0x2000},
         {"r", 0x105000, 0x106000, 0x5000},  {"r", 0x107000, 0x108000, 0x6000},
-        {"rw", 0x108000, 0x10a000, 0x7000}, {"rw", 0x10a000, 0x10c000, 0, false},
+        {"rw", 0x108000, 0x10a000, 0x7000}, {"rw", 0x10a000, 0x10c000, 0, ""},
     };
-    const std::string names = "100000: __LINKEDIT 100000-102000 __TEXT 102000-105000 __CONST 105000-106000 "
-                              "__DATA_CONST 107000-108000 __DATA 108000-10a000 __BSS 10a000-10c000\n";
-    EXPECT_EQ(layoutOf(loaded, library), names);
-
-    // Twice; the anonymous memory behind is longer than the image's.
     auto twice = loaded;
     for (Place place : loaded) {
         place.start += 0x100000;
         place.end += 0x100000;
         twice.push_back(place);
     }
-    twice.back().end += 0x5000;
-    EXPECT_EQ(layoutOf(twice, library), names + "200000: __LINKEDIT 200000-202000 __TEXT 202000-205000 "
-                                                "__CONST 205000-206000 __DATA_CONST 207000-208000 "
-                                                "__DATA 208000-20a000 __BSS 20a000-20c000\n");
-    // Not relocated yet; code whose protection was changed for a while; the heap behind it.
-    EXPECT_EQ(layoutOf({{"rx", 0x102000, 0x103000, 0x2000},
-                        {"rwx", 0x103000, 0x104000, 0x3000},
-                        {"rx", 0x104000, 0x105000, 0x4000},
-                        {"rw", 0x107000, 0x10a000, 0x6000},
-                        {"rw", 0x10a000, 0x10b000, 0, false, "[heap]"}},
-                       library),
-              "100000: __TEXT 102000-105000 __DATA 107000-10a000\n");
-    EXPECT_EQ(layoutOf({{"rx", 0x7000, 0x9000, 0, false, "[vdso]"}}, {}), "7000: __TEXT 7000-9000\n");
-}
-
-TEST(HXImageLayout, LeavesPlainMappingsAlone) {
-    const std::vector<std::vector<Place>> plain = {
-        {{"rx", 0x100000, 0x109000, 0}},       // the whole file, executable
-        {{"rx", 0x102000, 0x106000, 0x2000}},  // beyond the code
-        {{"rxs", 0x102000, 0x105000, 0x2000}}, // shared
-        {{"rx", 0x1000, 0x2000, 0x3000}},      // the image would begin below address 0
-        {{"rx", 0x102000, 0x103000, 0x5000}},  // constants, mapped executable
+    twice.back().end += 0x5000; // anonymous memory that goes on behind the image's
+    const std::string first = "100000: __LINKEDIT 100000-102000 __TEXT 102000-105000 __CONST 105000-106000 "
+                              "__DATA_CONST 107000-108000 __DATA 108000-10a000 __BSS 10a000-10c000\n";
+    const std::string second = "200000: __LINKEDIT 200000-202000 __TEXT 202000-205000 __CONST 205000-206000 "
+                               "__DATA_CONST 207000-208000 __DATA 208000-20a000 __BSS 20a000-20c000\n";
+    const struct {
+        const char *what;
+        std::vector<Place> places;
+        std::string expected;
+    } cases[] = {
+        {"twice", twice, first + second},
+        {"not relocated yet, its protection changed for a while, the heap behind it",
+         {{"rx", 0x102000, 0x103000, 0x2000},
+          {"rwx", 0x103000, 0x104000, 0x3000},
+          {"rx", 0x104000, 0x105000, 0x4000},
+          {"rw", 0x107000, 0x10a000, 0x6000},
+          {"rw", 0x10a000, 0x10b000, 0, "[heap]"}},
+         "100000: __TEXT 102000-105000 __DATA 107000-10a000\n"},
+        {"the end of the code alone", {{"rx", 0x104000, 0x105000, 0x4000}}, "100000: __TEXT 104000-105000\n"},
+        {"the vDSO", {{"rx", 0x7000, 0x9000, 0, "[vdso]"}}, "7000: __TEXT 7000-9000\n"},
+        {"all that is readable is executable",
+         {{"rx", 0x100000, 0x106000, 0}, {"rwx", 0x400000, 0x401000, 0, "[stack]"}},
+         "100000: __TEXT 100000-106000\n"},
+        {"the whole file, executable", {{"rx", 0x100000, 0x109000, 0}}, ""},
+        {"beyond the code", {{"rx", 0x102000, 0x106000, 0x2000}}, ""},
+        {"shared", {{"rxs", 0x102000, 0x105000, 0x2000}}, ""},
+        {"the image would begin below address 0", {{"rx", 0x1000, 0x2000, 0x3000}}, ""},
+        {"constants, mapped executable", {{"rx", 0x102000, 0x103000, 0x5000}}, ""},
     };
-    for (size_t i = 0; i < plain.size(); i++)
-        EXPECT_EQ(layoutOf(plain[i], library), "") << i;
-    EXPECT_EQ(layoutOf({{"rx", 0x102000, 0x105000, 0x2000}}, {}), "") << "no headers";
+    for (const auto &item : cases)
+        EXPECT_EQ(layoutOf(item.places), item.expected) << item.what;
+    EXPECT_EQ(layoutOf(loaded, {}), "") << "no image by its headers";
 }
 
 } // namespace
