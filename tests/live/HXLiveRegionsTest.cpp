@@ -22,7 +22,7 @@ constexpr uint64_t kPage = 4096;
 constexpr size_t kAsMuchAsUsed = SIZE_MAX;
 constexpr int kWrite = MADV_POPULATE_WRITE, kRead = MADV_POPULATE_READ, kGuard = 102,
               kNoHuge = MADV_NOHUGEPAGE;
-constexpr int kReadWrite = PROT_READ | PROT_WRITE;
+constexpr int kReadOnly = HXActProtect - PROT_READ, kReadWrite = PROT_READ | PROT_WRITE;
 constexpr int kOwn = MAP_PRIVATE | MAP_ANONYMOUS, kShared = MAP_SHARED | MAP_ANONYMOUS;
 constexpr int kPool = MAP_HUGETLB | MAP_NORESERVE;
 constexpr size_t kHuge = 512;
@@ -52,7 +52,7 @@ const HXMemoryRecipe kRecipes[] = {
        "anonymous",
        2 * kHuge}}},
     {"ManyMappings",
-     {{4000, kReadWrite, kOwn, nullptr, {{kNoHuge}, {kWrite, 0, 2000}, {HXActDenyWriting, 0, 4000, 2}}}}},
+     {{4000, kReadWrite, kOwn, nullptr, {{kNoHuge}, {kWrite, 0, 2000}, {kReadOnly, 0, 4000, 2}}}}},
     {"FileMappings",
      {{16, kReadWrite, MAP_PRIVATE, "/var/tmp", {{kWrite, 0, 3}, {kRead}}, "mapped file", 3, 13},
       {8, kReadWrite, MAP_SHARED, "/var/tmp", {{kRead}, {kWrite, 0, 1}}, "mapped file", 0, 8}}},
@@ -64,27 +64,25 @@ const HXMemoryRecipe kRecipes[] = {
       {16, kReadWrite, MAP_PRIVATE, "memfd", {{kRead, 0, 5}, {kWrite, 0, 1}}, "memfd", 5},
       {16, kReadWrite, kShared, nullptr, {{kWrite, 0, 7}}, "shared anonymous", 7},
       {16, kReadWrite, MAP_SHARED, "SysV", {{kWrite, 0, 3}}, "System V shared memory", 3}}},
-    {"NamedMemory", {{4, kReadWrite, kOwn, nullptr, {{kWrite}, {HXActName}}}}},
     // On a machine with swap, what the kernel takes out is told as swapped; elsewhere it stays.
     {"PagedOut",
      {{256, kReadWrite, kOwn, nullptr, {{kNoHuge}, {kWrite, 0, 128}, {MADV_PAGEOUT, 0, 64}}},
       {256, kReadWrite, kShared, nullptr, {{kWrite, 0, 128}, {MADV_PAGEOUT, 0, 64}}}}},
     {"ThreadStack",
      {{256, kReadWrite, kOwn | MAP_STACK, nullptr, {{kNoHuge}, {HXActRunThread}}, "stack", kAsMuchAsUsed}}},
-    {"Heap", {{16, kReadWrite, kOwn, nullptr, {{HXActGrowHeap}}, "anonymous", 0}}},
     // What page tables must tell apart.
     {"ZerosAndGuards",
      {{512, kReadWrite, kOwn, nullptr, {{kRead, 0, 64}, {kWrite, 10, 100, 3}}},
       {4096, kReadWrite, kOwn, nullptr, {{MADV_HUGEPAGE}, {kRead}, {kWrite, 1024, kHuge}}},
       {64, kReadWrite, MAP_PRIVATE, "/dev/zero", {{kRead, 0, 32}, {kWrite, 8, 4}}},
-      {64, kReadWrite, kOwn, nullptr, {{kWrite}, {kGuard, 0, 8}, {HXActDenyAccess, 0, 32}}}}},
+      {64, kReadWrite, kOwn, nullptr, {{kWrite}, {kGuard, 0, 8}, {HXActProtect, 0, 32}}}}},
     {"CopiesAmongFiles",
      {{512, kReadWrite, MAP_SHARED, "memfd", {{kWrite, 0, 100, 7}}},
       {512, kReadWrite, MAP_PRIVATE, "memfd", {{kRead, 0, 50}, {kWrite, 20, 50}}},
       {16, kReadWrite, MAP_PRIVATE, "/proc/self/exe", {{kRead}, {kWrite, 3, 4}}, "mapped file", 4, 12},
       {16, PROT_READ, MAP_SHARED, "/proc/self/exe", {{kRead}}, "mapped file", 0, 16}}},
     {"MoreRunsThanOneRequestFinds",
-     {{6000, kReadWrite, kOwn, nullptr, {{kNoHuge}, {kWrite, 0, 6000, 2}, {HXActDenyWriting, 0, 600, 3}}}}},
+     {{6000, kReadWrite, kOwn, nullptr, {{kNoHuge}, {kWrite, 0, 6000, 2}, {kReadOnly, 0, 600, 3}}}}},
     // Of the huge-page pool, of which it takes no page.
     {"UntouchedHugePages",
      {{kHuge, kReadWrite, kOwn | kPool, nullptr, {}, "huge pages", 0, 0, 0, true},
@@ -131,8 +129,8 @@ class HXLiveRegions : public testing::TestWithParam<HXMemoryRecipe> {
 };
 
 TEST_P(HXLiveRegions, AgreeWithTheKernelsFiles) {
-    const auto process = gathered(true);
-    ASSERT_TRUE(process);
+    const auto objects = gathered(false), process = gathered(true);
+    ASSERT_TRUE(objects && process);
     EXPECT_TRUE(process->errors().empty());
     uint64_t charged = 0;
     for (const HXSmapsEntry &entry : entries) {
@@ -146,6 +144,13 @@ TEST_P(HXLiveRegions, AgreeWithTheKernelsFiles) {
         EXPECT_EQ(sizesOf(*region), (Sizes{dirty, entry["Swap"], clean, lazyFree}))
             << entry.path << " at " << std::hex << entry.start;
         charged += dirty + entry["Swap"];
+        const bool isFile =
+            entry.path.starts_with("/") && !isSwapBacked(entry) && !entry.path.starts_with("/anon_hugepage");
+        const uint64_t seen = isFile ? entry["Shared_Dirty"] + entry["Private_Dirty"] : dirty + clean;
+        // The kernel's own pages in the process are nobody's.
+        if (!entry.path.starts_with("[v")) {
+            EXPECT_EQ(regionAt(*objects, entry.start)->dirtySize(), seen) << entry.path;
+        }
         const bool isNamed = entry.path.starts_with("[anon:");
         EXPECT_EQ(isNamed ? "[anon:" + region->name().str() + "]" : entry.path, entry.path);
         if (const HXRangeList *runs = region->subrangeList()) {
@@ -175,21 +180,6 @@ TEST_P(HXLiveRegions, AgreeWithTheKernelsFiles) {
         EXPECT_EQ(sizesOf(*region),
                   (Sizes{mapping.dirty * kPage, 0, mapping.clean * kPage, mapping.reclaimable * kPage}))
             << mapping.name;
-    }
-}
-
-TEST_P(HXLiveRegions, ShowDirtyPagesOfObjectsInTheOtherMode) {
-    const auto process = gathered(false);
-    ASSERT_TRUE(process);
-    for (const HXSmapsEntry &entry : entries) {
-        const HXMemoryRegion *region = regionAt(*process, entry.start);
-        ASSERT_TRUE(region) << entry.path;
-        if (entry.path.starts_with("[v")) continue; // the kernel's own pages in the process
-        const bool isFile =
-            entry.path.starts_with("/") && !isSwapBacked(entry) && !entry.path.starts_with("/anon_hugepage");
-        EXPECT_EQ(region->dirtySize(), isFile ? entry["Shared_Dirty"] + entry["Private_Dirty"]
-                                              : entry["Rss"] + entry.hugePages() - entry["LazyFree"])
-            << entry.path;
     }
 }
 

@@ -15,8 +15,7 @@
 namespace {
 
 constexpr size_t kPage = 4096;
-constexpr int kGuardInstall = 102;  // MADV_GUARD_INSTALL, which not every kernel has
-constexpr int kSetVma = 0x53564d41; // PR_SET_VMA, prctl(2)
+constexpr int kGuardInstall = 102; // MADV_GUARD_INSTALL, which not every kernel has
 
 void require(bool holds) {
     if (!holds) _exit(1);
@@ -57,24 +56,10 @@ void runThread(char *stack, size_t size) {
 
 // By the kernel itself where it can be: sanitizers know nothing of that memory.
 bool act(int what, char *start, size_t size) {
-    switch (what) {
-    case HXActLock:
-        return syscall(SYS_mlock, start, size) == 0;
-    case HXActName: // where the kernel has such names
-        return syscall(SYS_prctl, kSetVma, 0, start, size, "my arena") == 0 || errno == EINVAL;
-    case HXActDenyAccess:
-        return mprotect(start, size, PROT_NONE) == 0;
-    case HXActDenyWriting:
-        return mprotect(start, size, PROT_READ) == 0;
-    case HXActRunThread:
-        runThread(start, size);
-        return true;
-    case HXActGrowHeap:
-        return sbrk(static_cast<intptr_t>(size)) != reinterpret_cast<void *>(-1) &&
-               madvise(static_cast<char *>(sbrk(0)) - size, size, MADV_POPULATE_WRITE) == 0;
-    default:
-        return madvise(start, size, what) == 0 || what == kGuardInstall;
-    }
+    if (what <= HXActProtect) return mprotect(start, size, HXActProtect - what) == 0;
+    if (what == HXActLock) return syscall(SYS_mlock, start, size) == 0;
+    if (what == HXActRunThread) runThread(start, size);
+    return what < 0 || madvise(start, size, what) == 0 || what == kGuardInstall;
 }
 
 char *map(const HXMemoryMapping &mapping, void *place) {

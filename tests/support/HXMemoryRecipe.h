@@ -6,21 +6,15 @@
 #include <ostream>
 #include <vector>
 
-// Something done to pages of a mapping: an advice of madvise(2), or one of HXMemoryAct.
+// Something done to pages of a mapping: an advice of madvise(2), one of HXMemoryAct, or HXActProtect less the
+// PROT_… bits that the pages get.
 struct HXMemoryStep {
     int act;
     size_t first = 0;
     size_t count = 0; // 0: all that follow
     size_t every = 1; // 2: to the first, the third, …
 };
-enum HXMemoryAct {
-    HXActLock = -100,
-    HXActName,
-    HXActDenyAccess,
-    HXActDenyWriting,
-    HXActRunThread,
-    HXActGrowHeap
-};
+enum HXMemoryAct { HXActLock = -1, HXActRunThread = -2, HXActProtect = -3 };
 
 struct HXMemoryMapping {
     size_t pages;

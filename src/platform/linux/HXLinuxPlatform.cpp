@@ -117,18 +117,10 @@ int32_t HXLinuxPlatform::ledger(int32_t command, int32_t pid, void *buffer, int6
     return 0;
 }
 
-int32_t HXLinuxPlatform::getpid() {
-    return ::getpid();
-}
-
 std::string HXLinuxPlatform::hostDescription() {
     utsname names{};
     if (::uname(&names) != 0) return HXPlatform::hostDescription();
     return "Linux " + HXSafeText(names.release) + ", " + HXPlatform::hostDescription();
-}
-
-uint32_t HXLinuxPlatform::geteuid() {
-    return ::geteuid();
 }
 
 int32_t HXLinuxPlatform::sysctl(const int32_t *name, uint32_t nameLength, void *old, size_t *oldBytes) {

@@ -9,6 +9,8 @@
 #include "platform/linux/memory/HXLinuxTask.h"
 #include "platform/linux/procfs/HXLinuxProcesses.h"
 
+#include <unistd.h>
+
 #include <atomic>
 #include <cstdint>
 #include <string>
@@ -57,10 +59,10 @@ class HXLinuxPlatform final : public HXPlatform {
     int32_t proc_pid_rusage(int32_t pid, int32_t flavor, rusage_info_v4 *info) override;
     int32_t proc_get_dirty(int32_t pid, uint32_t *flags) override;
     int32_t proc_regionfilename(int32_t pid, uint64_t address, char *buffer, uint32_t bufferBytes) override;
-    int32_t getpid() override;
+    int32_t getpid() override { return ::getpid(); }
     // "Linux RELEASE, X86-64".
     std::string hostDescription() override;
-    uint32_t geteuid() override;
+    uint32_t geteuid() override { return ::geteuid(); }
     int32_t sysctl(const int32_t *name, uint32_t nameLength, void *old, size_t *oldBytes) override;
     int32_t sysctlbyname(const char *name, void *old, size_t *oldBytes, const void *newValue,
                          size_t newBytes) override;

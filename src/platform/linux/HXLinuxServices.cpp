@@ -15,6 +15,7 @@
 HXOptionScan HXLinuxServices::getopt_long(int argc, char *const argv[], const char *shortOptions,
                                           const std::vector<HXLongOption> &options, bool restart) {
     std::vector<option> table;
+    table.reserve(options.size() + 1);
     for (const HXLongOption &entry : options)
         table.push_back(
             {entry.name, entry.hasArgument ? required_argument : no_argument, entry.flag, entry.value});

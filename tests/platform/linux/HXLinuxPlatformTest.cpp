@@ -35,7 +35,7 @@ class HXLinuxPlatformTest : public testing::Test {
         proc.write(folder + "stat", std::to_string(pid) + " (" + comm + ") " + state + " 7 8 9 0 -1 " +
                                         std::to_string(flags) +
                                         " 1 2 3 4 5 6 7 8 20 0 1 0 4242 1000 200 0 0 0 "
-                                        "140724000000000 0 0\n");
+                                        "140724247392256 0 0\n");
         proc.write(folder + "comm", comm + "\n");
         proc.write(folder + "maps", memory);
         proc.write(folder + "smaps", memory);
@@ -229,12 +229,16 @@ TEST_F(HXLinuxPlatformTest, ProcessesVanishAndRefuse) {
 }
 
 TEST_F(HXLinuxPlatformTest, ReadsPageTables) {
-    const uint64_t present = 1ULL << 63, swapped = 1ULL << 62, file = 1ULL << 61;
     process(10, "p",
-            "1000-9000 rw-p 0 fe:01 5 /x\nRss:                  16 kB\nAnonymous:            12 "
-            "kB\nLazyFree:              4 kB\n"
-            "Swap:                  4 kB\nVmFlags: rd\n20000-21000 r--p 0 00:00 0\n");
-    const uint64_t entries[] = {0, present | file, present, swapped, swapped, 0, present, present};
+            "1000-9000 rw-p 0 fe:01 5 /x\n"
+            "Rss:                  16 kB\nAnonymous:            12 kB\nLazyFree:              4 kB\n"
+            "Swap:                  4 kB\nVmFlags: rd\n9000-a000 rw-p 0 00:06 7 /dev/driver\nVmFlags: rd\n"
+            "a000-c000 rw-s 0 00:01 8 /memfd:x (deleted)\nVmFlags: rd\n"
+            "c000-e000 rw-s 0 00:0f 9 /pool\nVmFlags: rd ht\n20000-21000 r--p 0 00:00 0\n");
+    constexpr uint64_t present = 1ULL << 63, swapped = 1ULL << 62, file = 1ULL << 61, guard = 1ULL << 58;
+    const uint64_t entries[] = {
+        0,       present | file, present, swapped,        swapped, guard | swapped, present, present, 0,
+        present, present | file, 0,       present | file, 0};
     proc.write("10/pagemap", {reinterpret_cast<const char *>(entries), sizeof entries});
     const mach_port_t task = open(10);
     const struct {
@@ -246,15 +250,30 @@ TEST_F(HXLinuxPlatformTest, ReadsPageTables) {
         {0x3001, 0x1fff, KERN_SUCCESS, {0x10, 0}}, // back, and rounded to pages
         {0x6000, 0x1000, KERN_SUCCESS, {0x9}},     // what lies before has been counted
         {0x2000, 0x1000, KERN_SUCCESS, {0x801}},
-        {0x8000, 0x2000, KERN_INVALID_ARGUMENT, {}}, // the page tables end
-        {0x9000, 0x1000, KERN_INVALID_ADDRESS, {}},  // no mapping
-        {0x20000, 0x1000, KERN_INVALID_ARGUMENT, {}},
+        {0x9000, 0x5000, KERN_SUCCESS, {0, 0x9, 0, 0x9, 0}}, // a driver's, shared memory, the huge-page pool
+        {0xd000, 0x2000, KERN_INVALID_ADDRESS, {}},          // no mapping
+        {0x20000, 0x1000, KERN_INVALID_ARGUMENT, {}},        // the page tables have gone
     };
     for (const auto &item : cases) {
         std::vector<int32_t> dispositions(8);
         ASSERT_EQ(pages(task, item.from, item.bytes, dispositions), item.error) << std::hex << item.from;
         if (item.error != KERN_SUCCESS) continue;
         EXPECT_EQ(dispositions, item.expected) << std::hex << item.from;
+    }
+}
+
+TEST_F(HXLinuxPlatformTest, LeavesThePagesOfAnotherProgramAlone) {
+    // The fixture's processes have their stack at 0x7ffceac6f000.
+    const std::pair<const char *, kern_return_t> cases[] = {
+        {"7ffceac60000-7ffceac6f000", KERN_SUCCESS},
+        {"7ffceac60000-7ffceac6e000", KERN_INVALID_ARGUMENT},
+        {"7ffceac70000-7ffceac7f000", KERN_INVALID_ARGUMENT}};
+    int pid = 10;
+    for (const auto &[range, error] : cases) {
+        process(++pid, "p", "0-1000 rw-p 0 00:00 0\n"s + range + " rw-p 0 00:00 0 [stack]\n");
+        proc.write(std::to_string(pid) + "/pagemap", std::string(8, '\0'));
+        std::vector<int32_t> dispositions(1);
+        EXPECT_EQ(pages(open(pid), 0, 0x1000, dispositions), error) << range;
     }
 }
 
@@ -281,7 +300,7 @@ TEST_F(HXLinuxPlatformTest, CountsFromPageTablesOnlyWhereTheyTellEnough) {
         {"rw-p 0 00:00 0", "VmLck: 4 kB\n" + status.substr(12), "0", "0", false},
         {"rw-p 0 00:00 0", "HugetlbPages: 2048 kB\nThreads: 1\n", "0", "0", false},
         {"rw-p 0 00:00 0", "VmSwap: 4 kB\nThreads: 1\n", "0", "0", false},
-        {"rw-p 0 00:00 0", "VmRSS: 1000 kB\nThreads: 1\n", "1", "0", false}, // too many pages to find out
+        {"rw-p 0 00:00 0", "VmRSS: 2000 kB\nThreads: 1\n", "1", "0", false}, // too many pages to find out
     };
     HXFileSystems fileSystems(HXDeviceNumber(0, 1));
     HXNamedTags tags;
@@ -292,8 +311,11 @@ TEST_F(HXLinuxPlatformTest, CountsFromPageTablesOnlyWhereTheyTellEnough) {
         char range[64];
         const auto start = reinterpret_cast<uint64_t>(ownPage);
         snprintf(range, sizeof range, "%" PRIx64 "-%" PRIx64 " ", start, start + sizeof ownPage);
-        proc.write("maps", range + std::string(item.mapping) + "\n");
-        proc.write("smaps", range + std::string(item.mapping) + "\n");
+        // Behind it one that is large enough to be walked by itself.
+        const std::string maps =
+            range + std::string(item.mapping) + "\n7e0000000000-7e0000400000 rw-p 0 00:00 0\n";
+        proc.write("maps", maps);
+        proc.write("smaps", maps);
         proc.write("status", item.status);
         proc.write("vmstat", "pglazyfree "s + item.freedEver + "\n");
         proc.write("smaps_rollup", "LazyFree: "s + item.freed + " kB\n");
@@ -335,6 +357,8 @@ TEST_F(HXLinuxPlatformTest, FiguresAndLedger) {
     size_t length = sizeof value;
     EXPECT_EQ(platform.sysctlbyname("vm.self_region_heft", &value, &length, nullptr, 0), 0);
     EXPECT_EQ(value, 0u);
+    const int32_t otherNames[] = {6, 8};
+    EXPECT_NE(platform.sysctl(otherNames, 2, &value, &length), 0);
     EXPECT_NE(platform.sysctlbyname("vm.get_owned_vmobjects", nullptr, &length, &task, 4), 0);
     EXPECT_EQ(errno, ENOENT);
 

@@ -1,6 +1,7 @@
 #include "platform/linux/memory/HXAddressSpaceReader.h"
 
 #include "platform/linux/memory/HXMappedFile.h"
+#include "platform/linux/memory/HXPageScan.h"
 #include "platform/linux/memory/HXScanFigures.h"
 #include "platform/linux/memory/HXTaskFiles.h"
 #include "platform/linux/procfs/HXMapsParser.h"

@@ -29,9 +29,8 @@ bool isReplaced(const HXAddressSpace &addressSpace, const HXDescriptor &process)
     return false;
 }
 
-} // namespace
-
-int32_t HXPageDisposition(const HXMapping &mapping, uint8_t facts, HXPagesLeft *left) {
+// The disposition (VM_PAGE_QUERY_… bits) of a page of `mapping`; takes it off `left`.
+int32_t dispositionOf(const HXMapping &mapping, uint8_t facts, HXPagesLeft *left) {
     constexpr int32_t present = VM_PAGE_QUERY_PAGE_PRESENT;
     constexpr int32_t dirty = present | VM_PAGE_QUERY_PAGE_DIRTY;
     if (facts & HXPageRun::nothing) return 0;
@@ -53,6 +52,8 @@ int32_t HXPageDisposition(const HXMapping &mapping, uint8_t facts, HXPagesLeft *
     }
     return dirty;
 }
+
+} // namespace
 
 kern_return_t HXPageReader::query(const HXAddressSpace &addressSpace, uint64_t address,
                                   std::span<int32_t> dispositions) {
@@ -122,7 +123,7 @@ kern_return_t HXPageReader::fill(const HXMapping &mapping, uint64_t start, std::
         for (; run != _runs.end() && run->start < limit; ++run)
             for (at = std::max(at, run->start); at < std::min(run->end, limit);
                  at += uint64_t{1} << _pageShift)
-                dispositions[(at - start) >> _pageShift] = HXPageDisposition(mapping, run->facts, &_left);
+                dispositions[(at - start) >> _pageShift] = dispositionOf(mapping, run->facts, &_left);
         at = limit;
     }
     return KERN_SUCCESS;

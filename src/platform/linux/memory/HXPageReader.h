@@ -17,10 +17,6 @@ struct HXPagesLeft {
     uint64_t lazyFree = 0;
 };
 
-// The disposition (VM_PAGE_QUERY_… bits) of a page of `mapping`; takes it off `left`. The dispositions of a
-// mapping's pages, asked for in order, add up to the figures of the mapping.
-int32_t HXPageDisposition(const HXMapping &mapping, uint8_t facts, HXPagesLeft *left);
-
 // Reads the pages of one process; one thread at a time.
 class HXPageReader {
   public:
@@ -28,7 +24,8 @@ class HXPageReader {
     HXPageReader(const HXDescriptor &process, uint32_t pageShift)
         : _process(process), _pageShift(pageShift) {}
 
-    // The dispositions of the pages from `address` on, which lies on a page's border. KERN_INVALID_ADDRESS
+    // The dispositions (VM_PAGE_QUERY_… bits) of the pages from `address` on, which lies on a page's border;
+    // those of all pages of a mapping add up to its figures. KERN_INVALID_ADDRESS
     // when a page lies in no mapping, KERN_INVALID_ARGUMENT when the process is gone or executes another
     // program.
     kern_return_t query(const HXAddressSpace &addressSpace, uint64_t address,

@@ -1,9 +1,11 @@
 #include "platform/linux/memory/HXScanFigures.h"
 
+#include "platform/linux/memory/HXPageScan.h"
 #include "platform/linux/procfs/HXProcFile.h"
 
 #include <algorithm>
 #include <array>
+#include <span>
 
 namespace {
 
@@ -15,12 +17,12 @@ bool needsPages(const HXMapping &mapping) {
 }
 
 // Walks the page tables of a process, stretch by stretch of its mappings, and counts what is there.
-class Counter {
+class Scanner {
   public:
-    Counter(const HXFindRuns &findRuns, uint32_t pageShift, HXAddressSpace &addressSpace)
-        : _findRuns(findRuns), _pageShift(pageShift), _addressSpace(addressSpace) {}
+    Scanner(const HXDescriptor &process, uint32_t pageShift, HXAddressSpace &addressSpace)
+        : _pagemap(HXOpenAt(process.get(), "pagemap")), _pageShift(pageShift), _addressSpace(addressSpace) {}
 
-    bool countAll();
+    bool scan();
     uint64_t swappedSize() const { return _swappedPages << _pageShift; }
     bool foundAny() const { return _foundAny; }
 
@@ -29,7 +31,7 @@ class Counter {
     void add(const HXPageRun &run);
     void count(uint8_t facts, uint32_t pages, HXMapping &mapping);
 
-    const HXFindRuns &_findRuns;
+    const HXDescriptor _pagemap;
     const uint32_t _pageShift;
     HXAddressSpace &_addressSpace;
     size_t _index = 0;
@@ -39,8 +41,9 @@ class Counter {
 
 // Neighbours that need the same go together. So does what does not need its pages looked at, yet lies between
 // others that do and is so small that a request of its own would cost more than looking.
-bool Counter::countAll() {
+bool Scanner::scan() {
     constexpr uint64_t smallSize = 1 << 20; // 256 pages
+    if (!_pagemap) return false;
     size_t count = _addressSpace.count();
     while (count > 0 && _addressSpace[count - 1].end >> 63 != 0)
         count--; // the gate page, which no page table of the process shows
@@ -63,11 +66,11 @@ bool Counter::countAll() {
 }
 
 // From the mapping `first` to the one before `end`.
-bool Counter::walk(size_t first, size_t end, bool tellsFiles) {
+bool Scanner::walk(size_t first, size_t end, bool tellsFiles) {
     thread_local std::array<HXPageRun, HXPageScan::kMostRuns> runs;
     const uint64_t endAddress = _addressSpace[end - 1].end;
     for (uint64_t start = _addressSpace[first].start; start < endAddress;) {
-        const auto found = _findRuns(tellsFiles, start, endAddress, runs);
+        const auto found = HXPageScan::find(_pagemap, tellsFiles, start, endAddress, runs);
         if (!found) return false;
         for (const HXPageRun &run : std::span(runs).first(found->count))
             add(run);
@@ -77,7 +80,7 @@ bool Counter::walk(size_t first, size_t end, bool tellsFiles) {
 }
 
 // Runs come in ascending order; one may reach over several mappings.
-void Counter::add(const HXPageRun &run) {
+void Scanner::add(const HXPageRun &run) {
     while (_index < _addressSpace.count() && _addressSpace[_index].end <= run.start)
         _index++;
     for (size_t i = _index; i < _addressSpace.count() && _addressSpace[i].start < run.end; i++) {
@@ -87,7 +90,7 @@ void Counter::add(const HXPageRun &run) {
     }
 }
 
-void Counter::count(uint8_t facts, uint32_t pages, HXMapping &mapping) {
+void Scanner::count(uint8_t facts, uint32_t pages, HXMapping &mapping) {
     _foundAny = true;
     if (facts & HXPageRun::nothing) return;
     const bool isFile = needsPages(mapping) ? (facts & HXPageRun::file) != 0 : mapping.isFile();
@@ -105,19 +108,9 @@ void Counter::count(uint8_t facts, uint32_t pages, HXMapping &mapping) {
 
 } // namespace
 
-bool HXCountRuns(const HXFindRuns &findRuns, uint32_t pageShift, uint64_t swappedSize,
-                 HXAddressSpace *addressSpace) {
-    Counter counter(findRuns, pageShift, *addressSpace);
-    // A living process has pages; the page tables of one that has gone are empty.
-    return counter.countAll() && counter.foundAny() && counter.swappedSize() == swappedSize;
-}
-
 bool HXScanFigures(const HXDescriptor &process, uint32_t pageShift, uint64_t swappedSize,
                    HXAddressSpace *addressSpace) {
-    const HXDescriptor pagemap = HXOpenAt(process.get(), "pagemap");
-    const HXFindRuns findRuns = [&](bool tellsFiles, uint64_t start, uint64_t end,
-                                    std::span<HXPageRun> runs) {
-        return HXPageScan::find(pagemap, tellsFiles, start, end, runs);
-    };
-    return pagemap && HXCountRuns(findRuns, pageShift, swappedSize, addressSpace);
+    Scanner scanner(process, pageShift, *addressSpace);
+    // A living process has pages; the page tables of one that has gone are empty.
+    return scanner.scan() && scanner.foundAny() && scanner.swappedSize() == swappedSize;
 }

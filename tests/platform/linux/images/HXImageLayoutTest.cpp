@@ -135,6 +135,7 @@ TEST(HXImageLayout, NamesSegmentsByTheHeaders) {
         {"rw", 0x108000, 0x10a000, 0x7000}, {"rw", 0x10a000, 0x10c000, 0, ""},
     };
     auto twice = loaded;
+    twice.push_back({"rw", 0x10c000, 0x10d000, 0, ""}); // behind the image's zero-filled memory
     for (Place place : loaded) {
         place.start += 0x100000;
         place.end += 0x100000;
