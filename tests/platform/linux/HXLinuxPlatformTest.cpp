@@ -89,7 +89,7 @@ TEST_F(HXLinuxPlatformTest, ListsAndDescribesProcesses) {
 
     proc_bsdinfo long_;
     ASSERT_EQ(platform.proc_pidinfo(300, 3, 0, &long_, sizeof long_), 136);
-    EXPECT_EQ(std::string(long_.pbi_name, strnlen(long_.pbi_name, 32)), "worker ?[1m'x'?");
+    EXPECT_STREQ(long_.pbi_name, "worker ?[1m'x'?");
     EXPECT_EQ(std::string(long_.pbi_comm, strnlen(long_.pbi_comm, 16)), "worker ?[1m'x'?");
     EXPECT_EQ(long_.pbi_ppid, 7);
     EXPECT_EQ(long_.pbi_flags, PROC_FLAG_LP64);

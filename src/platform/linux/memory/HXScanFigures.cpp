@@ -23,8 +23,10 @@ class Scanner {
         : _pagemap(HXOpenAt(process.get(), "pagemap")), _pageShift(pageShift), _addressSpace(addressSpace) {}
 
     bool scan();
-    uint64_t swappedSize() const { return _swappedPages << _pageShift; }
-    bool foundAny() const { return _foundAny; }
+    // A living process has pages; the page tables of one that has gone are empty.
+    bool isGood(uint64_t swappedSize) const {
+        return _foundAny && _swappedPages << _pageShift == swappedSize;
+    }
 
   private:
     bool walk(size_t first, size_t end, bool tellsFiles);
@@ -111,6 +113,5 @@ void Scanner::count(uint8_t facts, uint32_t pages, HXMapping &mapping) {
 bool HXScanFigures(const HXDescriptor &process, uint32_t pageShift, uint64_t swappedSize,
                    HXAddressSpace *addressSpace) {
     Scanner scanner(process, pageShift, *addressSpace);
-    // A living process has pages; the page tables of one that has gone are empty.
-    return scanner.scan() && scanner.foundAny() && scanner.swappedSize() == swappedSize;
+    return scanner.scan() && scanner.isGood(swappedSize);
 }

@@ -1,47 +1,13 @@
 #include "platform/linux/images/HXImageLayout.h"
-#include "platform/linux/images/HXElfHeaders.h"
 
-#include <elf.h>
+#include "support/HXBuilders.h"
+
 #include <gtest/gtest.h>
 
 #include <cstring>
 #include <sstream>
 
 namespace {
-
-struct Header {
-    uint32_t type;
-    uint32_t flags;
-    uint64_t offset, address, fileSize, memorySize;
-};
-
-// The bytes of an ELF file of that word size with those program headers.
-template <typename FileHeader, typename ProgramHeader>
-std::string elfFile(uint8_t wordClass, const std::vector<Header> &headers) {
-    FileHeader file{};
-    std::memcpy(file.e_ident, ELFMAG, SELFMAG);
-    file.e_ident[EI_CLASS] = wordClass;
-    file.e_ident[EI_DATA] = ELFDATA2LSB;
-    file.e_type = ET_DYN;
-    file.e_phoff = sizeof file;
-    file.e_phentsize = sizeof(ProgramHeader);
-    file.e_phnum = static_cast<uint16_t>(headers.size());
-    std::string bytes(reinterpret_cast<const char *>(&file), sizeof file);
-    for (const Header &header : headers) {
-        ProgramHeader program{};
-        program.p_type = header.type;
-        program.p_flags = header.flags;
-        program.p_offset = static_cast<decltype(program.p_offset)>(header.offset);
-        program.p_vaddr = static_cast<decltype(program.p_vaddr)>(header.address);
-        program.p_filesz = static_cast<decltype(program.p_filesz)>(header.fileSize);
-        program.p_memsz = static_cast<decltype(program.p_memsz)>(header.memorySize);
-        bytes.append(reinterpret_cast<const char *>(&program), sizeof program);
-    }
-    return bytes;
-}
-std::string wide(const std::vector<Header> &headers) {
-    return elfFile<Elf64_Ehdr, Elf64_Phdr>(ELFCLASS64, headers);
-}
 
 std::optional<HXElfHeaders> parse(const std::string &bytes) {
     const auto place = HXParseElfFileHeader(bytes);
@@ -50,44 +16,48 @@ std::optional<HXElfHeaders> parse(const std::string &bytes) {
 }
 
 // As linkers lay out libraries: symbols, code, constants, data of which the first page is relocated.
-const std::vector<Header> library = {
-    {PT_LOAD, PF_R, 0, 0, 0x1800, 0x1800},
-    {PT_LOAD, PF_R | PF_X, 0x2000, 0x2000, 0x2f00, 0x2f00},
-    {PT_LOAD, PF_R, 0x5000, 0x5000, 0x1000, 0x1000},
-    {PT_LOAD, PF_R | PF_W, 0x6d00, 0x7d00, 0x1400, 0x3400},
-    {PT_GNU_RELRO, PF_R, 0x6d00, 0x7d00, 0x300, 0x300},
-    {PT_NOTE, PF_R, 0x300, 0x300, 0x20, 0x20},
-};
+const std::string kCorpus = FUZZ_CORPUS "/elf/";
+const std::string kLibrary = contentOf(kCorpus + "library");
 
 TEST(HXElfHeaders, AcceptsSenseAlone) {
-    const auto headers = parse(wide(library));
-    ASSERT_TRUE(headers);
+    const auto headers = parse(kLibrary), narrow = parse(contentOf(kCorpus + "library-32"));
+    ASSERT_TRUE(headers && narrow);
     EXPECT_EQ(headers->loads.size(), 4u);
     EXPECT_EQ(headers->relocatedEnd, 0x8000u);
-    EXPECT_EQ((parse(elfFile<Elf32_Ehdr, Elf32_Phdr>(ELFCLASS32, library))->loads.size()), 4u);
+    EXPECT_EQ(narrow->loads.size(), 4u);
+    EXPECT_EQ(narrow->loads[3].memorySize, headers->loads[3].memorySize);
+    EXPECT_TRUE(headers->loads[3].writable && !headers->loads[3].executable);
 
-    const Header code{PT_LOAD, PF_X, 0, 0, 0x1000, 0x1000};
-    const std::vector<std::vector<Header>> senseless = {
-        {},
-        {{PT_LOAD, PF_R, 0, 0, 0x1000, 0x1000}},                  // no code
-        {{PT_LOAD, PF_X, 0, 0, 0x2000, 0x1000}},                  // more in the file than in memory
-        {{PT_LOAD, PF_X, 0, UINT64_MAX - 0xfff, 0x1000, 0x2000}}, // wraps around
-        {{PT_LOAD, PF_X, UINT64_MAX, 0, 0x1000, 0x1000}},
-        {code, code},                                       // overlap
-        {{PT_LOAD, PF_R, 0, 0x8000, 0x1000, 0x1000}, code}, // descend
-        {code, {PT_GNU_RELRO, PF_R, 0, UINT64_MAX, 1, UINT64_MAX}},
-        std::vector<Header>(513, code),
+    constexpr size_t code = 64 + 56, relocated = 64 + 4 * 56; // program headers (elf(5))
+    constexpr size_t flags = 4, address = 16, memorySize = 40;
+    const struct {
+        size_t position;
+        int byte;
+        const char *what;
+    } senseless[] = {
+        {0, 9, "magic"},
+        {4, 9, "class"},
+        {5, 2, "byte order"},
+        {16, 9, "type"},
+        {32, 63, "program headers inside the file's header"},
+        {39, 9, "program headers far away"},
+        {54, 9, "size of a program header"},
+        {56, 0, "no program header"},
+        {57, 3, "hundreds of program headers"},
+        {code + flags, 4, "no code"},
+        {code + memorySize + 1, 0x20, "more in the file than in memory"},
+        {code + address + 1, 0x10, "overlapping loads"},
+        {code + address + 7, 2, "an address that no process has"},
+        {code + memorySize + 7, 2, "a size that no process has"},
+        {relocated + memorySize + 7, 2, "what is relocated ends nowhere"},
     };
-    for (size_t i = 0; i < senseless.size(); i++)
-        EXPECT_FALSE(parse(wide(senseless[i]))) << i;
-    const std::string good = wide(library);
-    for (size_t length = 0; length < good.size(); length++)
-        EXPECT_FALSE(parse(good.substr(0, length))) << length;
-    for (const size_t position : {0, EI_CLASS, EI_DATA, 16, 54}) { // up to the type and the headers' size
-        std::string bad = good;
-        bad[position] = 9;
-        EXPECT_FALSE(parse(bad)) << position;
+    for (const auto &item : senseless) {
+        std::string bad = kLibrary;
+        bad[item.position] = static_cast<char>(item.byte);
+        EXPECT_FALSE(parse(bad)) << item.what;
     }
+    for (size_t length = 0; length < kLibrary.size(); length++)
+        EXPECT_FALSE(parse(kLibrary.substr(0, length))) << length;
 }
 
 struct Place {
@@ -97,7 +67,7 @@ struct Place {
 };
 
 // "NAME START-END" of every segment of every image, an image's base before.
-std::string layoutOf(const std::vector<Place> &places, const std::vector<Header> &headers = library) {
+std::string layoutOf(const std::vector<Place> &places, const std::string &file = kLibrary) {
     HXAddressSpace addressSpace;
     for (const Place &place : places) {
         HXMapping mapping;
@@ -115,7 +85,7 @@ std::string layoutOf(const std::vector<Place> &places, const std::vector<Header>
             if (strchr(place.access, letter)) mapping.flags |= flag;
         addressSpace.append(mapping);
     }
-    const auto parsed = parse(wide(headers));
+    const auto parsed = parse(file);
     std::ostringstream text;
     text << std::hex;
     for (const auto &image :
@@ -172,7 +142,7 @@ TEST(HXImageLayout, NamesSegmentsByTheHeaders) {
     };
     for (const auto &item : cases)
         EXPECT_EQ(layoutOf(item.places), item.expected) << item.what;
-    EXPECT_EQ(layoutOf(loaded, {}), "") << "no image by its headers";
+    EXPECT_EQ(layoutOf(loaded, ""), "") << "no image by its headers";
 }
 
 } // namespace
