@@ -167,7 +167,11 @@ TEST_P(HXLiveRegions, AgreeWithTheKernelsFiles) {
     EXPECT_EQ(process->physHeft(), status("RssAnon") + status("RssShmem") + status("VmSwap") +
                                        status("VmPTE") + status("HugetlbPages"));
     EXPECT_GE(process->physHeftPeak(), process->physHeft());
+}
 
+TEST_P(HXLiveRegions, AreNamedAndSizedAsMapped) {
+    const auto process = gathered(true);
+    ASSERT_TRUE(process);
     for (size_t i = 0; i < GetParam().mappings.size(); i++) {
         const HXMemoryMapping &mapping = GetParam().mappings[i];
         if (mapping.name == nullptr) continue;

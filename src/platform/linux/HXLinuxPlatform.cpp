@@ -22,10 +22,6 @@ constexpr int32_t kKernelNamespace = 1, kArgumentMaximum = 8, kProcessArguments 
 constexpr uint32_t kArgumentAreaSize = 131072;
 constexpr const char *kChargeSwitch = "vm.self_region_heft";
 
-uint32_t machinePageSize() {
-    return static_cast<uint32_t>(::sysconf(_SC_PAGESIZE));
-}
-
 int32_t failed(int error) {
     errno = error;
     return -1;
@@ -44,7 +40,7 @@ int32_t copyOut(const Value &value, void *old, size_t *oldBytes) {
 } // namespace
 
 HXLinuxPlatform::HXLinuxPlatform(const Setting &setting)
-    : _pageSize(machinePageSize()), _fileSystems(setting.sharedMemoryDevice),
+    : _pageSize(static_cast<uint32_t>(::sysconf(_SC_PAGESIZE))), _fileSystems(setting.sharedMemoryDevice),
       _machine(setting.procPath), _readerSetting{&_fileSystems, &_machine, &namedTags(),
                                                  static_cast<uint32_t>(std::countr_zero(_pageSize)),
                                                  setting.mayScanPageTables},
