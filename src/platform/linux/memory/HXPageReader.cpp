@@ -95,7 +95,7 @@ kern_return_t HXPageReader::queryMapping(const HXMapping &mapping, uint64_t star
 
 kern_return_t HXPageReader::countUpTo(const HXMapping &mapping, uint64_t start) {
     const bool counts = mapping.lazyFreePages > 0 || mapping.swappedPages > 0;
-    if (mapping.start != _mappingStart || start == mapping.start || (counts && start < _nextAddress)) {
+    if (mapping.start != _mappingStart || (counts && start < _nextAddress)) {
         _mappingStart = _nextAddress = mapping.start;
         _left = {mapping.swappedPages, mapping.lazyFreePages};
         _swapFile.reset();

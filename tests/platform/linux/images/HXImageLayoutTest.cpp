@@ -142,6 +142,8 @@ TEST(HXImageLayout, NamesSegmentsByTheHeaders) {
     };
     for (const auto &item : cases)
         EXPECT_EQ(layoutOf(item.places), item.expected) << item.what;
+    EXPECT_EQ(layoutOf({{"rx", 0x400000, 0x402000, 0}}, contentOf(kCorpus + "program")),
+              "400000: __TEXT 400000-402000\n");
     EXPECT_EQ(layoutOf(loaded, ""), "") << "no image by its headers";
 }
 
