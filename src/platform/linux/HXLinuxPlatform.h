@@ -9,6 +9,8 @@
 #include "platform/linux/memory/HXLinuxTask.h"
 #include "platform/linux/procfs/HXLinuxProcesses.h"
 
+#include <unistd.h>
+
 #include <atomic>
 #include <cstdint>
 #include <string>
@@ -32,7 +34,7 @@ class HXLinuxPlatform final : public HXPlatform {
     // no file of its own on the descriptors of the standard streams, should one be closed. For main.
     static void prepareProcess();
 
-    mach_port_t mach_task_self() override;
+    mach_port_t mach_task_self() override { return kSelfPort; }
     kern_return_t task_for_pid(mach_port_t self, int32_t pid, mach_port_t *task) override;
     void mach_port_deallocate(mach_port_t self, mach_port_t task) override;
     kern_return_t mach_vm_region(mach_port_t task, uint64_t *address, uint64_t *size, int32_t flavor,
@@ -42,21 +44,25 @@ class HXLinuxPlatform final : public HXPlatform {
                                          uint32_t *infoCount) override;
     kern_return_t mach_vm_page_range_query(mach_port_t task, uint64_t address, uint64_t size,
                                            int32_t *dispositions, uint64_t *count) override;
-    kern_return_t mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,
-                                           int32_t *state) override;
+    kern_return_t mach_vm_purgable_control(mach_port_t, uint64_t, int32_t, int32_t *) override {
+        return KERN_INVALID_ARGUMENT; // nothing is purgeable here
+    }
     uint32_t vm_kernel_page_size() override { return _pageSize; }
     bool hasSharedRegion() override { return false; }
 
-    int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes) override;
-    int32_t proc_pidinfo(int32_t pid, int32_t flavor, uint64_t argument, void *buffer,
-                         uint32_t bufferBytes) override;
+    int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes) override {
+        return _processes.proc_listallpids(pids, bufferBytes);
+    }
+    int32_t proc_pidinfo(int32_t pid, int32_t flavor, uint64_t, void *buffer, uint32_t bufferBytes) override {
+        return _processes.proc_pidinfo(pid, flavor, buffer, bufferBytes);
+    }
     int32_t proc_pid_rusage(int32_t pid, int32_t flavor, rusage_info_v4 *info) override;
     int32_t proc_get_dirty(int32_t pid, uint32_t *flags) override;
     int32_t proc_regionfilename(int32_t pid, uint64_t address, char *buffer, uint32_t bufferBytes) override;
-    int32_t getpid() override;
+    int32_t getpid() override { return ::getpid(); }
     // "Linux RELEASE, X86-64".
     std::string hostDescription() override;
-    uint32_t geteuid() override;
+    uint32_t geteuid() override { return ::geteuid(); }
     int32_t sysctl(const int32_t *name, uint32_t nameLength, void *old, size_t *oldBytes) override;
     int32_t sysctlbyname(const char *name, void *old, size_t *oldBytes, const void *newValue,
                          size_t newBytes) override;
@@ -67,21 +73,34 @@ class HXLinuxPlatform final : public HXPlatform {
     void
     RVSymbolicatorForeachSymbolOwnerAtTime(RVSymbolicator *symbolicator, uint64_t time,
                                            const std::function<void(const RVSymbolOwner &)> &each) override;
-    std::string stringByResolvingSymlinksInPath(const std::string &path) override;
+    // The kernel names mapped files without links.
+    std::string stringByResolvingSymlinksInPath(const std::string &path) override { return path; }
     RVSymbolicator *RVSymbolicatorCreateWithMachKernelFlagsAndNotification(uint32_t flags,
-                                                                           const void *notification) override;
+                                                                           const void *n) override {
+        return _kernelMemory.RVSymbolicatorCreateWithMachKernelFlagsAndNotification(flags, n);
+    }
     RVSymbol RVSymbolicatorGetSymbolWithAddressAtTime(RVSymbolicator *symbolicator, uint64_t address,
-                                                      uint64_t time) override;
+                                                      uint64_t time) override {
+        return _kernelMemory.RVSymbolicatorGetSymbolWithAddressAtTime(symbolicator, address, time);
+    }
     RVSourceInfo RVSymbolicatorGetSourceInfoWithAddressAtTime(RVSymbolicator *symbolicator, uint64_t address,
-                                                              uint64_t time) override;
-    void RVRelease(RVSymbolicator *symbolicator) override;
+                                                              uint64_t time) override {
+        return _kernelMemory.RVSymbolicatorGetSourceInfoWithAddressAtTime(symbolicator, address, time);
+    }
+    void RVRelease(RVSymbolicator *symbolicator) override { _kernelMemory.RVRelease(symbolicator); }
 
-    mach_port_t mach_host_self() override;
+    mach_port_t mach_host_self() override { return kHostPort; }
     kern_return_t mach_memory_info(mach_port_t host, mach_zone_name **names, uint32_t *nameCount,
                                    mach_zone_info **zones, uint32_t *zoneCount,
-                                   mach_memory_info_record **records, uint32_t *recordCount) override;
-    kern_return_t vm_deallocate(mach_port_t task, const void *address, uint64_t bytes) override;
-    std::vector<OSKextInfo> OSKextCopyLoadedKextInfo() override;
+                                   mach_memory_info_record **records, uint32_t *recordCount) override {
+        return _kernelMemory.mach_memory_info(host, names, nameCount, zones, zoneCount, records, recordCount);
+    }
+    kern_return_t vm_deallocate(mach_port_t task, const void *address, uint64_t bytes) override {
+        return _kernelMemory.vm_deallocate(task, address, bytes);
+    }
+    std::vector<OSKextInfo> OSKextCopyLoadedKextInfo() override {
+        return _kernelMemory.OSKextCopyLoadedKextInfo();
+    }
     std::optional<std::string> GXRegionTypeDescriptionForTagShareProtAndPager(uint32_t tag, uint8_t shareMode,
                                                                               int32_t protection,
                                                                               uint8_t pager) override;
@@ -89,6 +108,8 @@ class HXLinuxPlatform final : public HXPlatform {
     HXLinuxServices &services() override { return _services; }
 
   private:
+    static constexpr mach_port_t kSelfPort = 1, kHostPort = 2; // below those of tasks
+
     const HXAddressSpace &addressSpaceOf(HXLinuxTask *task);
     // The first mapping whose end lies above *address, of which it stores the place; null with *error.
     const HXMapping *mappingAt(HXLinuxTask *task, uint64_t *address, uint64_t *size, kern_return_t *error);

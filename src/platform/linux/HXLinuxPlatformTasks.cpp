@@ -1,6 +1,7 @@
 // Tasks, their mappings, their pages and their images.
 #include "platform/linux/HXLinuxPlatform.h"
 #include "platform/linux/images/HXImageLayout.h"
+#include "platform/linux/memory/HXTaskFiles.h"
 #include "platform/linux/procfs/HXProcFile.h"
 
 #include <algorithm>
@@ -9,41 +10,28 @@
 
 namespace {
 
-constexpr mach_port_t selfPort = 1;
-
-// The images of a task; the paths and segment names that it hands out are its own.
 class TaskSymbolicator final : public RVSymbolicator {
   public:
-    struct Owner {
-        std::string path;
-        uint64_t baseAddress;
-        std::vector<RVRegion> segments;
-    };
-    std::vector<Owner> owners;
+    std::vector<HXLoadedImage> images;
 };
 
-bool hasAddressSpace(int directory) {
-    const HXDescriptor maps = HXOpenAt(directory, "maps");
-    char text[2048];
+bool hasAddressSpace(const HXDescriptor &process) {
+    const HXDescriptor maps = HXOpenAt(process, "maps");
+    char byte;
     if (!maps) return false;
-    if (::read(maps.get(), text, 1) > 0) return true;
+    if (maps.readAt(0, &byte, sizeof byte) > 0) return true;
     // No mapping at all: a kernel thread, a process that has ended, or one that has unmapped everything.
-    const auto stat = HXReadOnce(directory, "stat", text);
-    const auto record = stat ? HXParseStat(*stat) : std::nullopt;
-    return record && !record->isZombie() && !record->isKernelThread();
+    const auto stat = HXReadStat(process);
+    return stat && !stat->isZombie() && !stat->isKernelThread();
 }
 
 } // namespace
 
-mach_port_t HXLinuxPlatform::mach_task_self() {
-    return selfPort;
-}
-
 kern_return_t HXLinuxPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_t *task) {
     HXDescriptor directory = pid > 0 ? _processes.open(pid) : HXDescriptor();
-    if (!directory || !hasAddressSpace(directory.get())) return KERN_FAILURE;
-    *task = _tasks.add(std::make_unique<HXLinuxTask>(pid, std::move(directory), _readerSetting.pageShift));
-    return *task == 0 ? KERN_RESOURCE_SHORTAGE : KERN_SUCCESS;
+    if (!directory || !hasAddressSpace(directory)) return KERN_FAILURE;
+    *task = _tasks.add(std::make_unique<HXLinuxTask>(pid, std::move(directory)));
+    return KERN_SUCCESS;
 }
 
 void HXLinuxPlatform::mach_port_deallocate(mach_port_t, mach_port_t task) {
@@ -124,14 +112,11 @@ kern_return_t HXLinuxPlatform::mach_vm_page_range_query(mach_port_t port, uint64
     const uint64_t mask = _pageSize - 1;
     const uint64_t start = address & ~mask;
     const uint64_t pages = std::min<uint64_t>((size + (address - start) + mask) / _pageSize, *count);
+    const HXAddressSpace &addressSpace = addressSpaceOf(task);
     const kern_return_t error =
-        task->pages().query(addressSpaceOf(task), start, std::span(dispositions, static_cast<size_t>(pages)));
+        task->pages().query(addressSpace, start, std::span(dispositions, static_cast<size_t>(pages)));
     if (error == KERN_SUCCESS) *count = pages;
     return error;
-}
-
-kern_return_t HXLinuxPlatform::mach_vm_purgable_control(mach_port_t, uint64_t, int32_t, int32_t *) {
-    return KERN_INVALID_ARGUMENT; // nothing is purgeable here
 }
 
 int32_t HXLinuxPlatform::proc_regionfilename(int32_t pid, uint64_t address, char *buffer,
@@ -157,17 +142,10 @@ RVSymbolicator *HXLinuxPlatform::RVSymbolicatorCreateWithTaskFlagsAndNotificatio
     HXLinuxTask *task = _tasks.find(port);
     if (task == nullptr) return nullptr;
     const HXAddressSpace &addressSpace = addressSpaceOf(task);
-    const auto images = HXFindImages(addressSpace, _pageSize, [&](size_t index) {
+    auto symbolicator = std::make_unique<TaskSymbolicator>();
+    symbolicator->images = HXFindImages(addressSpace, _pageSize, [&](size_t index) {
         return _imageHeaders.headersOf(addressSpace, index, task->directory());
     });
-    auto symbolicator = std::make_unique<TaskSymbolicator>();
-    for (const HXLoadedImage &image : images) {
-        auto &owner = symbolicator->owners.emplace_back();
-        owner.path = addressSpace.path(image.path).text;
-        owner.baseAddress = image.baseAddress;
-        for (const HXImageSegment &segment : image.segments)
-            owner.segments.push_back({segment.name, segment.start, segment.length});
-    }
     return symbolicator.release();
 }
 
@@ -175,10 +153,6 @@ void HXLinuxPlatform::RVSymbolicatorForeachSymbolOwnerAtTime(
     RVSymbolicator *symbolicator, uint64_t, const std::function<void(const RVSymbolOwner &)> &each) {
     const auto *task = dynamic_cast<const TaskSymbolicator *>(symbolicator);
     if (task == nullptr) return;
-    for (const auto &owner : task->owners)
-        each({owner.path.c_str(), owner.baseAddress, owner.segments.data(), owner.segments.size()});
-}
-
-std::string HXLinuxPlatform::stringByResolvingSymlinksInPath(const std::string &path) {
-    return path; // the kernel names mapped files without links
+    for (const HXLoadedImage &image : task->images)
+        each({image.path.c_str(), image.baseAddress, image.segments.data(), image.segments.size()});
 }

@@ -22,11 +22,8 @@ HXOptionScan HXLinuxServices::getopt_long(int argc, char *const argv[], const ch
     table.push_back({});
     if (restart) optind = 0; // the C library then begins anew, whatever its last scan left behind
     optarg = nullptr;
-    HXOptionScan scan;
-    scan.result = ::getopt_long(argc, argv, shortOptions, table.data(), nullptr);
-    scan.argument = optarg;
-    scan.index = optind;
-    return scan;
+    const int result = ::getopt_long(argc, argv, shortOptions, table.data(), nullptr);
+    return {result, optarg, optind};
 }
 
 bool HXLinuxServices::stat(const std::string &path) {
@@ -43,56 +40,60 @@ bool HXLinuxServices::isatty(int descriptor) {
     return ::isatty(descriptor) == 1;
 }
 
-// An open regular file and its facts; nothing, with errno set, when it is another kind of thing.
-static HXDescriptor openRegularFile(const std::string &path, struct ::stat *status) {
-    HXDescriptor file = HXOpenAt(AT_FDCWD, path.c_str());
-    if (!file || ::fstat(file.get(), status) != 0) return {};
-    if (S_ISREG(status->st_mode)) return file;
-    errno = S_ISDIR(status->st_mode) ? EISDIR : EINVAL;
-    return {};
+namespace {
+
+int otherKindError(const struct ::stat &status) {
+    return S_ISDIR(status.st_mode) ? EISDIR : EINVAL;
 }
 
-std::optional<std::string> HXLinuxServices::readFileStart(const std::string &path, size_t bytes) {
-    struct ::stat status;
-    const HXDescriptor file = openRegularFile(path, &status);
-    if (!file) return std::nullopt;
-    std::string content(bytes, '\0');
-    const ssize_t got = file.readFully(content);
-    if (got < 0) return std::nullopt;
-    content.resize(static_cast<size_t>(got));
-    return content;
+void removeKeepingError(const std::string &path) {
+    const int error = errno;
+    ::unlink(path.c_str());
+    errno = error;
 }
 
-std::optional<std::string> HXLinuxServices::readFile(const std::string &path, uint64_t limit) {
+// At most the first `most` bytes of a regular file; none with errno set, EFBIG when it has more than `limit`.
+std::optional<std::string> readRegularFile(const std::string &path, uint64_t most, uint64_t limit) {
     struct ::stat status;
-    const HXDescriptor file = openRegularFile(path, &status);
-    if (!file) return std::nullopt;
-    if (static_cast<uint64_t>(status.st_size) > limit) {
-        errno = EFBIG;
+    const HXDescriptor file = HXOpenAt(AT_FDCWD, path.c_str());
+    if (!file || ::fstat(file.get(), &status) != 0) return std::nullopt;
+    const auto size = static_cast<uint64_t>(status.st_size);
+    if (!S_ISREG(status.st_mode) || size > limit) {
+        errno = S_ISREG(status.st_mode) ? EFBIG : otherKindError(status);
         return std::nullopt;
     }
     std::string content;
     // The size is a hint: the kernel's own files tell none, and a file may grow.
-    constexpr size_t step = 65536;
-    for (size_t room = static_cast<size_t>(status.st_size) + 1;; room = std::max(step, content.size())) {
+    constexpr uint64_t step = 65536;
+    for (uint64_t next = size + 1;; next = std::max(step, content.size())) {
         const size_t length = content.size();
+        const size_t room = std::min(next, most - length);
         content.resize(length + room);
         const ssize_t got = file.readFully(std::span(content).subspan(length));
         if (got < 0) return std::nullopt;
         content.resize(length + static_cast<size_t>(got));
-        if (content.size() > limit) {
-            errno = EFBIG;
-            return std::nullopt;
-        }
-        if (static_cast<size_t>(got) < room) return content;
+        if (static_cast<size_t>(got) < room || content.size() == most) break;
     }
+    if (content.size() <= limit) return content;
+    errno = EFBIG;
+    return std::nullopt;
+}
+
+} // namespace
+
+std::optional<std::string> HXLinuxServices::readFileStart(const std::string &path, size_t bytes) {
+    return readRegularFile(path, bytes, UINT64_MAX);
+}
+
+std::optional<std::string> HXLinuxServices::readFile(const std::string &path, uint64_t limit) {
+    return readRegularFile(path, limit + 1, limit);
 }
 
 std::optional<HXPendingFile> HXLinuxServices::createPendingFile(const std::string &path) {
     // Renaming over a device or a pipe would take it away.
     struct ::stat status;
     if (::stat(path.c_str(), &status) == 0 && !S_ISREG(status.st_mode)) {
-        errno = S_ISDIR(status.st_mode) ? EISDIR : EINVAL;
+        errno = otherKindError(status);
         return std::nullopt;
     }
     HXPendingFile file;
@@ -102,9 +103,7 @@ std::optional<HXPendingFile> HXLinuxServices::createPendingFile(const std::strin
     if (!descriptor) return std::nullopt;
     file.stream = ::fdopen(descriptor.get(), "w");
     if (file.stream == nullptr) {
-        const int error = errno;
-        ::unlink(file.temporaryPath.c_str());
-        errno = error;
+        removeKeepingError(file.temporaryPath);
         return std::nullopt;
     }
     descriptor.release(); // the stream's now
@@ -118,9 +117,7 @@ bool HXLinuxServices::commitPendingFile(HXPendingFile &file) {
     file.stream = nullptr;
     if (closed && failedBefore) errno = EIO;
     if (closed && !failedBefore && ::rename(file.temporaryPath.c_str(), file.path.c_str()) == 0) return true;
-    const int error = errno;
-    ::unlink(file.temporaryPath.c_str());
-    errno = error;
+    removeKeepingError(file.temporaryPath);
     return false;
 }
 

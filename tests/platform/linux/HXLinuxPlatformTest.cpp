@@ -2,68 +2,64 @@
 #include "platform/linux/HXLinuxPlatform.h"
 
 #include "platform/HXRegionTags.h"
+#include "platform/linux/memory/HXPageScan.h"
+#include "platform/linux/procfs/HXProcFile.h"
+#include "support/HXTemporaryFolder.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <cinttypes>
 #include <cstring>
-#include <filesystem>
-#include <fstream>
 
 namespace {
 
-namespace fs = std::filesystem;
+using namespace std::literals;
 
-// A directory made to look like /proc.
-class MadeUpProc {
-  public:
-    MadeUpProc() {
-        std::string name = fs::temp_directory_path() / "heft-proc-XXXXXX";
-        if (mkdtemp(name.data()) == nullptr) abort();
-        _path = name;
-    }
-    ~MadeUpProc() { fs::remove_all(_path); }
-    MadeUpProc(const MadeUpProc &) = delete;
+constexpr uint32_t kRegionWords = 19;
+const std::string kMapping = "1000-2000 rw-p 00000000 00:00 0\nRss:                  4 kB\n";
 
-    std::string path() const { return _path; }
-    void write(const std::string &name, const std::string &content) const {
-        fs::create_directories((_path / name).parent_path());
-        std::ofstream(_path / name) << content;
-    }
-    void link(const std::string &name, const std::string &target) const {
-        fs::create_directories((_path / name).parent_path());
-        fs::create_symlink(target, _path / name);
-    }
+class HXLinuxPlatformTest : public testing::Test {
+  protected:
+    const HXTemporaryFolder proc;
+    HXLinuxPlatform platform{{proc.path(), proc.path(), HXDeviceNumber(0, 1)}};
+    uint64_t address = 0, size = 0;
+    vm_region_submap_info_64 info{};
+
     // `memory` as maps and smaps have it.
     void process(int pid, const std::string &comm, const std::string &memory, char state = 'S',
                  uint32_t flags = 4194560) const {
         const std::string folder = std::to_string(pid) + "/";
-        std::ostringstream stat;
-        stat << pid << " (" << comm << ") " << state << " 7 8 9 0 -1 " << flags
-             << " 1 2 3 4 5 6 7 8 20 0 1 0 4242 1000 200 0 0 0 140724000000000 0 0\n";
-        write(folder + "stat", stat.str());
-        write(folder + "comm", comm + "\n");
-        write(folder + "maps", memory);
-        write(folder + "smaps", memory);
+        proc.write(folder + "stat", std::to_string(pid) + " (" + comm + ") " + state + " 7 8 9 0 -1 " +
+                                        std::to_string(flags) +
+                                        " 1 2 3 4 5 6 7 8 20 0 1 0 4242 1000 200 0 0 0 "
+                                        "140724247392256 0 0\n");
+        proc.write(folder + "comm", comm + "\n");
+        proc.write(folder + "maps", memory);
+        proc.write(folder + "smaps", memory);
     }
-    void remove(int pid) const { fs::remove_all(_path / std::to_string(pid)); }
-
-  private:
-    fs::path _path;
-};
-
-class HXLinuxPlatformTest : public testing::Test {
-  protected:
-    MadeUpProc proc;
-    HXLinuxPlatform platform{{proc.path(), proc.path(), HXDeviceNumber(0, 1)}};
-
+    void kernelThread(int pid) const { process(pid, "kthreadd", "", 'S', 2129984); }
     mach_port_t open(int pid) {
         mach_port_t task = 0;
         EXPECT_EQ(platform.task_for_pid(platform.mach_task_self(), pid, &task), KERN_SUCCESS) << pid;
         return task;
     }
+    // The region from `address` on.
+    kern_return_t region(mach_port_t task) {
+        uint32_t depth = UINT32_MAX, words = kRegionWords;
+        return platform.mach_vm_region_recurse(task, &address, &size, &depth, &info, &words);
+    }
+    kern_return_t pages(mach_port_t task, uint64_t from, uint64_t bytes, std::vector<int32_t> &dispositions) {
+        uint64_t count = dispositions.size();
+        const kern_return_t error =
+            platform.mach_vm_page_range_query(task, from, bytes, dispositions.data(), &count);
+        dispositions.resize(count);
+        return error;
+    }
     std::string nameInArguments(int pid) {
-        int32_t name[] = {1, 49, pid};
+        const int32_t name[] = {1, 49, pid};
         std::string area(131072, 'x');
         size_t length = area.size();
         if (platform.sysctl(name, 3, area.data(), &length) != 0) return "error " + std::to_string(errno);
@@ -76,43 +72,38 @@ class HXLinuxPlatformTest : public testing::Test {
     }
 };
 
-const std::string mapping = "1000-2000 rw-p 00000000 00:00 0\nRss:                  4 kB\n";
-
 TEST_F(HXLinuxPlatformTest, ListsAndDescribesProcesses) {
-    proc.process(300, "worker \x1b[1m\"x\"\n", mapping);
-    proc.process(2, "kthreadd", "", 'S', 2129984);
-    proc.process(40, "gone", "", 'Z');
-    proc.write("50/stat", "senseless");
-    proc.write("self/stat", "");
-    proc.write("12monkeys", "");
+    process(300, "worker \x1b[1m\"x\"\n", kMapping);
+    kernelThread(2);
+    process(40, "gone", "", 'Z');
+    for (const char *const name : {"50/stat", "self/stat", "12monkeys"})
+        proc.write(name, "senseless");
 
     EXPECT_EQ(platform.proc_listallpids(nullptr, 0), 5);
     std::vector<int32_t> pids(10);
-    const int32_t count = platform.proc_listallpids(pids.data(), 40);
-    pids.resize(static_cast<size_t>(std::max(count, 0)));
-    ASSERT_FALSE(pids.empty());
+    pids.resize(static_cast<size_t>(std::max(platform.proc_listallpids(pids.data(), 40), 1)));
     EXPECT_EQ(pids.front(), 0);
     std::sort(pids.begin(), pids.end());
     EXPECT_EQ(pids, (std::vector<int32_t>{0, 40, 300}));
     EXPECT_EQ(platform.proc_listallpids(pids.data(), 8), 2) << "as many as there is room for";
 
-    proc_bsdinfo info;
-    ASSERT_EQ(platform.proc_pidinfo(300, 3, 0, &info, sizeof info), 136);
-    EXPECT_EQ(std::string(info.pbi_name, strnlen(info.pbi_name, 32)), "worker ?[1m'x'?");
-    EXPECT_EQ(std::string(info.pbi_comm, strnlen(info.pbi_comm, 16)), "worker ?[1m'x'?");
-    EXPECT_EQ(info.pbi_ppid, 7);
-    EXPECT_EQ(info.pbi_flags, PROC_FLAG_LP64);
-    ASSERT_EQ(platform.proc_pidinfo(0, 3, 0, &info, sizeof info), 136);
-    EXPECT_STREQ(info.pbi_name, "kernel");
-    EXPECT_EQ(info.pbi_flags & PROC_FLAG_SYSTEM, PROC_FLAG_SYSTEM);
+    proc_bsdinfo long_;
+    ASSERT_EQ(platform.proc_pidinfo(300, 3, 0, &long_, sizeof long_), 136);
+    EXPECT_STREQ(long_.pbi_name, "worker ?[1m'x'?");
+    EXPECT_EQ(std::string(long_.pbi_comm, strnlen(long_.pbi_comm, 16)), "worker ?[1m'x'?");
+    EXPECT_EQ(long_.pbi_ppid, 7);
+    EXPECT_EQ(long_.pbi_flags, PROC_FLAG_LP64);
+    ASSERT_EQ(platform.proc_pidinfo(0, 3, 0, &long_, sizeof long_), 136);
+    EXPECT_STREQ(long_.pbi_name, "kernel");
+    EXPECT_EQ(long_.pbi_flags & PROC_FLAG_SYSTEM, PROC_FLAG_SYSTEM);
     for (const int32_t absent : {40, 2, 50, 99, -1}) {
-        EXPECT_EQ(platform.proc_pidinfo(absent, 3, 0, &info, sizeof info), 0) << absent;
+        EXPECT_EQ(platform.proc_pidinfo(absent, 3, 0, &long_, sizeof long_), 0) << absent;
         EXPECT_EQ(errno, ESRCH) << absent;
     }
     proc_bsdshortinfo brief;
     ASSERT_EQ(platform.proc_pidinfo(40, 13, 1, &brief, sizeof brief), 64);
     EXPECT_EQ(brief.pbsi_status, SZOMB);
-    proc.remove(300);
+    proc.remove("300");
     EXPECT_EQ(platform.proc_pidinfo(300, 13, 1, &brief, sizeof brief), 0);
     EXPECT_EQ(errno, ESRCH);
 }
@@ -139,7 +130,6 @@ TEST_F(HXLinuxPlatformTest, ReadsStatusBehindLongListsOfGroups) {
 }
 
 TEST_F(HXLinuxPlatformTest, NamesProcessesByWhatWasExecuted) {
-    using namespace std::literals;
     const struct {
         const char *exe;
         const char *comm;
@@ -151,33 +141,27 @@ TEST_F(HXLinuxPlatformTest, NamesProcessesByWhatWasExecuted) {
         {"/usr/bin/a-rather-long-program", "a-rather-long-p", "x\0"s, "/usr/bin/a-rather-long-program"},
         {"/usr/bin/python3.11", "tool.py", "/usr/bin/python3\0/opt/tool.py\0-v\0"s, "/opt/tool.py"},
         {"/usr/bin/perl", "tool", "perl\0-w\0./tool\0x\0"s, "./tool"},
-        {"/usr/bin/python3.11", "python3", "python3\0/opt/tool.py\0"s,
-         "/usr/bin/python3.11"}, // not by its #! line
+        {"/usr/bin/python3.11", "python3", "python3\0/opt/tool.py\0"s, "/usr/bin/python3.11"}, // no #! line
         {"/usr/bin/node", "MainThread", "node\0server.js\0"s, "/usr/bin/node"},
         {"/usr/bin/x\x1b\"\n", "renamed", "", "/usr/bin/x?'?"},
-        {"/usr/bin/none", "other", "", "/usr/bin/none"},
+        {"/usr/bin/none", "other", std::string(512, '\0'), "/usr/bin/none"}, // 256 arguments and more
     };
     int pid = 1000;
     for (const auto &item : cases) {
         const std::string folder = std::to_string(++pid) + "/";
-        proc.process(pid, item.comm, mapping);
+        process(pid, item.comm, kMapping);
         proc.link(folder + "exe", item.exe);
         proc.write(folder + "cmdline", item.arguments);
         EXPECT_EQ(nameInArguments(pid), item.expected);
     }
-    std::string many;
-    for (int i = 0; i < 1000; i++)
-        many += "arg\0"s;
-    proc.write(std::to_string(pid) + "/cmdline", many);
-    EXPECT_EQ(nameInArguments(pid), "/usr/bin/none") << "256 arguments and more";
-    proc.process(2000, "kthread", "");
+    process(2000, "kthread", "");
     EXPECT_EQ(nameInArguments(2000), "error " + std::to_string(ENOENT));
     EXPECT_EQ(nameInArguments(3000), "error " + std::to_string(ESRCH));
     // Where the process's memory tells the path that was executed, it decides.
-    const HXProgramName told{"/usr/bin/python3", "worker", "python3\0-c\0/opt/worker\0"sv, "/opt/worker"};
-    EXPECT_EQ(HXExecutedPath(told), "/opt/worker");
-    const HXProgramName renamed{"/usr/bin/node", "server.js", "node\0server.js\0"sv, "/usr/bin/node"};
-    EXPECT_EQ(HXExecutedPath(renamed), "/usr/bin/node");
+    EXPECT_EQ(HXExecutedPath({"/usr/bin/python3", "worker", "python3\0-c\0/opt/worker\0"sv, "/opt/worker"}),
+              "/opt/worker");
+    EXPECT_EQ(HXExecutedPath({"/usr/bin/node", "server.js", "node\0server.js\0"sv, "/usr/bin/node"}),
+              "/usr/bin/node");
 }
 
 std::string smaps(const std::string &header, uint64_t rss, uint64_t anonymous, uint64_t dirty) {
@@ -189,13 +173,13 @@ std::string smaps(const std::string &header, uint64_t rss, uint64_t anonymous, u
 }
 
 TEST_F(HXLinuxPlatformTest, WalksMappings) {
-    proc.process(10, "p",
-                 smaps("1000-9000 r-xp 00002000 fe:01 5 /bin/a\\012b\\c", 32, 8, 4) +
-                     smaps("10000-18000 rw-s 00000000 00:01 7 /SYSV00000000 (deleted)", 32, 0, 0) +
-                     smaps("20000-28000 rw-s 00000000 00:33 8 /shm/x", 16, 0, 0) +
-                     smaps("30000-38000 rw-s 00000000 00:34 8 /nfs/x", 16, 0, 8) +
-                     smaps("34000-3a000 rw-p 00000000 00:00 0 [anon:My Arena]", 8, 8, 0) + // joined meanwhile
-                     smaps("40000-48000 rw-p 00000000 00:00 0 [stack]", 8, 8, 0));
+    process(10, "p",
+            smaps("1000-9000 r-xp 00002000 fe:01 5 /bin/a\\012b\\c", 32, 8, 4) +
+                smaps("10000-18000 rw-s 00000000 00:01 7 /SYSV00000000 (deleted)", 32, 0, 0) +
+                smaps("20000-28000 rw-s 00000000 00:33 8 /shm/x", 16, 0, 0) +
+                smaps("30000-38000 rw-s 00000000 00:34 8 /nfs/x", 16, 0, 8) +
+                smaps("34000-3a000 rw-p 00000000 00:00 0 [anon:My Arena]", 8, 8, 0) + // joined meanwhile
+                smaps("40000-48000 rw-p 00000000 00:00 0 [stack]", 8, 8, 0));
     proc.write("10/mountinfo", "1 1 0:51 / /shm rw - tmpfs tmpfs rw\n2 1 0:52 / /nfs rw - nfs4 s:/x rw\n");
     setReportsCharge(1);
     const mach_port_t task = open(10);
@@ -211,105 +195,160 @@ TEST_F(HXLinuxPlatformTest, WalksMappings) {
         {0x38000, 0x3a000, 2, HXHostTagFirstNamed, ""},
         {0x40000, 0x48000, 2, HXHostTagStack, ""},
     };
-    uint64_t address = 0;
-    uint64_t size = 0;
-    uint32_t depth = UINT32_MAX;
-    uint32_t count = 19;
-    vm_region_submap_info_64 info;
     for (const auto &item : expected) {
-        ASSERT_EQ(platform.mach_vm_region_recurse(task, &address, &size, &depth, &info, &count),
-                  KERN_SUCCESS);
+        ASSERT_EQ(region(task), KERN_SUCCESS);
         EXPECT_EQ(address, item.start);
         EXPECT_EQ(address + size, item.end);
-        EXPECT_EQ(info.pages_dirtied, item.dirtyPages) << std::hex << address;
-        EXPECT_EQ(info.user_tag, item.tag) << std::hex << address;
+        EXPECT_EQ(info.pages_dirtied, item.dirtyPages) << item.path;
+        EXPECT_EQ(info.user_tag, item.tag) << item.path;
         char path[1024];
         const int32_t length = platform.proc_regionfilename(10, address, path, sizeof path);
         EXPECT_EQ(std::string(path, static_cast<size_t>(length)), item.path);
         address += size;
     }
-    EXPECT_EQ(platform.mach_vm_region_recurse(task, &address, &size, &depth, &info, &count),
-              KERN_INVALID_ADDRESS);
+    EXPECT_EQ(region(task), KERN_INVALID_ADDRESS);
     EXPECT_EQ(platform.GXRegionTypeDescriptionForTagShareProtAndPager(HXHostTagFirstNamed, 0, 0, 0),
               "My Arena");
 
     address = 0x8fff; // not in order, in the middle of a mapping
     vm_region_basic_info_64 basic;
-    count = 9;
-    ASSERT_EQ(platform.mach_vm_region(task, &address, &size, 9, &basic, &count), KERN_SUCCESS);
+    uint32_t words = 9;
+    ASSERT_EQ(platform.mach_vm_region(task, &address, &size, 9, &basic, &words), KERN_SUCCESS);
     EXPECT_EQ(address, 0x1000u);
     EXPECT_EQ(uint64_t{basic.offset}, 0x2000u);
     setReportsCharge(0);
-    count = 19;
     address = 0x30000;
-    ASSERT_EQ(platform.mach_vm_region_recurse(task, &address, &size, &depth, &info, &count), KERN_SUCCESS);
+    ASSERT_EQ(region(task), KERN_SUCCESS);
     EXPECT_EQ(info.pages_dirtied, 2u) << "dirty pages of a file";
-    EXPECT_EQ(platform.mach_vm_purgable_control(task, 0x1000, 0, nullptr), KERN_INVALID_ARGUMENT);
     platform.mach_port_deallocate(platform.mach_task_self(), task);
-    EXPECT_EQ(platform.mach_vm_region_recurse(task, &address, &size, &depth, &info, &count),
-              KERN_INVALID_ARGUMENT);
+    EXPECT_EQ(region(task), KERN_INVALID_ARGUMENT);
 }
 
 TEST_F(HXLinuxPlatformTest, ProcessesVanishAndRefuse) {
     mach_port_t task = 0;
-    proc.process(2, "kthreadd", "", 'S', 2129984);
-    proc.process(3, "zombie", "", 'Z');
+    kernelThread(2);
+    process(3, "zombie", "", 'Z');
     for (const int32_t pid : {2, 3, 4, 0, -1})
         EXPECT_EQ(platform.task_for_pid(1, pid, &task), KERN_FAILURE) << pid;
 
-    proc.process(10, "empty", "");
-    proc.process(11, "vanishes", mapping);
-    proc.process(12, "recycled", mapping);
-    const mach_port_t empty = open(10);
-    const mach_port_t vanishes = open(11);
-    const mach_port_t recycled = open(12);
-    proc.remove(11);
-    proc.remove(12);
-    proc.process(12, "another", mapping);
-    const struct {
-        mach_port_t task;
-        kern_return_t error;
-    } cases[] = {{empty, KERN_INVALID_ADDRESS},
-                 {vanishes, MACH_SEND_INVALID_DEST},
-                 {recycled, MACH_SEND_INVALID_DEST}};
-    for (const auto &item : cases) {
-        uint64_t address = 0, size = 0;
-        uint32_t depth = UINT32_MAX, count = 19;
-        vm_region_submap_info_64 info;
-        EXPECT_EQ(platform.mach_vm_region_recurse(item.task, &address, &size, &depth, &info, &count),
-                  item.error);
-        RVSymbolicator *symbolicator =
-            platform.RVSymbolicatorCreateWithTaskFlagsAndNotification(item.task, 0, nullptr);
-        platform.RVSymbolicatorForeachSymbolOwnerAtTime(symbolicator, kRVNow,
+    process(10, "empty", "");
+    process(11, "vanishes", kMapping);
+    process(12, "recycled", kMapping);
+    const mach_port_t tasks[] = {open(10), open(11), open(12)};
+    proc.remove("11");
+    proc.remove("12");
+    process(12, "another", kMapping);
+    for (const mach_port_t each : tasks) {
+        EXPECT_EQ(region(each), each == tasks[0] ? KERN_INVALID_ADDRESS : MACH_SEND_INVALID_DEST);
+        RVSymbolicator *images = platform.RVSymbolicatorCreateWithTaskFlagsAndNotification(each, 0, nullptr);
+        platform.RVSymbolicatorForeachSymbolOwnerAtTime(images, kRVNow,
                                                         [](const RVSymbolOwner &) { ADD_FAILURE(); });
-        platform.RVRelease(symbolicator);
+        platform.RVRelease(images);
     }
     rusage_info_v4 usage;
     EXPECT_NE(platform.proc_pid_rusage(11, 4, &usage), 0);
 }
 
-TEST_F(HXLinuxPlatformTest, PageTablesOfMadeUpProcess) {
-    const uint64_t present = 1ULL << 63, swapped = 1ULL << 62, file = 1ULL << 61;
-    proc.process(10, "p",
-                 "1000-5000 rw-p 0 fe:01 5 /x\nRss:            8 kB\nAnonymous:      4 kB\nSwap: 4 kB\n" +
-                     std::string("Swap:                  4 kB\nVmFlags: rd\n8000-9000 r--p 0 00:00 0\n"));
-    const uint64_t entries[] = {0, present | file, present, swapped, 0};
-    proc.write("10/pagemap", std::string(reinterpret_cast<const char *>(entries), sizeof entries));
+TEST_F(HXLinuxPlatformTest, ReadsPageTables) {
+    process(10, "p",
+            "1000-9000 rw-p 0 fe:01 5 /x\n"
+            "Rss:                  16 kB\nAnonymous:            12 kB\nLazyFree:              4 kB\n"
+            "Swap:                  4 kB\nVmFlags: rd\n9000-a000 rw-p 0 00:06 7 /dev/driver\nVmFlags: rd\n"
+            "a000-c000 rw-s 0 00:01 8 /memfd:x (deleted)\nVmFlags: rd\n"
+            "c000-e000 rw-s 0 00:0f 9 /pool\nVmFlags: rd ht\n20000-21000 r--p 0 00:00 0\n");
+    constexpr uint64_t present = 1ULL << 63, swapped = 1ULL << 62, file = 1ULL << 61, guard = 1ULL << 58;
+    const uint64_t entries[] = {
+        0,       present | file, present, swapped,        swapped, guard | swapped, present, present, 0,
+        present, present | file, 0,       present | file, 0};
+    proc.write("10/pagemap", {reinterpret_cast<const char *>(entries), sizeof entries});
     const mach_port_t task = open(10);
-    int32_t pages[8];
-    uint64_t count = 8;
-    ASSERT_EQ(platform.mach_vm_page_range_query(task, 0x1000, 0x4000, pages, &count), KERN_SUCCESS);
-    EXPECT_EQ(count, 4u);
-    EXPECT_EQ((std::vector<int32_t>(pages, pages + 4)), (std::vector<int32_t>{0x81, 0x9, 0x10, 0}));
-    count = 8;
-    EXPECT_EQ(platform.mach_vm_page_range_query(task, 0x3000, 0x4000, pages, &count), KERN_INVALID_ADDRESS);
-    count = 8;
-    EXPECT_EQ(platform.mach_vm_page_range_query(task, 0x8000, 0x1000, pages, &count), KERN_INVALID_ARGUMENT)
-        << "the page tables have gone";
+    const struct {
+        uint64_t from, bytes;
+        kern_return_t error;
+        std::vector<int32_t> expected;
+    } cases[] = {
+        {0x1000, 0x7000, KERN_SUCCESS, {0x81, 0x801, 0x10, 0, 0, 0x9, 0x9}},
+        {0x3001, 0x1fff, KERN_SUCCESS, {0x10, 0}}, // back, and rounded to pages
+        {0x6000, 0x1000, KERN_SUCCESS, {0x9}},     // what lies before has been counted
+        {0x2000, 0x1000, KERN_SUCCESS, {0x801}},
+        {0x9000, 0x5000, KERN_SUCCESS, {0, 0x9, 0, 0x9, 0}}, // a driver's, shared memory, the huge-page pool
+        {0xd000, 0x2000, KERN_INVALID_ADDRESS, {}},          // no mapping
+        {0x20000, 0x1000, KERN_INVALID_ARGUMENT, {}},        // the page tables have gone
+    };
+    for (const auto &item : cases) {
+        std::vector<int32_t> dispositions(8);
+        ASSERT_EQ(pages(task, item.from, item.bytes, dispositions), item.error) << std::hex << item.from;
+        if (item.error != KERN_SUCCESS) continue;
+        EXPECT_EQ(dispositions, item.expected) << std::hex << item.from;
+    }
+}
+
+TEST_F(HXLinuxPlatformTest, LeavesThePagesOfAnotherProgramAlone) {
+    // The fixture's processes have their stack at 0x7ffceac6f000.
+    const std::pair<const char *, kern_return_t> cases[] = {
+        {"7ffceac60000-7ffceac6f000", KERN_SUCCESS},
+        {"7ffceac60000-7ffceac6e000", KERN_INVALID_ARGUMENT},
+        {"7ffceac70000-7ffceac7f000", KERN_INVALID_ARGUMENT}};
+    int pid = 10;
+    for (const auto &[range, error] : cases) {
+        process(++pid, "p", "0-1000 rw-p 0 00:00 0\n"s + range + " rw-p 0 00:00 0 [stack]\n");
+        proc.write(std::to_string(pid) + "/pagemap", std::string(8, '\0'));
+        std::vector<int32_t> dispositions(1);
+        EXPECT_EQ(pages(open(pid), 0, 0x1000, dispositions), error) << range;
+    }
+}
+
+// A page of the test's own, in a made-up process that has the test's page tables.
+alignas(4096) char ownPage[4096] = {1};
+
+TEST_F(HXLinuxPlatformTest, CountsFromPageTablesOnlyWhereTheyTellEnough) {
+    if (!HXPageScan::isComplete()) GTEST_SKIP() << "the kernel's answers are not complete";
+    const std::string status = "VmLck: 0 kB\nVmRSS: 4 kB\nVmSwap: 0 kB\nHugetlbPages: 0 kB\nThreads: 1\n";
+    const struct {
+        const char *mapping; // behind its addresses
+        std::string status;
+        const char *freedEver, *freed;
+        bool suffice;
+    } cases[] = {
+        {"rw-p 0 00:00 0", status, "0", "1", true},
+        {"rw-p 0 fe:01 5 /bin/x", status, "1", "0", true},
+        {"rw-p 0 00:00 0", status, "1", "4", false},
+        {"rw-s 0 00:01 5 /memfd:x (deleted)", status, "0", "0", true},
+        {"rw-s 0 00:0f 5 /memfd:x (deleted)", status, "0", "0", false}, // of the huge-page pool
+        {"rw-s 0 00:0f 5 /SYSV00000000 (deleted)", status, "0", "0", false},
+        {"rw-p 0 00:0f 5 /anon_hugepage (deleted)", status, "0", "0", false},
+        {"rw-p 0 00:35 5 /huge/x", status, "0", "0", false},
+        {"rw-p 0 00:00 0", "VmLck: 4 kB\n" + status.substr(12), "0", "0", false},
+        {"rw-p 0 00:00 0", "HugetlbPages: 2048 kB\nThreads: 1\n", "0", "0", false},
+        {"rw-p 0 00:00 0", "VmSwap: 4 kB\nThreads: 1\n", "0", "0", false},
+        {"rw-p 0 00:00 0", "VmRSS: 2000 kB\nThreads: 1\n", "1", "0", false}, // too many pages to find out
+    };
+    HXFileSystems fileSystems(HXDeviceNumber(0, 1));
+    HXNamedTags tags;
+    proc.write("mountinfo", "1 1 0:53 / /huge rw - hugetlbfs none rw\n");
+    proc.link("pagemap", "/proc/self/pagemap");
+    const HXDescriptor directory = HXOpenAt(AT_FDCWD, proc.path().c_str());
+    for (const auto &item : cases) {
+        char range[64];
+        const auto start = reinterpret_cast<uint64_t>(ownPage);
+        snprintf(range, sizeof range, "%" PRIx64 "-%" PRIx64 " ", start, start + sizeof ownPage);
+        // Behind it one that is large enough to be walked by itself.
+        const std::string maps =
+            range + std::string(item.mapping) + "\n7e0000000000-7e0000400000 rw-p 0 00:00 0\n";
+        proc.write("maps", maps);
+        proc.write("smaps", maps);
+        proc.write("status", item.status);
+        proc.write("vmstat", "pglazyfree "s + item.freedEver + "\n");
+        proc.write("smaps_rollup", "LazyFree: "s + item.freed + " kB\n");
+        HXMachineFacts machine(proc.path());
+        const auto read = HXReadAddressSpace({directory, {}, false, std::chrono::steady_clock::now()},
+                                             {&fileSystems, &machine, &tags, 12, true});
+        EXPECT_NE(read->knowsDirtyPages, item.suffice) << item.mapping << " " << item.status;
+    }
 }
 
 TEST_F(HXLinuxPlatformTest, FiguresAndLedger) {
-    proc.process(10, "p", mapping);
+    process(10, "p", kMapping);
     const auto status = [&](int pageTable) {
         proc.write("10/status", "VmHWM: 900 kB\nRssAnon: 100 kB\nRssShmem: 0 kB\nVmSwap: 0 kB\nVmPTE: " +
                                     std::to_string(pageTable) + " kB\nThreads: 1\n");
@@ -329,7 +368,6 @@ TEST_F(HXLinuxPlatformTest, FiguresAndLedger) {
     ASSERT_EQ(platform.proc_pid_rusage(10, 4, &usage), 0);
     EXPECT_EQ(usage.ri_phys_heft, 116u * 1024) << "read anew";
     platform.mach_port_deallocate(1, task);
-    ASSERT_EQ(platform.proc_pid_rusage(10, 4, &usage), 0) << "without a task";
 
     ledger_template_info names[2];
     count = 2;
@@ -340,8 +378,21 @@ TEST_F(HXLinuxPlatformTest, FiguresAndLedger) {
     size_t length = sizeof value;
     EXPECT_EQ(platform.sysctlbyname("vm.self_region_heft", &value, &length, nullptr, 0), 0);
     EXPECT_EQ(value, 0u);
+    const int32_t otherNames[] = {6, 8};
+    EXPECT_NE(platform.sysctl(otherNames, 2, &value, &length), 0);
     EXPECT_NE(platform.sysctlbyname("vm.get_owned_vmobjects", nullptr, &length, &task, 4), 0);
     EXPECT_EQ(errno, ENOENT);
+
+    // The figures may stand behind long lists of groups; what is cut has none.
+    std::string groups = "Groups:\t";
+    for (int i = 0; i < 65536; i++)
+        groups += std::to_string(1000000 + i) + " ";
+    for (const std::string end : {"Threads:\t1\n", ""}) {
+        proc.write("10/status", groups + "\nRssAnon:\t    8 kB\nVmPTE:\t    4 kB\n" + end);
+        usage = {};
+        EXPECT_EQ(platform.proc_pid_rusage(10, RUSAGE_INFO_V4, &usage), end.empty() ? -1 : 0);
+        EXPECT_EQ(usage.ri_phys_heft, end.empty() ? 0u : 12288u);
+    }
 }
 
 } // namespace

@@ -1,7 +1,7 @@
 // Work queues, signals and the command line's own files on the live host.
 #include "platform/linux/HXLinuxServices.h"
 
-#include "support/HXBuilders.h"
+#include "support/HXTemporaryFolder.h"
 
 #include <gtest/gtest.h>
 
@@ -12,7 +12,6 @@
 #include <cerrno>
 #include <csignal>
 #include <filesystem>
-#include <fstream>
 #include <future>
 
 namespace {
@@ -70,23 +69,19 @@ TEST(HXLinuxDispatch, SignalsGoToTheSourceThenToTheDisposition) {
     EXPECT_TRUE(WIFSIGNALED(ended) && WTERMSIG(ended) == SIGINT) << ended;
 }
 
-class HXLinuxFiles : public testing::Test {
-  protected:
-    HXLinuxFiles() { fs::create_directories(folder); }
-
+TEST(HXLinuxFiles, ReadsPlainFilesAlone) {
     HXLinuxServices services;
-    const fs::path folder = temporaryPath();
-};
-
-TEST_F(HXLinuxFiles, ReadsPlainFilesAlone) {
-    std::ofstream(folder / "plain") << std::string(100000, 'x');
+    const HXTemporaryFolder folder;
+    folder.write("plain", std::string(100000, 'x'));
     mkfifo((folder / "fifo").c_str(), 0600);
     EXPECT_EQ(services.readFile(folder / "plain", 100000)->size(), 100000u);
+    EXPECT_EQ(services.readFileStart(folder / "plain", 99999)->size(), 99999u);
+    EXPECT_EQ(services.readFileStart(folder / "plain", 100001)->size(), 100000u);
     EXPECT_GT(services.readFile("/proc/self/status", 100000).value_or("").size(), 100u) << "of no size";
     const std::pair<std::string, int> cases[] = {{folder / "plain", EFBIG},
                                                  {folder / "fifo", EINVAL},
                                                  {"/dev/zero", EINVAL},
-                                                 {folder, EISDIR},
+                                                 {folder.path(), EISDIR},
                                                  {folder / "none", ENOENT}};
     for (const auto &item : cases) {
         EXPECT_FALSE(services.readFile(item.first, 99999)) << item.first;
@@ -94,7 +89,9 @@ TEST_F(HXLinuxFiles, ReadsPlainFilesAlone) {
     }
 }
 
-TEST_F(HXLinuxFiles, PendingFilesAppearWhole) {
+TEST(HXLinuxFiles, PendingFilesAppearWhole) {
+    HXLinuxServices services;
+    const HXTemporaryFolder folder;
     const std::string path = folder / "report";
     auto file = services.createPendingFile(path);
     ASSERT_TRUE(file);
@@ -102,9 +99,7 @@ TEST_F(HXLinuxFiles, PendingFilesAppearWhole) {
     EXPECT_FALSE(services.stat(path));
     EXPECT_TRUE(services.commitPendingFile(*file));
     EXPECT_EQ(services.readFile(path, 10), "text");
-    struct stat status;
-    ASSERT_EQ(::stat(path.c_str(), &status), 0);
-    EXPECT_EQ(status.st_mode & 0777, 0600u);
+    EXPECT_EQ(fs::status(path).permissions(), fs::perms(0600));
 
     auto discarded = services.createPendingFile(path);
     services.discardPendingFile(*discarded);
@@ -114,7 +109,7 @@ TEST_F(HXLinuxFiles, PendingFilesAppearWhole) {
     lost = services.createPendingFile(folder / "sub" / "x");
     fs::create_directory(folder / "sub" / "x"); // in the way
     EXPECT_FALSE(services.commitPendingFile(*lost));
-    EXPECT_EQ(std::distance(fs::directory_iterator(folder), {}), 2) << "nothing is left over";
+    EXPECT_EQ(std::distance(fs::directory_iterator(folder.path()), {}), 2) << "nothing is left over";
     EXPECT_EQ(std::distance(fs::directory_iterator(folder / "sub"), {}), 1);
 }
 

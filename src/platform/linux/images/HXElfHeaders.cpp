@@ -7,8 +7,8 @@
 
 namespace {
 
-constexpr uint32_t maximumHeaders = 512;
-constexpr uint64_t maximumAddress = uint64_t{1} << 57;
+constexpr uint32_t kMostHeaders = 512;                // far more than linkers make
+constexpr uint64_t kAddressLimit = uint64_t{1} << 57; // of five levels of page tables; sums do not wrap
 
 template <typename Header>
 Header read(std::string_view bytes, size_t offset) {
@@ -22,16 +22,16 @@ std::optional<HXElfHeaderPlace> placeIn(std::string_view bytes, bool is64bit) {
     if (bytes.size() < sizeof(FileHeader)) return std::nullopt;
     const auto header = read<FileHeader>(bytes, 0);
     if (header.e_type != ET_EXEC && header.e_type != ET_DYN) return std::nullopt;
-    if (header.e_phentsize != sizeof(ProgramHeader) || header.e_phnum == 0 || header.e_phnum > maximumHeaders)
+    if (header.e_phentsize != sizeof(ProgramHeader) || header.e_phnum == 0 || header.e_phnum > kMostHeaders)
         return std::nullopt;
-    if (header.e_phoff < sizeof(FileHeader) || header.e_phoff >= maximumAddress) return std::nullopt;
+    if (header.e_phoff < sizeof(FileHeader) || header.e_phoff >= kAddressLimit) return std::nullopt;
     return HXElfHeaderPlace{is64bit, header.e_phoff, header.e_phnum};
 }
 
 template <typename ProgramHeader>
 bool isSensible(const ProgramHeader &header) {
-    return header.p_filesz <= header.p_memsz && header.p_memsz < maximumAddress &&
-           header.p_vaddr < maximumAddress && header.p_offset < maximumAddress;
+    return header.p_filesz <= header.p_memsz && header.p_memsz < kAddressLimit &&
+           header.p_vaddr < kAddressLimit && header.p_offset < kAddressLimit;
 }
 
 template <typename ProgramHeader>

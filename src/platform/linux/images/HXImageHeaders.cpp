@@ -1,10 +1,10 @@
 #include "platform/linux/images/HXImageHeaders.h"
 
 #include "platform/linux/memory/HXMappedFile.h"
+#include "platform/linux/memory/HXPageScan.h"
 #include "platform/linux/procfs/HXProcFile.h"
 
 #include <fcntl.h>
-#include <unistd.h>
 
 #include <functional>
 #include <optional>
@@ -30,78 +30,59 @@ Outcome readHeaders(const ReadBytes &read) {
     return {true, HXParseElfProgramHeaders(*bytes, *place)};
 }
 
-std::optional<std::string> readExactly(int file, uint64_t position, uint64_t length) {
+std::optional<std::string> readExactly(const HXDescriptor &file, uint64_t position, uint64_t length) {
     std::string bytes(length, '\0');
-    if (::pread(file, bytes.data(), length, static_cast<off_t>(position)) != static_cast<ssize_t>(length))
-        return std::nullopt;
+    if (file.readAt(position, bytes.data(), length) != static_cast<ssize_t>(length)) return std::nullopt;
     return bytes;
 }
 
-// The file system's own page, where it is in memory anyway, read through the process. A page that the process
-// has made its own is not taken.
-class MemoryReader {
-  public:
-    MemoryReader(int directory, const HXMapping &mapping, uint64_t pageSize)
-        : _mapping(mapping), _pageSize(pageSize), _pagemap(HXOpenAt(directory, "pagemap")),
-          _memory(HXOpenAt(directory, "mem")) {}
-
-    std::optional<std::string> read(uint64_t offset, uint64_t length) const {
-        if (!_pagemap || !_memory || offset < _mapping.offset) return std::nullopt;
-        const uint64_t start = _mapping.start + (offset - _mapping.offset);
-        if (start < _mapping.start || start + length < start || start + length > _mapping.end)
-            return std::nullopt;
-        for (uint64_t page = start / _pageSize; page * _pageSize < start + length; page++)
+// Reads the file system's own pages, where they are in memory anyway, through the process: none for a page
+// that the process has made its own.
+Outcome readThroughProcess(const HXMapping &mapping, const HXDescriptor &process, uint64_t pageSize) {
+    const HXDescriptor pagemap = HXOpenAt(process, "pagemap");
+    const HXDescriptor memory = HXOpenAt(process, "mem");
+    const auto isCached = [&](uint64_t page) {
+        constexpr uint8_t wanted = HXPageRun::present | HXPageRun::file;
+        uint8_t facts = 0;
+        return HXReadPageFacts(pagemap, page, {&facts, 1}) == 1 && (facts & wanted) == wanted;
+    };
+    const auto read = [&](uint64_t offset, uint64_t length) -> std::optional<std::string> {
+        const uint64_t start = mapping.start + (offset - mapping.offset);
+        const bool isMapped = offset >= mapping.offset && start >= mapping.start && start <= mapping.end &&
+                              length <= mapping.end - start;
+        if (!isMapped) return std::nullopt;
+        for (uint64_t page = start / pageSize; page * pageSize < start + length; page++)
             if (!isCached(page)) return std::nullopt;
-        return readExactly(_memory.get(), start, length);
-    }
-
-  private:
-    bool isCached(uint64_t page) const {
-        constexpr uint64_t present = uint64_t{1} << 63, ofFile = uint64_t{1} << 61;
-        uint64_t entry = 0;
-        const auto position = static_cast<off_t>(page * sizeof entry);
-        if (::pread(_pagemap.get(), &entry, sizeof entry, position) != sizeof entry) return false;
-        return (entry & (present | ofFile)) == (present | ofFile);
-    }
-
-    const HXMapping &_mapping;
-    const uint64_t _pageSize;
-    const HXDescriptor _pagemap, _memory;
-};
-
-Outcome readThroughProcess(const HXMapping &mapping, int directory, uint64_t pageSize) {
-    const MemoryReader reader(directory, mapping, pageSize);
-    Outcome outcome =
-        readHeaders([&](uint64_t offset, uint64_t length) { return reader.read(offset, length); });
+        return readExactly(memory, start, length);
+    };
+    if (!pagemap || !memory) return {};
+    Outcome outcome = readHeaders(read);
     if (!outcome.isRead) return outcome;
     // Was it that file, or has the process mapped another one there meanwhile? Only root may ask.
-    const HXDescriptor file = HXLocateMapped(directory, mapping);
-    if (file && !HXIsMappedFile(mapping, file.get())) return {};
+    const HXDescriptor file = HXLocateMapped(process, mapping);
+    if (file && !HXIsMappedFile(mapping, file)) return {};
     return outcome;
 }
 
 // The mapping's file by its path, in the process's root or else, for a process that left its root, in ours.
-HXDescriptor locateByPath(const HXMapping &mapping, const std::string &path, int directory) {
-    HXDescriptor place = HXLocateBelowRoot(directory, path);
-    if (place && HXIsMappedFile(mapping, place.get())) return place;
-    const HXDescriptor self(::open("/proc/self", O_PATH | O_DIRECTORY | O_CLOEXEC));
-    return HXLocateBelowRoot(self.get(), path);
+HXDescriptor locateByPath(const HXMapping &mapping, const std::string &path, const HXDescriptor &process) {
+    HXDescriptor place = HXLocateBelowRoot(process, path);
+    if (place && HXIsMappedFile(mapping, place)) return place;
+    return HXLocateBelowRoot(HXOpenAt(AT_FDCWD, "/proc/self", O_PATH | O_DIRECTORY), path);
 }
 
-Outcome readFile(const HXMapping &mapping, const std::string &path, int directory) {
-    HXDescriptor place = HXLocateMapped(directory, mapping);
-    if (!place) place = locateByPath(mapping, path, directory);
-    if (!place || !HXIsMappedFile(mapping, place.get())) return {};
+Outcome readFile(const HXMapping &mapping, const std::string &path, const HXDescriptor &process) {
+    HXDescriptor place = HXLocateMapped(process, mapping);
+    if (!place) place = locateByPath(mapping, path, process);
+    if (!place || !HXIsMappedFile(mapping, place)) return {};
     const HXDescriptor file = HXOpenLocated(place);
     if (!file) return {};
-    return readHeaders([&](uint64_t offset, uint64_t length) -> std::optional<std::string> {
-        return readExactly(file.get(), offset, length);
-    });
+    return readHeaders([&](uint64_t offset, uint64_t length) { return readExactly(file, offset, length); });
 }
 
 // The mapping of the file's beginning, which mostly lies just before its code; else the mapping itself.
 const HXMapping &beginningOfFile(const HXAddressSpace &addressSpace, size_t index) {
-    constexpr size_t reach = 8;
+    constexpr size_t reach = 8; // linkers make four loads or five, of which a protection may cut some
     const HXMapping &mapping = addressSpace[index];
     for (size_t i = index + 1; i-- > 0 && index - i < reach;) {
         const HXMapping &other = addressSpace[i];
@@ -113,24 +94,23 @@ const HXMapping &beginningOfFile(const HXAddressSpace &addressSpace, size_t inde
 } // namespace
 
 const HXElfHeaders *HXImageHeaders::headersOf(const HXAddressSpace &addressSpace, size_t index,
-                                              int directory) {
+                                              const HXDescriptor &process) {
     const HXMapping &mapping = addressSpace[index];
     const FileKey key{mapping.device, mapping.inode};
     {
         const std::lock_guard lock(_mutex);
         File &file = _files[key];
         if (file.isRead) return file.headers ? &*file.headers : nullptr;
-        if (file.tries == maximumTries) return nullptr;
+        if (file.tries == kMostTries) return nullptr;
         file.tries++;
     }
-    Outcome outcome = readThroughProcess(beginningOfFile(addressSpace, index), directory, _pageSize);
+    Outcome outcome = readThroughProcess(beginningOfFile(addressSpace, index), process, _pageSize);
     if (!outcome.isRead) {
-        HXFileSystemLookup lookup;
-        lookup.directory = directory;
+        HXFileSystemLookup lookup{process};
         const bool isShared = mapping.device == _fileSystems.sharedMemoryDevice();
         const HXFileSystemKind kind = _fileSystems.kindOf(mapping.device, &lookup);
         if (isShared || kind == HXFileSystemKind::local || kind == HXFileSystemKind::swapBacked)
-            outcome = readFile(mapping, addressSpace.path(mapping.path).text, directory);
+            outcome = readFile(mapping, addressSpace.path(mapping.path).text, process);
     }
     const std::lock_guard lock(_mutex);
     File &file = _files[key];

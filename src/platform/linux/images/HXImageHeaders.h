@@ -6,33 +6,27 @@
 #include "platform/linux/memory/HXFileSystems.h"
 
 #include <cstdint>
+#include <map>
 #include <mutex>
 #include <optional>
-#include <unordered_map>
+#include <utility>
 
 class HXImageHeaders {
   public:
     HXImageHeaders(HXFileSystems &fileSystems, uint64_t pageSize)
         : _fileSystems(fileSystems), _pageSize(pageSize) {}
 
-    // The headers of the file that the mapping maps; null when it is no image or can't be read. `directory`:
-    // the process's in /proc. Any thread; never waits on a file system that may hang. What is handed out
+    // The headers of the file that the mapping maps; null when it is no image or can't be read. `process`:
+    // its directory in /proc. Any thread; never waits on a file system that may hang. What is handed out
     // lives as long as this.
-    const HXElfHeaders *headersOf(const HXAddressSpace &addressSpace, size_t index, int directory);
+    const HXElfHeaders *headersOf(const HXAddressSpace &addressSpace, size_t index,
+                                  const HXDescriptor &process);
 
   private:
-    struct FileKey {
-        uint32_t device;
-        uint64_t inode;
-        bool operator==(const FileKey &) const = default;
-    };
-    struct FileKeyHash {
-        size_t operator()(const FileKey &key) const {
-            return static_cast<size_t>(key.inode * 0x9E3779B97F4A7C15 ^ key.device);
-        }
-    };
-    // A file that could not be read in one process may be readable in another one.
-    static constexpr uint32_t maximumTries = 3;
+    using FileKey = std::pair<uint32_t, uint64_t>; // device and inode
+    // A file that could not be read in one process may be readable in another one, but each try costs as
+    // much.
+    static constexpr uint32_t kMostTries = 3;
     struct File {
         uint32_t tries = 0;
         bool isRead = false;
@@ -42,5 +36,5 @@ class HXImageHeaders {
     HXFileSystems &_fileSystems;
     const uint64_t _pageSize;
     std::mutex _mutex;
-    std::unordered_map<FileKey, File, FileKeyHash> _files;
+    std::map<FileKey, File> _files;
 };

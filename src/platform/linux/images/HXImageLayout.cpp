@@ -5,12 +5,12 @@
 
 namespace {
 
-constexpr const char *textName = "__TEXT";
-constexpr const char *symbolsName = "__LINKEDIT";
-constexpr const char *constantsName = "__CONST";
-constexpr const char *relocatedName = "__DATA_CONST";
-constexpr const char *dataName = "__DATA";
-constexpr const char *zeroFilledName = "__BSS";
+constexpr const char *kText = "__TEXT";
+constexpr const char *kSymbols = "__LINKEDIT";
+constexpr const char *kConstants = "__CONST";
+constexpr const char *kRelocated = "__DATA_CONST";
+constexpr const char *kData = "__DATA";
+constexpr const char *kZeroFilled = "__BSS";
 
 struct Pages {
     uint64_t size;
@@ -42,7 +42,7 @@ class Finder {
     void addVdso(const HXMapping &mapping);
     void assign(const HXMapping &mapping, Candidate *candidate) const;
     const char *nameInFile(const HXMapping &mapping, const Candidate &candidate) const;
-    std::optional<HXImageSegment> zeroFilledPart(const HXMapping &mapping, const Candidate &candidate) const;
+    std::optional<RVRegion> zeroFilledPart(const HXMapping &mapping, const Candidate &candidate) const;
 
     const HXAddressSpace &_addressSpace;
     const Pages _pages;
@@ -51,18 +51,18 @@ class Finder {
 };
 
 bool mapsCode(const HXMapping &mapping) {
-    const auto kind = static_cast<HXPathKind>(mapping.kind);
     return mapping.has(HXMappingExecutable) && !mapping.has(HXMappingShared) && mapping.isFile() &&
-           (kind == HXPathKind::file || kind == HXPathKind::deletedFile || kind == HXPathKind::memfd);
+           (mapping.kind == HXPathKind::file || mapping.kind == HXPathKind::deletedFile ||
+            mapping.kind == HXPathKind::memfd);
 }
 
 void Finder::findCandidates(const HXHeadersOfMapping &headersOf) {
     for (size_t i = 0; i < _addressSpace.count(); i++)
-        if (_addressSpace[i].kind == static_cast<uint8_t>(HXPathKind::stack))
+        if (_addressSpace[i].kind == HXPathKind::stack)
             _readableIsExecutable = _addressSpace[i].has(HXMappingExecutable);
     for (size_t i = 0; i < _addressSpace.count(); i++) {
         const HXMapping &mapping = _addressSpace[i];
-        if (mapping.kind == static_cast<uint8_t>(HXPathKind::vdso)) addVdso(mapping);
+        if (mapping.kind == HXPathKind::vdso) addVdso(mapping);
         if (!mapsCode(mapping)) continue;
         const HXElfHeaders *headers = headersOf(i);
         if (headers != nullptr) addCandidate(mapping, *headers);
@@ -73,8 +73,8 @@ void Finder::findCandidates(const HXHeadersOfMapping &headersOf) {
 }
 
 void Finder::addVdso(const HXMapping &mapping) {
-    HXLoadedImage image{
-        mapping.path, mapping.start, {{textName, mapping.start, mapping.end - mapping.start}}};
+    const RVRegion whole{kText, mapping.start, mapping.end - mapping.start};
+    HXLoadedImage image{_addressSpace.path(mapping.path).text, mapping.start, {whole}};
     _candidates.push_back({nullptr, 0, 0, 0, std::move(image), mapping.end});
 }
 
@@ -116,7 +116,7 @@ void Finder::addCandidate(const HXMapping &mapping, const HXElfHeaders &headers)
         const HXElfLoad &last = headers.loads.back();
         Candidate candidate{
             &headers, loadStart - _pages.down(load.address), mapping.device, mapping.inode, {}, 0};
-        candidate.image = {mapping.path, loadStart - distance, {}};
+        candidate.image = {_addressSpace.path(mapping.path).text, loadStart - distance, {}};
         candidate.end = candidate.bias + _pages.up(last.address + last.memorySize);
         if (candidate.end <= candidate.image.baseAddress) continue;
         const bool isKnown = std::any_of(_candidates.begin(), _candidates.end(), [&](const Candidate &other) {
@@ -143,7 +143,7 @@ void Finder::assignMappings() {
 }
 
 void Finder::assign(const HXMapping &mapping, Candidate *candidate) const {
-    HXImageSegment segment{nullptr, mapping.start, mapping.end - mapping.start};
+    RVRegion segment{nullptr, mapping.start, mapping.end - mapping.start};
     if (mapping.isFile()) {
         if (mapping.device == candidate->device && mapping.inode == candidate->inode)
             segment.name = nameInFile(mapping, *candidate);
@@ -170,13 +170,13 @@ const char *Finder::nameInFile(const HXMapping &mapping, const Candidate &candid
         const uint64_t loadEnd = _pages.up(load.address + load.fileSize);
         const bool fits = start >= loadStart && end <= loadEnd &&
                           mapping.offset - _pages.down(load.offset) == start - loadStart;
-        if (fits && load.executable) return textName;
+        if (fits && load.executable) return kText;
         // What is relocated is protected in whole pages; a mapping that goes further is not protected yet.
         if (fits && load.writable)
             return start >= _pages.down(headers.relocatedStart) && end <= _pages.down(headers.relocatedEnd)
-                       ? relocatedName
-                       : dataName;
-        if (fits) return afterCode ? constantsName : symbolsName;
+                       ? kRelocated
+                       : kData;
+        if (fits) return afterCode ? kConstants : kSymbols;
         afterCode = afterCode || load.executable;
     }
     // Code together with what is readable around it.
@@ -186,21 +186,20 @@ const char *Finder::nameInFile(const HXMapping &mapping, const Candidate &candid
         if (stretch.isCode && start >= loadStart &&
             end <= loadStart + (stretch.fileEnd - stretch.fileStart) &&
             mapping.offset - stretch.fileStart == start - loadStart)
-            return textName;
+            return kText;
     }
     return nullptr;
 }
 
-std::optional<HXImageSegment> Finder::zeroFilledPart(const HXMapping &mapping,
-                                                     const Candidate &candidate) const {
-    const auto kind = static_cast<HXPathKind>(mapping.kind);
-    if (mapping.has(HXMappingShared) || (kind != HXPathKind::none && kind != HXPathKind::namedAnonymous))
+std::optional<RVRegion> Finder::zeroFilledPart(const HXMapping &mapping, const Candidate &candidate) const {
+    if (mapping.has(HXMappingShared) ||
+        (mapping.kind != HXPathKind::none && mapping.kind != HXPathKind::namedAnonymous))
         return std::nullopt;
     for (const HXElfLoad &load : candidate.headers->loads) {
         const uint64_t start = candidate.bias + _pages.up(load.address + load.fileSize);
         const uint64_t end = candidate.bias + _pages.up(load.address + load.memorySize);
         if (mapping.start >= start && mapping.start < end)
-            return HXImageSegment{zeroFilledName, mapping.start, std::min(mapping.end, end) - mapping.start};
+            return RVRegion{kZeroFilled, mapping.start, std::min(mapping.end, end) - mapping.start};
     }
     return std::nullopt;
 }

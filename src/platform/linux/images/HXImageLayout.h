@@ -1,22 +1,19 @@
 // Finds the loaded images in an address space by the program headers of the files that it maps. Pure.
 #pragma once
 
+#include "platform/HXHostRecords.h"
 #include "platform/linux/images/HXElfHeaders.h"
 #include "platform/linux/memory/HXAddressSpace.h"
 
 #include <cstdint>
 #include <functional>
+#include <string>
 #include <vector>
 
-struct HXImageSegment {
-    const char *name; // lives for ever
-    uint64_t start;
-    uint64_t length; // bytes
-};
 struct HXLoadedImage {
-    uint32_t path; // index into the address space's paths
+    std::string path;
     uint64_t baseAddress;
-    std::vector<HXImageSegment> segments; // ascending, not overlapping
+    std::vector<RVRegion> segments; // ascending, not overlapping; their names live for ever
 };
 
 // The headers of the file that a mapping (by its index) maps; null when it is no image. They live on.

@@ -10,10 +10,10 @@ HXAddressSpace::HXAddressSpace() {
 }
 
 size_t HXAddressSpace::find(uint64_t address, size_t hint) const {
-    for (size_t index = hint; index < std::min(hint + 2, _count); index++)
+    for (size_t index = hint; index < std::min(hint + 2, count()); index++)
         if ((*this)[index].end > address && (index == 0 || (*this)[index - 1].end <= address)) return index;
     size_t low = 0;
-    size_t high = _count;
+    size_t high = count();
     while (low < high) {
         const size_t middle = low + (high - low) / 2;
         if ((*this)[middle].end > address)
@@ -25,17 +25,15 @@ size_t HXAddressSpace::find(uint64_t address, size_t hint) const {
 }
 
 void HXAddressSpace::append(HXMapping mapping) {
-    if (_count > 0) {
-        const uint64_t previousEnd = (*this)[_count - 1].end;
+    if (!_mappings.empty()) {
+        const uint64_t previousEnd = _mappings.back().end;
         if (mapping.end <= previousEnd) return;
         if (mapping.start < previousEnd) {
             if (mapping.isFile()) mapping.offset += previousEnd - mapping.start;
             mapping.start = previousEnd;
         }
     }
-    if (_count % chunkLength == 0)
-        _chunks.push_back(std::make_unique_for_overwrite<HXMapping[]>(chunkLength));
-    (*this)[_count++] = mapping;
+    _mappings.push_back(mapping);
 }
 
 namespace {

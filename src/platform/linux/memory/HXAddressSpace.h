@@ -8,11 +8,9 @@
 #include <cstddef>
 #include <cstdint>
 #include <deque>
-#include <memory>
 #include <string>
 #include <string_view>
 #include <unordered_map>
-#include <vector>
 
 // A path that mappings name; `text` is safe.
 struct HXMappedPath {
@@ -31,11 +29,9 @@ class HXAddressSpace {
     bool knowsDirtyPages = false;
     uint64_t ipcNamespace = 0; // read when there is System V memory
 
-    size_t count() const { return _count; }
-    HXMapping &operator[](size_t index) { return _chunks[index / chunkLength][index % chunkLength]; }
-    const HXMapping &operator[](size_t index) const {
-        return _chunks[index / chunkLength][index % chunkLength];
-    }
+    size_t count() const { return _mappings.size(); }
+    HXMapping &operator[](size_t index) { return _mappings[index]; }
+    const HXMapping &operator[](size_t index) const { return _mappings[index]; }
 
     // The index of the first mapping that ends above `address`; `count()` when there is none. `hint`: where
     // it is likely to be.
@@ -50,10 +46,7 @@ class HXAddressSpace {
     const HXMappedPath &path(uint32_t index) const { return _paths[index]; }
 
   private:
-    static constexpr size_t chunkLength = 256;
-
-    std::vector<std::unique_ptr<HXMapping[]>> _chunks;
-    size_t _count = 0;
+    std::deque<HXMapping> _mappings; // a million may come, which nobody should copy as they grow
     std::deque<HXMappedPath> _paths; // the first one is empty
     std::unordered_map<std::string, uint32_t> _pathIndexes;
     std::string _lastPath; // mappings of one file mostly follow each other

@@ -2,13 +2,13 @@
 
 #include "platform/linux/memory/HXMappedFile.h"
 #include "platform/linux/memory/HXPageScan.h"
+#include "platform/linux/memory/HXScanFigures.h"
+#include "platform/linux/memory/HXTaskFiles.h"
 #include "platform/linux/procfs/HXMapsParser.h"
 #include "platform/linux/procfs/HXProcFile.h"
-#include "platform/linux/procfs/HXProcText.h"
 #include "platform/linux/procfs/HXTextNumber.h"
 
-#include <unistd.h>
-
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
@@ -17,9 +17,7 @@ namespace {
 class Reader {
   public:
     Reader(const HXReadRequest &request, const HXReaderSetting &setting)
-        : _request(request), _setting(setting) {
-        _lookup.directory = request.directory;
-    }
+        : _request(request), _setting(setting), _lookup{request.process} {}
 
     std::unique_ptr<HXAddressSpace> read();
 
@@ -48,28 +46,15 @@ class Reader {
     bool _mayHoldHugePages = false;
 };
 
-std::optional<HXStatRecord> readStat(int directory) {
-    char buffer[2048];
-    const auto text = HXReadOnce(directory, "stat", buffer);
-    return text ? HXParseStat(*text) : std::nullopt;
-}
-
 kern_return_t errorOfOpening(int error) {
-    static constexpr struct {
-        int error;
-        kern_return_t answer;
-    } answers[] = {
-        {EMFILE, KERN_RESOURCE_SHORTAGE}, {ENFILE, KERN_RESOURCE_SHORTAGE}, {ENOMEM, KERN_RESOURCE_SHORTAGE},
-        {EACCES, KERN_NO_ACCESS},         {EPERM, KERN_NO_ACCESS},
-    };
-    for (const auto &entry : answers)
-        if (entry.error == error) return entry.answer;
-    return MACH_SEND_INVALID_DEST;
+    if (error == EACCES || error == EPERM) return KERN_NO_ACCESS;
+    const bool lacksResources = error == EMFILE || error == ENFILE || error == ENOMEM;
+    return lacksResources ? KERN_RESOURCE_SHORTAGE : MACH_SEND_INVALID_DEST;
 }
 
-uint64_t readIpcNamespace(int directory) {
+uint64_t readIpcNamespace(const HXDescriptor &process) {
     char buffer[64];
-    const auto link = HXReadLink(directory, "ns/ipc", buffer);
+    const auto link = HXReadLink(process, "ns/ipc", buffer);
     if (!link) return 0;
     HXTextCursor cursor{link->substr(std::min(link->find('[') + 1, link->size()))};
     uint64_t number = 0;
@@ -80,7 +65,7 @@ uint64_t readIpcNamespace(int directory) {
 // A file of an address space that is gone reads as empty; one that lives still has its first line.
 bool isAlive(const HXDescriptor &file) {
     char byte;
-    return ::pread(file.get(), &byte, 1, 0) > 0;
+    return file.readAt(0, &byte, sizeof byte) > 0;
 }
 
 std::unique_ptr<HXAddressSpace> Reader::read() {
@@ -89,14 +74,14 @@ std::unique_ptr<HXAddressSpace> Reader::read() {
         _addressSpace->knowsDirtyPages = true;
     }
     if (_addressSpace->count() > 0 && (!_sawStack || !isSingleThreaded()))
-        HXTagThreadStacks(_request.directory, _addressSpace.get());
+        HXTagThreadStacks(_request.process, _addressSpace.get());
     return std::move(_addressSpace);
 }
 
 // Locked mappings and dirty file pages show in smaps alone; pages of the huge-page pool are left to it, too.
 bool Reader::mapsMaySuffice() {
     if (!_setting.mayScan || _request.needsDirtyPages || !HXPageScan::isComplete()) return false;
-    if (!_request.status) _request.status = HXReadStatus(_request.directory);
+    if (!_request.status) _request.status = HXReadStatus(_request.process);
     if (!_request.status) return false;
     const HXStatusRecord &status = *_request.status;
     return status.lockedSize.value_or(0) == 0 && status.hugePageSize.value_or(0) == 0;
@@ -105,7 +90,7 @@ bool Reader::mapsMaySuffice() {
 bool Reader::readMapsAndScan() {
     const HXDescriptor maps = readFile("maps");
     if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return true;
-    if (!mapsSuffice() || !HXScanFigures(_request.directory, _setting.pageShift,
+    if (!mapsSuffice() || !HXScanFigures(_request.process, _setting.pageShift,
                                          _request.status->swapSize.value_or(0), _addressSpace.get()))
         return false;
     // If the process executed another program before its page tables were opened, those are not of this.
@@ -122,13 +107,14 @@ bool Reader::mapsSuffice() const {
 }
 
 // Whether the process holds lazily freed pages, which look like others in the page tables; also true where
-// smaps costs less than to find out.
+// smaps costs less than to find out. Both walk all pages for that, so that the time goes with the pages, and
+// only what smaps writes for each mapping, as long as looking at some hundred pages, can be saved.
 bool Reader::hasFreedLazily() const {
     constexpr uint64_t fewPagesPerMapping = 128;
     const uint64_t pages = _request.status->residentSize.value_or(0) >> _setting.pageShift;
     if (pages > fewPagesPerMapping * _addressSpace->count()) return true;
-    char buffer[4096];
-    const auto text = HXReadOnce(_request.directory, "smaps_rollup", buffer);
+    char buffer[4096]; // of some 25 lines
+    const auto text = HXReadOnce(_request.process.get(), "smaps_rollup", buffer);
     return !text || HXParseLabelled(*text, "LazyFree:").value_or(1) != 0;
 }
 
@@ -136,7 +122,7 @@ bool Reader::hasFreedLazily() const {
 HXDescriptor Reader::readFile(const char *name) {
     _addressSpace = std::make_unique<HXAddressSpace>();
     _readFailed = _sawStack = _sawGate = _sawSwapBacked = _mayHoldHugePages = false;
-    HXDescriptor file = HXOpenAt(_request.directory, name);
+    HXDescriptor file = HXOpenAt(_request.process.get(), name);
     if (!file) {
         _addressSpace->endError = errorOfOpening(errno);
         return file;
@@ -178,7 +164,7 @@ void Reader::take(const HXMapsEntry &entry) {
     if (path.kind == HXPathKind::stack) _sawStack = true;
     if (path.kind == HXPathKind::special && path.text == "[vsyscall]") _sawGate = true;
     if (path.kind == HXPathKind::systemV && _addressSpace->ipcNamespace == 0)
-        _addressSpace->ipcNamespace = readIpcNamespace(_request.directory);
+        _addressSpace->ipcNamespace = readIpcNamespace(_request.process);
     _addressSpace->append(mapping);
 }
 
@@ -196,9 +182,9 @@ HXFileSystemKind Reader::fileSystemOf(const HXMapping &mapping, const HXMappedPa
 // Whether a path on a devtmpfs leads to a device (what its driver maps is no tmpfs page) and not to a plain
 // file.
 bool Reader::isDeviceFile(const HXMapping &mapping, const HXMappedPath &path) const {
-    HXDescriptor place = HXLocateMapped(_request.directory, mapping);
-    if (!place) place = HXLocateBelowRoot(_request.directory, path.text);
-    return !place || !HXIsMappedFile(mapping, place.get());
+    HXDescriptor place = HXLocateMapped(_request.process, mapping);
+    if (!place) place = HXLocateBelowRoot(_request.process, path.text);
+    return !place || !HXIsMappedFile(mapping, place);
 }
 
 // By the path and the file system, which is all that maps tells of the huge-page pool.
@@ -214,13 +200,13 @@ kern_return_t Reader::endError(const HXDescriptor &file) const {
     if (_sawGate) return KERN_INVALID_ADDRESS;
     if (isAlive(file)) return KERN_INVALID_ADDRESS;
     if (_addressSpace->count() > 0) return MACH_SEND_INVALID_DEST;
-    const auto stat = readStat(_request.directory);
+    const auto stat = HXReadStat(_request.process);
     return stat && !stat->isZombie() ? KERN_INVALID_ADDRESS : MACH_SEND_INVALID_DEST;
 }
 
 bool Reader::isSingleThreaded() const {
-    if (_request.status) return _request.status->threadCount <= 1;
-    const auto stat = readStat(_request.directory);
+    if (_request.status) return _request.status->threadCount.value_or(1) <= 1;
+    const auto stat = HXReadStat(_request.process);
     return !stat || stat->threadCount <= 1;
 }
 

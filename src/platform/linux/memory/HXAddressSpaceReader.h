@@ -23,7 +23,7 @@ struct HXReaderSetting {
 
 // What a reader of one process knows and wants.
 struct HXReadRequest {
-    int directory;                                  // of the process in /proc
+    const HXDescriptor &process;                    // its directory in /proc
     std::optional<HXStatusRecord> status;           // where it has been read already
     bool needsDirtyPages = true;                    // HXMapping::dirtyPages
     std::chrono::steady_clock::time_point opened{}; // when the process was
@@ -34,13 +34,6 @@ struct HXReadRequest {
 std::unique_ptr<HXAddressSpace> HXReadAddressSpace(const HXReadRequest &request,
                                                    const HXReaderSetting &setting);
 
-// Reads and parses the status of a process; none with errno set, as for a text that is cut.
-std::optional<HXStatusRecord> HXReadStatus(int directory);
-
-// Counts the resident and swapped pages of all mappings by the process's page tables. False when they cannot
-// tell: `swappedSize`, what the kernel has counted, is not what is found.
-bool HXScanFigures(int directory, uint32_t pageShift, uint64_t swappedSize, HXAddressSpace *addressSpace);
-
 // Gives the mappings that hold the stack pointers of threads the user tag of stacks. Threads that keep
 // running, and those beyond the first few thousand, are left out.
-void HXTagThreadStacks(int directory, HXAddressSpace *addressSpace);
+void HXTagThreadStacks(const HXDescriptor &process, HXAddressSpace *addressSpace);

@@ -2,7 +2,6 @@
 #pragma once
 
 #include <cstdint>
-#include <string_view>
 
 enum class HXFileSystemKind : uint8_t {
     unknown,
@@ -13,6 +12,3 @@ enum class HXFileSystemKind : uint8_t {
     deviceNodes, // devtmpfs: a tmpfs of device files, whose mappings need not be its pages
     hugePages,   // hugetlbfs
 };
-
-// The kind of a file system type as mountinfo names it.
-HXFileSystemKind HXFileSystemKindOf(std::string_view type);

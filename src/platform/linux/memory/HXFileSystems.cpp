@@ -9,14 +9,41 @@
 
 #include <string>
 
+namespace {
+
+// The kind of a file system type as mountinfo names it.
+HXFileSystemKind kindOfType(std::string_view type) {
+    using Kind = HXFileSystemKind;
+    // A type that is not listed is taken for one that may hang.
+    static constexpr struct {
+        std::string_view type;
+        Kind kind;
+    } known[] = {
+        {"tmpfs", Kind::swapBacked}, {"devtmpfs", Kind::deviceNodes}, {"hugetlbfs", Kind::hugePages},
+        {"ext4", Kind::local},       {"ext3", Kind::local},           {"ext2", Kind::local},
+        {"xfs", Kind::local},        {"btrfs", Kind::local},          {"overlay", Kind::layered},
+        {"f2fs", Kind::local},       {"squashfs", Kind::local},       {"erofs", Kind::local},
+        {"zfs", Kind::local},        {"bcachefs", Kind::local},       {"jfs", Kind::local},
+        {"reiserfs", Kind::local},   {"nilfs2", Kind::local},         {"vfat", Kind::local},
+        {"exfat", Kind::local},      {"ntfs3", Kind::local},          {"iso9660", Kind::local},
+        {"udf", Kind::local},        {"ramfs", Kind::local},          {"rootfs", Kind::local},
+        {"aufs", Kind::layered},     {"ubifs", Kind::local},          {"cramfs", Kind::local},
+    };
+    for (const auto &entry : known)
+        if (entry.type == type) return entry.kind;
+    return Kind::remote;
+}
+
+} // namespace
+
 uint32_t HXFileSystems::sharedMemoryDevice() {
-    const uint32_t device = _sharedMemoryDevice.load(std::memory_order_relaxed);
-    if (device != UINT32_MAX || _lookedForSharedMemory.load(std::memory_order_acquire)) return device;
-    const HXDescriptor file(::memfd_create("", MFD_CLOEXEC));
-    struct stat status;
-    if (file && ::fstat(file.get(), &status) == 0)
-        _sharedMemoryDevice = HXDeviceNumber(major(status.st_dev), minor(status.st_dev));
-    _lookedForSharedMemory.store(true, std::memory_order_release);
+    std::call_once(_sharedMemoryOnce, [this] {
+        if (_sharedMemoryDevice != UINT32_MAX) return;
+        const HXDescriptor file(::memfd_create("", MFD_CLOEXEC));
+        struct stat status;
+        if (file && ::fstat(file.get(), &status) == 0)
+            _sharedMemoryDevice = HXDeviceNumber(major(status.st_dev), minor(status.st_dev));
+    });
     return _sharedMemoryDevice;
 }
 
@@ -31,14 +58,14 @@ HXFileSystemKind HXFileSystems::kindOf(uint32_t device, HXFileSystemLookup *look
     HXFileSystemKind kind = known(device);
     if (kind == HXFileSystemKind::unknown && !lookup->readMounts) {
         lookup->readMounts = true;
-        readMounts(lookup->directory, "mountinfo");
+        readMounts(lookup->process, "mountinfo");
         kind = known(device);
     }
     if (kind == HXFileSystemKind::unknown) {
         // The file may have come from another mount namespace.
         std::call_once(_commonMountsOnce, [&] {
-            readMounts(lookup->directory, "../1/mountinfo");
-            readMounts(lookup->directory, "../self/mountinfo");
+            readMounts(lookup->process, "../1/mountinfo");
+            readMounts(lookup->process, "../self/mountinfo");
         });
         kind = known(device);
     }
@@ -49,12 +76,12 @@ HXFileSystemKind HXFileSystems::kindOf(uint32_t device, HXFileSystemLookup *look
     return kind;
 }
 
-void HXFileSystems::readMounts(int directory, const char *name) {
-    constexpr size_t limit = 16 << 20;
-    const auto text = HXReadText(directory, name, limit);
+void HXFileSystems::readMounts(const HXDescriptor &process, const char *name) {
+    constexpr size_t limit = 16 << 20; // 100000 mounts, as many as a namespace may have (fs.mount-max)
+    const auto text = HXReadText(process, name, limit);
     if (!text) return;
     const std::unique_lock lock(_mutex);
     HXParseMountInfo(*text, [this](uint32_t device, std::string_view type) {
-        _kinds.try_emplace(device, HXFileSystemKindOf(type));
+        _kinds.try_emplace(device, kindOfType(type));
     });
 }

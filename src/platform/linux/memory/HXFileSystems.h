@@ -3,8 +3,8 @@
 #pragma once
 
 #include "platform/linux/memory/HXFileSystemKind.h"
+#include "platform/linux/procfs/HXDescriptor.h"
 
-#include <atomic>
 #include <cstdint>
 #include <mutex>
 #include <shared_mutex>
@@ -12,7 +12,7 @@
 
 // What one process's mappings need of file systems; belongs to the reading of one address space.
 struct HXFileSystemLookup {
-    int directory = -1; // of the process in /proc
+    const HXDescriptor &process; // its directory in /proc
     bool readMounts = false;
     uint32_t lastDevice = UINT32_MAX;
     HXFileSystemKind lastKind = HXFileSystemKind::unknown;
@@ -30,11 +30,11 @@ class HXFileSystems {
     HXFileSystemKind kindOf(uint32_t device, HXFileSystemLookup *lookup);
 
   private:
-    void readMounts(int directory, const char *name);
+    void readMounts(const HXDescriptor &process, const char *name);
     HXFileSystemKind known(uint32_t device) const;
 
-    std::atomic<uint32_t> _sharedMemoryDevice;
-    std::atomic<bool> _lookedForSharedMemory = false;
+    std::once_flag _sharedMemoryOnce;
+    uint32_t _sharedMemoryDevice;
     mutable std::shared_mutex _mutex;
     std::unordered_map<uint32_t, HXFileSystemKind> _kinds;
     std::once_flag _commonMountsOnce;

@@ -1,9 +1,13 @@
 #include "platform/linux/memory/HXLinuxTask.h"
 
+#include "platform/linux/memory/HXTaskFiles.h"
+
+#include <mutex>
+
 const HXAddressSpace &HXLinuxTask::addressSpace(const HXReaderSetting &setting, bool needsDirtyPages) {
     if (!_addressSpace || (needsDirtyPages && !_addressSpace->knowsDirtyPages)) {
-        _addressSpace = HXReadAddressSpace({directory(), _status, needsDirtyPages, _opened}, setting);
-        _pages.reset();
+        _addressSpace = HXReadAddressSpace({_directory, _status, needsDirtyPages, _opened}, setting);
+        _pages.emplace(_directory, setting.pageShift);
     }
     return *_addressSpace;
 }
@@ -16,57 +20,38 @@ size_t HXLinuxTask::find(uint64_t address) {
 std::optional<HXStatusRecord> HXLinuxTask::status(StatusUse use) {
     bool &used = _used[use == StatusUse::ledger];
     if (!_status || used) {
-        _status = HXReadStatus(directory());
+        _status = HXReadStatus(_directory);
         _used[0] = _used[1] = false;
     }
     used = true;
     return _status;
 }
 
-HXTaskTable::~HXTaskTable() {
-    for (auto &slot : _chunks) {
-        const std::unique_ptr<Chunk> chunk(slot.load());
-        if (!chunk) break;
-        for (auto &task : *chunk)
-            delete task.load();
-    }
-}
-
 uint32_t HXTaskTable::add(std::unique_ptr<HXLinuxTask> task) {
-    const std::lock_guard lock(_mutex);
-    if (_count == chunkLength * chunkCount) return 0;
-    const uint32_t index = _count++;
-    std::atomic<Chunk *> &slot = _chunks[index / chunkLength];
-    if (slot.load() == nullptr) slot = std::make_unique<Chunk>().release();
-    _portsByPid[task->pid()] = firstPort + index;
-    (*slot.load())[index % chunkLength].store(task.release(), std::memory_order_release);
-    return firstPort + index;
-}
-
-HXLinuxTask *HXTaskTable::find(uint32_t port) const {
-    const uint32_t index = port - firstPort;
-    if (port < firstPort || index >= chunkLength * chunkCount) return nullptr;
-    const Chunk *chunk = _chunks[index / chunkLength].load(std::memory_order_acquire);
-    return chunk == nullptr ? nullptr : (*chunk)[index % chunkLength].load(std::memory_order_acquire);
+    const std::unique_lock lock(_mutex);
+    const uint32_t port = _nextPort++;
+    _portsByPid[task->pid()] = port;
+    _tasks[port] = std::move(task);
+    return port;
 }
 
 void HXTaskTable::remove(uint32_t port) {
-    const std::lock_guard lock(_mutex);
-    const std::unique_ptr<HXLinuxTask> task(find(port));
-    if (!task) return;
-    const uint32_t index = port - firstPort;
-    (*_chunks[index / chunkLength].load())[index % chunkLength] = nullptr;
-    const auto found = _portsByPid.find(task->pid());
-    if (found != _portsByPid.end() && found->second == port) _portsByPid.erase(found);
+    const std::unique_lock lock(_mutex);
+    const auto found = _tasks.find(port);
+    if (found == _tasks.end()) return;
+    const auto byPid = _portsByPid.find(found->second->pid());
+    if (byPid != _portsByPid.end() && byPid->second == port) _portsByPid.erase(byPid);
+    _tasks.erase(found);
+}
+
+HXLinuxTask *HXTaskTable::find(uint32_t port) const {
+    const std::shared_lock lock(_mutex);
+    const auto found = _tasks.find(port);
+    return found == _tasks.end() ? nullptr : found->second.get();
 }
 
 HXLinuxTask *HXTaskTable::findByPid(int32_t pid) const {
-    uint32_t port;
-    {
-        const std::lock_guard lock(_mutex);
-        const auto found = _portsByPid.find(pid);
-        if (found == _portsByPid.end()) return nullptr;
-        port = found->second;
-    }
-    return find(port);
+    const std::shared_lock lock(_mutex);
+    const auto found = _portsByPid.find(pid);
+    return found == _portsByPid.end() ? nullptr : _tasks.at(found->second).get();
 }

@@ -12,28 +12,28 @@
 #include <cstdio>
 
 // Never waits for a server: the attributes may be old ones, but not the identity.
-bool HXIsMappedFile(const HXMapping &mapping, int descriptor) {
+bool HXIsMappedFile(const HXMapping &mapping, const HXDescriptor &place) {
     struct statx status;
-    if (::statx(descriptor, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_TYPE | STATX_INO, &status) != 0)
+    if (::statx(place.get(), "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_TYPE | STATX_INO, &status) != 0)
         return false;
     // The device is not compared: file systems with subvolumes tell another one here than in maps.
     return S_ISREG(status.stx_mode) && status.stx_ino == mapping.inode;
 }
 
-HXDescriptor HXLocateMapped(int directory, const HXMapping &mapping) {
+HXDescriptor HXLocateMapped(const HXDescriptor &process, const HXMapping &mapping) {
     char name[64];
     std::snprintf(name, sizeof name, "map_files/%" PRIx64 "-%" PRIx64, mapping.start, mapping.end);
-    return HXDescriptor(::openat(directory, name, O_PATH | O_CLOEXEC));
+    return HXOpenAt(process, name, O_PATH);
 }
 
-HXDescriptor HXLocateBelowRoot(int directory, const std::string &path) {
+HXDescriptor HXLocateBelowRoot(const HXDescriptor &process, const std::string &path) {
     if (path.empty() || path.front() != '/') return {};
-    const HXDescriptor root(::openat(directory, "root", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    const HXDescriptor root = HXOpenAt(process, "root", O_PATH | O_DIRECTORY);
     if (!root) return {};
     open_how how{};
     how.flags = O_PATH | O_CLOEXEC | O_NOFOLLOW;
     how.resolve = RESOLVE_CACHED | RESOLVE_NO_MAGICLINKS | RESOLVE_IN_ROOT;
-    // A change anywhere in the cache may make the kernel give up (openat2(2)).
+    // A change anywhere in the cache may make the kernel give up (openat2(2)), seldom twice in a row.
     constexpr int tries = 3;
     for (int i = 0; i < tries; i++) {
         HXDescriptor file(
@@ -48,9 +48,9 @@ HXDescriptor HXOpenLocated(const HXDescriptor &place) {
     return HXOpenAt(AT_FDCWD, name.c_str());
 }
 
-HXDescriptor HXOpenMappedFile(int directory, const HXMapping &mapping) {
-    const HXDescriptor place = HXLocateMapped(directory, mapping);
+HXDescriptor HXOpenMappedFile(const HXDescriptor &process, const HXMapping &mapping) {
+    const HXDescriptor place = HXLocateMapped(process, mapping);
     // Opening a device may do anything.
-    if (!place || !HXIsMappedFile(mapping, place.get())) return {};
+    if (!place || !HXIsMappedFile(mapping, place)) return {};
     return HXOpenLocated(place);
 }

@@ -1,4 +1,5 @@
-// Finding and opening the file that a mapping maps, without waiting for a file system.
+// Finding and opening the file that a mapping maps, without waiting for a file system. `process`: its
+// directory in /proc.
 #pragma once
 
 #include "platform/linux/memory/HXMapping.h"
@@ -7,17 +8,17 @@
 #include <string>
 
 // Whether a descriptor (of any kind) is of the plain file that the mapping maps.
-bool HXIsMappedFile(const HXMapping &mapping, int descriptor);
+bool HXIsMappedFile(const HXMapping &mapping, const HXDescriptor &place);
 
 // A descriptor that only names what the mapping maps, which may be a device; not open without the right to.
-HXDescriptor HXLocateMapped(int directory, const HXMapping &mapping);
+HXDescriptor HXLocateMapped(const HXDescriptor &process, const HXMapping &mapping);
 
 // A descriptor that only names `path` below the root of the process, if the kernel has all of it in its
 // cache, as it has the path of every mapped file.
-HXDescriptor HXLocateBelowRoot(int directory, const std::string &path);
+HXDescriptor HXLocateBelowRoot(const HXDescriptor &process, const std::string &path);
 
 // Opens a plain file for reading that has been located and checked.
 HXDescriptor HXOpenLocated(const HXDescriptor &place);
 
 // Opens the plain file that a mapping maps; not open without the right to.
-HXDescriptor HXOpenMappedFile(int directory, const HXMapping &mapping);
+HXDescriptor HXOpenMappedFile(const HXDescriptor &process, const HXMapping &mapping);

@@ -3,6 +3,23 @@
 
 #include <cstdint>
 
+// What the path column of maps says.
+enum class HXPathKind : uint8_t {
+    none,
+    file,
+    deletedFile,     // FILE (deleted)
+    heap,            // [heap]
+    stack,           // [stack]
+    vdso,            // [vdso]
+    special,         // other names in brackets
+    namedAnonymous,  // [anon:NAME]
+    namedShared,     // [anon_shmem:NAME]
+    sharedAnonymous, // /dev/zero (deleted)
+    systemV,         // /SYSVKEY (deleted)
+    memfd,           // /memfd:NAME (deleted)
+    anonymousHuge,   // /anon_hugepage (deleted)
+};
+
 enum HXMappingFlag : uint16_t {
     HXMappingReadable = 1 << 0,
     HXMappingWritable = 1 << 1,
@@ -35,8 +52,8 @@ struct HXMapping {
     uint32_t dirtyPages = 0; // Shared_Dirty and Private_Dirty
     uint32_t hugePages = 0;  // Shared_Hugetlb and Private_Hugetlb, in base pages
     uint16_t flags = 0;      // HXMappingFlag
-    uint8_t kind = 0;        // HXPathKind
-    uint8_t tag = 0;         // user tag
+    HXPathKind kind = HXPathKind::none;
+    uint8_t tag = 0; // user tag
 
     // Of a file or a shared object. An inode number may be 0: System V memory's is its identifier.
     bool isFile() const { return device != 0 || inode != 0; }

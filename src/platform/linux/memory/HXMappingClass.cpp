@@ -6,9 +6,9 @@
 
 namespace {
 
-constexpr std::string_view deletedSuffix = " (deleted)";
-constexpr std::string_view anonymousPrefix = "[anon:";
-constexpr std::string_view sharedPrefix = "[anon_shmem:";
+constexpr std::string_view kDeletedSuffix = " (deleted)";
+constexpr std::string_view kAnonymousPrefix = "[anon:";
+constexpr std::string_view kSharedPrefix = "[anon_shmem:";
 
 // Finaliser of a 64-bit linear generator; every bit of the result depends on every bit of the value.
 uint64_t mix(uint64_t value) {
@@ -32,7 +32,11 @@ bool isAccessible(const HXMapping &mapping) {
 
 bool isPrivateAnonymous(const HXMapping &mapping) {
     if (mapping.has(HXMappingShared)) return false;
-    return !mapping.isFile() || mapping.kind == static_cast<uint8_t>(HXPathKind::anonymousHuge);
+    return !mapping.isFile() || mapping.kind == HXPathKind::anonymousHuge;
+}
+
+uint64_t residentPages(const HXMapping &mapping) {
+    return uint64_t{mapping.residentPages} + mapping.hugePages;
 }
 
 uint32_t saturated(uint64_t pages) {
@@ -43,13 +47,40 @@ uint64_t difference(uint64_t whole, uint64_t part) {
     return whole - std::min(whole, part);
 }
 
-uint8_t tagOf(const HXMapping &mapping, HXPathKind kind, uint8_t namedTag) {
-    if (kind == HXPathKind::stack) return HXHostTagStack;
+// Resident pages that the kernel cannot drop without swapping, and that go with their last mapping. Lazily
+// freed pages are not among them.
+uint64_t chargedPages(const HXMapping &mapping) {
+    uint64_t pages = difference(mapping.anonymousPages, mapping.lazyFreePages) + mapping.hugePages;
+    if (mapping.has(HXMappingSwapBacked)) pages += difference(mapping.residentPages, mapping.anonymousPages);
+    return pages;
+}
+
+// Whether a private mapping holds pages of its own.
+bool holdsOwnPages(const HXMapping &mapping) {
+    if (mapping.has(HXMappingShared) || mapping.kind == HXPathKind::vdso) return false;
+    return isPrivateAnonymous(mapping) || mapping.anonymousPages > 0 || mapping.swappedPages > 0 ||
+           mapping.hugePages > 0;
+}
+
+// Never 0 or all ones.
+uint64_t objectIdentifier(const HXMapping &mapping, const HXRegionContext &context) {
+    if (holdsOwnPages(mapping))
+        return identifier(mappingClass, static_cast<uint32_t>(context.pid), mapping.start);
+    if (mapping.kind == HXPathKind::vdso) return identifier(vdsoClass, 0, mapping.end - mapping.start);
+    // System V memory's inode number is its identifier, which says nothing outside its namespace and which
+    // other shared memory may have, too.
+    if (mapping.kind == HXPathKind::systemV)
+        return identifier(systemVClass, context.ipcNamespace, mapping.inode ^ uint64_t{mapping.device} << 32);
+    return identifier(fileClass, mapping.device, mapping.inode);
+}
+
+uint8_t tagOf(const HXMapping &mapping, uint8_t namedTag) {
+    if (mapping.kind == HXPathKind::stack) return HXHostTagStack;
     if (!isAccessible(mapping)) return HXHostTagGuard;
     if (namedTag != 0) return namedTag;
     const bool huge = mapping.has(HXMappingHugePages);
     const bool anonymous = mapping.has(HXMappingShared) || mapping.isFile();
-    switch (kind) {
+    switch (mapping.kind) {
     case HXPathKind::heap:
         return HXHostTagHeap;
     case HXPathKind::systemV:
@@ -57,9 +88,9 @@ uint8_t tagOf(const HXMapping &mapping, HXPathKind kind, uint8_t namedTag) {
     case HXPathKind::memfd:
         return HXHostTagMemfd;
     case HXPathKind::deletedFile:
-        if (!huge && !mapping.has(HXMappingSwapBacked)) return 0;
-        if (!huge) return HXHostTagDeletedSharedMemory;
-        break;
+        if (huge) break;
+        if (mapping.has(HXMappingSwapBacked)) return HXHostTagDeletedSharedMemory;
+        return 0;
     case HXPathKind::file:
         if (mapping.has(HXMappingHasPager)) return 0;
         break;
@@ -77,24 +108,24 @@ bool isNamelessSharedMemory(HXPathKind kind) {
            kind == HXPathKind::namedShared || kind == HXPathKind::anonymousHuge;
 }
 
-bool hasPager(const HXMapping &mapping, HXPathKind kind) {
-    if (!mapping.isFile() || isNamelessSharedMemory(kind)) return false;
-    const bool nameIsGone = kind == HXPathKind::deletedFile;
+bool hasPager(const HXMapping &mapping) {
+    if (!mapping.isFile() || isNamelessSharedMemory(mapping.kind)) return false;
+    const bool nameIsGone = mapping.kind == HXPathKind::deletedFile;
     return !(nameIsGone && mapping.has(HXMappingSwapBacked | HXMappingHugePages));
 }
 
 uint8_t shareModeOf(const HXMapping &mapping) {
-    if (!isAccessible(mapping) && HXResidentPages(mapping) == 0 && mapping.swappedPages == 0) return SM_EMPTY;
+    if (!isAccessible(mapping) && residentPages(mapping) == 0 && mapping.swappedPages == 0) return SM_EMPTY;
     if (mapping.has(HXMappingShared)) return SM_SHARED;
-    if (mapping.kind == static_cast<uint8_t>(HXPathKind::vdso)) return SM_COW;
+    if (mapping.kind == HXPathKind::vdso) return SM_COW;
     return isPrivateAnonymous(mapping) ? SM_PRIVATE : SM_COW;
 }
 
 uint32_t reportedDirtyPages(const HXMapping &mapping, bool reportsCharge) {
-    if (reportsCharge) return saturated(HXChargedPages(mapping));
+    if (reportsCharge) return saturated(chargedPages(mapping));
     if (mapping.has(HXMappingHasPager) && !mapping.has(HXMappingSwapBacked | HXMappingHugePages))
         return mapping.dirtyPages;
-    return saturated(HXResidentPages(mapping));
+    return saturated(residentPages(mapping));
 }
 
 int32_t protectionOf(const HXMapping &mapping, uint16_t read, uint16_t write, uint16_t execute) {
@@ -111,11 +142,11 @@ HXPathKind HXPathKindOf(std::string_view path) {
         // Kernels before 4.5 tell the stacks of threads as [stack:TID].
         if (path == "[stack]" || path.starts_with("[stack:")) return HXPathKind::stack;
         if (path == "[vdso]") return HXPathKind::vdso;
-        if (path.starts_with(anonymousPrefix)) return HXPathKind::namedAnonymous;
-        if (path.starts_with(sharedPrefix)) return HXPathKind::namedShared;
+        if (path.starts_with(kAnonymousPrefix)) return HXPathKind::namedAnonymous;
+        if (path.starts_with(kSharedPrefix)) return HXPathKind::namedShared;
         return HXPathKind::special;
     }
-    if (!path.ends_with(deletedSuffix)) return HXPathKind::file;
+    if (!path.ends_with(kDeletedSuffix)) return HXPathKind::file;
     if (path == "/dev/zero (deleted)") return HXPathKind::sharedAnonymous;
     if (path == "/anon_hugepage (deleted)") return HXPathKind::anonymousHuge;
     if (path.starts_with("/SYSV")) return HXPathKind::systemV;
@@ -125,7 +156,7 @@ HXPathKind HXPathKindOf(std::string_view path) {
 
 std::string_view HXGivenName(std::string_view path) {
     if (!path.ends_with(']')) return {};
-    for (const std::string_view prefix : {anonymousPrefix, sharedPrefix})
+    for (const std::string_view prefix : {kAnonymousPrefix, kSharedPrefix})
         if (path.starts_with(prefix)) return path.substr(prefix.size(), path.size() - prefix.size() - 1);
     return {};
 }
@@ -135,35 +166,11 @@ void HXClassifyMapping(HXPathKind kind, HXFileSystemKind fileSystem, uint32_t sh
     const bool huge = mapping->has(HXMappingHugePages);
     const bool kernelsOwn = mapping->isFile() && mapping->device == sharedMemoryDevice;
     if (isNamelessSharedMemory(kind) && !kernelsOwn && !huge) kind = HXPathKind::deletedFile;
-    mapping->kind = static_cast<uint8_t>(kind);
+    mapping->kind = kind;
     if (!huge && (kernelsOwn || (mapping->isFile() && fileSystem == HXFileSystemKind::swapBacked)))
         mapping->flags |= HXMappingSwapBacked;
-    if (hasPager(*mapping, kind)) mapping->flags |= HXMappingHasPager;
-    mapping->tag = tagOf(*mapping, kind, namedTag);
-}
-
-uint64_t HXChargedPages(const HXMapping &mapping) {
-    uint64_t pages = difference(mapping.anonymousPages, mapping.lazyFreePages) + mapping.hugePages;
-    if (mapping.has(HXMappingSwapBacked)) pages += difference(mapping.residentPages, mapping.anonymousPages);
-    return pages;
-}
-
-bool HXHoldsOwnPages(const HXMapping &mapping) {
-    if (mapping.has(HXMappingShared) || mapping.kind == static_cast<uint8_t>(HXPathKind::vdso)) return false;
-    return isPrivateAnonymous(mapping) || mapping.anonymousPages > 0 || mapping.swappedPages > 0 ||
-           mapping.hugePages > 0;
-}
-
-uint64_t HXObjectIdentifier(const HXMapping &mapping, const HXRegionContext &context) {
-    const auto kind = static_cast<HXPathKind>(mapping.kind);
-    if (HXHoldsOwnPages(mapping))
-        return identifier(mappingClass, static_cast<uint32_t>(context.pid), mapping.start);
-    if (kind == HXPathKind::vdso) return identifier(vdsoClass, 0, mapping.end - mapping.start);
-    // System V memory's inode number is its identifier, which says nothing outside its namespace and which
-    // other shared memory may have, too.
-    if (kind == HXPathKind::systemV)
-        return identifier(systemVClass, context.ipcNamespace, mapping.inode ^ uint64_t{mapping.device} << 32);
-    return identifier(fileClass, mapping.device, mapping.inode);
+    if (hasPager(*mapping)) mapping->flags |= HXMappingHasPager;
+    mapping->tag = tagOf(*mapping, namedTag);
 }
 
 vm_region_submap_info_64 HXRegionInfo(const HXMapping &mapping, const HXRegionContext &context) {
@@ -174,7 +181,7 @@ vm_region_submap_info_64 HXRegionInfo(const HXMapping &mapping, const HXRegionCo
     info.inheritance = mapping.has(HXMappingNotInherited) ? inheritNone : inheritCopy;
     info.offset = isPrivateAnonymous(mapping) ? 0 : mapping.offset;
     info.user_tag = mapping.tag;
-    info.pages_resident = saturated(HXResidentPages(mapping));
+    info.pages_resident = saturated(residentPages(mapping));
     info.pages_swapped_out = mapping.swappedPages;
     info.pages_dirtied = reportedDirtyPages(mapping, context.reportsCharge);
     info.ref_count = 1;
@@ -182,7 +189,7 @@ vm_region_submap_info_64 HXRegionInfo(const HXMapping &mapping, const HXRegionCo
     info.share_mode = shareModeOf(mapping);
     info.user_wired_count = mapping.has(HXMappingLocked | HXMappingHugePages) ? 1 : 0;
     info.pages_reusable = mapping.lazyFreePages;
-    info.object_id_full = HXObjectIdentifier(mapping, context);
+    info.object_id_full = objectIdentifier(mapping, context);
     info.object_id = static_cast<uint32_t>(info.object_id_full ^ info.object_id_full >> 32);
     if (info.object_id == 0) info.object_id = 1;
     return info;

@@ -17,44 +17,35 @@ struct HXPagesLeft {
     uint64_t lazyFree = 0;
 };
 
-// The disposition (VM_PAGE_QUERY_… bits) of a page of `mapping`; takes it off `left`. The dispositions of a
-// mapping's pages, asked for in order, add up to the figures of the mapping.
-int32_t HXPageDisposition(const HXMapping &mapping, uint8_t facts, HXPagesLeft *left);
-
 // Reads the pages of one process; one thread at a time.
 class HXPageReader {
   public:
-    // `directory`: the process's in /proc; it outlives this.
-    HXPageReader(int directory, uint32_t pageShift) : _directory(directory), _pageShift(pageShift) {}
+    // `process`: its directory in /proc; it outlives this.
+    HXPageReader(const HXDescriptor &process, uint32_t pageShift)
+        : _process(process), _pageShift(pageShift) {}
 
-    // The dispositions of the pages from `address` on, which lies on a page's border. KERN_INVALID_ADDRESS
+    // The dispositions (VM_PAGE_QUERY_… bits) of the pages from `address` on, which lies on a page's border;
+    // those of all pages of a mapping add up to its figures. KERN_INVALID_ADDRESS
     // when a page lies in no mapping, KERN_INVALID_ARGUMENT when the process is gone or executes another
     // program.
     kern_return_t query(const HXAddressSpace &addressSpace, uint64_t address,
                         std::span<int32_t> dispositions);
 
-    // Forgets what has been read, for an address space that has been read anew.
-    void reset();
-
-    // Leaves newer kernel interfaces unused. For tests.
-    void useOnlyPagemap() { _mayScan = false; }
-
   private:
     kern_return_t openPagemap(const HXAddressSpace &addressSpace);
     kern_return_t queryMapping(const HXMapping &mapping, uint64_t start, std::span<int32_t> dispositions);
+    // Goes through the pages of a mapping that lie before what is asked for, where these count.
+    kern_return_t countUpTo(const HXMapping &mapping, uint64_t start);
+    kern_return_t fill(const HXMapping &mapping, uint64_t start, std::span<int32_t> dispositions);
     kern_return_t readRuns(uint64_t start, uint64_t end);
-    bool scan(uint64_t start, uint64_t end);
     kern_return_t readEntries(uint64_t start, uint64_t end);
-    bool isGone(uint64_t address) const;
     void findSwapped(const HXMapping &mapping, uint64_t start, std::span<int32_t> dispositions);
 
-    const int _directory;
+    const HXDescriptor &_process;
     const uint32_t _pageShift;
-    bool _mayScan = true;
     HXDescriptor _pagemap;
     // The runs of [_windowStart, _windowEnd); pages between them are not there.
     std::vector<HXPageRun> _runs;
-    size_t _run = 0;
     uint64_t _windowStart = 0;
     uint64_t _windowEnd = 0;
     // Where the last query of a mapping ended.

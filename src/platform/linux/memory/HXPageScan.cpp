@@ -32,37 +32,45 @@ struct Argument {
     uint64_t anyOfCategories;
     uint64_t returnedCategories;
 };
-constexpr unsigned long scanRequest = _IOWR('f', 16, Argument);
-constexpr uint64_t fileCategory = 1 << 2, presentCategory = 1 << 3, swappedCategory = 1 << 4;
-constexpr uint64_t zeroCategory = 1 << 5;
-constexpr uint64_t guardCategory = 1 << 8; // kernel 6.15
+constexpr unsigned long kScanRequest = _IOWR('f', 16, Argument);
+constexpr uint64_t kFile = 1 << 2, kPresent = 1 << 3, kSwapped = 1 << 4, kZero = 1 << 5;
+constexpr uint64_t kGuard = 1 << 8; // kernel 6.15
 
-uint8_t factsOf(uint64_t categories) {
-    static constexpr struct {
-        uint64_t category;
-        uint8_t fact;
-    } facts[] = {
-        {presentCategory, HXPageRun::present}, {fileCategory, HXPageRun::file},
-        {swappedCategory, HXPageRun::swapped}, {zeroCategory, HXPageRun::nothing},
-        {guardCategory, HXPageRun::nothing},
-    };
+struct BitMeaning {
+    uint64_t bit;
+    uint8_t fact;
+};
+constexpr BitMeaning kCategories[] = {
+    {kPresent, HXPageRun::present}, {kFile, HXPageRun::file},     {kSwapped, HXPageRun::swapped},
+    {kZero, HXPageRun::nothing},    {kGuard, HXPageRun::nothing},
+};
+// Of an entry of pagemap.
+constexpr BitMeaning kEntryBits[] = {
+    {uint64_t{1} << 63, HXPageRun::present},
+    {uint64_t{1} << 62, HXPageRun::swapped},
+    {uint64_t{1} << 61, HXPageRun::file},
+    {uint64_t{1} << 58, HXPageRun::nothing}, // a guard
+};
+
+uint8_t factsOf(uint64_t bits, std::span<const BitMeaning> meanings) {
     uint8_t found = 0;
-    for (const auto &entry : facts)
-        if (categories & entry.category) found |= entry.fact;
+    for (const BitMeaning &meaning : meanings)
+        if (bits & meaning.bit) found |= meaning.fact;
     return found;
 }
 
-int scan(int pagemap, uint64_t categories, uint64_t start, uint64_t end, std::span<Region> regions,
-         uint64_t *walkEnd) {
+// Answers how many regions were found, -1 with errno.
+int scan(const HXDescriptor &pagemap, uint64_t categories, uint64_t start, uint64_t end,
+         std::span<Region> regions, uint64_t *walkEnd) {
     Argument argument{};
     argument.size = sizeof argument;
     argument.start = start;
     argument.end = end;
     argument.vector = reinterpret_cast<uint64_t>(regions.data());
     argument.vectorLength = regions.size();
-    argument.anyOfCategories = presentCategory | swappedCategory;
+    argument.anyOfCategories = kPresent | kSwapped;
     argument.returnedCategories = categories;
-    const int count = ::ioctl(pagemap, scanRequest, &argument);
+    const int count = ::ioctl(pagemap.get(), kScanRequest, &argument);
     *walkEnd = argument.walkEnd;
     return count;
 }
@@ -71,11 +79,11 @@ int scan(int pagemap, uint64_t categories, uint64_t start, uint64_t end, std::sp
 struct Support {
     bool isSupported = false;
     bool isComplete = false;
-    uint64_t categories = presentCategory | swappedCategory | fileCategory | zeroCategory;
+    uint64_t categories = kPresent | kSwapped | kFile | kZero;
 };
 
 // Whether the huge page of zeros is told as one; true where there is none.
-bool knowsHugeZeros(int pagemap, const Support &support) {
+bool knowsHugeZeros(const HXDescriptor &pagemap, const Support &support) {
     constexpr size_t hugeSize = 2 << 20, length = 2 * hugeSize;
     void *memory =
         ::mmap(nullptr, length, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
@@ -89,7 +97,7 @@ bool knowsHugeZeros(int pagemap, const Support &support) {
     uint64_t walkEnd = 0;
     const int count = scan(pagemap, support.categories, start, start + hugeSize, {&region, 1}, &walkEnd);
     ::munmap(memory, length);
-    return count == 1 && (region.categories & zeroCategory) != 0;
+    return count == 1 && (region.categories & kZero) != 0;
 }
 
 // Kernels that have guards without telling them (6.13, 6.14) show them as swapped.
@@ -111,13 +119,13 @@ Support findSupport() {
     uint64_t walkEnd = 0;
     const auto address = reinterpret_cast<uint64_t>(&region) & ~uint64_t{0xFFFF};
     const auto answers = [&](uint64_t categories) {
-        return scan(pagemap.get(), categories, address, address + 0x10000, {&region, 1}, &walkEnd) >= 0;
+        return scan(pagemap, categories, address, address + 0x10000, {&region, 1}, &walkEnd) >= 0;
     };
     support.isSupported = answers(support.categories);
-    const bool knowsGuards = support.isSupported && answers(support.categories | guardCategory);
-    if (knowsGuards) support.categories |= guardCategory;
+    const bool knowsGuards = support.isSupported && answers(support.categories | kGuard);
+    if (knowsGuards) support.categories |= kGuard;
     support.isComplete =
-        support.isSupported && (knowsGuards || !hasGuards()) && knowsHugeZeros(pagemap.get(), support);
+        support.isSupported && (knowsGuards || !hasGuards()) && knowsHugeZeros(pagemap, support);
     return support;
 }
 
@@ -128,27 +136,37 @@ const Support &support() {
 
 } // namespace
 
-bool HXPageScan::isSupported() {
-    return support().isSupported;
-}
-
 bool HXPageScan::isComplete() {
     return support().isComplete;
 }
 
-int HXPageScan::find(int pagemap, bool tellsFiles, uint64_t start, uint64_t end, std::span<HXPageRun> runs,
-                     uint64_t *walkEnd) {
-    thread_local std::array<Region, 1024> regions;
+std::optional<HXPageScan::Walk> HXPageScan::find(const HXDescriptor &pagemap, bool tellsFiles, uint64_t start,
+                                                 uint64_t end, std::span<HXPageRun> runs) {
+    if (!support().isSupported) return std::nullopt;
+    thread_local std::array<Region, kMostRuns> regions;
     const auto room = std::span(regions).first(std::min(regions.size(), runs.size()));
-    const uint64_t categories = support().categories & ~(tellsFiles ? 0 : fileCategory);
-    const int count = scan(pagemap, categories, start, end, room, walkEnd);
-    for (int i = 0; i < count; i++) {
-        const Region &region = regions[static_cast<size_t>(i)];
-        runs[static_cast<size_t>(i)] = {region.start, region.end, factsOf(region.categories)};
-    }
+    const uint64_t categories = support().categories & ~(tellsFiles ? 0 : kFile);
+    Walk walk{};
+    const int found = scan(pagemap, categories, start, end, room, &walk.end);
+    if (found < 0) return std::nullopt;
+    walk.count = static_cast<size_t>(found);
+    for (size_t i = 0; i < walk.count; i++)
+        runs[i] = {room[i].start, room[i].end, factsOf(room[i].categories, kCategories)};
     // A walk that the kernel did in several steps may tell the end of an earlier one: all of [start, end) has
     // been walked if there was room to spare, and what has been found is behind it in any case.
-    if (count >= 0 && static_cast<size_t>(count) < room.size()) *walkEnd = end;
-    if (count > 0) *walkEnd = std::max(*walkEnd, room[static_cast<size_t>(count) - 1].end);
+    if (walk.count < room.size()) walk.end = end;
+    if (walk.count > 0) walk.end = std::max(walk.end, runs[walk.count - 1].end);
+    if (walk.end <= start) return std::nullopt;
+    return walk;
+}
+
+size_t HXReadPageFacts(const HXDescriptor &pagemap, uint64_t page, std::span<uint8_t> facts) {
+    constexpr size_t step = 4096; // 32 KiB of entries: 16 MiB of small pages
+    thread_local std::array<uint64_t, step> entries;
+    const size_t length = std::min(facts.size(), entries.size()) * sizeof entries[0];
+    const ssize_t got = pagemap.readAt(page * sizeof entries[0], entries.data(), length);
+    const size_t count = got < 0 ? 0 : static_cast<size_t>(got) / sizeof entries[0];
+    for (size_t i = 0; i < count; i++)
+        facts[i] = factsOf(entries[i], kEntryBits);
     return count;
 }

@@ -1,9 +1,13 @@
-// The kernel's PAGEMAP_SCAN request (kernel 6.7; Documentation/admin-guide/mm/pagemap.rst): runs of pages
-// that are there, found by one walk of the page tables.
+// The two ways to read the page tables of a process from its pagemap
+// (Documentation/admin-guide/mm/pagemap.rst): the PAGEMAP_SCAN request of kernel 6.7, which finds runs of
+// pages that are there in one walk, and an entry for each page.
 #pragma once
+
+#include "platform/linux/procfs/HXDescriptor.h"
 
 #include <cstddef>
 #include <cstdint>
+#include <optional>
 #include <span>
 
 // A run of pages that the kernel tells alike.
@@ -21,16 +25,25 @@ struct HXPageRun {
 
 class HXPageScan {
   public:
-    // Whether this kernel answers the request.
-    static bool isSupported();
-    // Whether its answers tell shared zeros and guards from memory in every case, so that pages can be
-    // counted by them.
+    // Whether this kernel's answers tell shared zeros and guards from memory in every case, so that pages can
+    // be counted by them. False also for a kernel that does not know the request.
     static bool isComplete();
 
-    // Finds the runs of present or swapped pages in [start, end) by an open pagemap: stores as many as there
-    // is room for and where the walk ended, `end` or before the first run that had no room. -1 when the
-    // kernel refuses. Without `tellsFiles` the fact `file` is left out, which is several times faster: the
-    // kernel then need not look at the pages themselves.
-    static int find(int pagemap, bool tellsFiles, uint64_t start, uint64_t end, std::span<HXPageRun> runs,
-                    uint64_t *walkEnd);
+    // How many runs one walk finds at most, for which each thread keeps room (24 KiB).
+    static constexpr size_t kMostRuns = 1024;
+    // How many runs a walk found and where it ended: the end asked for, or before the first run that had no
+    // room.
+    struct Walk {
+        size_t count;
+        uint64_t end;
+    };
+    // Finds the runs of present or swapped pages in [start, end), which is not empty, by an open pagemap;
+    // none when the kernel refuses, or gets nowhere. Without `tellsFiles` the fact `file` is left out, which
+    // is several times faster: the kernel then need not look at the pages themselves.
+    static std::optional<Walk> find(const HXDescriptor &pagemap, bool tellsFiles, uint64_t start,
+                                    uint64_t end, std::span<HXPageRun> runs);
 };
+
+// The facts (HXPageRun) of the pages from number `page` on by pagemap's entries: how many were read, 0 when
+// the page tables have gone. Other than the request, entries show the shared page of zeros as present memory.
+size_t HXReadPageFacts(const HXDescriptor &pagemap, uint64_t page, std::span<uint8_t> facts);

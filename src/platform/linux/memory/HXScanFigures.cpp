@@ -1,58 +1,35 @@
-#include "platform/linux/memory/HXAddressSpaceReader.h"
+#include "platform/linux/memory/HXScanFigures.h"
+
 #include "platform/linux/memory/HXPageScan.h"
 #include "platform/linux/procfs/HXProcFile.h"
 
 #include <algorithm>
 #include <array>
-#include <cerrno>
 #include <span>
-
-namespace {
-
-// The line behind all figures: a text that lacks it was cut.
-bool isWholeStatus(std::string_view text) {
-    const size_t last = text.find("\nThreads:");
-    return last != std::string_view::npos && text.find('\n', last + 1) != std::string_view::npos;
-}
-
-} // namespace
-
-std::optional<HXStatusRecord> HXReadStatus(int directory) {
-    char buffer[8192];
-    const auto text = HXReadOnce(directory, "status", buffer);
-    if (!text) return std::nullopt;
-    if (isWholeStatus(*text)) return HXParseStatus(*text);
-    // A process may have 65536 groups, whose numbers come before the figures.
-    constexpr size_t limit = 2 << 20;
-    const auto longText = HXReadText(directory, "status", limit);
-    if (!longText) return std::nullopt;
-    if (isWholeStatus(*longText)) return HXParseStatus(*longText);
-    errno = EIO;
-    return std::nullopt;
-}
 
 namespace {
 
 // Whether only a page itself shows whose it is: a private mapping of a file holds the file's pages and its
 // own, and a driver's mapping what is nobody's memory.
 bool needsPages(const HXMapping &mapping) {
-    const auto kind = static_cast<HXPathKind>(mapping.kind);
-    if (!mapping.isFile()) return kind == HXPathKind::vdso || kind == HXPathKind::special;
+    if (!mapping.isFile()) return mapping.kind == HXPathKind::vdso || mapping.kind == HXPathKind::special;
     return !(mapping.has(HXMappingShared) && mapping.has(HXMappingSwapBacked));
 }
 
 // Walks the page tables of a process, stretch by stretch of its mappings, and counts what is there.
 class Scanner {
   public:
-    Scanner(int directory, uint32_t pageShift, HXAddressSpace &addressSpace)
-        : _pagemap(HXOpenAt(directory, "pagemap")), _pageShift(pageShift), _addressSpace(addressSpace) {}
+    Scanner(const HXDescriptor &process, uint32_t pageShift, HXAddressSpace &addressSpace)
+        : _pagemap(HXOpenAt(process, "pagemap")), _pageShift(pageShift), _addressSpace(addressSpace) {}
 
     bool scan();
-    uint64_t swappedSize() const { return _swappedPages << _pageShift; }
-    bool foundAny() const { return _foundAny; }
+    // A living process has pages; the page tables of one that has gone are empty.
+    bool isGood(uint64_t swappedSize) const {
+        return _foundAny && _swappedPages << _pageShift == swappedSize;
+    }
 
   private:
-    bool scan(uint64_t start, uint64_t end, bool tellsFiles);
+    bool walk(size_t first, size_t end, bool tellsFiles);
     void add(const HXPageRun &run);
     void count(uint8_t facts, uint32_t pages, HXMapping &mapping);
 
@@ -64,9 +41,10 @@ class Scanner {
     bool _foundAny = false;
 };
 
+// Neighbours that need the same go together. So does what does not need its pages looked at, yet lies between
+// others that do and is so small that a request of its own would cost more than looking.
 bool Scanner::scan() {
-    // A stretch of less memory is not worth a request of its own.
-    constexpr uint64_t smallSize = 1 << 20;
+    constexpr uint64_t smallSize = 1 << 20; // 256 pages
     if (!_pagemap) return false;
     size_t count = _addressSpace.count();
     while (count > 0 && _addressSpace[count - 1].end >> 63 != 0)
@@ -80,22 +58,25 @@ bool Scanner::scan() {
         for (; i < count && needsPages(_addressSpace[i]) == needs; i++)
             size += _addressSpace[i].end - _addressSpace[i].start;
         const bool tellsNext = needs || size < smallSize;
-        if (first == 0) tellsFiles = tellsNext;
-        if (tellsNext == tellsFiles) continue;
-        if (!scan(_addressSpace[begin].start, _addressSpace[first - 1].end, tellsFiles)) return false;
-        begin = first;
+        if (first > 0 && tellsNext != tellsFiles) {
+            if (!walk(begin, first, tellsFiles)) return false;
+            begin = first;
+        }
         tellsFiles = tellsNext;
     }
-    return count == 0 || scan(_addressSpace[begin].start, _addressSpace[count - 1].end, tellsFiles);
+    return count == 0 || walk(begin, count, tellsFiles);
 }
 
-bool Scanner::scan(uint64_t start, uint64_t end, bool tellsFiles) {
-    thread_local std::array<HXPageRun, 1024> runs;
-    for (uint64_t walkEnd = start; start < end; start = walkEnd) {
-        const int count = HXPageScan::find(_pagemap.get(), tellsFiles, start, end, runs, &walkEnd);
-        if (count < 0 || walkEnd <= start) return false;
-        for (const HXPageRun &run : std::span(runs).first(static_cast<size_t>(count)))
+// From the mapping `first` to the one before `end`.
+bool Scanner::walk(size_t first, size_t end, bool tellsFiles) {
+    thread_local std::array<HXPageRun, HXPageScan::kMostRuns> runs;
+    const uint64_t endAddress = _addressSpace[end - 1].end;
+    for (uint64_t start = _addressSpace[first].start; start < endAddress;) {
+        const auto found = HXPageScan::find(_pagemap, tellsFiles, start, endAddress, runs);
+        if (!found) return false;
+        for (const HXPageRun &run : std::span(runs).first(found->count))
             add(run);
+        start = found->end;
     }
     return true;
 }
@@ -129,8 +110,8 @@ void Scanner::count(uint8_t facts, uint32_t pages, HXMapping &mapping) {
 
 } // namespace
 
-bool HXScanFigures(int directory, uint32_t pageShift, uint64_t swappedSize, HXAddressSpace *addressSpace) {
-    Scanner scanner(directory, pageShift, *addressSpace);
-    // A living process has pages; the page tables of one that has gone are empty.
-    return scanner.scan() && scanner.foundAny() && scanner.swappedSize() == swappedSize;
+bool HXScanFigures(const HXDescriptor &process, uint32_t pageShift, uint64_t swappedSize,
+                   HXAddressSpace *addressSpace) {
+    Scanner scanner(process, pageShift, *addressSpace);
+    return scanner.scan() && scanner.isGood(swappedSize);
 }

@@ -21,29 +21,25 @@ struct CacheFigures {
     uint64_t evicted;
     uint64_t recentlyEvicted;
 };
-constexpr long cacheStatCall = 451;
+constexpr long kCacheStatCall = 451; // on every machine
 
 class Marker {
   public:
     Marker(const HXCountSwapped &countSwapped, uint64_t limit) : _countSwapped(countSwapped), _left(limit) {}
 
     void mark(uint64_t first, std::span<int32_t> dispositions) {
-        uint64_t swapped = dispositions.size();
         if (_left == 0 || dispositions.empty()) return;
-        if (_callsLeft > 0) {
-            _callsLeft--;
-            if (!_countSwapped(first, dispositions.size(), &swapped)) {
-                _callsLeft = 0;
-                swapped = dispositions.size();
-            }
-        }
+        std::optional<uint64_t> counted;
+        if (_callsLeft > 0) counted = _countSwapped(first, dispositions.size());
+        _callsLeft = counted ? _callsLeft - 1 : 0;
+        const uint64_t swapped = counted.value_or(dispositions.size());
         if (swapped == 0) return;
         if (swapped >= dispositions.size() || _callsLeft == 0) return markFirst(swapped, dispositions);
         const size_t half = dispositions.size() / 2;
         mark(first, dispositions.first(half));
         mark(first + half, dispositions.subspan(half));
     }
-    uint64_t marked() const { return _marked; }
+    uint64_t left() const { return _left; }
 
   private:
     void markFirst(uint64_t swapped, std::span<int32_t> dispositions) {
@@ -53,14 +49,12 @@ class Marker {
             disposition = VM_PAGE_QUERY_PAGE_PAGED_OUT;
             swapped--;
             _left--;
-            _marked++;
         }
     }
 
     const HXCountSwapped &_countSwapped;
     uint64_t _left;
-    uint64_t _marked = 0;
-    uint32_t _callsLeft = 16384; // bounds the time for pages that are swapped here and there
+    uint32_t _callsLeft = 16384; // some 10 ms for pages that are swapped here and there
 };
 
 } // namespace
@@ -69,17 +63,16 @@ uint64_t HXMarkSwapped(const HXCountSwapped &countSwapped, uint64_t first, uint6
                        std::span<int32_t> dispositions) {
     Marker marker(countSwapped, limit);
     marker.mark(first, dispositions);
-    return marker.marked();
+    return limit - marker.left();
 }
 
-uint64_t HXMarkSwapped(int file, uint64_t first, uint32_t pageShift, uint64_t limit,
+uint64_t HXMarkSwapped(const HXDescriptor &file, uint64_t first, uint32_t pageShift, uint64_t limit,
                        std::span<int32_t> dispositions) {
-    const HXCountSwapped countSwapped = [&](uint64_t page, uint64_t count, uint64_t *swapped) {
+    const HXCountSwapped countSwapped = [&](uint64_t page, uint64_t count) -> std::optional<uint64_t> {
         CacheRange range{page << pageShift, count << pageShift};
         CacheFigures figures{};
-        if (file < 0 || ::syscall(cacheStatCall, file, &range, &figures, 0) != 0) return false;
-        *swapped = figures.evicted;
-        return true;
+        if (!file || ::syscall(kCacheStatCall, file.get(), &range, &figures, 0) != 0) return std::nullopt;
+        return figures.evicted;
     };
     return HXMarkSwapped(countSwapped, first, limit, dispositions);
 }

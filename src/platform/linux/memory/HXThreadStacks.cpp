@@ -10,11 +10,11 @@
 namespace {
 
 // None for a thread that runs whenever it is looked at, has ended, or may not be examined.
-std::optional<uint64_t> stackPointer(int tasks, const char *thread) {
-    constexpr int tries = 3;
+std::optional<uint64_t> stackPointer(const HXDescriptor &tasks, const char *thread) {
+    constexpr int tries = 3; // one that runs now mostly waits a moment later
     char name[64];
     std::snprintf(name, sizeof name, "%.20s/syscall", thread);
-    char buffer[512];
+    char buffer[512]; // nine hexadecimal numbers
     for (int i = 0; i < tries; i++) {
         const auto text = HXReadOnce(tasks, name, buffer);
         if (!text) return std::nullopt;
@@ -28,22 +28,21 @@ void tagStack(uint64_t pointer, HXAddressSpace *addressSpace) {
     const size_t index = addressSpace->find(pointer);
     if (index == addressSpace->count()) return;
     HXMapping &mapping = (*addressSpace)[index];
-    const auto kind = static_cast<HXPathKind>(mapping.kind);
-    const bool anonymous = kind == HXPathKind::none || kind == HXPathKind::namedAnonymous;
+    const bool anonymous = mapping.kind == HXPathKind::none || mapping.kind == HXPathKind::namedAnonymous;
     if (mapping.contains(pointer) && anonymous && mapping.has(HXMappingWritable))
         mapping.tag = HXHostTagStack;
 }
 
 } // namespace
 
-void HXTagThreadStacks(int directory, HXAddressSpace *addressSpace) {
+void HXTagThreadStacks(const HXDescriptor &process, HXAddressSpace *addressSpace) {
     constexpr size_t threadLimit = 8192; // some tens of milliseconds
-    const HXDescriptor tasks = HXOpenAt(directory, "task", O_DIRECTORY);
+    const HXDescriptor tasks = HXOpenAt(process, "task", O_DIRECTORY);
     if (!tasks) return;
     size_t count = 0;
-    HXForEachEntry(tasks.get(), [&](const char *thread) {
+    HXForEachEntry(tasks, [&](const char *thread) {
         if (thread[0] < '0' || thread[0] > '9') return true;
-        const auto pointer = stackPointer(tasks.get(), thread);
+        const auto pointer = stackPointer(tasks, thread);
         if (pointer) tagStack(*pointer, addressSpace);
         return ++count < threadLimit;
     });

@@ -29,7 +29,6 @@ ssize_t HXDescriptor::readFully(std::span<char> buffer) const {
     return static_cast<ssize_t>(length);
 }
 
-bool HXDescriptor::readAt(uint64_t position, std::span<char> buffer) const {
-    const ssize_t got = ::pread(_descriptor, buffer.data(), buffer.size(), static_cast<off_t>(position));
-    return got == static_cast<ssize_t>(buffer.size());
+ssize_t HXDescriptor::readAt(uint64_t position, void *buffer, size_t length) const {
+    return ::pread(_descriptor, buffer, length, static_cast<off_t>(position));
 }

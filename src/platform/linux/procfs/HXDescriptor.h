@@ -3,6 +3,7 @@
 
 #include <unistd.h>
 
+#include <cstddef>
 #include <cstdint>
 #include <span>
 #include <utility>
@@ -30,8 +31,9 @@ class HXDescriptor {
     // Reads from the descriptor's place until `buffer` is full or the file ends: bytes read. -1 with errno
     // set when a read fails, the first or a later one: what came before it is no answer.
     ssize_t readFully(std::span<char> buffer) const;
-    // Whether `buffer` could be filled from `position`, in bytes, which leaves the descriptor's place alone.
-    bool readAt(uint64_t position, std::span<char> buffer) const;
+    // Reads up to `length` bytes from byte `position` on, which leaves the descriptor's place alone: bytes
+    // read, or -1 with errno set.
+    ssize_t readAt(uint64_t position, void *buffer, size_t length) const;
 
   private:
     int _descriptor = -1;

@@ -76,7 +76,8 @@ std::optional<HXAuxiliaryVector> readAuxiliaryVector(HXDirectoryView directory, 
 bool isPresentAndOwn(const HXDescriptor &pagemap, uint64_t page) {
     constexpr uint64_t present = uint64_t{1} << 63, ofFile = uint64_t{1} << 61; // pagemap of proc(5)
     std::array<char, sizeof(uint64_t)> bytes;
-    if (!pagemap.readAt(page * bytes.size(), bytes)) return false;
+    if (pagemap.readAt(page * bytes.size(), bytes.data(), bytes.size()) != static_cast<ssize_t>(bytes.size()))
+        return false;
     return (std::bit_cast<uint64_t>(bytes) & (present | ofFile)) == present;
 }
 
@@ -90,7 +91,8 @@ std::optional<std::string> readPresentText(const HXDescriptor &process, uint64_t
     char buffer[PATH_MAX];
     while (text.size() < PATH_MAX) {
         const size_t length = std::min<uint64_t>(pageSize - address % pageSize, sizeof buffer);
-        if (!isPresentAndOwn(pagemap, address / pageSize) || !memory.readAt(address, {buffer, length}))
+        if (!isPresentAndOwn(pagemap, address / pageSize) ||
+            memory.readAt(address, buffer, length) != static_cast<ssize_t>(length))
             return std::nullopt;
         const std::string_view piece(buffer, length);
         const size_t end = piece.find('\0');
