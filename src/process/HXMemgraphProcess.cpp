@@ -57,13 +57,12 @@ bool HXMemgraphProcess::initWithMemgraph(const std::string &path, HXError *error
     proc_bsdinfo info{};
     info.pbi_flags = _graph->is64bit() ? PROC_FLAG_LP64 : 0;
     info.pbi_pid = _graph->pid();
-    if (!initWithBsdInfo(info)) return false;
+    if (!initWithBsdInfo(info, nullptr)) return false;
     setName(_graph->processName());
     setDisplayString(name() + " [" + std::to_string(pid()) + "] (memgraph)");
     if (!_setSharedRegionFromPlatform(HXPlatformOfDescription(_graph->processDescriptionString())))
         return fail(error, unknownPlatform,
                     "Unable to determine platform from memory graph process description");
-    setIdleExitStatus(HXIdleExitUnknown);
     return true;
 }
 
@@ -73,8 +72,7 @@ void HXMemgraphProcess::_gatherPhysHeft() {
 }
 
 vm_region_submap_info_64 HXMemgraphProcess::infoOfRegion(const GXVMRegion &region) const {
-    const bool inSharedRegion =
-        region.address >= sharedRegionBase() && region.address - sharedRegionBase() < sharedRegionSize();
+    const bool inSharedRegion = sharedRegion().contains(region.address);
     // Within the shared region the fields hold bytes; elsewhere pages, as a live walk delivers them.
     const auto amount = [&](uint64_t bytes) {
         return static_cast<uint32_t>(inSharedRegion ? bytes : bytes / pageSize());
@@ -118,14 +116,4 @@ void HXMemgraphProcess::enumerateRegions(const HXRegionCallback &callback) {
         if (region.external_pager && region.path) path = *region.path;
         *stop = callback(region.address, region.length, info, region.purgeable, path);
     });
-}
-
-bool HXMemgraphProcess::_populateMemoryRegionWithPageQueries(HXMemoryRegion &region,
-                                                             const vm_region_submap_info_64 &info) {
-    constexpr char operation[] = "_populateMemoryRegionWithPageQueries";
-    HXRequire(region.dirtySize() == 0, operation, "memoryRegion.dirtySize == 0");
-    HXRequire(region.swappedSize() == 0, operation, "memoryRegion.swappedSize == 0");
-    region.setDirtySize(info.pages_dirtied);
-    region.setSwappedSize(info.pages_swapped_out);
-    return true;
 }

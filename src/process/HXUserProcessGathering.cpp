@@ -23,11 +23,18 @@ uint64_t pagesLeft(uint64_t all, uint64_t taken) {
 
 // What one gathering's walk and its closing steps share.
 struct HXUserProcess::Gathering {
+    explicit Gathering(HXUserProcess &process)
+        : enumerator(process._images), cutter(process.pageSize(), enumerator, regions, process.pageQuery()),
+          hidden(process.hiddenFromDisplay()), breakDown(process.breakDownPhysHeft()),
+          cutsRuns(breakDown && !hidden && process._canQueryPages() &&
+                   !HXHeftSwitches::isSharingAnalysisDisabled()) {}
+
     HXMemoryRegionList regions;
     HXImageEnumerator enumerator;
-    bool hidden;
-    bool breakDown;
-    bool sharingDisabled;
+    HXSharedRegionCutter cutter;
+    const bool hidden;
+    const bool breakDown;
+    const bool cutsRuns;
     std::optional<HXMemoryRegion> unmappedRegion; // built from the kernel's fake region
     // Dirty and swapped bytes charged to mapped regions from owned objects: the kernel's fake region counts
     // them, too.
@@ -42,15 +49,16 @@ void HXUserProcess::gatherData() {
     }
     _gatherMemoryData();
     _images = {};
-    releaseTask();
+    _task.close();
 }
 
 std::optional<HXOwnedVmObjects> HXUserProcess::_gatherOwnedVmObjects() {
     constexpr size_t slack = 0x380; // sixteen objects that appear between two calls
     if (!HXHeftSwitches::breakDownPhysHeft()) return std::nullopt;
     HXPlatform &platform = HXPlatform::current();
+    const mach_port_t task = _task.get();
     size_t size = 0;
-    if (platform.sysctlbyname(kOwnedObjectsSetting, nullptr, &size, &_task, sizeof _task) != 0) {
+    if (platform.sysctlbyname(kOwnedObjectsSetting, nullptr, &size, &task, sizeof task) != 0) {
         if (errno != ENOENT) _addErrnoWarningWithDescription(kOwnedObjectsSetting);
         return std::nullopt;
     }
@@ -63,7 +71,7 @@ std::optional<HXOwnedVmObjects> HXUserProcess::_gatherOwnedVmObjects() {
         size += slack;
         reply.resize(size);
         length = size;
-        if (platform.sysctlbyname(kOwnedObjectsSetting, reply.data(), &length, &_task, sizeof _task) != 0) {
+        if (platform.sysctlbyname(kOwnedObjectsSetting, reply.data(), &length, &task, sizeof task) != 0) {
             _addErrnoWarningWithDescription(kOwnedObjectsSetting);
             return std::nullopt;
         }
@@ -84,12 +92,7 @@ std::optional<HXOwnedVmObjects> HXUserProcess::_gatherOwnedVmObjects() {
 }
 
 void HXUserProcess::_gatherMemoryData() {
-    Gathering gathering{.regions = {},
-                        .enumerator = HXImageEnumerator(_images),
-                        .hidden = hiddenFromDisplay(),
-                        .breakDown = breakDownPhysHeft(),
-                        .sharingDisabled = HXHeftSwitches::isSharingAnalysisDisabled(),
-                        .unmappedRegion = std::nullopt};
+    Gathering gathering(*this);
     enumerateRegions([&](uint64_t start, uint64_t size, const vm_region_submap_info_64 &info,
                          int32_t purgeState, std::optional<std::string_view> path) {
         return addRegion(gathering, start, size, info, purgeState, path);
@@ -104,10 +107,8 @@ void HXUserProcess::_gatherMemoryData() {
 bool HXUserProcess::addRegion(Gathering &gathering, uint64_t start, uint64_t size,
                               const vm_region_submap_info_64 &info, int32_t purgeState,
                               std::optional<std::string_view> path) {
-    if (inSharedRegion(start)) {
-        if (gathering.hidden ||
-            _addRegionsToArray(gathering.regions, start, size, info, gathering.enumerator))
-            return false;
+    if (_sharedRegion.contains(start)) {
+        if (gathering.hidden || gathering.cutter._addRegionsToArray(start, size, info)) return false;
         printBailingOut();
         return true;
     }
@@ -134,8 +135,7 @@ bool HXUserProcess::addRegion(Gathering &gathering, uint64_t start, uint64_t siz
         }
     }
     nameRegion(region, gathering, info, purgeState, path);
-    if (gathering.breakDown && !gathering.sharingDisabled && !gathering.hidden &&
-        region.eligibleForSubrangesUsingPageSize(pageSize()))
+    if (gathering.cutsRuns && region.eligibleForSubrangesUsingPageSize(pageSize()))
         _addSubrangesForRegion(region, purgeState);
 
     if (isUnmappedRegion)
@@ -246,64 +246,4 @@ void HXUserProcess::addPageTables(Gathering &gathering) {
     region.setName("page table");
     region.setObject_id(UINT64_MAX);
     region.setShare_mode(SM_PRIVATE);
-}
-
-// A region of the cut with the fields that all pieces of an entry have in common, appended to the list.
-HXMemoryRegion &HXUserProcess::appendCut(HXMemoryRegionList &regions, uint64_t cursor, uint64_t entryStart,
-                                         const vm_region_submap_info_64 &info) const {
-    HXMemoryRegion &region = regions.emplace_back();
-    region.setStart(cursor);
-    region.setUser_tag(info.user_tag);
-    region.setObject_id(info.object_id_full);
-    region.setShare_mode(info.share_mode);
-    region.setOffset(info.offset + (cursor - entryStart));
-    region.setInSharedCache(true);
-    region.setWired(info.user_wired_count != 0);
-    return region;
-}
-
-bool HXUserProcess::_addRegionsToArray(HXMemoryRegionList &regions, uint64_t start, uint64_t size,
-                                       const vm_region_submap_info_64 &info, HXImageEnumerator &enumerator) {
-    const uint64_t end = start + size;
-    const uint64_t alignment = _sharedRegionAlignmentSize;
-    const bool writable = info.max_protection & VM_PROT_WRITE;
-    const auto isPageAligned = [&](uint64_t address) { return address % pageSize() == 0; };
-    const auto populate = [&](HXMemoryRegion &region) {
-        if (_populateMemoryRegionWithPageQueries(region, info)) return true;
-        regions.pop_back();
-        _pendingUnusedSharedRegion = nullptr;
-        return false;
-    };
-    _pendingUnusedSharedRegion = nullptr;
-    const HXImage *image = enumerator.nextImageForStart(start, end);
-    for (uint64_t cursor = start; cursor < end;) {
-        if (!image || cursor < image->start()) {
-            HXMemoryRegion &gap = appendCut(regions, cursor, start, info);
-            gap.setEnd(image && image->start() < end ? image->start() : end);
-            gap.setName("unused dyld shared cache area");
-            gap.setUnusedSharedCacheRegion(true);
-            if (writable && !(isPageAligned(gap.start()) && isPageAligned(gap.end())) && !populate(gap))
-                return false;
-            cursor = gap.end();
-            if (cursor >= end || !image) return true;
-        }
-        if (image->end() <= cursor) { // an image that overlaps the one before, and ends within it
-            image = enumerator.nextImageForStart(cursor, end);
-            continue;
-        }
-        HXMemoryRegion &piece = appendCut(regions, std::max(image->start(), cursor), start, info);
-        piece.setEnd(std::min(image->end(), end));
-        const HXImage *next = enumerator.nextImageForStart(piece.end(), end);
-        const uint64_t nextStart = next ? next->start() : 0;
-        if (next != image && piece.start() % alignment == 0 && nextStart % alignment == 0)
-            piece.setEnd((piece.end() + alignment - 1) / alignment * alignment);
-        static const HXString sharedCache = HXString::intern("dyld shared cache");
-        piece.setName(image->name());
-        piece.setDetailedName(image->segment() == HXSegmentLinkedit ? sharedCache : image->ownerPath());
-        piece.setSegment(image->segment());
-        if (writable && !populate(piece)) return false;
-        cursor = piece.end();
-        image = next;
-    }
-    return true;
 }

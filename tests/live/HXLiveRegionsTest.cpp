@@ -2,6 +2,7 @@
 #include "analysis/HXHeft.h"
 #include "platform/HXPlatform.h"
 #include "platform/linux/HXLinuxPlatform.h"
+#include "process/HXProcessSnapshot.h"
 #include "process/HXUserProcess.h"
 #include "support/HXSubject.h"
 
@@ -218,7 +219,8 @@ class HXLiveRegions : public testing::TestWithParam<Case> {
 
     std::unique_ptr<HXUserProcess> gathered(pid_t pid, bool breakDown) {
         HXHeft::setBreakDownPhysHeft(breakDown);
-        auto process = HXProcess::processWithPid(pid);
+        HXProcessSnapshot snapshot;
+        auto process = HXProcess::processWithPid(pid, snapshot);
         if (process) process->gatherData();
         return std::unique_ptr<HXUserProcess>(static_cast<HXUserProcess *>(process.release()));
     }

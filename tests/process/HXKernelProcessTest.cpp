@@ -1,4 +1,5 @@
 #include "process/HXKernelProcess.h"
+#include "process/HXProcessSnapshot.h"
 
 #include "support/HXBuilders.h"
 #include "support/HXMadeUpMachine.h"
@@ -20,7 +21,8 @@ Gathered gather(const std::string &records, const std::string &hostFields = "") 
     proc_bsdinfo info{};
     info.pbi_flags = PROC_FLAG_SYSTEM | PROC_FLAG_LP64;
     info.pbi_comm[0] = 'k';
-    const auto kernel = HXProcess::processWithBsdInfo(info);
+    HXProcessSnapshot snapshot;
+    const auto kernel = HXProcess::processWithBsdInfo(info, snapshot);
     EXPECT_EQ(kernel->displayString(), "k [0]");
     EXPECT_EQ(kernel->idleExitStatus(), HXIdleExitNotSupported);
     Gathered gathered;

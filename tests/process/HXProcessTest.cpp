@@ -78,7 +78,7 @@ TEST(HXProcessTest, RecordsCompareByPidAndKeepTheirLists) {
     process.addError("two");
     EXPECT_EQ(errors.size(), 1u); // a copy
     EXPECT_EQ(process.errors().size(), 2u);
-    EXPECT_FALSE(HXProcess().initWithBsdInfo(record("n", "c"))); // the base class takes no task
+    EXPECT_FALSE(HXProcess().initWithBsdInfo(record("n", "c"), nullptr)); // the base class takes no task
 }
 
 TEST(HXProcessTest, DirtyFlagsAndLayoutsAreTold) {
@@ -99,12 +99,12 @@ TEST(HXProcessTest, DirtyFlagsAndLayoutsAreTold) {
                                    {0x1A000000, 0x40000000}};
     for (int32_t code = 0; code < 5; code++) {
         EXPECT_TRUE(process._setSharedRegionFromPlatform(code));
-        EXPECT_EQ(process.sharedRegionBase(), layouts[code][0]) << code;
-        EXPECT_EQ(process.sharedRegionSize(), layouts[code][1]) << code;
+        EXPECT_EQ(process.sharedRegion().base, layouts[code][0]) << code;
+        EXPECT_EQ(process.sharedRegion().size, layouts[code][1]) << code;
     }
     for (const int32_t code : {5, -1, 100}) {
         const auto printed = printedBy([&] { EXPECT_FALSE(process._setSharedRegionFromPlatform(code)); });
         EXPECT_EQ(printed.err, "Unable to determine platform architecture of target\n");
-        EXPECT_EQ(process.sharedRegionBase(), layouts[4][0]);
+        EXPECT_EQ(process.sharedRegion().base, layouts[4][0]);
     }
 }

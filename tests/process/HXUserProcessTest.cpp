@@ -1,7 +1,7 @@
 // Gathering of live processes, over made-up machines.
 #include "process/HXUserProcess.h"
 
-#include "model/HXHeftSwitches.h"
+#include "process/HXProcessSnapshot.h"
 #include "support/HXBuilders.h"
 #include "support/HXMadeUpMachine.h"
 #include "support/HXRun.h"
@@ -64,7 +64,8 @@ Gathered gather(const std::string &machine, bool hidden = false) {
     Gathered gathered;
     std::unique_ptr<HXProcess> process;
     const HXPrinted printed = printedBy([&] {
-        process = HXProcess::processWithPid(7);
+        HXProcessSnapshot snapshot;
+        process = HXProcess::processWithPid(7, snapshot);
         process->setHiddenFromDisplay(hidden);
         process->gatherData();
     });
