@@ -1,7 +1,6 @@
 // Runs of the driver and its choice of targets.
 #include "support/HXBuilders.h"
 #include "support/HXRun.h"
-#include "support/HXTwoWorkers.h"
 
 #include <filesystem>
 #include <gtest/gtest.h>
@@ -177,23 +176,4 @@ TEST(HXHeftRunTest, EndsWithTheStatusAndTextOfEachFailure) {
     const std::string document = temporaryPath();
     EXPECT_EQ(run(kTree, {"nobody", "--json", document}).status, 1);
     EXPECT_FALSE(std::filesystem::exists(document));
-}
-
-TEST(HXHeftRunTest, AKernelWithoutTheSettingIsAnalysedByObjects) {
-    std::string machine = kTwoWorkers;
-    machine.replace(machine.find("self_region_heft=0  "), 20, "");
-    const HXRun without = report(machine, {"alpha", "beta"});
-    EXPECT_EQ(without.err, "");
-    const HXRun objects = report(kTwoWorkers, {"alpha", "beta", "--vmObjectDirty"});
-    EXPECT_EQ(without.out, objects.out);
-    EXPECT_EQ(without.json, objects.json);
-    // Both see the whole file's two dirty pages; heap is dirty as far as it is resident: 16 + 3 swapped + 2.
-    EXPECT_NE(without.out.find("alpha [100]: 64-bit\tHeft: 344064 B"), std::string::npos) << without.out;
-}
-TEST(HXHeftRunTest, TwoRunsPrintTheSameBytes) {
-    for (const Words &words : {Words{"-a"}, Words{"-a", "-v"}, Words{"-a", "-w", "--sort", "regions"}}) {
-        const HXRun first = report(kTwoWorkers, words), second = report(kTwoWorkers, words);
-        EXPECT_EQ(first.out, second.out);
-        EXPECT_EQ(first.json, second.json);
-    }
 }
