@@ -24,11 +24,6 @@ class HXMemgraphProcess : public HXUserProcess {
     uint32_t _gatherPageSize() override { return _graph->vmPageSize(); }
     bool _hostHasSharedRegion() const override { return _graph->hasSharedRegion(); }
     void _gatherPhysHeft() override;
-    // The images come with the regions.
-    void _gatherImageData() override {}
-    std::optional<HXOwnedVmObjects> _gatherOwnedVmObjects() override { return std::nullopt; }
-    // The graph holds the figures.
-    bool _canQueryPages() const override { return false; }
 
   private:
     bool initWithMemgraph(const std::string &path, HXError *error);

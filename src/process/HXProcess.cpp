@@ -30,13 +30,10 @@ std::string textOfField(const char *field, size_t width) {
 std::optional<std::string_view> pathInArgumentArea(char *area, size_t length) {
     if (length == 0) return std::nullopt;
     area[length - 1] = '\0';
-    size_t i = 0;
-    while (i < length && area[i] != '\0')
-        i++;
-    while (i < length && area[i] == '\0')
-        i++;
-    if (i >= length) return std::nullopt;
-    return std::string_view(area + i);
+    const std::string_view text(area, length);
+    const size_t path = text.find_first_not_of('\0', text.find('\0'));
+    if (path == std::string_view::npos) return std::nullopt;
+    return std::string_view(area + path);
 }
 
 } // namespace

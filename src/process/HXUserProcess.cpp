@@ -80,7 +80,7 @@ void HXUserProcess::enumerateRegions(const HXRegionCallback &callback) {
     uint64_t size = 0;
     bool seenFakeRegion = false;
     for (bool stop = false; !stop; address += size) {
-        if (isWithinReachOfSharedRegion(address, last)) {
+        if (last != 0 && address >= last && address < _sharedRegion.end()) {
             const uint64_t asked = address;
             vm_region_basic_info_64 basic{};
             uint32_t count = VM_REGION_BASIC_INFO_COUNT_64;

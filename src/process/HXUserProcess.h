@@ -51,15 +51,13 @@ class HXUserProcess : public HXProcess {
     // Whether the process's host has a shared region at all.
     virtual bool _hostHasSharedRegion() const;
 
-    virtual void _gatherImageData();
+    void _gatherImageData();
     virtual void _gatherPhysHeft();
     void _gatherLedgers();
     void _gatherIdleExitStatus();
-    virtual std::optional<HXOwnedVmObjects> _gatherOwnedVmObjects();
+    std::optional<HXOwnedVmObjects> _gatherOwnedVmObjects();
     void _gatherMemoryData();
 
-    // Whether the pages of this process can be asked for.
-    virtual bool _canQueryPages() const { return true; }
     // Cuts a region into runs of pages of one kind.
     void _addSubrangesForRegion(HXMemoryRegion &region, int32_t purgeState);
     // Queries `pages` pages from the page-aligned `start` on, in chunks; false when a query failed.
@@ -78,9 +76,6 @@ class HXUserProcess : public HXProcess {
     void walkEnded(const char *call, kern_return_t error);
     void printBailingOut() const;
     HXSharedRegionCutter::PageQuery pageQuery();
-    bool isWithinReachOfSharedRegion(uint64_t address, uint64_t last) const {
-        return last != 0 && address >= last && address < _sharedRegion.end();
-    }
     bool handOverRegion(uint64_t address, uint64_t size, const vm_region_submap_info_64 &info,
                         const HXRegionCallback &callback);
     void addImage(const RVSymbolOwner &owner);

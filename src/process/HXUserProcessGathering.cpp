@@ -14,9 +14,22 @@ constexpr uint32_t kNeverOwnedTag = 87;
 
 constexpr char kOwnedObjectsSetting[] = "vm.get_owned_vmobjects";
 
-// Pages of `all` that are left after `taken`; a kernel whose counts disagree leaves none.
-uint64_t pagesLeft(uint64_t all, uint64_t taken) {
+// What of `all` is left after `taken`; a kernel whose counts disagree leaves none.
+uint64_t left(uint64_t all, uint64_t taken) {
     return all > taken ? all - taken : 0;
+}
+
+// What an owned object adds to its owner's heft becomes the region's.
+void takeChargeOf(HXMemoryRegion &region, const owned_vmobject &object) {
+    constexpr uint64_t notCharged = 1;
+    region.setOwnedExclusivelyByParentProcess(true);
+    region.setReclaimableSize(object.reusable_size);
+    const bool isCharged = !(object.flags & notCharged);
+    const auto purgeState = static_cast<int32_t>(object.flags >> 4 & 3);
+    const bool canBePurged = purgeState == VM_PURGABLE_VOLATILE || purgeState == VM_PURGABLE_EMPTY;
+    const uint64_t dirty = canBePurged ? object.wired_size : left(object.resident_size, object.reusable_size);
+    region.setDirtySize(isCharged ? dirty : 0);
+    region.setSwappedSize(isCharged && !canBePurged ? object.compressed_size : 0);
 }
 
 } // namespace
@@ -26,7 +39,7 @@ struct HXUserProcess::Gathering {
     explicit Gathering(HXUserProcess &process)
         : enumerator(process._images), cutter(process.pageSize(), enumerator, regions, process.pageQuery()),
           hidden(process.hiddenFromDisplay()), breakDown(process.breakDownPhysHeft()),
-          cutsRuns(breakDown && !hidden && process._canQueryPages() &&
+          cutsRuns(breakDown && !hidden && process._isAlive() &&
                    !HXHeftSwitches::isSharingAnalysisDisabled()) {}
 
     HXMemoryRegionList regions;
@@ -43,9 +56,9 @@ struct HXUserProcess::Gathering {
 
 void HXUserProcess::gatherData() {
     if (!hiddenFromDisplay()) {
-        _gatherImageData();
+        if (_isAlive()) _gatherImageData(); // others' images come with their regions
         _gatherPhysHeft();
-        _ownedVmObjects = _gatherOwnedVmObjects();
+        if (_isAlive()) _ownedVmObjects = _gatherOwnedVmObjects();
     }
     _gatherMemoryData();
     _images = {};
@@ -149,11 +162,11 @@ void HXUserProcess::setSizes(HXMemoryRegion &region, const Gathering &gathering,
                              const vm_region_submap_info_64 &info) const {
     const uint64_t dirtyPages = info.external_pager || gathering.breakDown
                                     ? info.pages_dirtied
-                                    : pagesLeft(info.pages_resident, info.pages_reusable);
+                                    : left(info.pages_resident, info.pages_reusable);
     region.setDirtySize(dirtyPages * pageSize());
     region.setReclaimableSize(uint64_t{info.pages_reusable} * pageSize());
     region.setSwappedSize(uint64_t{info.pages_swapped_out} * pageSize());
-    region.setCleanNonSpecSize(pagesLeft(info.pages_resident, dirtyPages + info.pages_reusable) * pageSize());
+    region.setCleanNonSpecSize(left(info.pages_resident, dirtyPages + info.pages_reusable) * pageSize());
 }
 
 void HXUserProcess::nameRegion(HXMemoryRegion &region, Gathering &gathering,
@@ -180,13 +193,9 @@ void HXUserProcess::chargeOwnedObject(HXMemoryRegion &region, Gathering &gatheri
     if (_ownedVmObjects) {
         const auto object = _ownedVmObjects->take(info.object_id_full);
         if (!object) return;
-        const HXOwnedCharge charge = HXChargeOfOwnedObject(*object);
-        region.setOwnedExclusivelyByParentProcess(true);
-        region.setReclaimableSize(object->reusable_size);
-        region.setDirtySize(charge.dirty);
-        region.setSwappedSize(charge.swapped);
+        takeChargeOf(region, *object);
         region.setCleanNonSpecSize(0);
-        gathering.attributed += charge.dirty + charge.swapped;
+        gathering.attributed += region.dirtySize() + region.swappedSize();
     } else if (purgeState != VM_PURGABLE_DENY && info.user_tag != kNeverOwnedTag &&
                info.pages_resident != 0) {
         region.setOwnedExclusivelyByParentProcess(true);
@@ -201,18 +210,14 @@ void HXUserProcess::chargeOwnedObject(HXMemoryRegion &region, Gathering &gatheri
 void HXUserProcess::addUnmappedOwnedObjects(Gathering &gathering) {
     if (!_ownedVmObjects) return;
     _ownedVmObjects->forEach([&](const owned_vmobject &object) {
-        const HXOwnedCharge charge = HXChargeOfOwnedObject(object);
         HXMemoryRegion &region = gathering.regions.emplace_back();
+        takeChargeOf(region, object);
         region.setObject_id(object.object_id);
-        region.setOwnedExclusivelyByParentProcess(true);
         region.setUser_tag(kFakeRegionTag);
         region.setName(HXMemoryRegion::categoryNameForTag(kFakeRegionTag));
         region.setSize(object.virtual_size);
-        region.setReclaimableSize(object.reusable_size);
         region.setStart(kNoAddress);
         region.setShare_mode(SM_SHARED);
-        region.setDirtySize(charge.dirty);
-        region.setSwappedSize(charge.swapped);
         region.setWired(object.wired_size != 0);
     });
     _ownedVmObjects.reset();

@@ -66,7 +66,7 @@ bool HXUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uin
 }
 
 HXSharedRegionCutter::PageQuery HXUserProcess::pageQuery() {
-    if (!_canQueryPages()) return nullptr;
+    if (!_isAlive()) return nullptr;
     return [this](uint64_t start, uint64_t pages, const HXDispositionCallback &block) {
         return _enumerateDispositionChunksWithStartAddr(start, pages, block);
     };
