@@ -31,10 +31,11 @@ struct HXHeftArgs::Option {
     const char *name = ""; // empty: no long form
     char letter = '\0';    // zero: no short form
     bool hasArgument = false;
-    int32_t columns = 0;                     // HXTextOptions to add
-    bool HXHeftArgs::*set = nullptr;         // becomes true
-    HXStringSet HXHeftArgs::*list = nullptr; // gets the argument
-    const char *warning = nullptr;           // goes to standard error
+    int32_t columns = 0;                                    // HXTextOptions to add
+    bool HXHeftArgs::*set = nullptr;                        // becomes true
+    std::optional<std::string> HXHeftArgs::*text = nullptr; // becomes the argument
+    HXStringSet HXHeftArgs::*list = nullptr;                // gets the argument
+    const char *warning = nullptr;                          // goes to standard error
     bool (HXHeftArgs::*take)(const std::string &argument, HXError *error) = nullptr;
 
     static const Option all[19];
@@ -42,7 +43,7 @@ struct HXHeftArgs::Option {
 
 const HXHeftArgs::Option HXHeftArgs::Option::all[] = {
     {.name = "all", .letter = 'a', .set = &HXHeftArgs::_targetAll},
-    {.name = "json", .letter = 'j', .hasArgument = true, .take = &HXHeftArgs::takeJSONOutputFile},
+    {.name = "json", .letter = 'j', .hasArgument = true, .text = &HXHeftArgs::_JSONOutputFile},
     {.name = "help", .letter = 'h', .take = &HXHeftArgs::takeHelp},
     {.name = "targetChildren", .letter = 't', .set = &HXHeftArgs::_targetChildren},
     {.letter = 'p', .hasArgument = true, .list = &HXHeftArgs::_potentialTargetProcesses},
@@ -108,6 +109,7 @@ bool HXHeftArgs::fail(HXError *error, HXHeftErrorCode code, std::optional<std::s
 
 bool HXHeftArgs::take(const Option &option, const char *argument, HXError *error) {
     if (option.set) this->*option.set = true;
+    if (option.text) this->*option.text = argument;
     if (option.list) (this->*option.list).add(argument);
     if (option.warning) fputs(option.warning, stderr);
     _textOptions |= option.columns;
@@ -116,11 +118,6 @@ bool HXHeftArgs::take(const Option &option, const char *argument, HXError *error
 
 bool HXHeftArgs::takeHelp(const std::string &, HXError *error) {
     return fail(error, HXErrorHelp);
-}
-
-bool HXHeftArgs::takeJSONOutputFile(const std::string &argument, HXError *) {
-    _JSONOutputFile = argument;
-    return true;
 }
 
 bool HXHeftArgs::takeVmObjectDirty(const std::string &, HXError *) {

@@ -76,7 +76,6 @@ class HXHeftArgs {
                      std::optional<std::string> description = std::nullopt);
     bool take(const Option &option, const char *argument, HXError *error);
     bool takeHelp(const std::string &argument, HXError *error);
-    bool takeJSONOutputFile(const std::string &argument, HXError *error);
     bool takeFormat(const std::string &argument, HXError *error);
     bool takeSort(const std::string &argument, HXError *error);
     bool takePid(const std::string &argument, HXError *error);

@@ -48,8 +48,8 @@ std::set<int32_t> HXHeftArgs::exclusions(HXProcessSnapshot &snapshot) const {
     std::set<int32_t> excluded = {HXPlatform::current().getpid()};
     if (_excludedPidsOrProcesses.empty()) return excluded;
     if (const auto pids = snapshot.pidsForStringDescriptions(_excludedPidsOrProcesses.strings(), nullptr))
-        for (const auto &entry : pids->entries())
-            excluded.insert(entry.pid);
+        for (const int32_t pid : pids->pids())
+            excluded.insert(pid);
     return excluded;
 }
 
@@ -64,10 +64,7 @@ void HXHeftArgs::resolveDescriptions(HXProcessSnapshot &snapshot) {
 }
 
 void HXHeftArgs::addChildren(HXProcessSnapshot &snapshot) {
-    std::vector<int32_t> pids;
-    for (const auto &entry : _targetPids.entries())
-        pids.push_back(entry.pid);
-    if (const auto all = snapshot.childPidsForPids(pids))
+    if (const auto all = snapshot.childPidsForPids(_targetPids.pids()))
         for (const int32_t pid : *all)
             _targetPids.set(pid, std::nullopt);
 }
@@ -93,8 +90,8 @@ HXProcess::Map HXHeftArgs::liveTargets(HXProcessSnapshot &snapshot) {
     HXProcess::Map live;
     if (_searchForUnmapped) {
         excluded.insert(0);
-        for (const auto &entry : _targetPids.entries())
-            excluded.insert(entry.pid);
+        for (const int32_t pid : _targetPids.pids())
+            excluded.insert(pid);
         if (auto all = snapshot.allProcessesExcludingPids(excluded)) live = std::move(*all);
         for (auto &[pid, process] : live)
             process->setHiddenFromDisplay(true);

@@ -10,10 +10,11 @@ namespace {
 // Longer than any graph of a process; what is longer is no graph.
 constexpr uint64_t kLongestFile = uint64_t{4} << 30;
 
-enum { initializationFailed = 1, unknownPlatform = 2 };
+// Codes of HXHeftErrorDomain.
+constexpr int kInitializationFailed = 1, kUnknownPlatform = 2;
 
-bool fail(HXError *error, int code, const char *description) {
-    if (error) *error = HXError(HXHeftErrorDomain, code, description);
+bool fail(HXError *error, const char *domain, int code, std::string description) {
+    if (error) *error = HXError(domain, code, std::move(description));
     return false;
 }
 
@@ -42,17 +43,14 @@ bool HXMemgraphProcess::initWithMemgraph(const std::string &path, HXError *error
     if (data && *data == GXProcessObjectGraph::header)
         data = HXPlatform::current().services().readFile(path, kLongestFile);
     if (!data) {
-        const int failure = errno;
-        if (error)
-            *error = HXError(HXPOSIXErrorDomain, failure,
-                             std::error_code(failure, std::generic_category()).message());
-        return false;
+        const std::error_code failure(errno, std::generic_category());
+        return fail(error, HXPOSIXErrorDomain, failure.value(), failure.message());
     }
     std::string reason;
     _graph = GXProcessObjectGraph::directedGraphWithData(*data, HXPlatform::current().namedTags(), &reason);
     if (!_graph)
-        return fail(error, initializationFailed,
-                    reason.empty() ? "memgraph initialization failed with unknown error" : reason.c_str());
+        return fail(error, HXHeftErrorDomain, kInitializationFailed,
+                    reason.empty() ? "memgraph initialization failed with unknown error" : reason);
 
     proc_bsdinfo info{};
     info.pbi_flags = _graph->is64bit() ? PROC_FLAG_LP64 : 0;
@@ -61,7 +59,7 @@ bool HXMemgraphProcess::initWithMemgraph(const std::string &path, HXError *error
     setName(_graph->processName());
     setDisplayString(name() + " [" + std::to_string(pid()) + "] (memgraph)");
     if (!_setSharedRegionFromPlatform(HXPlatformOfDescription(_graph->processDescriptionString())))
-        return fail(error, unknownPlatform,
+        return fail(error, HXHeftErrorDomain, kUnknownPlatform,
                     "Unable to determine platform from memory graph process description");
     return true;
 }

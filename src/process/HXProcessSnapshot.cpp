@@ -32,6 +32,13 @@ void HXPidDescriptions::set(int32_t pid, Description description) {
         _entries[position->second].description = std::move(description);
 }
 
+std::vector<int32_t> HXPidDescriptions::pids() const {
+    std::vector<int32_t> pids;
+    for (const Entry &entry : _entries)
+        pids.push_back(entry.pid);
+    return pids;
+}
+
 void HXPidDescriptions::remove(const std::set<int32_t> &pids) {
     _index.clear();
     for (Entry &entry : std::exchange(_entries, {}))

@@ -26,6 +26,7 @@ class HXPidDescriptions {
     void set(int32_t pid, Description description);
     void remove(const std::set<int32_t> &pids);
     const std::vector<Entry> &entries() const { return _entries; }
+    std::vector<int32_t> pids() const;
     bool empty() const { return _entries.empty(); }
 
   private:
