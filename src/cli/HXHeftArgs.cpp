@@ -10,19 +10,10 @@
 
 namespace {
 
-// Values of options without a short form.
-enum { physHeftOption = 256, vmObjectDirtyOption, swappedOption, wiredOption, sortOption, unmappedOption };
-
-constexpr char kShortOptions[] = "aj:htp:x:svf:yw";
-
 std::string lowered(std::string text) {
     std::transform(text.begin(), text.end(), text.begin(),
                    [](char c) { return static_cast<char>(std::tolower(static_cast<unsigned char>(c))); });
     return text;
-}
-
-void setError(HXError *error, HXHeftErrorCode code, std::optional<std::string> description = std::nullopt) {
-    if (error) *error = HXError(HXHeftError, code, std::move(description));
 }
 
 } // namespace
@@ -35,32 +26,44 @@ void HXStringSet::remove(const std::string &text) {
     std::erase(_strings, text);
 }
 
-// The scanner's flag cells.
-struct HXHeftArgs::Parse {
-    int procFlag = 0;
-    int pidFlag = 0;
+// One option, and what of it there is to do.
+struct HXHeftArgs::Option {
+    const char *name = ""; // empty: no long form
+    char letter = '\0';    // zero: no short form
+    bool hasArgument = false;
+    int32_t columns = 0;                                    // HXTextOptions to add
+    bool HXHeftArgs::*set = nullptr;                        // becomes true
+    std::optional<std::string> HXHeftArgs::*text = nullptr; // becomes the argument
+    HXStringSet HXHeftArgs::*list = nullptr;                // gets the argument
+    const char *warning = nullptr;                          // goes to standard error
+    bool (HXHeftArgs::*take)(const std::string &argument, HXError *error) = nullptr;
 
-    std::vector<HXLongOption> options() {
-        return {{"all", false, nullptr, 'a'},
-                {"json", true, nullptr, 'j'},
-                {"help", false, nullptr, 'h'},
-                {"targetChildren", false, nullptr, 't'},
-                {"", true, nullptr, 'p'},
-                {"proc", true, &procFlag, 1},
-                {"exclude", true, nullptr, 'x'},
-                {"pid", true, &pidFlag, 1},
-                {"skip", false, nullptr, 's'},
-                {"", false, nullptr, 'v'},
-                {"format", true, nullptr, 'f'},
-                {"sort", true, nullptr, sortOption},
-                {"summary", false, nullptr, 'y'},
-                {"physHeft", false, nullptr, physHeftOption},
-                {"vmObjectDirty", false, nullptr, vmObjectDirtyOption},
-                {"wide", false, nullptr, 'w'},
-                {"swapped", false, nullptr, swappedOption},
-                {"wired", false, nullptr, wiredOption},
-                {"unmapped", false, nullptr, unmappedOption}};
-    }
+    static const Option all[19];
+};
+
+const HXHeftArgs::Option HXHeftArgs::Option::all[] = {
+    {.name = "all", .letter = 'a', .set = &HXHeftArgs::_targetAll},
+    {.name = "json", .letter = 'j', .hasArgument = true, .text = &HXHeftArgs::_JSONOutputFile},
+    {.name = "help", .letter = 'h', .take = &HXHeftArgs::takeHelp},
+    {.name = "targetChildren", .letter = 't', .set = &HXHeftArgs::_targetChildren},
+    {.letter = 'p', .hasArgument = true, .list = &HXHeftArgs::_potentialTargetProcesses},
+    {.name = "proc", .hasArgument = true, .list = &HXHeftArgs::_potentialTargetProcesses},
+    {.name = "exclude", .letter = 'x', .hasArgument = true, .list = &HXHeftArgs::_excludedPidsOrProcesses},
+    {.name = "pid", .hasArgument = true, .take = &HXHeftArgs::takePid},
+    {.name = "skip", .letter = 's', .set = &HXHeftArgs::_skipIdleExitClean},
+    {.letter = 'v', .set = &HXHeftArgs::_atlasLikeOutput},
+    {.name = "format", .letter = 'f', .hasArgument = true, .take = &HXHeftArgs::takeFormat},
+    {.name = "sort", .hasArgument = true, .take = &HXHeftArgs::takeSort},
+    {.name = "summary",
+     .letter = 'y',
+     .warning = "WARNING: -y/--summary options are deprecated because summary is the default mode\n"},
+    {.name = "physHeft",
+     .warning = "WARNING: --physHeft option is deprecated because it is the default mode\n"},
+    {.name = "vmObjectDirty", .take = &HXHeftArgs::takeVmObjectDirty},
+    {.name = "wide", .letter = 'w', .columns = HXTextWired | HXTextSwapped | HXTextWide},
+    {.name = "swapped", .columns = HXTextSwapped},
+    {.name = "wired", .columns = HXTextWired},
+    {.name = "unmapped", .set = &HXHeftArgs::_searchForUnmapped},
 };
 
 const std::vector<std::string> &HXHeftArgs::sortColumnNames() {
@@ -70,15 +73,28 @@ const std::vector<std::string> &HXHeftArgs::sortColumnNames() {
 }
 
 std::unique_ptr<HXHeftArgs> HXHeftArgs::withArgc(int argc, char *const argv[], HXError *error) {
+    constexpr int beyondLetters = 256; // the first value of options that have no letter
     if (error) *error = HXError();
+    std::string letters;
+    std::vector<HXLongOption> words;
+    for (const Option &option : Option::all) {
+        const int position = static_cast<int>(words.size());
+        if (option.letter) letters += std::string(1, option.letter) + (option.hasArgument ? ":" : "");
+        words.push_back({option.name, option.hasArgument, nullptr,
+                         option.letter ? option.letter : beyondLetters + position});
+    }
     auto args = std::make_unique<HXHeftArgs>();
-    Parse parse;
-    const std::vector<HXLongOption> options = parse.options();
     HXOptionScan scan;
     for (bool restart = true;; restart = false) {
-        scan = HXPlatform::current().services().getopt_long(argc, argv, kShortOptions, options, restart);
+        scan = HXPlatform::current().services().getopt_long(argc, argv, letters.c_str(), words, restart);
         if (scan.result == -1) break;
-        if (!args->takeOption(scan.result, scan.argument, parse, error)) return nullptr;
+        const auto word = std::find_if(words.begin(), words.end(),
+                                       [&](const HXLongOption &each) { return each.value == scan.result; });
+        if (word == words.end()) {
+            fail(error, HXErrorOption);
+            return nullptr;
+        }
+        if (!args->take(Option::all[word - words.begin()], scan.argument, error)) return nullptr;
     }
     args->reconcile();
     for (int i = scan.index; i < argc; i++)
@@ -86,82 +102,37 @@ std::unique_ptr<HXHeftArgs> HXHeftArgs::withArgc(int argc, char *const argv[], H
     return args;
 }
 
-bool HXHeftArgs::takeOption(int option, const char *argument, Parse &parse, HXError *error) {
-    switch (option) {
-    case 'a':
-        _targetAll = true;
-        return true;
-    case 'j':
-        _JSONOutputFile = argument;
-        return true;
-    case 'h':
-        setError(error, HXErrorHelp);
-        return false;
-    case 't':
-        _targetChildren = true;
-        return true;
-    case 'p':
-        _potentialTargetProcesses.add(argument);
-        return true;
-    case 'x':
-        _excludedPidsOrProcesses.add(argument);
-        return true;
-    case 's':
-        _skipIdleExitClean = true;
-        return true;
-    case 'v':
-        _atlasLikeOutput = true;
-        _summarize = false;
-        return true;
-    case 'f':
-        return takeFormat(argument, error);
-    case 'y':
-        fputs("WARNING: -y/--summary options are deprecated because summary is the default mode\n", stderr);
-        return true;
-    case 'w':
-        _textOptions |= HXTextWired | HXTextSwapped | HXTextWide;
-        return true;
-    case physHeftOption:
-        fputs("WARNING: --physHeft option is deprecated because it is the default mode\n", stderr);
-        return true;
-    case vmObjectDirtyOption:
-        _shouldGetPhysHeftBreakdown = false;
-        _didSetShouldGetPhysHeftBreakdown = true;
-        return true;
-    case swappedOption:
-        _textOptions |= HXTextSwapped;
-        return true;
-    case wiredOption:
-        _textOptions |= HXTextWired;
-        return true;
-    case sortOption:
-        return takeSort(argument, error);
-    case unmappedOption:
-        _searchForUnmapped = true;
-        return true;
-    case 0:
-        if (parse.procFlag) {
-            parse.procFlag = 0;
-            _potentialTargetProcesses.add(argument);
-        } else if (parse.pidFlag) {
-            parse.pidFlag = 0;
-            return takePid(argument, error);
-        }
-        return true;
-    default:
-        setError(error, HXErrorOption);
-        return false;
-    }
+bool HXHeftArgs::fail(HXError *error, HXHeftErrorCode code, std::optional<std::string> description) {
+    if (error) *error = HXError(HXHeftError, code, std::move(description));
+    return false;
+}
+
+bool HXHeftArgs::take(const Option &option, const char *argument, HXError *error) {
+    if (option.set) this->*option.set = true;
+    if (option.text) this->*option.text = argument;
+    if (option.list) (this->*option.list).add(argument);
+    if (option.warning) fputs(option.warning, stderr);
+    _textOptions |= option.columns;
+    return !option.take || (this->*option.take)(argument ? argument : "", error);
+}
+
+bool HXHeftArgs::takeHelp(const std::string &, HXError *error) {
+    return fail(error, HXErrorHelp);
+}
+
+bool HXHeftArgs::takeVmObjectDirty(const std::string &, HXError *) {
+    _shouldGetPhysHeftBreakdown = false;
+    _didSetShouldGetPhysHeftBreakdown = true;
+    return true;
 }
 
 bool HXHeftArgs::takeFormat(const std::string &argument, HXError *error) {
     static const std::vector<std::string> formats = {"bytes", "formatted", "pages"};
     const auto found = std::find(formats.begin(), formats.end(), argument);
     if (found == formats.end()) {
-        setError(
+        return fail(
             error, HXErrorFormat,
             "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.");
-        return false;
     }
     _summaryFormat = static_cast<int32_t>(found - formats.begin());
     return true;
@@ -176,20 +147,18 @@ bool HXHeftArgs::takeSort(const std::string &argument, HXError *error) {
         }
         accepted += (accepted.empty() ? "" : ", ") + lowered(name);
     }
-    setError(error, HXErrorSort,
-             "Unrecognized argument '" + argument + "' to --sort.\nAccepted arguments: " + accepted);
-    return false;
+    return fail(error, HXErrorSort,
+                "Unrecognized argument '" + argument + "' to --sort.\nAccepted arguments: " + accepted);
 }
 
 bool HXHeftArgs::takePid(const std::string &argument, HXError *error) {
     char *end = nullptr;
     const long number = std::strtol(argument.c_str(), &end, 10);
     if (end == argument.c_str()) {
-        setError(error, HXErrorPid,
-                 "'" + argument +
-                     "' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a "
-                     "process name.");
-        return false;
+        return fail(error, HXErrorPid,
+                    "'" + argument +
+                        "' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a "
+                        "process name.");
     }
     _targetPids.set(static_cast<int32_t>(number), std::nullopt);
     return true;
@@ -198,8 +167,7 @@ bool HXHeftArgs::takePid(const std::string &argument, HXError *error) {
 void HXHeftArgs::reconcile() {
     if (!_shouldGetPhysHeftBreakdown && _searchForUnmapped) {
         fputs("WARNING: ignoring '--unmapped' because the requested analysis mode '--vmObjectDirty' does not "
-              "support "
-              "unmapped owned VM objects\n",
+              "support unmapped owned VM objects\n",
               stderr);
         _searchForUnmapped = false;
     } else if (_targetAll && _searchForUnmapped) {

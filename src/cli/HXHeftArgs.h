@@ -2,7 +2,7 @@
 #pragma once
 
 #include "model/HXError.h"
-#include "process/HXProcess.h"
+#include "process/HXProcessSnapshot.h"
 
 #include <cstdint>
 #include <memory>
@@ -55,12 +55,10 @@ class HXHeftArgs {
     bool targetAll() const { return _targetAll; }
     bool skipIdleExitClean() const { return _skipIdleExitClean; }
     bool atlasLikeOutput() const { return _atlasLikeOutput; }
-    bool summarize() const { return _summarize; }
+    bool summarize() const { return !_atlasLikeOutput; }
     bool shouldGetPhysHeftBreakdown() const { return _shouldGetPhysHeftBreakdown; }
     bool didSetShouldGetPhysHeftBreakdown() const { return _didSetShouldGetPhysHeftBreakdown; }
     bool searchForUnmapped() const { return _searchForUnmapped; }
-    bool excludeSelf() const { return _excludeSelf; }
-    void setExcludeSelf(bool exclude) { _excludeSelf = exclude; }
     int32_t summaryFormat() const { return _summaryFormat; } // HXSummaryFormat
     int32_t textOptions() const { return _textOptions; }     // HXTextOptions
     const std::string &textSort() const { return _textSort; }
@@ -70,32 +68,35 @@ class HXHeftArgs {
     const HXStringSet &excludedPidsOrProcesses() const { return _excludedPidsOrProcesses; }
 
   private:
-    struct Parse;
-    struct Memgraphs;
+    struct Option;
+    struct Choice;
 
-    // Acts on one step of the scanner; false with *error set when parsing must stop.
-    bool takeOption(int option, const char *argument, Parse &parse, HXError *error);
+    // Every step that can fail answers false with *error (may be null) set.
+    static bool fail(HXError *error, HXHeftErrorCode code,
+                     std::optional<std::string> description = std::nullopt);
+    bool take(const Option &option, const char *argument, HXError *error);
+    bool takeHelp(const std::string &argument, HXError *error);
     bool takeFormat(const std::string &argument, HXError *error);
     bool takeSort(const std::string &argument, HXError *error);
     bool takePid(const std::string &argument, HXError *error);
+    bool takeVmObjectDirty(const std::string &argument, HXError *error);
     void reconcile();
 
-    bool loadMemgraphs(Memgraphs &memgraphs, HXError *error);
-    bool takeMemgraph(const std::string &path, Memgraphs &memgraphs, HXError *error);
-    std::set<int32_t> exclusions() const;
-    void resolveDescriptions();
-    void addChildren();
-    void addTargets(HXProcess::Map &processes) const;
+    bool loadMemgraphs(Choice &choice, HXError *error);
+    bool takeMemgraph(const std::string &path, Choice &choice, HXError *error);
+    HXProcess::Map liveTargets(HXProcessSnapshot &snapshot);
+    std::set<int32_t> exclusions(HXProcessSnapshot &snapshot) const;
+    void resolveDescriptions(HXProcessSnapshot &snapshot);
+    void addChildren(HXProcessSnapshot &snapshot);
+    void addTargets(HXProcessSnapshot &snapshot, HXProcess::Map &processes) const;
 
     bool _targetChildren = false;
     bool _targetAll = false;
     bool _skipIdleExitClean = false;
     bool _atlasLikeOutput = false;
-    bool _summarize = true;
     bool _shouldGetPhysHeftBreakdown = true;
     bool _didSetShouldGetPhysHeftBreakdown = false;
     bool _searchForUnmapped = false;
-    bool _excludeSelf = true;
     int32_t _summaryFormat = 1;
     int32_t _textOptions = 0;
     std::string _textSort = sortColumnNames().front();

@@ -10,28 +10,35 @@
 #include <cerrno>
 #include <system_error>
 
+namespace {
+
+// %s: the default sort column.
+constexpr char kUsage[] =
+    "Gather memory information about a process or set of processes\n"
+    "Usage: heft [args] [proc/pid/memgraph [proc/pid/memgraph [...]]]\n"
+    "\t-a, --all \t\t\t\ttarget all processes\n"
+    "\t-j, --json <file> \t\t\tprint json output to a file\n"
+    "\t-h, --help \t\t\t\tprint this output\n"
+    "\t-p, --proc, --pid [proc/pid] \t\ttarget pid or process (or interpret for -p)\n"
+    "\t-x, --exclude [proc/pid] \t\texclude pid or process\n"
+    "\t-s, --skip \t\t\t\tskip processes that are idle-exit clean\n"
+    "\t-v \t\t\t\t\tprint all regions and atlas-like output of address space layout "
+    "(default output is a summary)\n"
+    "\t-f, --format (bytes|formatted|pages) \tchange size formatting preference (default: formatted)\n"
+    "\t--sort <column> \t\t\tchange the column used for sorting (default: %s)\n"
+    "\t-w, --wide\t\t\t\tshow wide output with all columns and full paths (implies --swapped --wired)\n"
+    "\t--swapped\t\t\t\tshow swapped/compressed column\n"
+    "\t--wired\t\t\t\t\tshow wired column\n"
+    "\t--vmObjectDirty\t\t\tinterpret dirty memory as viewed by VM objects in the kernel\n"
+    "\t--unmapped\t\t\t\tsearch all processes for unmapped memory owned by the target processes\n";
+
+} // namespace
+
 void printUsage() {
     std::string defaultSort = HXHeftArgs::sortColumnNames().front();
     for (char &c : defaultSort)
         c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
-    puts("Gather memory information about a process or set of processes");
-    puts("Usage: heft [args] [proc/pid/memgraph [proc/pid/memgraph [...]]]");
-    puts("\t-a, --all \t\t\t\ttarget all processes");
-    puts("\t-j, --json <file> \t\t\tprint json output to a file");
-    puts("\t-h, --help \t\t\t\tprint this output");
-    puts("\t-p, --proc, --pid [proc/pid] \t\ttarget pid or process (or interpret for -p)");
-    puts("\t-x, --exclude [proc/pid] \t\texclude pid or process");
-    puts("\t-s, --skip \t\t\t\tskip processes that are idle-exit clean");
-    puts(
-        "\t-v \t\t\t\t\tprint all regions and atlas-like output of address space layout (default output is a "
-        "summary)");
-    puts("\t-f, --format (bytes|formatted|pages) \tchange size formatting preference (default: formatted)");
-    printf("\t--sort <column> \t\t\tchange the column used for sorting (default: %s)\n", defaultSort.c_str());
-    puts("\t-w, --wide\t\t\t\tshow wide output with all columns and full paths (implies --swapped --wired)");
-    puts("\t--swapped\t\t\t\tshow swapped/compressed column");
-    puts("\t--wired\t\t\t\t\tshow wired column");
-    puts("\t--vmObjectDirty\t\t\tinterpret dirty memory as viewed by VM objects in the kernel");
-    puts("\t--unmapped\t\t\t\tsearch all processes for unmapped memory owned by the target processes");
+    printf(kUsage, defaultSort.c_str());
 }
 
 namespace {

@@ -1,7 +1,7 @@
 // heft-record: writes captures of the live machine.
 #include "model/HXMemoryRegion.h"
 #include "platform/linux/HXLinuxPlatform.h"
-#include "process/HXProcess.h"
+#include "process/HXProcessSnapshot.h"
 #include "record/HXMachineRecorder.h"
 #include "record/HXMemgraphRecorder.h"
 
@@ -10,6 +10,7 @@
 #include <cstdio>
 #include <cstring>
 #include <functional>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -41,25 +42,19 @@ int failUsage() {
     return 1;
 }
 
-// Whether `word` is there as an option before the other words; takes it away.
-bool takeOption(Words &words, std::string_view word) {
-    const bool found = !words.empty() && words.front() == word;
-    if (found) words.erase(words.begin());
-    return found;
-}
-
-// The process that `word` names, told on standard error when there is none.
-bool parsePid(HXPlatform &host, std::string_view word, int32_t *pid) {
+// The process that `word` names; none, told on standard error, when there is none.
+std::optional<int32_t> parsePid(HXPlatform &host, std::string_view word) {
     const char *const end = word.data() + word.size();
-    const auto [stop, error] = std::from_chars(word.data(), end, *pid);
-    if (error != std::errc() || stop != end || *pid < 0) {
+    int32_t pid = 0;
+    const auto [stop, error] = std::from_chars(word.data(), end, pid);
+    if (error != std::errc() || stop != end || pid < 0) {
         fail(word, "not a process id");
-        return false;
+        return std::nullopt;
     }
     proc_bsdshortinfo info;
-    if (*pid == 0 || host.proc_pidinfo(*pid, PROC_PIDT_SHORTBSDINFO, 1, &info, sizeof info) != 0) return true;
+    if (pid == 0 || host.proc_pidinfo(pid, PROC_PIDT_SHORTBSDINFO, 1, &info, sizeof info) != 0) return pid;
     fail(word, std::strerror(errno));
-    return false;
+    return std::nullopt;
 }
 
 // Writes `path` with `write`, which tells itself what fails; the file appears only when all succeeds.
@@ -73,13 +68,14 @@ int writeFile(HXServices &services, const std::string &path, const std::function
     return services.commitPendingFile(*file) ? 0 : fail(path, std::strerror(errno));
 }
 
-int recordMachine(HXPlatform &host, Words words) {
-    const bool anonymize = takeOption(words, "--anonymize");
-    if (words.empty() || words.front().starts_with("-")) return failUsage();
-    const std::string path(words.front());
+int recordMachine(HXPlatform &host, const Words &words, bool anonymize) {
+    const std::string path(words[0]);
     std::vector<int32_t> pids;
-    for (size_t i = 1; i < words.size(); i++)
-        if (!parsePid(host, words[i], &pids.emplace_back())) return 1;
+    for (size_t i = 1; i < words.size(); i++) {
+        const auto pid = parsePid(host, words[i]);
+        if (!pid) return 1;
+        pids.push_back(*pid);
+    }
     return writeFile(host.services(), path, [&](std::FILE *out) {
         HXMachineRecorder recorder(host, out, anonymize);
         if (!recorder.record(pids)) {
@@ -92,23 +88,35 @@ int recordMachine(HXPlatform &host, Words words) {
     });
 }
 
-int recordMemgraph(HXPlatform &host, Words words) {
-    const bool vmObjectDirty = takeOption(words, "--vmObjectDirty");
-    if (words.size() != 2 || words.front().starts_with("-")) return failUsage();
-    int32_t pid = 0;
-    if (!parsePid(host, words[0], &pid)) return 1;
-    proc_bsdinfo info{};
-    if (host.proc_pidinfo(pid, PROC_PIDTBSDINFO, 0, &info, sizeof info) != int32_t{sizeof info})
-        return fail(words[0], std::strerror(errno));
+int recordMemgraph(HXPlatform &host, const Words &words, bool vmObjectDirty) {
+    const auto pid = parsePid(host, words[0]);
+    if (!pid) return 1;
+    HXProcessSnapshot snapshot;
+    const auto info = snapshot.bsdInfoOfPid(*pid);
+    if (!info) return fail(words[0], std::strerror(errno));
     return writeFile(host.services(), std::string(words[1]), [&](std::FILE *out) {
         HXMemgraphRecorder recorder(
             host, out, [](uint32_t tag) { return HXMemoryRegion::categoryNameForTag(tag).str(); });
         std::string reason;
-        if (recorder.record(pid, HXProcess::_nameForBsdInfo(info), !vmObjectDirty, &reason)) return true;
+        if (recorder.record(*pid, snapshot.nameOf(*info), !vmObjectDirty, &reason)) return true;
         fail(words[0], reason);
         return false;
     });
 }
+
+// A capture: its name on the command line, the one option that may follow, how many words must and may come
+// then, and what writes it.
+struct Capture {
+    std::string_view name;
+    std::string_view option;
+    size_t fewestWords;
+    size_t mostWords;
+    int (*record)(HXPlatform &host, const Words &words, bool hasOption);
+};
+constexpr Capture kCaptures[] = {
+    {"machine", "--anonymize", 1, SIZE_MAX, recordMachine},
+    {"memgraph", "--vmObjectDirty", 2, 2, recordMemgraph},
+};
 
 } // namespace
 
@@ -122,7 +130,14 @@ int main(int argc, char *argv[]) {
     static HXLinuxPlatform live;
     live.prepareProcess();
     HXPlatform::setCurrent(&live);
-    if (takeOption(words, "machine")) return recordMachine(live, words);
-    if (takeOption(words, "memgraph")) return recordMemgraph(live, words);
+    for (const Capture &capture : kCaptures) {
+        if (words[0] != capture.name) continue;
+        const bool hasOption = words.size() > 1 && words[1] == capture.option;
+        words.erase(words.begin(), words.begin() + (hasOption ? 2 : 1));
+        if (words.size() < capture.fewestWords || words.size() > capture.mostWords ||
+            words[0].starts_with('-'))
+            return failUsage();
+        return capture.record(live, words, hasOption);
+    }
     return failUsage();
 }

@@ -46,22 +46,6 @@ uint64_t siteType(const mach_memory_info_record &info) {
     return info.flags & VM_KERN_SITE_TYPE;
 }
 
-uint64_t objectIdForSite(const mach_memory_info_record &info) {
-    uint64_t source = kSourceCode;
-    switch (siteType(info)) {
-    case VM_KERN_SITE_TAG:
-        source = kSourceTag;
-        break;
-    case VM_KERN_SITE_KMOD:
-        source = kSourceKext;
-        break;
-    case VM_KERN_SITE_COUNTER:
-        source = kSourceCounter;
-        break;
-    }
-    return info.site ^ source << 32;
-}
-
 template <size_t Width>
 std::string textOfField(const char (&field)[Width]) {
     return std::string(field, strnlen(field, Width));
@@ -73,45 +57,59 @@ std::string hexadecimal(uint64_t number) {
     return text;
 }
 
-std::string nameForTag(uint64_t tag) {
+std::string nameForTag(uint64_t tag, const HXKernelProcess::SiteNames &) {
     if (tag < std::size(kTagNames)) return kTagNames[tag];
     return tag == kAnyTag ? "VM_KERN_MEMORY_ANY" : "VM_KERN_MEMORY_" + std::to_string(tag);
 }
 
-std::string nameForCounter(uint64_t counter) {
+std::string nameForCounter(uint64_t counter, const HXKernelProcess::SiteNames &) {
     if (counter < std::size(kCounterNames)) return kCounterNames[counter];
     return "VM_KERN_COUNT_" + std::to_string(counter);
 }
 
-std::string nameForKext(uint64_t loadTag, const HXKernelProcess::KextTags &kexts) {
-    const auto kext = kexts.find(loadTag);
-    if (kext != kexts.end() && kext->second.CFBundleIdentifier) return *kext->second.CFBundleIdentifier;
+std::string nameForKext(uint64_t loadTag, const HXKernelProcess::SiteNames &names) {
+    const auto kext = names.kexts.find(loadTag);
+    if (kext != names.kexts.end() && kext->second.CFBundleIdentifier) return *kext->second.CFBundleIdentifier;
     return "unloaded kmod " + std::to_string(loadTag);
 }
 
-std::string nameForCode(uint64_t address, RVSymbolicator *symbolicator) {
-    if (address != 0 && symbolicator) {
-        HXPlatform &platform = HXPlatform::current();
-        const RVSymbol symbol =
-            platform.RVSymbolicatorGetSymbolWithAddressAtTime(symbolicator, address, kRVNow);
+std::string nameForCode(uint64_t address, const HXKernelProcess::SiteNames &names) {
+    if (address != 0 && names.symbolicator) {
+        const RVSymbol symbol = HXPlatform::current().RVSymbolicatorGetSymbolWithAddressAtTime(
+            names.symbolicator.get(), address, kRVNow);
         if (symbol.name) return symbol.name;
     }
     return "site " + hexadecimal(address);
 }
 
-std::string nameForSite(const mach_memory_info_record &info, const HXKernelProcess::KextTags &kexts,
-                        RVSymbolicator *symbolicator) {
+// What sites of one type have in common.
+struct SiteKind {
+    uint64_t type;
+    uint64_t source; // of their object identifiers
+    std::string (*name)(uint64_t site, const HXKernelProcess::SiteNames &names);
+};
+constexpr SiteKind kSiteKinds[] = {
+    {VM_KERN_SITE_TAG, kSourceTag, nameForTag},
+    {VM_KERN_SITE_KMOD, kSourceKext, nameForKext},
+    {VM_KERN_SITE_KERNEL, kSourceCode, nameForCode},
+    {VM_KERN_SITE_COUNTER, kSourceCounter, nameForCounter},
+};
+
+// Null for types that a newer kernel has.
+const SiteKind *kindOfSite(const mach_memory_info_record &info) {
+    for (const SiteKind &kind : kSiteKinds)
+        if (kind.type == siteType(info)) return &kind;
+    return nullptr;
+}
+
+uint64_t objectIdForSite(const mach_memory_info_record &info) {
+    const SiteKind *const kind = kindOfSite(info);
+    return info.site ^ (kind ? kind->source : kSourceCode) << 32;
+}
+
+std::string nameForSite(const mach_memory_info_record &info, const HXKernelProcess::SiteNames &names) {
     if (info.flags & VM_KERN_SITE_NAMED) return textOfField(info.name);
-    switch (siteType(info)) {
-    case VM_KERN_SITE_TAG:
-        return nameForTag(info.site);
-    case VM_KERN_SITE_KMOD:
-        return nameForKext(info.site, kexts);
-    case VM_KERN_SITE_KERNEL:
-        return nameForCode(info.site, symbolicator);
-    case VM_KERN_SITE_COUNTER:
-        return nameForCounter(info.site);
-    }
+    if (const SiteKind *const kind = kindOfSite(info)) return kind->name(info.site, names);
     return "unknown site (" + hexadecimal(siteType(info)) + ", " + hexadecimal(info.site) + ")";
 }
 
@@ -150,10 +148,9 @@ void setSiteSizes(HXMemoryRegion &region, const mach_memory_info_record &info) {
 
 } // namespace
 
-bool HXKernelProcess::initWithBsdInfo(const proc_bsdinfo &info) {
-    if (!HXProcess::initWithBsdInfo(info)) return false;
+bool HXKernelProcess::initWithBsdInfo(const proc_bsdinfo &info, HXProcessSnapshot *snapshot) {
+    if (!HXProcess::initWithBsdInfo(info, snapshot)) return false;
     _idleExitStatus = HXIdleExitNotSupported;
-    _auxData = std::make_shared<HXAuxDictionary>();
     return true;
 }
 
@@ -163,67 +160,62 @@ HXAuxTree HXKernelProcess::auxData() const {
     return tree;
 }
 
-void HXKernelProcess::release(const void *array, uint64_t bytes) const {
-    HXPlatform &platform = HXPlatform::current();
-    const kern_return_t error = platform.vm_deallocate(platform.mach_task_self(), array, bytes);
-    if (error != KERN_SUCCESS)
-        std::fprintf(stderr, "%s: vm_deallocate: %s\n", displayString().c_str(),
-                     platform.mach_error_string(error));
-}
-
 void HXKernelProcess::gatherData() {
     HXPlatform &platform = HXPlatform::current();
-    mach_zone_name *zoneNames = nullptr;
-    mach_zone_info *zones = nullptr;
-    mach_memory_info_record *records = nullptr;
-    uint32_t nameCount = 0, zoneCount = 0, recordCount = 0;
-    const kern_return_t error = platform.mach_memory_info(platform.mach_host_self(), &zoneNames, &nameCount,
-                                                          &zones, &zoneCount, &records, &recordCount);
+    HXKernelArray<mach_zone_name> zoneNames(platform);
+    HXKernelArray<mach_zone_info> zones(platform);
+    HXKernelArray<mach_memory_info_record> records(platform);
+    const kern_return_t error =
+        platform.mach_memory_info(platform.mach_host_self(), &zoneNames.array, &zoneNames.count, &zones.array,
+                                  &zones.count, &records.array, &records.count);
     if (error != KERN_SUCCESS) {
         const char *reason = platform.mach_error_string(error);
         std::fprintf(stderr, "%s: mach_memory_info: %s\n", displayString().c_str(), reason);
         _errors.push_back(displayString() + ": " + reason);
         return;
     }
+    const auto release = [&](auto &array) {
+        const kern_return_t failure = array.release();
+        if (failure != KERN_SUCCESS)
+            std::fprintf(stderr, "%s: vm_deallocate: %s\n", displayString().c_str(),
+                         platform.mach_error_string(failure));
+    };
+    _addZones(zones.records(), zoneNames.records());
+    release(zones);
+    _addWiredData(records.records(), zoneNames.records());
+    release(zoneNames);
+    release(records);
+}
 
-    HXMemoryRegionList regions;
-    for (uint32_t i = 0; i < zoneCount; i++) {
-        HXMemoryRegion &region = regions.emplace_back();
-        region.setName(i < nameCount ? textOfField(zoneNames[i].mzn_name) : "unknown");
+void HXKernelProcess::_addZones(std::span<const mach_zone_info> zones, ZoneNames names) {
+    for (size_t i = 0; i < zones.size(); i++) {
+        HXMemoryRegion &region = _memoryRegions.emplace_back();
+        region.setName(i < names.size() ? textOfField(names[i].mzn_name) : "unknown");
         setZoneSizes(region, zones[i]);
         region.setDetailedName("zone");
         region.setObject_id((kSourceZone << 32) + i);
     }
-    release(zones, uint64_t{zoneCount} * sizeof *zones);
-    _addWiredData(records, recordCount, zoneNames, nameCount, regions);
-    release(zoneNames, uint64_t{nameCount} * sizeof *zoneNames);
-    release(records, uint64_t{recordCount} * sizeof *records);
-    setMemoryRegions(std::move(regions));
 }
 
-void HXKernelProcess::_addWiredData(const mach_memory_info_record *records, uint32_t count,
-                                    const mach_zone_name *zoneNames, uint32_t zoneCount,
-                                    HXMemoryRegionList &regions) {
+void HXKernelProcess::_addWiredData(std::span<const mach_memory_info_record> records, ZoneNames zoneNames) {
     constexpr uint64_t counterMask = VM_KERN_SITE_TYPE | VM_KERN_SITE_WIRED | VM_KERN_SITE_ZONE;
-    RVSymbolicator *symbolicator = _createSymbolicator();
-    const KextTags kexts = kextTags();
-    for (uint32_t k = 0; k < count; k++) {
+    const SiteNames names{kextTags(), _createSymbolicator(), zoneNames};
+    for (size_t k = 0; k < records.size(); k++) {
         const mach_memory_info_record &info = records[k];
         const bool isCounter = (info.flags & counterMask) == VM_KERN_SITE_COUNTER;
         const uint64_t amount = isCounter ? info.mapped : info.size;
         if (info.site == 0 && amount == 0) continue;
         if (isCounter) {
-            _auxData->set(_nameForWiredInfo(info, kexts, symbolicator, nullptr, 0),
+            _auxData->set(_nameForWiredInfo(info, names),
                           std::make_shared<HXAuxData>(static_cast<int64_t>(amount), false));
             continue;
         }
-        HXMemoryRegion &region = regions.emplace_back();
+        HXMemoryRegion &region = _memoryRegions.emplace_back();
         setSiteSizes(region, info);
-        region.setUser_tag(k);
+        region.setUser_tag(static_cast<uint32_t>(k));
         region.setObject_id(objectIdForSite(info));
-        _setNameForRegion(region, info, kexts, symbolicator, zoneNames, zoneCount);
+        _setNameForRegion(region, info, names);
     }
-    HXPlatform::current().RVRelease(symbolicator);
 }
 
 HXKernelProcess::KextTags HXKernelProcess::_kextTagsWithKextInfo(const std::vector<OSKextInfo> &kextInfo) {
@@ -237,30 +229,26 @@ HXKernelProcess::KextTags HXKernelProcess::kextTags() {
     return _kextTagsWithKextInfo(HXPlatform::current().OSKextCopyLoadedKextInfo());
 }
 
-RVSymbolicator *HXKernelProcess::_createSymbolicator() {
+HXSymbolicatorGuard HXKernelProcess::_createSymbolicator() {
     // The library's flags for symbols of the running kernel.
     constexpr uint32_t kernelFlags = 0x100000 | 0x2;
     HXPlatform &platform = HXPlatform::current();
-    const uint32_t flags = platform.RVSymbolicatorGetFlagsForNListOnlyData() | kernelFlags;
-    return platform.RVSymbolicatorCreateWithMachKernelFlagsAndNotification(flags, nullptr);
+    return HXSymbolicatorOfKernel(platform, platform.RVSymbolicatorGetFlagsForNListOnlyData() | kernelFlags);
 }
 
-std::string HXKernelProcess::_nameForWiredInfo(const mach_memory_info_record &info, const KextTags &kexts,
-                                               RVSymbolicator *symbolicator, const mach_zone_name *zoneNames,
-                                               uint32_t zoneCount) {
-    std::string name = nameForSite(info, kexts, symbolicator);
-    if (zoneNames && (info.flags & VM_KERN_SITE_ZONE) && info.zone < zoneCount)
-        name += "[" + textOfField(zoneNames[info.zone].mzn_name) + "]";
+std::string HXKernelProcess::_nameForWiredInfo(const mach_memory_info_record &info, const SiteNames &names) {
+    std::string name = nameForSite(info, names);
+    if ((info.flags & VM_KERN_SITE_ZONE) && info.zone < names.zones.size())
+        name += "[" + textOfField(names.zones[info.zone].mzn_name) + "]";
     return name;
 }
 
 void HXKernelProcess::_setNameForRegion(HXMemoryRegion &region, const mach_memory_info_record &info,
-                                        const KextTags &kexts, RVSymbolicator *symbolicator,
-                                        const mach_zone_name *zoneNames, uint32_t zoneCount) {
-    region.setName(_nameForWiredInfo(info, kexts, symbolicator, zoneNames, zoneCount));
-    if (siteType(info) != VM_KERN_SITE_KERNEL || !symbolicator) return;
-    const RVSourceInfo source =
-        HXPlatform::current().RVSymbolicatorGetSourceInfoWithAddressAtTime(symbolicator, info.site, kRVNow);
+                                        const SiteNames &names) {
+    region.setName(_nameForWiredInfo(info, names));
+    if (siteType(info) != VM_KERN_SITE_KERNEL || !names.symbolicator) return;
+    const RVSourceInfo source = HXPlatform::current().RVSymbolicatorGetSourceInfoWithAddressAtTime(
+        names.symbolicator.get(), info.site, kRVNow);
     if (!source.isNull && source.path)
         region.setDetailedName("(" + std::string(source.path) + ":" + std::to_string(source.lineNumber) +
                                ")");

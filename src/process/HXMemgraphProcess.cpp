@@ -10,10 +10,11 @@ namespace {
 // Longer than any graph of a process; what is longer is no graph.
 constexpr uint64_t kLongestFile = uint64_t{4} << 30;
 
-enum { initializationFailed = 1, unknownPlatform = 2 };
+// Codes of HXHeftErrorDomain.
+constexpr int kInitializationFailed = 1, kUnknownPlatform = 2;
 
-bool fail(HXError *error, int code, const char *description) {
-    if (error) *error = HXError(HXHeftErrorDomain, code, description);
+bool fail(HXError *error, const char *domain, int code, std::string description) {
+    if (error) *error = HXError(domain, code, std::move(description));
     return false;
 }
 
@@ -42,28 +43,24 @@ bool HXMemgraphProcess::initWithMemgraph(const std::string &path, HXError *error
     if (data && *data == GXProcessObjectGraph::header)
         data = HXPlatform::current().services().readFile(path, kLongestFile);
     if (!data) {
-        const int failure = errno;
-        if (error)
-            *error = HXError(HXPOSIXErrorDomain, failure,
-                             std::error_code(failure, std::generic_category()).message());
-        return false;
+        const std::error_code failure(errno, std::generic_category());
+        return fail(error, HXPOSIXErrorDomain, failure.value(), failure.message());
     }
     std::string reason;
     _graph = GXProcessObjectGraph::directedGraphWithData(*data, HXPlatform::current().namedTags(), &reason);
     if (!_graph)
-        return fail(error, initializationFailed,
-                    reason.empty() ? "memgraph initialization failed with unknown error" : reason.c_str());
+        return fail(error, HXHeftErrorDomain, kInitializationFailed,
+                    reason.empty() ? "memgraph initialization failed with unknown error" : reason);
 
     proc_bsdinfo info{};
     info.pbi_flags = _graph->is64bit() ? PROC_FLAG_LP64 : 0;
     info.pbi_pid = _graph->pid();
-    if (!initWithBsdInfo(info)) return false;
+    if (!initWithBsdInfo(info, nullptr)) return false;
     setName(_graph->processName());
     setDisplayString(name() + " [" + std::to_string(pid()) + "] (memgraph)");
     if (!_setSharedRegionFromPlatform(HXPlatformOfDescription(_graph->processDescriptionString())))
-        return fail(error, unknownPlatform,
+        return fail(error, HXHeftErrorDomain, kUnknownPlatform,
                     "Unable to determine platform from memory graph process description");
-    setIdleExitStatus(HXIdleExitUnknown);
     return true;
 }
 
@@ -73,8 +70,7 @@ void HXMemgraphProcess::_gatherPhysHeft() {
 }
 
 vm_region_submap_info_64 HXMemgraphProcess::infoOfRegion(const GXVMRegion &region) const {
-    const bool inSharedRegion =
-        region.address >= sharedRegionBase() && region.address - sharedRegionBase() < sharedRegionSize();
+    const bool inSharedRegion = sharedRegion().contains(region.address);
     // Within the shared region the fields hold bytes; elsewhere pages, as a live walk delivers them.
     const auto amount = [&](uint64_t bytes) {
         return static_cast<uint32_t>(inSharedRegion ? bytes : bytes / pageSize());
@@ -118,14 +114,4 @@ void HXMemgraphProcess::enumerateRegions(const HXRegionCallback &callback) {
         if (region.external_pager && region.path) path = *region.path;
         *stop = callback(region.address, region.length, info, region.purgeable, path);
     });
-}
-
-bool HXMemgraphProcess::_populateMemoryRegionWithPageQueries(HXMemoryRegion &region,
-                                                             const vm_region_submap_info_64 &info) {
-    constexpr char operation[] = "_populateMemoryRegionWithPageQueries";
-    HXRequire(region.dirtySize() == 0, operation, "memoryRegion.dirtySize == 0");
-    HXRequire(region.swappedSize() == 0, operation, "memoryRegion.swappedSize == 0");
-    region.setDirtySize(info.pages_dirtied);
-    region.setSwappedSize(info.pages_swapped_out);
-    return true;
 }

@@ -14,7 +14,6 @@ class HXMemgraphProcess : public HXUserProcess {
     // Reads the file at `path`; null with *error (may be null) set.
     static std::unique_ptr<HXMemgraphProcess> processWithMemgraph(const std::string &path, HXError *error);
 
-    const GXProcessObjectGraph &graph() const { return *_graph; }
     // Whether the graph was gathered with the heft breakdown, whatever the run's mode.
     bool breakDownPhysHeft() const override { return _graph->showsPhysHeft(); }
     void enumerateRegions(const HXRegionCallback &callback) override;
@@ -25,13 +24,6 @@ class HXMemgraphProcess : public HXUserProcess {
     uint32_t _gatherPageSize() override { return _graph->vmPageSize(); }
     bool _hostHasSharedRegion() const override { return _graph->hasSharedRegion(); }
     void _gatherPhysHeft() override;
-    // The images come with the regions.
-    void _gatherImageData() override {}
-    std::optional<HXOwnedVmObjects> _gatherOwnedVmObjects() override { return std::nullopt; }
-    void _addSubrangesForRegion(HXMemoryRegion &, int32_t) override {}
-    // The graph holds the figures: nothing is queried.
-    bool _populateMemoryRegionWithPageQueries(HXMemoryRegion &region,
-                                              const vm_region_submap_info_64 &info) override;
 
   private:
     bool initWithMemgraph(const std::string &path, HXError *error);

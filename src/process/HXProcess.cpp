@@ -3,6 +3,7 @@
 #include "model/HXHeftSwitches.h"
 #include "platform/HXPlatform.h"
 #include "process/HXKernelProcess.h"
+#include "process/HXProcessSnapshot.h"
 #include "process/HXUserProcess.h"
 
 #include <algorithm>
@@ -10,9 +11,10 @@
 
 namespace {
 
-constexpr int32_t CTL_KERN = 1;
-constexpr int32_t KERN_ARGMAX = 8;
-constexpr int32_t KERN_PROCARGS2 = 49;
+// The names of settings, as sysctl(3) has them.
+constexpr int32_t kCtlKern = 1;
+constexpr int32_t kKernArgMax = 8;
+constexpr int32_t kKernProcArgs2 = 49;
 
 std::vector<std::string> &globalErrorList() {
     static std::vector<std::string> list;
@@ -28,13 +30,10 @@ std::string textOfField(const char *field, size_t width) {
 std::optional<std::string_view> pathInArgumentArea(char *area, size_t length) {
     if (length == 0) return std::nullopt;
     area[length - 1] = '\0';
-    size_t i = 0;
-    while (i < length && area[i] != '\0')
-        i++;
-    while (i < length && area[i] == '\0')
-        i++;
-    if (i >= length) return std::nullopt;
-    return std::string_view(area + i);
+    const std::string_view text(area, length);
+    const size_t path = text.find_first_not_of('\0', text.find('\0'));
+    if (path == std::string_view::npos) return std::nullopt;
+    return std::string_view(area + path);
 }
 
 } // namespace
@@ -47,48 +46,35 @@ std::string_view HXLastPathComponent(std::string_view path) {
     return slash == std::string_view::npos ? path : path.substr(slash + 1);
 }
 
-void HXPidDescriptions::set(int32_t pid, Description description) {
-    const auto [position, isNew] = _index.try_emplace(pid, _entries.size());
-    if (isNew)
-        _entries.push_back({pid, std::move(description)});
-    else
-        _entries[position->second].description = std::move(description);
-}
-
-void HXPidDescriptions::remove(int32_t pid) {
-    const auto found = _index.find(pid);
-    if (found == _index.end()) return;
-    const size_t removed = found->second;
-    _entries.erase(_entries.begin() + static_cast<std::ptrdiff_t>(removed));
-    _index.erase(found);
-    for (auto &[other, position] : _index)
-        if (position > removed) position--;
-}
-
-std::unique_ptr<HXProcess> HXProcess::processWithBsdInfo(const proc_bsdinfo &info) {
+std::unique_ptr<HXProcess> HXProcess::processWithBsdInfo(const proc_bsdinfo &info,
+                                                         HXProcessSnapshot &snapshot) {
     std::unique_ptr<HXProcess> process;
     if (info.pbi_flags & PROC_FLAG_SYSTEM)
         process = std::make_unique<HXKernelProcess>();
     else
         process = std::make_unique<HXUserProcess>();
-    return process->initWithBsdInfo(info) ? std::move(process) : nullptr;
+    return process->initWithBsdInfo(info, &snapshot) ? std::move(process) : nullptr;
 }
 
-std::unique_ptr<HXProcess> HXProcess::processWithPid(int32_t pid) {
-    proc_bsdinfo info{};
-    const int32_t length = HXPlatform::current().proc_pidinfo(pid, PROC_PIDTBSDINFO, 0, &info, sizeof info);
-    if (length != static_cast<int32_t>(sizeof info)) return nullptr;
-    return processWithBsdInfo(info);
+std::unique_ptr<HXProcess> HXProcess::processWithPid(int32_t pid, HXProcessSnapshot &snapshot) {
+    const auto info = snapshot.bsdInfoOfPid(pid);
+    return info ? processWithBsdInfo(*info, snapshot) : nullptr;
 }
 
-bool HXProcess::initWithBsdInfo(const proc_bsdinfo &info) {
+bool HXProcess::initWithBsdInfo(const proc_bsdinfo &info, HXProcessSnapshot *snapshot) {
     setPid(info.pbi_pid);
     _is64bit = (info.pbi_flags & PROC_FLAG_LP64) != 0;
     if (!_populateTask()) return false;
-    _name = _nameForBsdInfo(info);
+    _name = snapshot ? snapshot->nameOf(info) : _nameForBsdInfoCommName(info);
     _displayString = _name + " [" + std::to_string(pid()) + "]";
     setPageSize(_gatherPageSize());
     return true;
+}
+
+HXProcess::Map HXProcess::removeIdleExitCleanProcessesFrom(Map processes) {
+    std::erase_if(processes,
+                  [](const auto &entry) { return entry.second->idleExitStatus() == HXIdleExitClean; });
+    return processes;
 }
 
 uint32_t HXProcess::_gatherPageSize() {
@@ -119,7 +105,7 @@ std::string HXProcess::_nameForBsdInfoCommName(const proc_bsdinfo &info) {
 
 std::string HXProcess::_nameForBsdInfo(const proc_bsdinfo &info) {
     HXPlatform &platform = HXPlatform::current();
-    const int32_t maximumName[] = {CTL_KERN, KERN_ARGMAX};
+    const int32_t maximumName[] = {kCtlKern, kKernArgMax};
     int32_t maximum = 0;
     size_t length = sizeof maximum;
     if (platform.sysctl(maximumName, 2, &maximum, &length) != 0 || maximum <= 0)
@@ -127,7 +113,7 @@ std::string HXProcess::_nameForBsdInfo(const proc_bsdinfo &info) {
 
     const std::unique_ptr<char[]> area(new (std::nothrow) char[static_cast<size_t>(maximum)]);
     if (!area) return _nameForBsdInfoCommName(info);
-    const int32_t areaName[] = {CTL_KERN, KERN_PROCARGS2, info.pbi_pid};
+    const int32_t areaName[] = {kCtlKern, kKernProcArgs2, info.pbi_pid};
     length = static_cast<size_t>(maximum);
     if (platform.sysctl(areaName, 3, area.get(), &length) != 0) return _nameForBsdInfoCommName(info);
 

@@ -15,26 +15,7 @@
 #include <string_view>
 #include <vector>
 
-// Pids in the order in which they were first stored, each with the description that matched it by name, or
-// none (the null marker) when it was given as a number.
-class HXPidDescriptions {
-  public:
-    using Description = std::optional<std::string>;
-    struct Entry {
-        int32_t pid;
-        Description description;
-    };
-
-    // Stores, replacing what the pid had.
-    void set(int32_t pid, Description description);
-    void remove(int32_t pid);
-    const std::vector<Entry> &entries() const { return _entries; }
-    bool empty() const { return _entries.empty(); }
-
-  private:
-    std::vector<Entry> _entries;
-    std::map<int32_t, size_t> _index;
-};
+class HXProcessSnapshot;
 
 enum HXIdleExitStatus : int32_t {
     HXIdleExitUnknown = 0,      // not determined
@@ -49,14 +30,15 @@ class HXProcess : public HXRegionOwner {
     using Map = std::map<int32_t, std::unique_ptr<HXProcess>>;
 
     // A new record of the right kind, or null when the process cannot be examined (a global error then says
-    // why). Main thread only.
-    static std::unique_ptr<HXProcess> processWithBsdInfo(const proc_bsdinfo &info);
+    // why), named by the snapshot that `info` comes from. Main thread only.
+    static std::unique_ptr<HXProcess> processWithBsdInfo(const proc_bsdinfo &info,
+                                                         HXProcessSnapshot &snapshot);
     // The same by pid; null also when there is no such process.
-    static std::unique_ptr<HXProcess> processWithPid(int32_t pid);
+    static std::unique_ptr<HXProcess> processWithPid(int32_t pid, HXProcessSnapshot &snapshot);
 
-    // Construction from process information: takes the task, the name and the page size. False when the
-    // record cannot be; it must then be dropped.
-    virtual bool initWithBsdInfo(const proc_bsdinfo &info);
+    // Construction from process information: takes the task, the name and the page size. Without a snapshot
+    // the name is the one in the record. False when the record cannot be; it must then be dropped.
+    virtual bool initWithBsdInfo(const proc_bsdinfo &info, HXProcessSnapshot *snapshot);
 
     // Fills `memoryRegions`, the figures, errors and warnings. Never fails otherwise.
     virtual void gatherData() {}
@@ -96,18 +78,6 @@ class HXProcess : public HXRegionOwner {
     // The name in the record: the process name, else the command name, else "Unknown".
     static std::string _nameForBsdInfoCommName(const proc_bsdinfo &info);
 
-    // ---- The process list ----
-    // A record of every listed process whose pid is not in `excluded`; none when the list cannot be read. A
-    // process that cannot be opened is left out.
-    static std::optional<Map> allProcessesExcludingPids(const std::set<int32_t> &excluded);
-    // The pids that names and numbers mean; none when the list cannot be read. What matches nothing is said
-    // in `messages`, where given.
-    static std::optional<HXPidDescriptions>
-    pidsForStringDescriptions(const std::vector<std::string> &descriptions,
-                              std::vector<std::string> *messages);
-    // The given pids, then their children, then the children's children and so on; none when the list cannot
-    // be read.
-    static std::optional<std::vector<int32_t>> childPidsForPids(const std::vector<int32_t> &pids);
     // Without the processes that are idle-exit clean.
     static Map removeIdleExitCleanProcessesFrom(Map processes);
 
@@ -130,6 +100,3 @@ class HXProcess : public HXRegionOwner {
 
 // The part of a path after its last slash; trailing slashes are ignored; of "/" it is "/".
 std::string_view HXLastPathComponent(std::string_view path);
-
-// The BSD records of all processes that could be read, in list order; none when there are none.
-std::optional<std::vector<proc_bsdinfo>> listAllBsdInfo();

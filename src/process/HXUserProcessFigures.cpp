@@ -29,7 +29,6 @@ void findLedgerPosition(HXPlatform &platform, HXHostCache &cache) {
 } // namespace
 
 void HXUserProcess::_gatherPhysHeft() {
-    if (!_isAlive()) return;
     rusage_info_v4 usage{};
     if (HXPlatform::current().proc_pid_rusage(pid(), RUSAGE_INFO_V4, &usage) != 0) return;
     _phys_heft = usage.ri_phys_heft;
@@ -52,6 +51,7 @@ void HXUserProcess::_gatherLedgers() {
 }
 
 void HXUserProcess::_gatherIdleExitStatus() {
+    if (!_isAlive()) return;
     uint32_t flags = 0;
     if (HXPlatform::current().proc_get_dirty(pid(), &flags) != 0) flags = 0;
     _setIdleExitStatusFromDirtyFlags(flags);
@@ -79,7 +79,7 @@ HXAuxTree HXUserProcess::auxData() const {
 void HXUserProcess::_processMachVMError(kern_return_t error, kern_return_t expected) {
     HXPlatform &platform = HXPlatform::current();
     const char *suffix = "";
-    if (error == expected && _isAlive()) {
+    if (error == expected) {
         proc_bsdshortinfo info{};
         errno = 0;
         const int32_t length = platform.proc_pidinfo(pid(), PROC_PIDT_SHORTBSDINFO, 1, &info, sizeof info);

@@ -14,20 +14,40 @@ constexpr uint32_t kNeverOwnedTag = 87;
 
 constexpr char kOwnedObjectsSetting[] = "vm.get_owned_vmobjects";
 
-// Pages of `all` that are left after `taken`; a kernel whose counts disagree leaves none.
-uint64_t pagesLeft(uint64_t all, uint64_t taken) {
+// What of `all` is left after `taken`; a kernel whose counts disagree leaves none.
+uint64_t left(uint64_t all, uint64_t taken) {
     return all > taken ? all - taken : 0;
+}
+
+// What an owned object adds to its owner's heft becomes the region's.
+void takeChargeOf(HXMemoryRegion &region, const owned_vmobject &object) {
+    constexpr uint64_t notCharged = 1;
+    region.setOwnedExclusivelyByParentProcess(true);
+    region.setReclaimableSize(object.reusable_size);
+    const bool isCharged = !(object.flags & notCharged);
+    const auto purgeState = static_cast<int32_t>(object.flags >> 4 & 3);
+    const bool canBePurged = purgeState == VM_PURGABLE_VOLATILE || purgeState == VM_PURGABLE_EMPTY;
+    const uint64_t dirty = canBePurged ? object.wired_size : left(object.resident_size, object.reusable_size);
+    region.setDirtySize(isCharged ? dirty : 0);
+    region.setSwappedSize(isCharged && !canBePurged ? object.compressed_size : 0);
 }
 
 } // namespace
 
 // What one gathering's walk and its closing steps share.
 struct HXUserProcess::Gathering {
+    explicit Gathering(HXUserProcess &process)
+        : enumerator(process._images), cutter(process.pageSize(), enumerator, regions, process.pageQuery()),
+          hidden(process.hiddenFromDisplay()), breakDown(process.breakDownPhysHeft()),
+          cutsRuns(breakDown && !hidden && process._isAlive() &&
+                   !HXHeftSwitches::isSharingAnalysisDisabled()) {}
+
     HXMemoryRegionList regions;
     HXImageEnumerator enumerator;
-    bool hidden;
-    bool breakDown;
-    bool sharingDisabled;
+    HXSharedRegionCutter cutter;
+    const bool hidden;
+    const bool breakDown;
+    const bool cutsRuns;
     std::optional<HXMemoryRegion> unmappedRegion; // built from the kernel's fake region
     // Dirty and swapped bytes charged to mapped regions from owned objects: the kernel's fake region counts
     // them, too.
@@ -36,21 +56,22 @@ struct HXUserProcess::Gathering {
 
 void HXUserProcess::gatherData() {
     if (!hiddenFromDisplay()) {
-        _gatherImageData();
+        if (_isAlive()) _gatherImageData(); // others' images come with their regions
         _gatherPhysHeft();
-        _ownedVmObjects = _gatherOwnedVmObjects();
+        if (_isAlive()) _ownedVmObjects = _gatherOwnedVmObjects();
     }
     _gatherMemoryData();
     _images = {};
-    releaseTask();
+    _task.close();
 }
 
 std::optional<HXOwnedVmObjects> HXUserProcess::_gatherOwnedVmObjects() {
     constexpr size_t slack = 0x380; // sixteen objects that appear between two calls
     if (!HXHeftSwitches::breakDownPhysHeft()) return std::nullopt;
     HXPlatform &platform = HXPlatform::current();
+    const mach_port_t task = _task.get();
     size_t size = 0;
-    if (platform.sysctlbyname(kOwnedObjectsSetting, nullptr, &size, &_task, sizeof _task) != 0) {
+    if (platform.sysctlbyname(kOwnedObjectsSetting, nullptr, &size, &task, sizeof task) != 0) {
         if (errno != ENOENT) _addErrnoWarningWithDescription(kOwnedObjectsSetting);
         return std::nullopt;
     }
@@ -63,7 +84,7 @@ std::optional<HXOwnedVmObjects> HXUserProcess::_gatherOwnedVmObjects() {
         size += slack;
         reply.resize(size);
         length = size;
-        if (platform.sysctlbyname(kOwnedObjectsSetting, reply.data(), &length, &_task, sizeof _task) != 0) {
+        if (platform.sysctlbyname(kOwnedObjectsSetting, reply.data(), &length, &task, sizeof task) != 0) {
             _addErrnoWarningWithDescription(kOwnedObjectsSetting);
             return std::nullopt;
         }
@@ -84,12 +105,7 @@ std::optional<HXOwnedVmObjects> HXUserProcess::_gatherOwnedVmObjects() {
 }
 
 void HXUserProcess::_gatherMemoryData() {
-    Gathering gathering{.regions = {},
-                        .enumerator = HXImageEnumerator(_images),
-                        .hidden = hiddenFromDisplay(),
-                        .breakDown = breakDownPhysHeft(),
-                        .sharingDisabled = HXHeftSwitches::isSharingAnalysisDisabled(),
-                        .unmappedRegion = std::nullopt};
+    Gathering gathering(*this);
     enumerateRegions([&](uint64_t start, uint64_t size, const vm_region_submap_info_64 &info,
                          int32_t purgeState, std::optional<std::string_view> path) {
         return addRegion(gathering, start, size, info, purgeState, path);
@@ -104,10 +120,8 @@ void HXUserProcess::_gatherMemoryData() {
 bool HXUserProcess::addRegion(Gathering &gathering, uint64_t start, uint64_t size,
                               const vm_region_submap_info_64 &info, int32_t purgeState,
                               std::optional<std::string_view> path) {
-    if (inSharedRegion(start)) {
-        if (gathering.hidden ||
-            _addRegionsToArray(gathering.regions, start, size, info, gathering.enumerator))
-            return false;
+    if (_sharedRegion.contains(start)) {
+        if (gathering.hidden || gathering.cutter._addRegionsToArray(start, size, info)) return false;
         printBailingOut();
         return true;
     }
@@ -134,8 +148,7 @@ bool HXUserProcess::addRegion(Gathering &gathering, uint64_t start, uint64_t siz
         }
     }
     nameRegion(region, gathering, info, purgeState, path);
-    if (gathering.breakDown && !gathering.sharingDisabled && !gathering.hidden &&
-        region.eligibleForSubrangesUsingPageSize(pageSize()))
+    if (gathering.cutsRuns && region.eligibleForSubrangesUsingPageSize(pageSize()))
         _addSubrangesForRegion(region, purgeState);
 
     if (isUnmappedRegion)
@@ -149,11 +162,11 @@ void HXUserProcess::setSizes(HXMemoryRegion &region, const Gathering &gathering,
                              const vm_region_submap_info_64 &info) const {
     const uint64_t dirtyPages = info.external_pager || gathering.breakDown
                                     ? info.pages_dirtied
-                                    : pagesLeft(info.pages_resident, info.pages_reusable);
+                                    : left(info.pages_resident, info.pages_reusable);
     region.setDirtySize(dirtyPages * pageSize());
     region.setReclaimableSize(uint64_t{info.pages_reusable} * pageSize());
     region.setSwappedSize(uint64_t{info.pages_swapped_out} * pageSize());
-    region.setCleanNonSpecSize(pagesLeft(info.pages_resident, dirtyPages + info.pages_reusable) * pageSize());
+    region.setCleanNonSpecSize(left(info.pages_resident, dirtyPages + info.pages_reusable) * pageSize());
 }
 
 void HXUserProcess::nameRegion(HXMemoryRegion &region, Gathering &gathering,
@@ -180,13 +193,9 @@ void HXUserProcess::chargeOwnedObject(HXMemoryRegion &region, Gathering &gatheri
     if (_ownedVmObjects) {
         const auto object = _ownedVmObjects->take(info.object_id_full);
         if (!object) return;
-        const HXOwnedCharge charge = HXChargeOfOwnedObject(*object);
-        region.setOwnedExclusivelyByParentProcess(true);
-        region.setReclaimableSize(object->reusable_size);
-        region.setDirtySize(charge.dirty);
-        region.setSwappedSize(charge.swapped);
+        takeChargeOf(region, *object);
         region.setCleanNonSpecSize(0);
-        gathering.attributed += charge.dirty + charge.swapped;
+        gathering.attributed += region.dirtySize() + region.swappedSize();
     } else if (purgeState != VM_PURGABLE_DENY && info.user_tag != kNeverOwnedTag &&
                info.pages_resident != 0) {
         region.setOwnedExclusivelyByParentProcess(true);
@@ -201,18 +210,14 @@ void HXUserProcess::chargeOwnedObject(HXMemoryRegion &region, Gathering &gatheri
 void HXUserProcess::addUnmappedOwnedObjects(Gathering &gathering) {
     if (!_ownedVmObjects) return;
     _ownedVmObjects->forEach([&](const owned_vmobject &object) {
-        const HXOwnedCharge charge = HXChargeOfOwnedObject(object);
         HXMemoryRegion &region = gathering.regions.emplace_back();
+        takeChargeOf(region, object);
         region.setObject_id(object.object_id);
-        region.setOwnedExclusivelyByParentProcess(true);
         region.setUser_tag(kFakeRegionTag);
         region.setName(HXMemoryRegion::categoryNameForTag(kFakeRegionTag));
         region.setSize(object.virtual_size);
-        region.setReclaimableSize(object.reusable_size);
         region.setStart(kNoAddress);
         region.setShare_mode(SM_SHARED);
-        region.setDirtySize(charge.dirty);
-        region.setSwappedSize(charge.swapped);
         region.setWired(object.wired_size != 0);
     });
     _ownedVmObjects.reset();
@@ -246,64 +251,4 @@ void HXUserProcess::addPageTables(Gathering &gathering) {
     region.setName("page table");
     region.setObject_id(UINT64_MAX);
     region.setShare_mode(SM_PRIVATE);
-}
-
-// A region of the cut with the fields that all pieces of an entry have in common, appended to the list.
-HXMemoryRegion &HXUserProcess::appendCut(HXMemoryRegionList &regions, uint64_t cursor, uint64_t entryStart,
-                                         const vm_region_submap_info_64 &info) const {
-    HXMemoryRegion &region = regions.emplace_back();
-    region.setStart(cursor);
-    region.setUser_tag(info.user_tag);
-    region.setObject_id(info.object_id_full);
-    region.setShare_mode(info.share_mode);
-    region.setOffset(info.offset + (cursor - entryStart));
-    region.setInSharedCache(true);
-    region.setWired(info.user_wired_count != 0);
-    return region;
-}
-
-bool HXUserProcess::_addRegionsToArray(HXMemoryRegionList &regions, uint64_t start, uint64_t size,
-                                       const vm_region_submap_info_64 &info, HXImageEnumerator &enumerator) {
-    const uint64_t end = start + size;
-    const uint64_t alignment = _sharedRegionAlignmentSize;
-    const bool writable = info.max_protection & VM_PROT_WRITE;
-    const auto isPageAligned = [&](uint64_t address) { return address % pageSize() == 0; };
-    const auto populate = [&](HXMemoryRegion &region) {
-        if (_populateMemoryRegionWithPageQueries(region, info)) return true;
-        regions.pop_back();
-        _pendingUnusedSharedRegion = nullptr;
-        return false;
-    };
-    _pendingUnusedSharedRegion = nullptr;
-    const HXImage *image = enumerator.nextImageForStart(start, end);
-    for (uint64_t cursor = start; cursor < end;) {
-        if (!image || cursor < image->start()) {
-            HXMemoryRegion &gap = appendCut(regions, cursor, start, info);
-            gap.setEnd(image && image->start() < end ? image->start() : end);
-            gap.setName("unused dyld shared cache area");
-            gap.setUnusedSharedCacheRegion(true);
-            if (writable && !(isPageAligned(gap.start()) && isPageAligned(gap.end())) && !populate(gap))
-                return false;
-            cursor = gap.end();
-            if (cursor >= end || !image) return true;
-        }
-        if (image->end() <= cursor) { // an image that overlaps the one before, and ends within it
-            image = enumerator.nextImageForStart(cursor, end);
-            continue;
-        }
-        HXMemoryRegion &piece = appendCut(regions, std::max(image->start(), cursor), start, info);
-        piece.setEnd(std::min(image->end(), end));
-        const HXImage *next = enumerator.nextImageForStart(piece.end(), end);
-        const uint64_t nextStart = next ? next->start() : 0;
-        if (next != image && piece.start() % alignment == 0 && nextStart % alignment == 0)
-            piece.setEnd((piece.end() + alignment - 1) / alignment * alignment);
-        static const HXString sharedCache = HXString::intern("dyld shared cache");
-        piece.setName(image->name());
-        piece.setDetailedName(image->segment() == HXSegmentLinkedit ? sharedCache : image->ownerPath());
-        piece.setSegment(image->segment());
-        if (writable && !populate(piece)) return false;
-        cursor = piece.end();
-        image = next;
-    }
-    return true;
 }

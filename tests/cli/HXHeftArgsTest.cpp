@@ -50,7 +50,6 @@ std::string told(const HXHeftArgs &args) {
     tell(!args.shouldGetPhysHeftBreakdown(), "objects");
     tell(args.didSetShouldGetPhysHeftBreakdown(), "set");
     tell(args.searchForUnmapped(), "unmapped");
-    tell(!args.excludeSelf(), "self");
     tell(args.summaryFormat() != 1, "format=" + std::to_string(args.summaryFormat()));
     tell(args.textOptions() != 0, "options=" + std::to_string(args.textOptions()));
     tell(args.textSort() != "Dirty", "sort=" + args.textSort());

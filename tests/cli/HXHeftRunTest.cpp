@@ -9,8 +9,7 @@
 namespace {
 using Words = std::vector<std::string>;
 
-constexpr char kNobody[] =
-    "Unable to find any processes matching the supplied process names or pids (try as root?)\n";
+constexpr char kClosed[] = "task_for_pid: (os/kern) failure\n"; // process 50
 
 // The pids whose headers a report has, in its order.
 std::vector<int32_t> shown(const std::string &report) {
@@ -19,28 +18,6 @@ std::vector<int32_t> shown(const std::string &report) {
     for (std::sregex_iterator match(report.begin(), report.end(), header), end; match != end; match++)
         pids.push_back(std::stoi((*match)[1]));
     return pids;
-}
-
-std::string usage() {
-    return "Gather memory information about a process or set of processes\n"
-           "Usage: heft [args] [proc/pid/memgraph [proc/pid/memgraph [...]]]\n"
-           "\t-a, --all \t\t\t\ttarget all processes\n"
-           "\t-j, --json <file> \t\t\tprint json output to a file\n"
-           "\t-h, --help \t\t\t\tprint this output\n"
-           "\t-p, --proc, --pid [proc/pid] \t\ttarget pid or process (or interpret for -p)\n"
-           "\t-x, --exclude [proc/pid] \t\texclude pid or process\n"
-           "\t-s, --skip \t\t\t\tskip processes that are idle-exit clean\n"
-           "\t-v \t\t\t\t\tprint all regions and atlas-like output of address space layout (default output "
-           "is "
-           "a summary)\n"
-           "\t-f, --format (bytes|formatted|pages) \tchange size formatting preference (default: formatted)\n"
-           "\t--sort <column> \t\t\tchange the column used for sorting (default: dirty)\n"
-           "\t-w, --wide\t\t\t\tshow wide output with all columns and full paths (implies --swapped "
-           "--wired)\n"
-           "\t--swapped\t\t\t\tshow swapped/compressed column\n"
-           "\t--wired\t\t\t\t\tshow wired column\n"
-           "\t--vmObjectDirty\t\t\tinterpret dirty memory as viewed by VM objects in the kernel\n"
-           "\t--unmapped\t\t\t\tsearch all processes for unmapped memory owned by the target processes\n";
 }
 
 // A small tree: 1 (this program) under 10; 10 → 20, 21 → 30; 40 alone. The kernel is its own parent.
@@ -79,12 +56,8 @@ TEST(HXHeftRunTest, ChoosesTargets) {
         {{"4294967336", "40"}, {40}, "Unable to find pid for process matching '4294967336'\n"},
         {{"40", "closed"},
          {40},
-         "task_for_pid: (os/kern) failure\n"
-         "Unable to analyze process closed [50] (try as root?)\n"},
-        {{"40", "50"},
-         {40},
-         "task_for_pid: (os/kern) failure\n"
-         "Unable to analyze process with pid 50 (try as root?)\n"},
+         std::string(kClosed) + "Unable to analyze process closed [50] (try as root?)\n"},
+        {{"40", "50"}, {40}, std::string(kClosed) + "Unable to analyze process with pid 50 (try as root?)\n"},
         {{"40", "--pid", "77"}, {40}, "Unable to analyze process with pid 77 (try as root?)\n"},
         {{"10", "worker", "-x", "worker", "-x", "nothing"}, {10}},
         {{"10", "1"}, {10}}, // never itself
@@ -93,15 +66,12 @@ TEST(HXHeftRunTest, ChoosesTargets) {
         {{"-t", "10", "-x", "worker"}, {30, 21, 20, 10, 1}},
         {{"-t", "0", "-x", "10"},
          {40, 30, 21, 20, 10, 1, 0},
-         "task_for_pid: (os/kern) failure\n"
-         "Unable to analyze process with pid 50 (try as root?)\n"},
+         std::string(kClosed) + "Unable to analyze process with pid 50 (try as root?)\n"},
         {{"-s", "worker", "30"}, {30, 21}},
-        {{"-a"}, {40, 30, 21, 20, 10, 0}, "task_for_pid: (os/kern) failure\n"},
-        {{"-a", "-s"}, {40, 30, 21, 10, 0}, "task_for_pid: (os/kern) failure\n"},
-        {{"-a", "-x", "worker", "-x", "0", "--pid", "77", "-t"},
-         {40, 30, 10},
-         "task_for_pid: (os/kern) failure\n"},
-        {{"40", "--unmapped"}, {40}, "task_for_pid: (os/kern) failure\n"},
+        {{"-a"}, {40, 30, 21, 20, 10, 0}, kClosed},
+        {{"-a", "-s"}, {40, 30, 21, 10, 0}, kClosed},
+        {{"-a", "-x", "worker", "-x", "0", "--pid", "77", "-t"}, {40, 30, 10}, kClosed},
+        {{"40", "--unmapped"}, {40}, kClosed},
     };
     for (const auto &test : cases) {
         const HXRun result = report(kTree, test.words);
@@ -113,60 +83,42 @@ TEST(HXHeftRunTest, ChoosesTargets) {
 TEST(HXHeftRunTest, EndsWithTheStatusAndTextOfEachFailure) {
     const std::string file = temporaryPath();
     std::fclose(std::fopen(file.c_str(), "w"));
+    const std::string nobody =
+        "Unable to find any processes matching the supplied process names or pids (try as root?)\n";
     const std::string unseen = "Unable to obtain system process list\n";
-    const std::string user =
-        std::string("host  pid=1  euid=501\n") + &kTree[std::string(kTree).find('\n') + 1];
-    const std::string blind =
-        std::string("host  list_pids_error=1\n") + &kTree[std::string(kTree).find('\n') + 1];
+    const std::string processes = &kTree[std::string(kTree).find('\n')];
+    const std::string user = "host  pid=1  euid=501" + processes;
+    const std::string blind = "host  list_pids_error=1" + processes;
+    const std::string usage = contentOf(std::string(TEST_CASES "/usage.txt"));
+    const std::string format =
+        "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.\n";
+    const std::string root = "Must run as root.\n";
     struct {
-        const char *title;
         std::string machine;
         Words words;
-        int status;
         std::string err;
         bool usage;
     } cases[] = {
-        {"help", kTree, {"-h"}, 0, "", true},
-        {"bad format",
-         kTree,
-         {"--format", "x"},
-         1,
-         "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.\n",
-         true},
-        {"nothing to target", kTree, {}, 1, "Must specify at least one process or memgraph\n", true},
-        {"a file that is no graph",
-         kTree,
-         {file},
-         1,
-         "Error opening memgraph " + file + ": not a memory graph\n",
-         true},
-        {"no match",
-         kTree,
-         {"nobody"},
-         1,
-         "Unable to find pid for process matching 'nobody'\n" + std::string(kNobody),
-         false},
-        {"all excluded", kTree, {"40", "-x", "launchd"}, 1, kNobody, false},
-        {"only clean ones", kTree, {"-s", "20"}, 1, kNobody, false},
-        {"all without privilege", user, {"-a"}, 1, "Must run as root.\n", false},
-        {"unmapped without privilege", user, {"--unmapped", "40"}, 1, "Must run as root.\n", false},
-        {"no process list", blind, {"40"}, 1, unseen + kNobody, false},
-        {"no directory for the document",
-         kTree,
-         {"40", "--json", "/no such/file"},
-         1,
-         "heft: /no such/file: No such file or directory\n",
-         false},
+        {kTree, {"-h"}, "", true},
+        {kTree, {"--format", "x"}, format, true},
+        {kTree, {}, "Must specify at least one process or memgraph\n", true},
+        {kTree, {file}, "Error opening memgraph " + file + ": not a memory graph\n", true},
+        {kTree, {"nobody"}, "Unable to find pid for process matching 'nobody'\n" + nobody, false},
+        {kTree, {"40", "-x", "launchd"}, nobody, false},
+        {kTree, {"-s", "20"}, nobody, false},
+        {user, {"-a"}, root, false},
+        {user, {"--unmapped", "40"}, root, false},
+        {blind, {"40"}, unseen + nobody, false},
+        {kTree, {"40", "-j", "/no/file"}, "heft: /no/file: No such file or directory\n", false},
     };
     for (const auto &test : cases) {
         const HXRun result = run(test.machine, test.words);
-        EXPECT_EQ(result.status, test.status) << test.title;
-        EXPECT_EQ(result.err, test.err) << test.title;
-        EXPECT_EQ(result.out, test.usage ? usage() : "") << test.title;
+        EXPECT_EQ(result.status, test.err.empty() ? 0 : 1) << test.err;
+        EXPECT_EQ(result.err, test.err) << test.err;
+        EXPECT_EQ(result.out, test.usage ? usage : "") << test.err;
     }
     EXPECT_EQ(shown(run(user, {"40"}).out), std::vector<int32_t>{40});
-    // A pid given as such needs no list; nor does a switch that privilege would be needed for but that is
-    // off.
+    // A pid given as such needs no list, and an option that was switched off no privilege.
     EXPECT_EQ(shown(run(blind, {"--pid", "40"}).out), std::vector<int32_t>{40});
     EXPECT_EQ(shown(run(user, {"--unmapped", "--vmObjectDirty", "40"}).out), std::vector<int32_t>{40});
     // A path that is no graph but names a process: only one of that name.

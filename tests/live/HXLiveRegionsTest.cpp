@@ -3,6 +3,7 @@
 #include "analysis/HXHeft.h"
 #include "platform/HXPlatform.h"
 #include "platform/linux/HXLinuxPlatform.h"
+#include "process/HXProcessSnapshot.h"
 #include "process/HXUserProcess.h"
 #include "support/HXMemoryRecipe.h"
 #include "support/HXSubject.h"
@@ -117,7 +118,8 @@ class HXLiveRegions : public testing::TestWithParam<HXMemoryRecipe> {
 
     std::unique_ptr<HXUserProcess> gathered(bool breakDown) {
         HXHeft::setBreakDownPhysHeft(breakDown);
-        auto process = HXProcess::processWithPid(subject.pid());
+        HXProcessSnapshot snapshot;
+        auto process = HXProcess::processWithPid(subject.pid(), snapshot);
         if (process) process->gatherData();
         return std::unique_ptr<HXUserProcess>(static_cast<HXUserProcess *>(process.release()));
     }

@@ -1,6 +1,8 @@
+#include "process/HXProcessSnapshot.h"
 #include "process/HXUserProcess.h"
 #include "support/HXBarePlatform.h"
 #include "support/HXBuilders.h"
+#include "support/HXRun.h"
 
 #include <cstring>
 #include <gtest/gtest.h>
@@ -68,17 +70,58 @@ TEST(HXProcessTest, IsNamedAfterItsExecutableOrItsRecord) {
     }
 }
 
-TEST(HXProcessTest, RecordsCompareByPidAndKeepTheirLists) {
-    const HXBarePlatform platform;
-    HXMadeUpProcess process(123, "foo");
-    EXPECT_TRUE(process.isEqual(HXMadeUpProcess(123, "other")));
-    EXPECT_FALSE(process.isEqual(HXMadeUpProcess(124, "foo")));
-    process.addError("one");
-    const auto errors = process.errors();
-    process.addError("two");
-    EXPECT_EQ(errors.size(), 1u); // a copy
-    EXPECT_EQ(process.errors().size(), 2u);
-    EXPECT_FALSE(HXProcess().initWithBsdInfo(record("n", "c"))); // the base class takes no task
+TEST(HXProcessTest, AListAndItsNamesAreReadOnceWhenSomebodyAsks) {
+    class Counted : public HXMadeUpMachine {
+      public:
+        using HXMadeUpMachine::HXMadeUpMachine;
+        int lists = 0, names = 0;
+        int32_t proc_listallpids(int32_t *pids, uint32_t bytes) override {
+            lists += pids != nullptr;
+            return HXMadeUpMachine::proc_listallpids(pids, bytes);
+        }
+        int32_t sysctl(const int32_t *name, uint32_t length, void *old, size_t *oldBytes) override {
+            names += length == 3;
+            return HXMadeUpMachine::sysctl(name, length, old, oldBytes);
+        }
+    };
+    Counted machine("process  pid=1  name=a\nprocess  pid=2  name=b\nprocess  pid=3  name=b\n"
+                    "process  pid=4  name=c  ppid=3\nprocess  pid=5  name=unlisted  listed=0\n");
+    HXProcessSnapshot alone;
+    EXPECT_EQ(HXProcess::processWithPid(3, alone)->displayString(), "b [3]");
+    EXPECT_EQ(machine.lists, 0);
+    EXPECT_EQ(machine.names, 1);
+
+    HXProcessSnapshot snapshot;
+    snapshot.pidsForStringDescriptions({"2"}, nullptr);
+    EXPECT_EQ(machine.names, 3); // a process listed before the pid could be called 2
+    EXPECT_EQ(snapshot.pidsForStringDescriptions({"b", "4", "c"}, nullptr)->entries().size(), 3u);
+    EXPECT_EQ(snapshot.childPidsForPids({3}), (std::vector<int32_t>{3, 4}));
+    EXPECT_EQ(snapshot.allProcessesExcludingPids({2})->size(), 3u);
+    EXPECT_EQ(HXProcess::processWithPid(5, snapshot)->name(), "unlisted");
+    EXPECT_EQ(machine.lists, 1);
+    EXPECT_EQ(machine.names, 6);
+}
+
+// A bisection by addresses, down to 16 MiB.
+TEST(HXProcessTest, SearchesForTheLastMappingBelowTheSharedRegion) {
+    class Asked : public HXMadeUpMachine {
+      public:
+        using HXMadeUpMachine::HXMadeUpMachine;
+        std::vector<uint64_t> addresses;
+        kern_return_t mach_vm_region(mach_port_t task, uint64_t *address, uint64_t *size, int32_t flavor,
+                                     vm_region_basic_info_64 *info, uint32_t *count) override {
+            addresses.push_back(*address);
+            return HXMadeUpMachine::mach_vm_region(task, address, size, flavor, info, count);
+        }
+    };
+    Asked machine("process  pid=7\n" + region(7, 0x80000000, 0x4000, "tag=2") +
+                  region(7, 0x180000000, 0x4000, "tag=2"));
+    HXUserProcess process;
+    HXProcessSnapshot snapshot;
+    ASSERT_TRUE(process.initWithBsdInfo(*snapshot.bsdInfoOfPid(7), &snapshot));
+    EXPECT_EQ(process._lastNonSharedCacheRegion(), 0x80000000u);
+    EXPECT_EQ(machine.addresses, (std::vector<uint64_t>{0xc0000000, 0x5fffe000, 0x9fffe000, 0x8fffd000,
+                                                        0x87ffc800, 0x83ffc400, 0x81ffc200, 0x80ffc100}));
 }
 
 TEST(HXProcessTest, DirtyFlagsAndLayoutsAreTold) {
@@ -92,19 +135,12 @@ TEST(HXProcessTest, DirtyFlagsAndLayoutsAreTold) {
                                                                         : HXIdleExitNotSupported);
     }
 
-    const uint64_t layouts[][2] = {{0x90000000, 0x20000000},
-                                   {0x7FFF00000000, 0xFFE00000},
-                                   {0x40000000, 0x40000000},
-                                   {0x180000000, 0x100000000},
-                                   {0x1A000000, 0x40000000}};
-    for (int32_t code = 0; code < 5; code++) {
-        EXPECT_TRUE(process._setSharedRegionFromPlatform(code));
-        EXPECT_EQ(process.sharedRegionBase(), layouts[code][0]) << code;
-        EXPECT_EQ(process.sharedRegionSize(), layouts[code][1]) << code;
-    }
+    const HXSharedRegion before = process.sharedRegion();
     for (const int32_t code : {5, -1, 100}) {
         const auto printed = printedBy([&] { EXPECT_FALSE(process._setSharedRegionFromPlatform(code)); });
         EXPECT_EQ(printed.err, "Unable to determine platform architecture of target\n");
-        EXPECT_EQ(process.sharedRegionBase(), layouts[4][0]);
+        EXPECT_EQ(process.sharedRegion().base, before.base);
     }
+    EXPECT_TRUE(process._setSharedRegionFromPlatform(HXPlatformARM64_32));
+    EXPECT_EQ(process.sharedRegion().end(), 0x5a000000u);
 }

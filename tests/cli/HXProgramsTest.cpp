@@ -1,0 +1,147 @@
+// The built programs, as a shell or an impatient user runs them.
+#include "support/HXBuilders.h"
+#include "support/HXCheckReport.h"
+#include "support/HXProgramRun.h"
+#include "support/HXTemporaryFolder.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <csignal>
+#include <fcntl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+namespace {
+namespace fs = std::filesystem;
+using Words = std::vector<std::string>;
+
+bool contains(const std::string &text, const std::string &part) {
+    return text.find(part) != std::string::npos;
+}
+
+// A machine file of so many processes, each of which tells on standard error that its walk failed.
+std::string failingMachine(int processes) {
+    std::string text = "heft-machine 1\nhost\tself_region_heft=1\tledger=other\n";
+    for (int pid = 101; pid <= 100 + processes; pid++) {
+        const std::string owner = "\tpid=" + std::to_string(pid);
+        text += "process" + owner + "\tname=p\nfault" + owner +
+                "\tcall=mach_vm_region_recurse\tfrom=1\terror=5\n";
+    }
+    return text;
+}
+
+// Whether a signal waits for the process, and whether all of its threads wait for something or it has ended.
+bool hasPending(pid_t pid, int signal) {
+    const std::string status = contentOf("/proc/" + std::to_string(pid) + "/status");
+    const std::string pending = status.substr(status.find("ShdPnd:") + 7, 17);
+    return std::stoull(pending, nullptr, 16) >> (signal - 1) & 1;
+}
+bool isAtRest(pid_t pid) {
+    for (const auto &thread : fs::directory_iterator("/proc/" + std::to_string(pid) + "/task")) {
+        const std::string stat = contentOf(thread.path() / "stat");
+        if (!contains(stat, ") S ") && !contains(stat, ") Z ")) return false;
+    }
+    return true;
+}
+} // namespace
+
+TEST(HXProgramsTest, RecordSaysWhatIsWrongWithItsArguments) {
+    const HXTemporaryFolder folder;
+    const std::string file = folder / "file", nowhere = folder / "nowhere/file";
+    const std::string self = std::to_string(getpid()), usage = "Usage: heft-record machine [--anonymize]";
+    const struct {
+        Words words;
+        std::string err; // how standard error begins
+    } cases[] = {
+        {{}, usage},
+        {{"core", file}, usage},
+        {{"machine"}, usage},
+        {{"machine", "--anonymize"}, usage},
+        {{"machine", "--vmObjectDirty", file}, usage},
+        {{"machine", "--anonymize", "--anonymize", file}, usage},
+        {{"memgraph", self}, usage},
+        {{"memgraph", self, file, file}, usage},
+        {{"memgraph", "--vmObjectDirty", self}, usage},
+        {{"memgraph", "--anonymize", self, file}, usage},
+        {{"memgraph", "-1", file}, usage},
+        {{"memgraph", "self", file}, "heft-record: self: not a process id\n"},
+        {{"memgraph", "4194305", file}, "heft-record: 4194305: No such process\n"},
+        {{"memgraph", self, nowhere}, "heft-record: " + nowhere + ": No such file or directory\n"},
+        {{"machine", file, self, "7x"}, "heft-record: 7x: not a process id\n"},
+        {{"machine", file, self, "-7"}, "heft-record: -7: not a process id\n"},
+        {{"machine", file, "99999999999"}, "heft-record: 99999999999: not a process id\n"},
+        {{"machine", file, "4194305"}, "heft-record: 4194305: No such process\n"},
+        {{"machine", nowhere, self}, "heft-record: " + nowhere + ": No such file or directory\n"},
+    };
+    for (const auto &each : cases) {
+        Words words{HEFT_RECORD_PROGRAM};
+        words.insert(words.end(), each.words.begin(), each.words.end());
+        const HXProgramRun run = HXRunProgram(words);
+        EXPECT_EQ(run.status, 1) << each.err;
+        EXPECT_TRUE(run.err.starts_with(each.err)) << run.err;
+        EXPECT_EQ(run.out, "");
+    }
+    EXPECT_TRUE(fs::is_empty(folder.path())); // nor is a half-written file left behind
+    for (const char *help : {"-h", "--help"})
+        EXPECT_TRUE(HXRunProgram({HEFT_RECORD_PROGRAM, help}).out.starts_with(usage));
+}
+
+// Standard error is a pipe that nobody reads, so gathering cannot come to its end.
+TEST(HXProgramsTest, AnInterruptDuringGatheringGivesTheReportOfWhatWasGathered) {
+    const HXTemporaryFolder folder;
+    folder.write("machine", failingMachine(2000));
+    const std::string machine = folder / "machine";
+    int err[2];
+    ASSERT_EQ(pipe2(err, O_CLOEXEC), 0);
+    ASSERT_GE(fcntl(err[1], F_SETPIPE_SZ, 4096), 4096);
+    std::FILE *const out = tmpfile();
+    const pid_t pid = fork();
+    if (pid == 0) {
+        dup2(fileno(out), 1);
+        dup2(err[1], 2);
+        execl(HEFT_REPLAY_PROGRAM, "heft-replay", machine.c_str(), "-a", nullptr);
+        _exit(127);
+    }
+    close(err[1]);
+    std::string printed(1, '\0');
+    ASSERT_EQ(read(err[0], printed.data(), 1), 1); // gathering has begun
+    kill(pid, SIGINT);
+    // The handler tells the analysis, and then comes to rest at the pipe, too.
+    while (hasPending(pid, SIGINT) || !isAtRest(pid))
+        sched_yield();
+    char buffer[4096];
+    for (ssize_t got = 0; (got = read(err[0], buffer, sizeof buffer)) > 0;)
+        printed.append(buffer, static_cast<size_t>(got));
+    close(err[0]);
+    int status = -1;
+    waitpid(pid, &status, 0);
+    EXPECT_EQ(status, 0);
+    EXPECT_TRUE(contains(printed, "Exiting early due to SIGINT\n"));
+    EXPECT_LT(std::count(printed.begin(), printed.end(), '\n'), 2 * 2000);
+    const std::string report = contentOf(out);
+    EXPECT_TRUE(contains(report, "Heft exited early due to SIGINT and did not finish gathering all data"));
+    EXPECT_TRUE(contains(report, "(os/kern) failure"));
+}
+
+TEST(HXProgramsTest, ClosedStandardStreamsStayOutOfTheDocument) {
+    const HXTemporaryFolder folder;
+    folder.write("machine", failingMachine(3));
+    const std::string json = folder / "json", machine = folder / "machine";
+    const std::string commands[] = {std::string(HEFT_REPLAY_PROGRAM) + " " + machine + " -a",
+                                    std::string(HEFT_PROGRAM) + " " + std::to_string(getpid())};
+    for (const std::string &command : commands)
+        for (int closed = 0; closed < 8; closed++) { // a bit for each descriptor
+            std::string line = "exec " + command + " -f bytes -j " + json;
+            for (int descriptor = 0; descriptor <= 2; descriptor++)
+                if (closed >> descriptor & 1) line += " " + std::to_string(descriptor) + ">&-";
+            folder.remove("json");
+            const HXProgramRun run = HXRunProgram({"/bin/sh", "-c", line});
+            EXPECT_EQ(run.status, 0) << line;
+            const std::string document = contentOf(json);
+            const bool hasText = !(closed & 2);
+            EXPECT_EQ(run.out.empty(), !hasText) << line;
+            if (hasText) checkReport(run.out, document);
+            EXPECT_TRUE(document.starts_with("{") && document.ends_with("}")) << line << document;
+        }
+}

@@ -1,0 +1,113 @@
+// Gathering of single processes, as cases in a file: after a line "== TITLE" the records of a machine whose
+// first process is gathered, after a line "-- MODE" what is found. The modes: charge, as programs run;
+// objects, a kernel that does not break down the heft; hidden, a process that gets no report.
+//
+// A region is told as START+SIZE NAME DETAIL, its sizes (dDIRTY sSWAPPED cCLEAN rRECLAIMABLE, none when 0),
+// what it is, #OBJECT and @OFFSET where not 0, and after a bar its page runs, each LOCATION+LENGTH and the
+// amounts; all numbers hexadecimal. Then come warnings, errors, auxiliary data and the lines on standard
+// error.
+#include "process/HXProcessSnapshot.h"
+#include "support/HXBuilders.h"
+#include "support/HXMadeUpMachine.h"
+
+#include <gtest/gtest.h>
+#include <map>
+#include <sstream>
+
+namespace {
+
+struct Amount {
+    const char *title;
+    uint64_t amount;
+};
+void tell(std::ostream &text, std::initializer_list<Amount> amounts) {
+    for (const Amount &each : amounts)
+        if (each.amount != 0) text << ' ' << each.title << each.amount;
+}
+
+std::string told(const HXMemoryRegion &region) {
+    std::ostringstream line;
+    line << std::hex;
+    region.start() == kNoAddress ? line << "nowhere" : line << region.start();
+    line << '+' << region.size() << ' ' << region.fullName();
+    tell(line, {{"d", region.dirtySize()},
+                {"s", region.swappedSize()},
+                {"c", region.cleanNonSpecSize()},
+                {"r", region.reclaimableSize()}});
+    if (region.wired()) line << " wired";
+    if (region.ownedExclusivelyByParentProcess()) line << " owned";
+    if (region.inSharedCache()) line << (region.unusedSharedCacheRegion() ? " unused" : " cache");
+    tell(line, {{"#", region.object_id()}, {"@", region.offset()}});
+    if (region.subrangeList() == nullptr) return line.str() + "\n";
+    const char *separator = " | ";
+    for (const auto &[location, run] : region.subrangeList()->nodes()) {
+        line << std::exchange(separator, ", ") << location << '+' << run.length;
+        tell(line, {{"d", run.dirty},
+                    {"s", run.swapped},
+                    {"c", run.clean},
+                    {"r", run.reclaimable},
+                    {"w", run.wired}});
+    }
+    return line.str() + "\n";
+}
+
+std::string gathered(const std::string &machine, bool hidden) {
+    const HXMadeUpMachine current(machine);
+    HXProcessSnapshot snapshot;
+    std::unique_ptr<HXProcess> process;
+    const HXPrinted printed = printedBy([&] {
+        process = HXProcess::processWithBsdInfo(snapshot.listAllBsdInfo()->front(), snapshot);
+        process->setHiddenFromDisplay(hidden);
+        process->gatherData();
+    });
+    std::string text;
+    for (const HXMemoryRegion &region : process->memoryRegions())
+        text += told(region);
+    for (const std::string &warning : process->warnings())
+        text += "warning " + warning + "\n";
+    for (const std::string &error : process->errors())
+        text += "error " + error + "\n";
+    if (const HXAuxTree aux = process->auxData()) {
+        text += "aux " + aux->jsonRepresentation() + "\n";
+        EXPECT_EQ(aux->mergeWithData(nullptr), nullptr); // no process's figure adds to another's
+    }
+    std::istringstream lines(printed.err);
+    for (std::string line; std::getline(lines, line);)
+        text += "prints " + line + "\n";
+    return text;
+}
+
+struct Case {
+    std::string title;
+    std::string machine;
+    std::map<std::string, std::string> expected; // by mode
+};
+std::vector<Case> cases() {
+    std::vector<Case> cases;
+    std::istringstream lines(contentOf(std::string(TEST_CASES "/gathering.txt")));
+    std::string *text = nullptr;
+    for (std::string line; std::getline(lines, line);) {
+        if (line.starts_with("== ")) {
+            cases.push_back({line.substr(3), {}, {}});
+            text = &cases.back().machine;
+        } else if (line.starts_with("-- ")) {
+            text = &cases.back().expected[line.substr(3)];
+        } else if (!line.empty()) {
+            *text += line + "\n";
+        }
+    }
+    return cases;
+}
+
+} // namespace
+
+TEST(HXGatheringTest, FindsWhatEachCaseExpects) {
+    const std::string breakDown = "self_region_heft=1";
+    for (const Case &each : cases())
+        for (const auto &[mode, expected] : each.expected) {
+            std::string machine = each.machine;
+            if (mode == "objects")
+                machine.replace(machine.find(breakDown), breakDown.size(), "self_region_heft=0");
+            EXPECT_EQ(gathered(machine, mode == "hidden"), expected) << each.title << ", " << mode;
+        }
+}
