@@ -10,10 +10,6 @@
 
 namespace {
 
-constexpr int32_t CTL_KERN = 1;
-constexpr int32_t KERN_ARGMAX = 8;
-constexpr int32_t KERN_PROCARGS2 = 49;
-
 std::vector<std::string> &globalErrorList() {
     static std::vector<std::string> list;
     return list;

@@ -1,10 +1,12 @@
 // What breaks the form of machine files, with the line that the load fails at.
 #include "platform/capture/HXMachine.h"
-#include "support/HXBarePlatform.h"
+#include "platform/linux/HXLinuxServices.h"
+#include "support/HXBuilders.h"
 
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <fstream>
 
 namespace {
 
@@ -24,10 +26,8 @@ std::string reasonFor(const std::string &text) {
 TEST(HXMachineReader, NamesTheLineThatBreaksTheForm) {
     const std::string process = "process|pid=1\n";
     const std::string region = process + "region|pid=1|address=0x8000|size=0x8000";
-    const struct {
-        std::string records;
-        const char *reason; // its beginning
-    } cases[] = {
+    const std::pair<std::string, const char *> cases[] = {
+        // records, and how the reason begins
         {"", ""},
         {"zone|name=tab\\tnewline\\nslash\\\\\n", ""},
         {"host|page_size=4096\n" + process + "region|pid=1|address=4096|size=4096|pages=1*0x10\n", ""},
@@ -44,7 +44,6 @@ TEST(HXMachineReader, NamesTheLineThatBreaksTheForm) {
         {"process|pid=1|listed=2\n", "line 2: listed is not 0 or 1"},
         {"process|pid=1|comm=a\\xb\n", "line 2: a bad escape in comm"},
         {region + "|pager=256\n", "line 3: pager is no number"},
-        {"region|pid=1|address=0|size=0x4000\n", "line 2: no process record before this one for pid 1"},
         {process + process, "line 3: a second process record of pid 1"},
         {process + "host|pid=2\n", "line 3: the host record comes after"},
         {"host|page_size=5000\n", "line 2: page_size"},
@@ -76,65 +75,59 @@ TEST(HXMachineReader, NamesTheLineThatBreaksTheForm) {
         {"zone|name=" + std::string((1 << 20) - 10, 'x'), ""},
         {"\nzone|name=" + std::string((1 << 20) - 9, 'x'), "line 3: the record is longer than 1 MiB"},
     };
-    for (const auto &test : cases) {
-        const std::string reason = reasonFor(file(test.records));
-        const std::string expected = test.reason;
+    for (const auto &[records, beginning] : cases) {
+        const std::string reason = reasonFor(file(records)), expected = beginning;
         EXPECT_EQ(reason.substr(0, expected.empty() ? reason.size() : expected.size()), expected)
-            << test.records.substr(0, 200) << ": " << reason;
+            << records.substr(0, 200) << ": " << reason;
     }
+    for (const char *record :
+         {"region|address=0|size=0x4000", "top|address=0|size=0x4000", "pages|pages=", "image|path=x|base=0",
+          "segment|name=x|start=0|size=1", "owned|object_id=1", "fault|call=mach_vm_region|error=1"})
+        EXPECT_EQ(reasonFor(file("process|pid=2\n" + std::string(record) + "|pid=1\n")),
+                  "line 3: no process record before this one for pid 1")
+            << record;
     for (const char *text : {"", "heft-machine 2\n", "heft-machine 1 \n", "# x\nheft-machine 1\n"})
         EXPECT_EQ(reasonFor(text), "not a machine file") << text;
     EXPECT_EQ(reasonFor("heft-machine 1"), "");
 }
 
-// Services whose only file is a text.
-class OneFile : public HXLinuxServices {
-  public:
-    explicit OneFile(std::string text) : _text(std::move(text)) {}
-    std::FILE *fopen(const std::string &, const char *) override {
-        std::FILE *const stream = std::tmpfile();
-        std::fwrite(_text.data(), 1, _text.size(), stream);
-        std::rewind(stream);
-        return stream;
-    }
-
-  private:
-    const std::string _text;
-};
-
 // Records lie anywhere across the pieces in which a file is read.
 TEST(HXMachineReader, ReadsFilesInPiecesAsItReadsText) {
-    std::string text = file("process|pid=7\n");
-    constexpr uint64_t regions = 5000;
-    for (uint64_t i = 1; i <= regions; i++) {
-        text += "#" + std::string(i % 97, 'c') + "\nregion\tpid=7\taddress=" + std::to_string(i << 14);
-        text += "\tsize=16384\tpath=/" + std::string(i % 89, 'p') + std::to_string(i % 10) + "\n";
-        if (i % 1000 == 0) text += "#" + std::string(i * 100, 'c') + "\n";
-    }
+    HXLinuxServices services;
     std::string reason;
-    OneFile host(text);
-    const auto machine = HXMachine::load(host, "", &reason);
+    const auto load = [&](const std::string &text) {
+        const std::string path = temporaryPath();
+        std::ofstream(path) << text;
+        return HXMachine::load(services, path, &reason);
+    };
+    const auto pathOf = [](uint64_t i) { return "/" + std::string(i % 89, 'p') + std::to_string(i % 10); };
+    constexpr uint64_t regions = 5000;
+    std::string text = file("process|pid=7\n");
+    for (uint64_t i = 1; i <= regions; i++) {
+        text += "#" + std::string(i % 1000 == 0 ? i * 100 : i % 97, 'c') +
+                "\nregion\tpid=7\taddress=" + std::to_string(i << 14) + "\tsize=16384\tpath=" + pathOf(i) +
+                "\n";
+    }
+    const auto machine = load(text);
     ASSERT_TRUE(machine) << reason;
     const auto &read = *machine->process(7)->regions;
     ASSERT_EQ(read.size(), regions);
     for (uint64_t i = 1; i <= regions; i++) {
         EXPECT_EQ(read[i - 1].address, i << 14);
-        EXPECT_EQ(machine->strings.text(read[i - 1].path),
-                  "/" + std::string(i % 89, 'p') + std::to_string(i % 10));
+        EXPECT_EQ(machine->strings.text(read[i - 1].path), pathOf(i));
     }
+    const std::string large(40 << 20, 'x');
     const std::pair<std::string, const char *> broken[] = {
-        {text + "x\n", "line 10008: unknown record \"x\""},
-        {text + "zone\tname=" + std::string(40 << 20, 'x'), "line 10008: the record is longer than 1 MiB"},
-        {text + "#" + std::string(40 << 20, 'x') + "\nx", "line 10009: unknown record \"x\""},
-        {std::string(40 << 20, 'x'), "not a machine file"},
+        {text + "x\n", "line 10003: unknown record \"x\""},
+        {text + "zone\tname=" + large, "line 10003: the record is longer than 1 MiB"},
+        {text + "#" + large + "\nx", "line 10004: unknown record \"x\""},
+        {large, "not a machine file"},
     };
-    for (const auto &test : broken) {
-        OneFile brokenHost(test.first);
-        EXPECT_FALSE(HXMachine::load(brokenHost, "", &reason));
-        EXPECT_EQ(reason, test.second);
+    for (const auto &[content, expected] : broken) {
+        EXPECT_FALSE(load(content));
+        EXPECT_EQ(reason, expected);
     }
-    HXLinuxServices without;
-    EXPECT_FALSE(HXMachine::load(without, "/nonexistent/machine", &reason));
+    EXPECT_FALSE(HXMachine::load(services, "/nonexistent/machine", &reason));
     EXPECT_EQ(reason, "No such file or directory");
 }
 

@@ -247,7 +247,7 @@ TEST_F(HXLinuxPlatformTest, WalksMappings) {
     EXPECT_EQ(platform.mach_vm_purgable_control(task, 0x1000, 0, nullptr), KERN_INVALID_ARGUMENT);
     platform.mach_port_deallocate(platform.mach_task_self(), task);
     EXPECT_EQ(platform.mach_vm_region_recurse(task, &address, &size, &depth, &info, &count),
-              KERN_INVALID_ARGUMENT);
+              MACH_SEND_INVALID_DEST);
 }
 
 TEST_F(HXLinuxPlatformTest, ProcessesVanishAndRefuse) {
