@@ -102,7 +102,7 @@ void HXMachineRecorder::recordKernel() {
     if (_facts.memoryInfoError != KERN_SUCCESS) return;
     for (uint32_t i = 0; i < std::min(names.count, zones.count); i++) {
         _writer.begin(zoneRecord);
-        _writer.text(Zone::name, HXTextOfField(names.array[i].mzn_name));
+        _writer.text(ZoneOrSite::name, HXTextOfField(names.array[i].mzn_name));
         _writer.numbers(&zones.array[i]);
         _writer.end();
     }
@@ -110,7 +110,7 @@ void HXMachineRecorder::recordKernel() {
     for (const mach_memory_info_record &site : sites.records()) {
         _writer.begin(siteRecord);
         _writer.numbers(&site);
-        _writer.text(Site::name, HXTextOfField(site.name));
+        _writer.text(ZoneOrSite::name, HXTextOfField(site.name));
         _writer.end();
         if ((site.flags & VM_KERN_SITE_TYPE) == VM_KERN_SITE_KERNEL) code.insert(site.site);
     }

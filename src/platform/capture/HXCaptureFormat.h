@@ -2,6 +2,7 @@
 // writer share.
 #pragma once
 
+#include <bit>
 #include <concepts>
 #include <cstddef>
 #include <cstdint>
@@ -21,68 +22,39 @@ enum class HXFieldKind : uint8_t {
 };
 
 // A member that holds a number, of a record that the reader fills and the writer writes; or, made from a kind
-// alone, none. Read and written bytewise: the host's records are packed.
+// alone, none. Read and written bytewise, since the host's records are packed.
 struct HXMember {
     HXFieldKind kind = HXFieldKind::text;
-    uint16_t offset = kNone;
-
-    static constexpr uint16_t kNone = UINT16_MAX;
+    uint8_t bytes = 0; // 0: none
+    uint16_t offset = 0;
 
     constexpr HXMember() = default;
-    // Not explicit: a field that has no place is given by its kind.
+    // Not explicit: a field without a place is given by its kind.
     constexpr HXMember(HXFieldKind ofKind) : kind(ofKind) {}
-    template <class Number>
+    template <std::integral Number>
     static constexpr HXMember at(size_t offset) {
-        HXMember member(kindOf<Number>());
+        constexpr HXFieldKind unsignedKinds[] = {HXFieldKind::unsigned8, HXFieldKind::unsigned16,
+                                                 HXFieldKind::unsigned32, HXFieldKind::unsigned64};
+        HXMember member(unsignedKinds[std::bit_width(sizeof(Number)) - 1]);
+        if (std::signed_integral<Number>) member.kind = HXFieldKind::signed32;
+        if (std::same_as<Number, bool>) member.kind = HXFieldKind::boolean;
+        member.bytes = sizeof(Number);
         member.offset = static_cast<uint16_t>(offset);
         return member;
     }
 
-    constexpr bool exists() const { return offset != kNone; }
+    constexpr bool exists() const { return bytes != 0; }
     // The number, sign-extended.
     uint64_t of(const void *record) const {
-        return withType([&](auto number) {
-            std::memcpy(&number, static_cast<const char *>(record) + offset, sizeof number);
-            return static_cast<uint64_t>(number);
-        });
+        uint64_t number = 0;
+        std::memcpy(&number, static_cast<const char *>(record) + offset, bytes);
+        return kind == HXFieldKind::signed32 ? static_cast<uint64_t>(static_cast<int32_t>(number)) : number;
     }
-    // Stores as much of `value` as the member has bits.
-    void set(void *record, uint64_t value) const {
-        withType([&](auto number) {
-            number = static_cast<decltype(number)>(value);
-            std::memcpy(static_cast<char *>(record) + offset, &number, sizeof number);
-            return uint64_t{0};
-        });
+    // Stores as much of `number` as the member has bits.
+    void set(void *record, uint64_t number) const {
+        std::memcpy(static_cast<char *>(record) + offset, &number, bytes);
     }
-
-  private:
-    template <class Number>
-    static constexpr HXFieldKind kindOf() {
-        using Kind = HXFieldKind;
-        if (std::same_as<Number, bool>) return Kind::boolean;
-        if (std::signed_integral<Number>) return sizeof(Number) == 4 ? Kind::signed32 : Kind::signed64;
-        return sizeof(Number) == 1   ? Kind::unsigned8
-               : sizeof(Number) == 2 ? Kind::unsigned16
-               : sizeof(Number) == 4 ? Kind::unsigned32
-                                     : Kind::unsigned64;
-    }
-    template <class Work>
-    uint64_t withType(Work work) const {
-        switch (kind) {
-        case HXFieldKind::unsigned8:
-            return work(uint8_t{});
-        case HXFieldKind::unsigned16:
-            return work(uint16_t{});
-        case HXFieldKind::unsigned32:
-            return work(uint32_t{});
-        case HXFieldKind::signed32:
-            return work(int32_t{});
-        case HXFieldKind::boolean:
-            return work(bool{});
-        default:
-            return work(uint64_t{});
-        }
-    }
+    static_assert(std::endian::native == std::endian::little, "a number's low bytes come first");
 };
 
 #define HX_MEMBER(Record, member) HXMember::at<decltype(Record::member)>(offsetof(Record, member))

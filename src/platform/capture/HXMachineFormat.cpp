@@ -111,10 +111,10 @@ constexpr F hostFields[] = {
 };
 
 constexpr HXRecordForm records[] = {
-    {"region", regionFields}, {"top", topFields},         {"pages", pagesFields}, {"process", processFields},
-    {"image", imageFields},   {"segment", segmentFields}, {"owned", ownedFields}, {"fault", faultFields},
-    {"zone", zoneFields},     {"site", siteFields},       {"kext", kextFields},   {"symbol", symbolFields},
-    {"tag", tagFields},       {"host", hostFields},
+    {"region", regionFields},   {"top", topFields},     {"pages", pagesFields}, {"image", imageFields},
+    {"segment", segmentFields}, {"owned", ownedFields}, {"fault", faultFields}, {"process", processFields},
+    {"zone", zoneFields},       {"site", siteFields},   {"kext", kextFields},   {"symbol", symbolFields},
+    {"tag", tagFields},         {"host", hostFields},
 };
 
 static_assert(std::size(regionFields) <= kMaxCaptureFields);

@@ -6,15 +6,16 @@
 
 namespace HXMachineFormat {
 
+// Those before `processRecord` are of a process that had its own before; their first field is its pid.
 enum Record : size_t {
     regionRecord,
     topRecord,
     pagesRecord,
-    processRecord,
     imageRecord,
     segmentRecord,
     ownedRecord,
     faultRecord,
+    processRecord,
     zoneRecord,
     siteRecord,
     kextRecord,
@@ -55,16 +56,10 @@ enum Field : size_t { pid, path, base };
 namespace Segment {
 enum Field : size_t { pid, name, start, size };
 }
-namespace Owned {
-enum Field : size_t { pid };
-}
 namespace Fault {
 enum Field : size_t { pid, call, from, error, becomes };
 }
-namespace Zone {
-enum Field : size_t { name };
-}
-namespace Site {
+namespace ZoneOrSite {
 enum Field : size_t { name };
 }
 namespace Kext {

@@ -18,42 +18,36 @@ constexpr size_t kNameBytes = sizeof proc_bsdinfo::pbi_name;
 } // namespace
 
 const HXMachineReader::Handler HXMachineReader::handlers[] = {
-    &HXMachineReader::readRegion,  &HXMachineReader::readTop,   &HXMachineReader::readPages,
-    &HXMachineReader::readProcess, &HXMachineReader::readImage, &HXMachineReader::readSegment,
-    &HXMachineReader::readOwned,   &HXMachineReader::readFault, &HXMachineReader::readZone,
-    &HXMachineReader::readSite,    &HXMachineReader::readKext,  &HXMachineReader::readSymbol,
-    &HXMachineReader::readTag,     &HXMachineReader::readHost,
+    &HXMachineReader::readRegion, &HXMachineReader::readTop,     &HXMachineReader::readPages,
+    &HXMachineReader::readImage,  &HXMachineReader::readSegment, &HXMachineReader::readOwned,
+    &HXMachineReader::readFault,  &HXMachineReader::readProcess, &HXMachineReader::readZone,
+    &HXMachineReader::readSite,   &HXMachineReader::readKext,    &HXMachineReader::readSymbol,
+    &HXMachineReader::readTag,    &HXMachineReader::readHost,
 };
 
-std::unique_ptr<HXMachine> HXMachine::load(HXServices &files, const std::string &path, std::string *reason) {
-    std::FILE *const stream = files.fopen(path, "r");
-    if (stream == nullptr) {
-        *reason = std::strerror(errno);
-        return nullptr;
-    }
+static std::unique_ptr<HXMachine> machineOf(HXCaptureReader &&reader, std::string *reason) {
     auto machine = std::make_unique<HXMachine>();
-    HXCaptureReader reader(format, stream);
-    const bool whole = HXMachineReader(reader, *machine).read();
-    std::fclose(stream);
-    if (whole) return machine;
-    *reason = reader.reason();
-    return nullptr;
-}
-
-std::unique_ptr<HXMachine> HXMachine::loadText(std::string_view text, std::string *reason) {
-    auto machine = std::make_unique<HXMachine>();
-    HXCaptureReader reader(format, text);
     if (HXMachineReader(reader, *machine).read()) return machine;
     *reason = reader.reason();
     return nullptr;
 }
 
+std::unique_ptr<HXMachine> HXMachine::load(HXServices &files, const std::string &path, std::string *reason) {
+    const std::unique_ptr<std::FILE, int (*)(std::FILE *)> stream(files.fopen(path, "r"), std::fclose);
+    if (stream) return machineOf(HXCaptureReader(format, stream.get()), reason);
+    *reason = std::strerror(errno);
+    return nullptr;
+}
+
+std::unique_ptr<HXMachine> HXMachine::loadText(std::string_view text, std::string *reason) {
+    return machineOf(HXCaptureReader(format, text), reason);
+}
+
 bool HXMachineReader::read() {
     _machine.regionExtras.emplace_back();
-    while (_reader.next()) {
-        if (!(this->*handlers[_reader.kind()])()) return false;
-        _hasRecords = true;
-    }
+    for (; _reader.next(); _hasRecords = true)
+        if ((_reader.kind() < processRecord && !findProcess()) || !(this->*handlers[_reader.kind()])())
+            return false;
     return !_reader.failed();
 }
 
@@ -75,10 +69,9 @@ uint32_t HXMachineReader::internName(size_t field, size_t bytes) {
     return _reader.has(field) ? _machine.strings.add(safeName(field, bytes)) : kNoString;
 }
 
-// Makes the process that the record's pid names the current one. The pid is the first field of every record
-// that has one.
+// Makes the process that the record's pid names the current one.
 bool HXMachineReader::findProcess() {
-    constexpr size_t pidField = 0;
+    constexpr size_t pidField = 0; // of every record that has one
     const int32_t pid = signed32(pidField);
     if (_process != nullptr && _process->pid == pid) return true;
     const auto found = _machine.processIndices.find(pid);
@@ -129,7 +122,6 @@ void HXMachineReader::keepNumbers(HXMachineRegion &region) {
 }
 
 bool HXMachineReader::readRegion() {
-    if (!findProcess()) return false;
     HXMachineRegion region{};
     region.address = _reader.number(Region::address);
     region.size = _reader.number(Region::size);
@@ -174,7 +166,6 @@ bool HXMachineReader::addPageRuns(HXMachineRegion &region, std::string_view text
 }
 
 bool HXMachineReader::readPages() {
-    if (!findProcess()) return false;
     if (!_process->regions) return _reader.fail("pages before a region of the process");
     HXMachineRegion &region = _process->regions->back();
     const HXMachineRegionExtra &extra = _machine.extra(region);
@@ -185,7 +176,6 @@ bool HXMachineReader::readPages() {
 }
 
 bool HXMachineReader::readTop() {
-    if (!findProcess()) return false;
     HXMachineTop top{};
     top.address = _reader.number(Top::address);
     top.size = _reader.number(Top::size);
@@ -214,14 +204,12 @@ bool HXMachineReader::readProcess() {
 }
 
 bool HXMachineReader::readImage() {
-    if (!findProcess()) return false;
     _process->images.push_back({_reader.number(Image::base), internText(Image::path),
                                 static_cast<uint32_t>(_process->segments.size())});
     return true;
 }
 
 bool HXMachineReader::readSegment() {
-    if (!findProcess()) return false;
     if (_process->images.empty()) return _reader.fail("a segment before an image of its process");
     const uint64_t start = _reader.number(Segment::start), size = _reader.number(Segment::size);
     if (!_reader.checkPlace(start, size)) return false;
@@ -230,7 +218,6 @@ bool HXMachineReader::readSegment() {
 }
 
 bool HXMachineReader::readOwned() {
-    if (!findProcess()) return false;
     if (_process->ownedNone) return _reader.fail("an owned object of a process with owned_none=1");
     _reader.fill(&_process->owned.emplace_back());
     return true;
@@ -240,7 +227,6 @@ bool HXMachineReader::readFault() {
     static constexpr std::string_view calls[] = {"mach_vm_region", "mach_vm_region_recurse",
                                                  "mach_vm_page_range_query"};
     static constexpr std::string_view fates[] = {"alive", "gone", "zombie"};
-    if (!findProcess()) return false;
     const auto call = std::find(std::begin(calls), std::end(calls), _reader.text(Fault::call));
     if (call == std::end(calls)) return _reader.fail("unknown call", _reader.text(Fault::call));
     const std::string_view fateName = _reader.has(Fault::becomes) ? _reader.text(Fault::becomes) : fates[0];
@@ -259,14 +245,14 @@ bool HXMachineReader::readFault() {
 
 bool HXMachineReader::readZone() {
     HXFillText(_machine.zoneNames.emplace_back().mzn_name,
-               safeName(Zone::name, sizeof mach_zone_name::mzn_name));
+               safeName(ZoneOrSite::name, sizeof mach_zone_name::mzn_name));
     _reader.fill(&_machine.zones.emplace_back());
     return true;
 }
 
 bool HXMachineReader::readSite() {
     mach_memory_info_record &site = _machine.sites.emplace_back();
-    HXFillText(site.name, safeName(Site::name, sizeof site.name));
+    HXFillText(site.name, safeName(ZoneOrSite::name, sizeof site.name));
     _reader.fill(&site);
     return true;
 }

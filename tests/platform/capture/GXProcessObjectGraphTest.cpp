@@ -1,4 +1,4 @@
-// Memory graphs: what is read, what breaks the form, and reports on them.
+// Memory graphs: what is read, and reports on them.
 #include "platform/capture/GXProcessObjectGraph.h"
 #include "support/HXBuilders.h"
 #include "support/HXRun.h"
@@ -17,13 +17,11 @@ std::string file(std::string records) {
     return "heft-memgraph 1\n" + records;
 }
 
-const std::string kProcess = "process|pid=42|name=a\"b|description=x, ARM64|page_size=16384\n";
-
 TEST(GXProcessObjectGraph, ReadsFactsAndRegions) {
     std::string reason;
     HXNamedTags tags;
     const auto graph = GXProcessObjectGraph::directedGraphWithData(
-        file(kProcess +
+        file("process|pid=42|name=a\"b|description=x, ARM64|page_size=16384\n"
              "region|address=0x4001|length=3|type=__TEXT|path=/a\\tb|user_tag=110\n"
              "region|address=0x8000|length=0x4000|type=arena|prot=-1|max_prot=7|offset=9|user_tag=200"
              "|resident=1|shared_now_private=2|swapped=3|dirty=4294967296|reusable=5|ref_count=6"
@@ -48,31 +46,6 @@ TEST(GXProcessObjectGraph, ReadsFactsAndRegions) {
     EXPECT_EQ(tags.nameForTag(r.user_tag), "arena");
     EXPECT_EQ(regions[2].user_tag, 201u);
     EXPECT_EQ(regions[2].purgeable, VM_PURGABLE_DENY);
-}
-
-TEST(GXProcessObjectGraph, NamesTheLineThatBreaksTheForm) {
-    const std::pair<std::string, std::string> cases[] = {
-        // content, and how the reason begins
-        {"heft-machine 1\n", "not a memory graph"},
-        {file(""), "line 1: no process record"},
-        {file("region|address=1|length=1|type=x\n" + kProcess), "line 2: a region before the process"},
-        {file(kProcess + kProcess), "line 3: a second process record"},
-        {file("process|pid=1|name=x|page_size=4096\n"), "line 2: missing field \"description\""},
-        {file("process|pid=1|name=x|description=x|page_size=12288\n"), "line 2: page_size"},
-        {file(kProcess + "region|address=1|length=0|type=x\n"), "line 3: a length of 0"},
-        {file(kProcess + "region|address=4|length=4|type=x\nregion|address=7|length=1|type=x\n"),
-         "line 4: it overlaps"},
-        {file(kProcess + "region|address=4|length=4|type=x|share_mode=256\n"), "line 3: share_mode"},
-        {file(kProcess + "host\n"), "line 3: unknown record \"host\""},
-        {file(kProcess + "region|address=4|length=4|type=x\nregion|address=8|length=1|type=x\n"), ""},
-    };
-    for (const auto &[content, expected] : cases) {
-        std::string reason;
-        HXNamedTags tags;
-        const bool loaded = GXProcessObjectGraph::directedGraphWithData(content, tags, &reason) != nullptr;
-        EXPECT_EQ(loaded, expected.empty());
-        EXPECT_EQ(reason.substr(0, expected.size()), expected) << reason;
-    }
 }
 
 std::string pathOf(const std::string &records) {
