@@ -99,7 +99,7 @@ inline constexpr uint32_t VM_REGION_SUBMAP_INFO_COUNT_64 = 19;
 inline constexpr uint32_t VM_REGION_SUBMAP_INFO_V1_COUNT_64 = 18;
 
 #pragma pack(pop)
-static_assert(sizeof(vm_region_submap_info_64) == 19 * 4);
+static_assert(sizeof(vm_region_submap_info_64) == VM_REGION_SUBMAP_INFO_COUNT_64 * sizeof(uint32_t));
 
 inline constexpr int32_t PROC_PIDTBSDINFO = 3;
 inline constexpr int32_t PROC_PIDT_SHORTBSDINFO = 13;

@@ -69,20 +69,18 @@ struct HXFieldForm {
     std::string_view name;
     HXMember member; // where its number is read to and written from, if anywhere
     HXFieldNeed need = HXFieldNeed::required;
-    uint64_t defaultValue = 0;  // signed values sign-extended
     bool isHexadecimal = false; // how it is written
+    uint64_t defaultValue = 0;  // signed values sign-extended
 
     constexpr HXFieldKind kind() const { return member.kind; }
 
-    static constexpr HXFieldForm required(std::string_view name, HXMember member) {
-        return {name, member, HXFieldNeed::required};
-    }
+    static constexpr HXFieldForm required(std::string_view name, HXMember member) { return {name, member}; }
     static constexpr HXFieldForm optional(std::string_view name, HXMember member) {
         return {name, member, HXFieldNeed::optional};
     }
     // A text's default is always empty.
     static constexpr HXFieldForm defaulted(std::string_view name, HXMember member, uint64_t value = 0) {
-        return {name, member, HXFieldNeed::defaulted, value};
+        return {name, member, HXFieldNeed::defaulted, false, value};
     }
     constexpr HXFieldForm inHexadecimal() const {
         HXFieldForm form = *this;

@@ -10,7 +10,7 @@
 
 namespace {
 
-constexpr size_t kReadBytes = 64 * 1024;
+constexpr size_t kReadBytes = size_t{64} * 1024;
 
 struct NumberRange {
     bool isSigned;

@@ -16,7 +16,7 @@ vm_region_submap_info_64 HXMachine::info(const HXMachineRegion &region) const {
     vm_region_submap_info_64 info = traits(region).info;
     const HXMachineRegionExtra &few = extra(region);
     HXForEachRegionField([&](auto each) {
-        constexpr HXRegionField field = *each;
+        constexpr HXRegionField field = kRegionFields[each];
         if constexpr (field.own.exists()) field.machine.member.set(&info, field.own.of(&region));
         if constexpr (field.extra.exists()) field.machine.member.set(&info, field.extra.of(&few));
     });

@@ -97,7 +97,7 @@ void HXMachineReader::keepNumbers(HXMachineRegion &region) {
     bool hasExtra = _reader.has(Region::pages);
     size_t index = Region::firstNumber;
     HXForEachRegionField([&](auto each) {
-        constexpr HXRegionField field = *each;
+        constexpr HXRegionField field = kRegionFields[each];
         if constexpr (!field.machine.name.empty()) {
             const uint64_t number = _reader.number(index++);
             if constexpr (field.own.exists()) {

@@ -96,12 +96,12 @@ constexpr auto HXWithRegionFields(const std::array<HXFieldForm, First> &first,
     return all;
 }
 
-// Calls `work` with a pointer to each field as a constant, so that what is done for every region costs no
+// Calls `work` with each field's index as a constant, so that what is done for every region costs no
 // more than if its fields were written out.
 template <class Work>
 void HXForEachRegionField(Work work) {
     [&]<size_t... I>(std::index_sequence<I...>) {
-        (work(std::integral_constant<const HXRegionField *, &kRegionFields[I]>()), ...);
+        (work(std::integral_constant<size_t, I>()), ...);
     }
     (std::make_index_sequence<std::size(kRegionFields)>());
 }
