@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 using kern_return_t = int32_t;
@@ -46,6 +47,9 @@ inline constexpr int32_t VM_PAGE_QUERY_PAGE_DIRTY = 0x8;
 inline constexpr int32_t VM_PAGE_QUERY_PAGE_PAGED_OUT = 0x10;
 inline constexpr int32_t VM_PAGE_QUERY_PAGE_EXTERNAL = 0x80;
 inline constexpr int32_t VM_PAGE_QUERY_PAGE_REUSABLE = 0x800;
+
+// The longest path of a mapped file that is asked for; longer ones are cut.
+inline constexpr size_t kMaxPathBytes = 1024;
 
 // The user tag of the region with which the kernel closes a walk, and of regions without an address.
 inline constexpr uint32_t kFakeRegionTag = 0xFFFFFFFF;
@@ -95,7 +99,7 @@ inline constexpr uint32_t VM_REGION_SUBMAP_INFO_COUNT_64 = 19;
 inline constexpr uint32_t VM_REGION_SUBMAP_INFO_V1_COUNT_64 = 18;
 
 #pragma pack(pop)
-static_assert(sizeof(vm_region_submap_info_64) == 76);
+static_assert(sizeof(vm_region_submap_info_64) == VM_REGION_SUBMAP_INFO_COUNT_64 * sizeof(uint32_t));
 
 inline constexpr int32_t PROC_PIDTBSDINFO = 3;
 inline constexpr int32_t PROC_PIDT_SHORTBSDINFO = 13;
@@ -148,6 +152,11 @@ struct proc_bsdshortinfo {
 };
 static_assert(sizeof(proc_bsdshortinfo) == 64);
 
+// Names for `sysctl`.
+inline constexpr int32_t CTL_KERN = 1;
+inline constexpr int32_t KERN_ARGMAX = 8;
+inline constexpr int32_t KERN_PROCARGS2 = 49;
+
 inline constexpr int32_t RUSAGE_INFO_V4 = 4;
 
 // `proc_pid_rusage` flavor 4; only the heft figures (bytes) are read.
@@ -164,6 +173,8 @@ static_assert(offsetof(rusage_info_v4, ri_lifetime_max_phys_heft) == 240);
 
 inline constexpr int32_t LEDGER_ENTRY_INFO = 1;
 inline constexpr int32_t LEDGER_TEMPLATE_INFO = 2;
+// The entry that counts a task's page tables, in bytes.
+inline constexpr std::string_view kPageTableEntry = "page_table";
 
 struct ledger_template_info {
     char lti_name[32]; // zero-terminated

@@ -54,21 +54,22 @@ class HXPlatform {
 
     // The first top-level mapping whose end lies above *address: its start and length in bytes, and its basic
     // information. *infoCount: words there is room for, then words filled. KERN_INVALID_ADDRESS when there is
-    // none, MACH_SEND_INVALID_DEST when the process is gone.
+    // none, MACH_SEND_INVALID_DEST when the process is gone or the port is no task's, KERN_INVALID_ARGUMENT
+    // for another flavor and without room for all of the record.
     virtual kern_return_t mach_vm_region(mach_port_t task, uint64_t *address, uint64_t *size, int32_t flavor,
                                          vm_region_basic_info_64 *info, uint32_t *infoCount) = 0;
 
-    // The same for leaf mappings, however deep; *nestingDepth is the deepest submap level to descend to.
-    // *infoCount comes back as 18 or less from a kernel that fills the older record. A task's walk is
-    // answered from one snapshot of its address space, so it neither skips nor repeats a mapping; one thread
-    // walks a task.
+    // The same for leaf mappings, however deep; *nestingDepth is the deepest submap level to descend to, then
+    // that of the mapping. As many words are filled as there is room for: 18 at most by a kernel that fills
+    // the older record. A task's walk is answered from one snapshot of its address space, so it neither skips
+    // nor repeats a mapping; one thread walks a task.
     virtual kern_return_t mach_vm_region_recurse(mach_port_t task, uint64_t *address, uint64_t *size,
                                                  uint32_t *nestingDepth, vm_region_submap_info_64 *info,
                                                  uint32_t *infoCount) = 0;
 
     // The dispositions (VM_PAGE_QUERY_… bits) of the pages of [address, address + size), one word a page.
     // *count: entries there is room for, then entries filled. KERN_INVALID_ADDRESS when a page lies in no
-    // mapping, KERN_INVALID_ARGUMENT when the process is gone.
+    // mapping, KERN_INVALID_ARGUMENT when the process is gone or the port is no task's.
     virtual kern_return_t mach_vm_page_range_query(mach_port_t task, uint64_t address, uint64_t size,
                                                    int32_t *dispositions, uint64_t *count) = 0;
 
@@ -92,7 +93,8 @@ class HXPlatform {
     // The kernel's text for an error; never null, lives for ever.
     const char *mach_error_string(kern_return_t error);
 
-    // Processes. These answer −1 with errno set when they fail, unless they say otherwise.
+    // Processes. These answer −1 with errno set when they fail, unless they say otherwise: ESRCH when there
+    // is no such process, EINVAL for a flavor or command that there is not.
 
     // Fills `pids` with the pids of all processes, as many as there is room for, and answers how many were
     // filled. With a null buffer: how many there are about. Kernel threads are no processes; the kernel
@@ -100,7 +102,7 @@ class HXPlatform {
     virtual int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes) = 0;
 
     // Fills `buffer` with the record of `flavor` (PROC_PIDTBSDINFO, PROC_PIDT_SHORTBSDINFO) and answers its
-    // length in bytes; 0 with errno set when it cannot (ESRCH: no such process). A zombie has no record of
+    // length in bytes; 0 with errno set when it cannot (ENOMEM: too little room). A zombie has no record of
     // flavor 3.
     virtual int32_t proc_pidinfo(int32_t pid, int32_t flavor, uint64_t argument, void *buffer,
                                  uint32_t bufferBytes) = 0;
@@ -111,18 +113,19 @@ class HXPlatform {
     // Idle-exit flags (0x1 tracked, 0x2 allows idle exit, 0x4 dirty). 0 on success.
     virtual int32_t proc_get_dirty(int32_t pid, uint32_t *flags) = 0;
 
-    // Path of the file mapped at `address`, not terminated, cut to `bufferBytes`; answers its length, 0 when
-    // there is none.
+    // Path of the file mapped at `address` by a process whose task is open, not terminated, cut to whole
+    // characters in `bufferBytes`; answers its length, 0 when there is none.
     virtual int32_t proc_regionfilename(int32_t pid, uint64_t address, char *buffer,
                                         uint32_t bufferBytes) = 0;
 
     virtual int32_t getpid() = 0;
     virtual uint32_t geteuid() = 0;
 
-    // { CTL_KERN, KERN_ARGMAX }: the size of the largest argument area in bytes, 32 bits.
-    // { CTL_KERN, KERN_PROCARGS2, pid }: the argument area: a 32-bit argument count, the executed file's
-    // path, at least one zero byte, then the arguments, each with a zero. *oldBytes: room, then bytes filled.
-    // 0 on success.
+    // { CTL_KERN, KERN_ARGMAX }: the size of the largest argument area in bytes, 32 bits (ENOMEM: too little
+    // room). { CTL_KERN, KERN_PROCARGS2, pid }: the argument area: a 32-bit argument count, the executed
+    // file's path, at least one zero byte, then the arguments, each with a zero; cut to the room there is.
+    // *oldBytes: room, then bytes filled; without a buffer the size needed. ENOENT for another name. 0 on
+    // success.
     virtual int32_t sysctl(const int32_t *name, uint32_t nameLength, void *old, size_t *oldBytes) = 0;
 
     // "vm.self_region_heft": read (32 bits) or written. "vm.get_owned_vmobjects": the new value is a task

@@ -1,6 +1,7 @@
 #include "process/HXMemgraphProcess.h"
 
 #include "platform/HXPlatform.h"
+#include "platform/capture/HXRegionFields.h"
 
 #include <cerrno>
 #include <system_error>
@@ -72,26 +73,7 @@ void HXMemgraphProcess::_gatherPhysHeft() {
 vm_region_submap_info_64 HXMemgraphProcess::infoOfRegion(const GXVMRegion &region) const {
     const bool inSharedRegion = sharedRegion().contains(region.address);
     // Within the shared region the fields hold bytes; elsewhere pages, as a live walk delivers them.
-    const auto amount = [&](uint64_t bytes) {
-        return static_cast<uint32_t>(inSharedRegion ? bytes : bytes / pageSize());
-    };
-    vm_region_submap_info_64 info{};
-    info.protection = region.prot;
-    info.max_protection = region.maxProt;
-    info.offset = region.offset;
-    info.user_tag = region.user_tag;
-    info.pages_resident = amount(region.resident_size);
-    info.pages_shared_now_private = amount(region.shared_now_private_size);
-    info.pages_swapped_out = amount(region.swapped_out_size);
-    info.pages_dirtied = amount(region.dirty_size);
-    info.pages_reusable = amount(region.reusable_size);
-    info.ref_count = region.ref_count;
-    info.external_pager = region.external_pager;
-    info.share_mode = region.share_mode;
-    info.is_submap = static_cast<int32_t>(region.is_submap & 1);
-    info.object_id = region.object_id;
-    info.object_id_full = region.object_id;
-    return info;
+    return HXInfoOfGraphRegion(region, inSharedRegion ? 1 : static_cast<uint32_t>(pageSize()));
 }
 
 // A region whose type names a segment completes the pending image; any other only names it.

@@ -11,11 +11,6 @@
 
 namespace {
 
-// The names of settings, as sysctl(3) has them.
-constexpr int32_t kCtlKern = 1;
-constexpr int32_t kKernArgMax = 8;
-constexpr int32_t kKernProcArgs2 = 49;
-
 std::vector<std::string> &globalErrorList() {
     static std::vector<std::string> list;
     return list;
@@ -105,7 +100,7 @@ std::string HXProcess::_nameForBsdInfoCommName(const proc_bsdinfo &info) {
 
 std::string HXProcess::_nameForBsdInfo(const proc_bsdinfo &info) {
     HXPlatform &platform = HXPlatform::current();
-    const int32_t maximumName[] = {kCtlKern, kKernArgMax};
+    const int32_t maximumName[] = {CTL_KERN, KERN_ARGMAX};
     int32_t maximum = 0;
     size_t length = sizeof maximum;
     if (platform.sysctl(maximumName, 2, &maximum, &length) != 0 || maximum <= 0)
@@ -113,7 +108,7 @@ std::string HXProcess::_nameForBsdInfo(const proc_bsdinfo &info) {
 
     const std::unique_ptr<char[]> area(new (std::nothrow) char[static_cast<size_t>(maximum)]);
     if (!area) return _nameForBsdInfoCommName(info);
-    const int32_t areaName[] = {kCtlKern, kKernProcArgs2, info.pbi_pid};
+    const int32_t areaName[] = {CTL_KERN, KERN_PROCARGS2, info.pbi_pid};
     length = static_cast<size_t>(maximum);
     if (platform.sysctl(areaName, 3, area.get(), &length) != 0) return _nameForBsdInfoCommName(info);
 

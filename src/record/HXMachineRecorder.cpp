@@ -3,6 +3,7 @@
 #include "platform/HXRegionTags.h"
 #include "platform/capture/HXFixedText.h"
 #include "platform/capture/HXMachineFormat.h"
+#include "record/HXLedger.h"
 #include "record/HXProcessRecorder.h"
 #include "record/HXRegionHeftSetting.h"
 
@@ -12,7 +13,6 @@ using namespace HXMachineFormat;
 
 namespace {
 
-constexpr int32_t kArgMaxName[] = {1, 8};
 constexpr uint32_t kLastDescribedTag = 239; // from 240 on tags are the program's own
 
 } // namespace
@@ -27,7 +27,7 @@ bool HXMachineRecorder::write(const std::string &text) {
 bool HXMachineRecorder::record(const std::vector<int32_t> &pids) {
     HXRegionHeftSetting setting(_host);
     const bool withKernel = pids.empty() || std::find(pids.begin(), pids.end(), 0) != pids.end();
-    readLedgerTemplate();
+    _facts.ledger = HXLedgerNames(_host);
     _listed = listedPids();
     // The host's record comes first and says whether the kernel told of its memory.
     if (withKernel) recordKernel();
@@ -37,8 +37,7 @@ bool HXMachineRecorder::record(const std::vector<int32_t> &pids) {
     recordHost(setting.found());
     if (!write(_writer.written()) || !write(kernel)) return false;
 
-    HXProcessRecorder process(_host, setting, _anonymize ? &_anonymizer : nullptr, _pageTableIndex,
-                              _ledger ? _ledger->size() : 0);
+    HXProcessRecorder process(_host, _facts, setting, _anonymize ? &_anonymizer : nullptr);
     const int32_t self = _host.getpid();
     for (const int32_t pid : pids.empty() ? _listed.value_or(std::vector<int32_t>()) : pids) {
         if (pid == self) continue;
@@ -71,80 +70,50 @@ std::optional<std::vector<int32_t>> HXMachineRecorder::listedPids() {
     return pids;
 }
 
-void HXMachineRecorder::readLedgerTemplate() {
-    constexpr int64_t longest = 1 << 16;
-    std::vector<ledger_template_info> entries;
-    int64_t count = 0;
-    for (int64_t room = 80; room <= longest; room *= 2) {
-        entries.resize(static_cast<size_t>(room));
-        count = room;
-        if (_host.ledger(LEDGER_TEMPLATE_INFO, 0, entries.data(), &count) < 0) return;
-        if (count < room) break;
-    }
-    _ledger.emplace();
-    for (size_t i = 0; i < static_cast<size_t>(count); i++) {
-        std::string name(HXTextOfField(entries[i].lti_name));
-        std::replace(name.begin(), name.end(), ',', '?'); // the comma joins them
-        if (!_pageTableIndex && name == "page_table") _pageTableIndex = i;
-        _ledger->push_back(std::move(name));
-    }
-}
-
 void HXMachineRecorder::recordHost(const std::optional<int32_t> &selfRegionHeft) {
+    constexpr int32_t argMaxName[] = {CTL_KERN, KERN_ARGMAX};
+    size_t bytes = sizeof _facts.argMax;
+    (void)_host.sysctl(argMaxName, 2, &_facts.argMax, &bytes); // else the default
+    _facts.pageSize = _host.vm_kernel_page_size();
+    _facts.pid = _host.getpid();
+    _facts.euid = _host.geteuid();
+    _facts.sharedRegion = _host.hasSharedRegion();
+    _facts.listPidsError = !_listed;
     _writer.begin(hostRecord);
-    _writer.number(Host::pageSize, _host.vm_kernel_page_size());
-    uint32_t argMax = 0;
-    size_t bytes = sizeof argMax;
-    if (_host.sysctl(kArgMaxName, 2, &argMax, &bytes) == 0) _writer.number(Host::argMax, argMax);
-    _writer.signedNumber(Host::pid, _host.getpid());
-    _writer.number(Host::euid, _host.geteuid());
+    _writer.numbers(&_facts);
     if (selfRegionHeft) _writer.number(Host::selfRegionHeft, *selfRegionHeft != 0);
-    _writer.number(Host::sharedRegion, _host.hasSharedRegion());
-    _writer.number(Host::listPidsError, !_listed);
-    if (_ledger) {
+    if (_facts.ledger) {
         std::string names;
-        for (const std::string &name : *_ledger)
+        for (std::string name : *_facts.ledger) {
+            std::replace(name.begin(), name.end(), ',', '?'); // the comma joins them
             names += (names.empty() ? "" : ",") + name;
+        }
         _writer.text(Host::ledger, names);
     }
-    _writer.signedNumber(Host::memoryInfoError, _memoryInfoError);
     _writer.end();
 }
 
 void HXMachineRecorder::recordKernel() {
-    mach_zone_name *names = nullptr;
-    mach_zone_info *zones = nullptr;
-    mach_memory_info_record *records = nullptr;
-    uint32_t nameCount = 0, zoneCount = 0, recordCount = 0;
-    _memoryInfoError = _host.mach_memory_info(_host.mach_host_self(), &names, &nameCount, &zones, &zoneCount,
-                                              &records, &recordCount);
-    if (_memoryInfoError != KERN_SUCCESS) return;
-    for (uint32_t i = 0; i < std::min(nameCount, zoneCount); i++) {
+    HXKernelArray<mach_zone_name> names(_host);
+    HXKernelArray<mach_zone_info> zones(_host);
+    HXKernelArray<mach_memory_info_record> sites(_host);
+    _facts.memoryInfoError = _host.mach_memory_info(_host.mach_host_self(), &names.array, &names.count,
+                                                    &zones.array, &zones.count, &sites.array, &sites.count);
+    if (_facts.memoryInfoError != KERN_SUCCESS) return;
+    for (uint32_t i = 0; i < std::min(names.count, zones.count); i++) {
         _writer.begin(zoneRecord);
-        _writer.text(Zone::name, HXTextOfField(names[i].mzn_name));
-        _writer.number(Zone::count, zones[i].mzi_count);
-        _writer.number(Zone::curSize, zones[i].mzi_cur_size);
-        _writer.number(Zone::elemSize, zones[i].mzi_elem_size);
-        _writer.number(Zone::collectable, zones[i].mzi_collectable);
+        _writer.text(ZoneOrSite::name, HXTextOfField(names.array[i].mzn_name));
+        _writer.numbers(&zones.array[i]);
         _writer.end();
     }
     std::set<uint64_t> code;
-    for (uint32_t i = 0; i < recordCount; i++) {
-        const mach_memory_info_record &record = records[i];
+    for (const mach_memory_info_record &site : sites.records()) {
         _writer.begin(siteRecord);
-        _writer.hex(Site::flags, record.flags);
-        _writer.hex(Site::site, record.site);
-        _writer.number(Site::size, record.size);
-        _writer.number(Site::mapped, record.mapped);
-        _writer.number(Site::tag, record.tag);
-        _writer.number(Site::zone, record.zone);
-        _writer.text(Site::name, HXTextOfField(record.name));
+        _writer.numbers(&site);
+        _writer.text(ZoneOrSite::name, HXTextOfField(site.name));
         _writer.end();
-        if ((record.flags & VM_KERN_SITE_TYPE) == VM_KERN_SITE_KERNEL) code.insert(record.site);
+        if ((site.flags & VM_KERN_SITE_TYPE) == VM_KERN_SITE_KERNEL) code.insert(site.site);
     }
-    _host.vm_deallocate(_host.mach_task_self(), names, nameCount * sizeof *names);
-    _host.vm_deallocate(_host.mach_task_self(), zones, zoneCount * sizeof *zones);
-    _host.vm_deallocate(_host.mach_task_self(), records, recordCount * sizeof *records);
     for (const OSKextInfo &kext : _host.OSKextCopyLoadedKextInfo()) {
         _writer.begin(kextRecord);
         _writer.number(Kext::loadTag, kext.OSBundleLoadTag);
@@ -156,17 +125,18 @@ void HXMachineRecorder::recordKernel() {
 
 // Of each symbol only the byte that is asked for is recorded: where it begins and ends the host does not say.
 void HXMachineRecorder::recordSymbols(const std::set<uint64_t> &addresses) {
-    RVSymbolicator *const symbolicator = _host.RVSymbolicatorCreateWithMachKernelFlagsAndNotification(
-        _host.RVSymbolicatorGetFlagsForNListOnlyData(), nullptr);
+    const HXSymbolicatorGuard symbolicator =
+        HXSymbolicatorOfKernel(_host, _host.RVSymbolicatorGetFlagsForNListOnlyData());
     if (symbolicator == nullptr) return;
     for (const uint64_t address : addresses) {
-        const RVSymbol symbol = _host.RVSymbolicatorGetSymbolWithAddressAtTime(symbolicator, address, kRVNow);
+        const RVSymbol symbol =
+            _host.RVSymbolicatorGetSymbolWithAddressAtTime(symbolicator.get(), address, kRVNow);
         const RVSourceInfo source =
-            _host.RVSymbolicatorGetSourceInfoWithAddressAtTime(symbolicator, address, kRVNow);
+            _host.RVSymbolicatorGetSourceInfoWithAddressAtTime(symbolicator.get(), address, kRVNow);
         const bool hasSource = !source.isNull && source.path != nullptr;
         if (symbol.name == nullptr && !hasSource) continue;
         _writer.begin(symbolRecord);
-        _writer.hex(Symbol::address, address);
+        _writer.number(Symbol::address, address);
         _writer.number(Symbol::size, 1);
         if (symbol.name != nullptr) _writer.text(Symbol::name, symbol.name);
         if (hasSource) {
@@ -175,7 +145,6 @@ void HXMachineRecorder::recordSymbols(const std::set<uint64_t> &addresses) {
         }
         _writer.end();
     }
-    _host.RVRelease(symbolicator);
 }
 
 void HXMachineRecorder::recordTags(const std::set<uint32_t> &tags) {

@@ -3,6 +3,7 @@
 
 #include "platform/HXPlatform.h"
 #include "platform/capture/HXCaptureWriter.h"
+#include "platform/capture/HXMachine.h"
 #include "record/HXAnonymizer.h"
 
 #include <cstdio>
@@ -26,7 +27,6 @@ class HXMachineRecorder {
     size_t processCount() const { return _processCount; }
 
   private:
-    void readLedgerTemplate();
     void recordHost(const std::optional<int32_t> &selfRegionHeft);
     void recordKernel();
     void recordSymbols(const std::set<uint64_t> &addresses);
@@ -39,10 +39,8 @@ class HXMachineRecorder {
     HXAnonymizer _anonymizer;
     const bool _anonymize;
     HXCaptureWriter _writer;
-    std::optional<std::vector<std::string>> _ledger;
-    std::optional<size_t> _pageTableIndex;
+    HXMachineHost _facts;
     std::optional<std::vector<int32_t>> _listed; // none when the host cannot list its processes
     std::vector<int32_t> _sorted;
-    kern_return_t _memoryInfoError = 0;
     size_t _processCount = 0;
 };

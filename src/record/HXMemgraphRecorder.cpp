@@ -2,11 +2,14 @@
 
 #include "platform/HXRegionTags.h"
 #include "platform/capture/HXMemgraphFormat.h"
+#include "platform/capture/HXRegionFields.h"
+#include "record/HXLedger.h"
 #include "record/HXRegionHeftSetting.h"
 
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <span>
 
 using namespace HXMemgraphFormat;
 
@@ -26,8 +29,8 @@ constexpr uint32_t kPageTableTag = HXHostTagLastNamed;
 } // namespace
 
 HXMemgraphRecorder::HXMemgraphRecorder(HXPlatform &host, std::FILE *out, CategoryName categoryName)
-    : _host(host), _out(out), _categoryName(std::move(categoryName)), _pageSize(host.vm_kernel_page_size()),
-      _writer(format) {}
+    : _host(host), _task(host), _out(out), _categoryName(std::move(categoryName)),
+      _pageSize(host.vm_kernel_page_size()), _writer(format) {}
 
 bool HXMemgraphRecorder::record(int32_t pid, const std::string &name, bool breakDownPhysHeft,
                                 std::string *reason) {
@@ -40,18 +43,20 @@ bool HXMemgraphRecorder::record(int32_t pid, const std::string &name, bool break
         *reason = "the kernel has no memory graph";
         return false;
     }
-    const kern_return_t error = _host.task_for_pid(_host.mach_task_self(), pid, &_task);
+    const kern_return_t error = _task.open(pid);
     if (error != KERN_SUCCESS) {
         *reason = _host.mach_error_string(error);
         return false;
     }
     HXRegionHeftSetting setting(_host);
     setting.set(breakDownPhysHeft ? 1 : 0);
-    const uint64_t pageTableBytes = breakDownPhysHeft ? pageTableSize(pid) : 0;
+    const auto ledger = breakDownPhysHeft ? HXLedgerNames(_host) : std::nullopt;
+    const int64_t balance = ledger ? HXPageTableBalance(_host, *ledger, pid).value_or(0) : 0;
+    const auto pageTableBytes = static_cast<uint64_t>(std::max<int64_t>(balance, 0));
     recordProcess(pid, info, name, breakDownPhysHeft);
     gatherImages();
     const bool whole = recordRegions(pid, pageTableBytes, reason);
-    _host.mach_port_deallocate(_host.mach_task_self(), _task);
+    _task.close();
     if (!whole) return false;
     if (flush() && std::fflush(_out) == 0) return true;
     *reason = std::strerror(errno);
@@ -69,52 +74,33 @@ void HXMemgraphRecorder::recordProcess(int32_t pid, const proc_bsdinfo &info, co
                                        bool breakDownPhysHeft) {
     rusage_info_v4 usage{};
     if (_host.proc_pid_rusage(pid, RUSAGE_INFO_V4, &usage) != 0) usage = {};
+    // Leaf mappings are written, also where a shared region lies: nothing is left to be cut.
+    const GXProcessFacts facts{.pageSize = _pageSize,
+                               .physicalHeft = usage.ri_phys_heft,
+                               .physicalHeftPeak = usage.ri_lifetime_max_phys_heft,
+                               .is64bit = (info.pbi_flags & PROC_FLAG_LP64) != 0,
+                               .showsPhysHeft = breakDownPhysHeft,
+                               .hasSharedRegion = false};
     _writer.header();
-    _writer.begin(processRecord);
-    _writer.signedNumber(Process::pid, pid);
+    _writer.begin(processRecord, pid);
     _writer.text(Process::name, name);
     _writer.text(Process::description, _host.hostDescription());
-    _writer.number(Process::is64bit, (info.pbi_flags & PROC_FLAG_LP64) != 0);
-    _writer.number(Process::pageSize, _pageSize);
-    _writer.number(Process::physHeft, usage.ri_phys_heft);
-    _writer.number(Process::physHeftPeak, usage.ri_lifetime_max_phys_heft);
-    _writer.number(Process::showsPhysHeft, breakDownPhysHeft);
-    // Leaf mappings are written, also where a shared region lies: nothing is left to be cut.
-    _writer.number(Process::sharedRegion, 0);
+    _writer.numbers(&facts);
     _writer.end();
 }
 
-// The balance of the ledger entry "page_table" in bytes, 0 when there is none.
-uint64_t HXMemgraphRecorder::pageTableSize(int32_t pid) {
-    constexpr int64_t room = 1024;
-    std::vector<ledger_template_info> names(room);
-    int64_t count = room;
-    if (_host.ledger(LEDGER_TEMPLATE_INFO, 0, names.data(), &count) < 0) return 0;
-    const auto end = names.begin() + count;
-    const auto found = std::find_if(names.begin(), end, [](const ledger_template_info &info) {
-        return std::strncmp(info.lti_name, "page_table", sizeof info.lti_name) == 0;
-    });
-    std::vector<ledger_entry_info> entries(static_cast<size_t>(count));
-    const auto index = found - names.begin();
-    if (found == end || _host.ledger(LEDGER_ENTRY_INFO, pid, entries.data(), &count) < 0 || index >= count)
-        return 0;
-    return static_cast<uint64_t>(std::max<int64_t>(entries[static_cast<size_t>(index)].lei_balance, 0));
-}
-
 void HXMemgraphRecorder::gatherImages() {
-    RVSymbolicator *const symbolicator = _host.RVSymbolicatorCreateWithTaskFlagsAndNotification(
-        _task, _host.RVSymbolicatorGetFlagsForNoSymbolOrSourceInfoData(), nullptr);
+    const HXSymbolicatorGuard symbolicator =
+        HXSymbolicatorOfTask(_host, _task.get(), _host.RVSymbolicatorGetFlagsForNoSymbolOrSourceInfoData());
     if (symbolicator == nullptr) return;
-    _host.RVSymbolicatorForeachSymbolOwnerAtTime(symbolicator, kRVNow, [&](const RVSymbolOwner &image) {
+    _host.RVSymbolicatorForeachSymbolOwnerAtTime(symbolicator.get(), kRVNow, [&](const RVSymbolOwner &image) {
         const std::string path = _host.stringByResolvingSymlinksInPath(image.path);
-        for (size_t i = 0; i < image.segmentCount; i++) {
-            const RVRegion &segment = image.segments[i];
+        for (const RVRegion &segment : std::span(image.segments, image.segmentCount)) {
             const std::string_view raw = segment.name;
             const std::string_view name = raw == "MACH_HEADER" ? "__TEXT" : raw.substr(0, raw.find(' '));
             _segments.push_back({segment.start, segment.start + segment.length, std::string(name), path});
         }
     });
-    _host.RVRelease(symbolicator);
     std::stable_sort(_segments.begin(), _segments.end(),
                      [](const Segment &a, const Segment &b) { return a.start < b.start; });
 }
@@ -147,7 +133,7 @@ bool HXMemgraphRecorder::recordRegions(int32_t pid, uint64_t pageTableBytes, std
         uint32_t depth = UINT32_MAX, words = VM_REGION_SUBMAP_INFO_COUNT_64;
         const uint64_t asked = address;
         const kern_return_t error =
-            _host.mach_vm_region_recurse(_task, &address, &size, &depth, &info, &words);
+            _host.mach_vm_region_recurse(_task.get(), &address, &size, &depth, &info, &words);
         const bool isLast =
             error == KERN_SUCCESS && (size == 0 || address > UINT64_MAX - size || address + size <= asked);
         if (error == KERN_INVALID_ADDRESS || isLast) {
@@ -170,53 +156,52 @@ bool HXMemgraphRecorder::recordRegions(int32_t pid, uint64_t pageTableBytes, std
 
 void HXMemgraphRecorder::recordRegion(int32_t pid, uint64_t address, uint64_t size,
                                       const vm_region_submap_info_64 &info) {
-    const Segment *const segment = nextSegment(address, address + size);
-    _writer.begin(regionRecord);
-    _writer.hex(Region::address, address);
-    _writer.hex(Region::length, size);
-    if (segment != nullptr) {
-        _writer.text(Region::type, segment->name);
-        _writer.text(Region::path, segment->path);
+    GXVMRegion region = HXGraphRegion(info, _pageSize);
+    region.address = address;
+    region.length = size;
+    region.object_id = graphObjectID(info.object_id_full, info.object_id);
+    region.is_submap = 0; // leaves only
+    region.purgeable = VM_PURGABLE_DENY;
+    int32_t purge = 0;
+    if (_host.mach_vm_purgable_control(_task.get(), address, VM_PURGABLE_GET_STATE, &purge) == KERN_SUCCESS)
+        region.purgeable = purge;
+    std::string category; // backs the type
+    char path[kMaxPathBytes];
+    if (const Segment *const segment = nextSegment(address, address + size)) {
+        region.type = segment->name;
+        region.path = segment->path;
     } else if (info.external_pager != 0) {
-        char path[1024];
         const int32_t bytes = _host.proc_regionfilename(pid, address, path, sizeof path);
-        _writer.text(Region::type, "mapped file");
-        if (bytes > 0) _writer.text(Region::path, std::string_view(path, static_cast<size_t>(bytes)));
+        region.type = "mapped file";
+        if (bytes > 0) region.path = std::string_view(path, static_cast<size_t>(bytes));
     } else {
-        _writer.text(Region::type, _categoryName(info.user_tag));
+        region.type = category = _categoryName(info.user_tag);
     }
-    _writer.signedNumber(Region::prot, info.protection);
-    _writer.signedNumber(Region::maxProt, info.max_protection);
-    _writer.hex(Region::offset, info.offset);
-    _writer.number(Region::userTag, info.user_tag);
-    _writer.number(Region::resident, uint64_t{info.pages_resident} * _pageSize);
-    _writer.number(Region::sharedNowPrivate, uint64_t{info.pages_shared_now_private} * _pageSize);
-    _writer.number(Region::swapped, uint64_t{info.pages_swapped_out} * _pageSize);
-    _writer.number(Region::dirty, uint64_t{info.pages_dirtied} * _pageSize);
-    _writer.number(Region::reusable, uint64_t{info.pages_reusable} * _pageSize);
-    _writer.number(Region::refCount, info.ref_count);
-    _writer.number(Region::externalPager, info.external_pager);
-    _writer.number(Region::shareMode, info.share_mode);
-    _writer.hex(Region::objectID, graphObjectID(info.object_id_full, info.object_id));
-    int32_t purge = VM_PURGABLE_DENY;
-    if (_host.mach_vm_purgable_control(_task, address, VM_PURGABLE_GET_STATE, &purge) != KERN_SUCCESS)
-        purge = VM_PURGABLE_DENY;
-    _writer.signedNumber(Region::purgeable, purge);
-    _writer.end();
+    writeRegion(region);
 }
 
 // Under an object id that no other region has, as memory that was copied on write: such memory is never
 // merged with another process's.
 void HXMemgraphRecorder::recordPageTable(uint64_t address, uint64_t size) {
+    GXVMRegion region{};
+    region.address = address;
+    region.length = region.resident_size = region.dirty_size = size;
+    region.type = kPageTableType;
+    region.user_tag = kPageTableTag;
+    region.ref_count = 1;
+    region.object_id = freeObjectID(kPageTableObjectID);
+    region.purgeable = VM_PURGABLE_DENY;
+    region.share_mode = SM_COW;
+    writeRegion(region);
+}
+
+void HXMemgraphRecorder::writeRegion(const GXVMRegion &region) {
     _writer.begin(regionRecord);
-    _writer.hex(Region::address, address);
-    _writer.hex(Region::length, size);
-    _writer.text(Region::type, kPageTableType);
-    _writer.number(Region::userTag, kPageTableTag);
-    _writer.number(Region::resident, size);
-    _writer.number(Region::dirty, size);
-    _writer.number(Region::shareMode, SM_COW);
-    _writer.hex(Region::objectID, freeObjectID(kPageTableObjectID));
+    _writer.number(Region::address, region.address);
+    _writer.number(Region::length, region.length);
+    _writer.text(Region::type, region.type);
+    if (region.path) _writer.text(Region::path, *region.path);
+    _writer.numbers(&region);
     _writer.end();
 }
 

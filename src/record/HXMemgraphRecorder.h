@@ -1,7 +1,8 @@
 // Writes the memory graph of a live process.
 #pragma once
 
-#include "platform/HXPlatform.h"
+#include "platform/HXHostGuards.h"
+#include "platform/capture/GXProcessObjectGraph.h"
 #include "platform/capture/HXCaptureWriter.h"
 
 #include <cstdio>
@@ -36,20 +37,20 @@ class HXMemgraphRecorder {
     void recordProcess(int32_t pid, const proc_bsdinfo &info, const std::string &name,
                        bool breakDownPhysHeft);
     void gatherImages();
-    uint64_t pageTableSize(int32_t pid);
     bool recordRegions(int32_t pid, uint64_t pageTableBytes, std::string *reason);
     void recordRegion(int32_t pid, uint64_t address, uint64_t size, const vm_region_submap_info_64 &info);
     void recordPageTable(uint64_t address, uint64_t size);
+    void writeRegion(const GXVMRegion &region);
     const Segment *nextSegment(uint64_t start, uint64_t end);
     uint32_t graphObjectID(uint64_t fullID, uint32_t preferred);
     uint32_t freeObjectID(uint32_t preferred);
     bool flush();
 
     HXPlatform &_host;
+    HXTaskPort _task; // of the process being recorded
     std::FILE *const _out;
     const CategoryName _categoryName;
     const uint32_t _pageSize;
-    mach_port_t _task = 0;
     std::vector<Segment> _segments; // by start
     size_t _segmentCursor = 0;
     std::unordered_map<uint64_t, uint32_t> _objectIDs; // of the graph, by full id

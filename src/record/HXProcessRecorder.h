@@ -1,8 +1,9 @@
 // Records one process of a host as records of a machine file.
 #pragma once
 
-#include "platform/HXPlatform.h"
+#include "platform/HXHostGuards.h"
 #include "platform/capture/HXCaptureWriter.h"
+#include "platform/capture/HXMachine.h"
 #include "record/HXAnonymizer.h"
 #include "record/HXRegionHeftSetting.h"
 
@@ -13,10 +14,9 @@
 
 class HXProcessRecorder {
   public:
-    // `anonymizer` may be null: names are then kept. `pageTableIndex` is the place of "page_table" among
-    // `ledgerCount` ledger entries, none when the host has no such entry.
-    HXProcessRecorder(HXPlatform &host, HXRegionHeftSetting &setting, HXAnonymizer *anonymizer,
-                      std::optional<size_t> pageTableIndex, size_t ledgerCount);
+    // `facts` are those of the host. `anonymizer` may be null: names are then kept.
+    HXProcessRecorder(HXPlatform &host, const HXMachineHost &facts, HXRegionHeftSetting &setting,
+                      HXAnonymizer *anonymizer);
 
     // Asks for all that an analysis of the process would, in both analysis modes. Its records are then in
     // `head` (the process) and `body` (its memory), to be written in that order. False, with why in
@@ -32,6 +32,8 @@ class HXProcessRecorder {
   private:
     bool fail(const std::string &problem);
     bool recordProcess(int32_t pid, bool listed);
+    bool openTask(int32_t pid);
+    bool exists(int32_t pid);
     void recordFigures(int32_t pid);
     void recordArguments(int32_t pid);
     void readAtOnce();
@@ -39,28 +41,29 @@ class HXProcessRecorder {
     bool recordRegions(int32_t pid);
     void recordRegion(int32_t pid, uint64_t address, uint64_t size, const vm_region_submap_info_64 &info,
                       uint32_t words);
-    void recordRegionObject(uint64_t address, uint64_t size, const vm_region_submap_info_64 &info);
+    void recordPages(int32_t pid, uint64_t address, uint64_t size);
+    std::optional<uint32_t> pagesDirtiedOfObject(uint64_t address, uint64_t size,
+                                                 HXMachineRegionTraits *traits);
+    bool nextTop(uint64_t *address, uint64_t *size, vm_region_basic_info_64 *top);
     void recordTops(int32_t pid);
     bool topsDiffer();
     void recordImages(int32_t pid);
     void recordOwned(int32_t pid);
+    std::optional<std::vector<char>> ownedReply();
     bool isPageQueried(uint64_t size, const vm_region_submap_info_64 &info) const;
     std::optional<std::vector<std::string>> pageRuns(uint64_t address, uint64_t size);
     std::string pathName(std::string_view path);
     std::string programName(std::string_view name);
 
     HXPlatform &_host;
+    const HXMachineHost &_facts;
+    HXTaskPort _task; // of the process being recorded
     HXRegionHeftSetting &_setting;
     HXAnonymizer *const _anonymizer;
-    const std::optional<size_t> _pageTableIndex;
-    const size_t _ledgerCount;
-    const uint32_t _pageSize;
     std::vector<char> _argumentArea;
     std::vector<int32_t> _dispositions;
 
-    mach_port_t _task = 0;
-    bool _ownedNone = false;
-    int _ownedError = 0;
+    HXMachineProcess _process; // the numbers of the one being recorded
     HXCaptureWriter _head, _body;
     std::set<uint32_t> _tags;
     std::string _problem;

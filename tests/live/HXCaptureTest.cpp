@@ -2,6 +2,7 @@
 #include "support/HXBuilders.h"
 #include "support/HXProgramRun.h"
 #include "support/HXSubject.h"
+#include "support/HXTemporaryFolder.h"
 
 #include <gtest/gtest.h>
 
@@ -16,18 +17,11 @@ namespace {
 
 class Captures : public testing::Test {
   protected:
-    void SetUp() override {
-        folder = (std::filesystem::temp_directory_path() / "heft-XXXXXX").string();
-        ASSERT_TRUE(mkdtemp(folder.data()));
-        ASSERT_EQ(ftruncate(memfd, 1 << 20), 0);
-    }
-    void TearDown() override {
-        std::filesystem::remove_all(folder);
-        close(memfd);
-    }
-    std::string file(const std::string &name) const { return folder + "/" + name; }
+    Captures() { EXPECT_EQ(ftruncate(memfd, 1 << 20), 0); }
+    ~Captures() override { close(memfd); }
+    std::string file(const std::string &name) const { return folder / name; }
 
-    std::string folder;
+    const HXTemporaryFolder folder;
     const int memfd = static_cast<int>(syscall(SYS_memfd_create, "heft", 0));
 };
 

@@ -47,21 +47,17 @@ bool GXProcessObjectGraph::read(HXCaptureReader &reader, HXNamedTags &tags) {
 bool GXProcessObjectGraph::readProcess(HXCaptureReader &reader) {
     if (_hasProcess) return reader.fail("a second process record");
     _hasProcess = true;
-    _pid = static_cast<int32_t>(reader.number(Process::pid));
+    reader.fill(&_facts);
+    _facts.pid = static_cast<int32_t>(reader.number(Process::pid));
     _processName = HXSafeName(reader.text(Process::name));
     _description = HXSafeText(reader.text(Process::description));
-    _is64bit = reader.number(Process::is64bit) != 0;
-    _pageSize = static_cast<uint32_t>(reader.number(Process::pageSize));
-    _physicalHeft = reader.number(Process::physHeft);
-    _physicalHeftPeak = reader.number(Process::physHeftPeak);
-    _showsPhysHeft = reader.number(Process::showsPhysHeft) != 0;
-    _hasSharedRegion = reader.number(Process::sharedRegion) != 0;
-    return reader.checkPageSize(_pageSize);
+    return reader.checkPageSize(_facts.pageSize);
 }
 
 bool GXProcessObjectGraph::readRegion(HXCaptureReader &reader, HXNamedTags &tags) {
     if (!_hasProcess) return reader.fail("a region before the process record");
     GXVMRegion region{};
+    reader.fill(&region);
     region.address = reader.number(Region::address);
     region.length = reader.number(Region::length);
     if (!reader.checkPlace(region.address, region.length)) return false;
@@ -69,21 +65,6 @@ bool GXProcessObjectGraph::readRegion(HXCaptureReader &reader, HXNamedTags &tags
         return reader.fail("it overlaps the region before it or does not ascend");
     region.type = intern(reader.text(Region::type));
     if (reader.has(Region::path)) region.path = intern(reader.text(Region::path));
-    region.prot = static_cast<int32_t>(reader.number(Region::prot));
-    region.maxProt = static_cast<int32_t>(reader.number(Region::maxProt));
-    region.offset = reader.number(Region::offset);
-    region.resident_size = reader.number(Region::resident);
-    region.shared_now_private_size = reader.number(Region::sharedNowPrivate);
-    region.swapped_out_size = reader.number(Region::swapped);
-    region.dirty_size = reader.number(Region::dirty);
-    region.reusable_size = reader.number(Region::reusable);
-    region.ref_count = static_cast<uint32_t>(reader.number(Region::refCount));
-    region.external_pager = static_cast<uint8_t>(reader.number(Region::externalPager));
-    region.share_mode = static_cast<uint8_t>(reader.number(Region::shareMode));
-    region.is_submap = static_cast<uint32_t>(reader.number(Region::isSubmap));
-    region.object_id = static_cast<uint32_t>(reader.number(Region::objectID));
-    region.purgeable = static_cast<int32_t>(reader.number(Region::purgeable));
-    region.user_tag = static_cast<uint32_t>(reader.number(Region::userTag));
     region.user_tag = tagOfThisRun(region, tags);
     _regions.push_back(region);
     return true;

@@ -37,6 +37,17 @@ struct GXVMRegion {
     uint8_t share_mode;
 };
 
+// The numbers of the process.
+struct GXProcessFacts {
+    int32_t pid = 0;
+    uint32_t pageSize = 0;         // bytes
+    uint64_t physicalHeft = 0;     // bytes
+    uint64_t physicalHeftPeak = 0; // bytes
+    bool is64bit = true;
+    bool showsPhysHeft = true;   // gathered with the heft breakdown
+    bool hasSharedRegion = true; // on a host that has a shared region at all
+};
+
 class GXProcessObjectGraph {
   public:
     // How every memory-graph file begins.
@@ -48,18 +59,18 @@ class GXProcessObjectGraph {
     static std::unique_ptr<GXProcessObjectGraph>
     directedGraphWithData(std::string_view data, HXNamedTags &tags, std::string *reason);
 
-    int32_t pid() const { return _pid; }
+    int32_t pid() const { return _facts.pid; }
     const std::string &processName() const { return _processName; }
     // Names the machine architecture.
     const std::string &processDescriptionString() const { return _description; }
-    bool is64bit() const { return _is64bit; }
-    uint32_t vmPageSize() const { return _pageSize; } // bytes
-    uint64_t physicalHeft() const { return _physicalHeft; }
-    uint64_t physicalHeftPeak() const { return _physicalHeftPeak; }
+    bool is64bit() const { return _facts.is64bit; }
+    uint32_t vmPageSize() const { return _facts.pageSize; } // bytes
+    uint64_t physicalHeft() const { return _facts.physicalHeft; }
+    uint64_t physicalHeftPeak() const { return _facts.physicalHeftPeak; }
     // Whether the graph was gathered with the heft breakdown.
-    bool showsPhysHeft() const { return _showsPhysHeft; }
+    bool showsPhysHeft() const { return _facts.showsPhysHeft; }
     // Whether the host that it was written on has a shared region at all.
-    bool hasSharedRegion() const { return _hasSharedRegion; }
+    bool hasSharedRegion() const { return _facts.hasSharedRegion; }
 
     // Calls `each` for the regions in the graph's order until it sets *stop.
     void enumerateRegionsWithBlock(const std::function<void(const GXVMRegion &, bool *stop)> &each) const;
@@ -71,15 +82,9 @@ class GXProcessObjectGraph {
     std::string_view intern(std::string_view text);
 
     bool _hasProcess = false;
-    int32_t _pid = 0;
+    GXProcessFacts _facts;
     std::string _processName;
     std::string _description;
-    bool _is64bit = true;
-    bool _showsPhysHeft = true;
-    bool _hasSharedRegion = true;
-    uint32_t _pageSize = 0;
-    uint64_t _physicalHeft = 0;
-    uint64_t _physicalHeftPeak = 0;
     std::deque<GXVMRegion> _regions; // ascending, without overlap
     HXStringTable _strings;
 };

@@ -10,7 +10,7 @@
 
 namespace {
 
-constexpr size_t kReadBytes = 64 * 1024;
+constexpr size_t kReadBytes = size_t{64} * 1024;
 
 struct NumberRange {
     bool isSigned;
@@ -75,6 +75,12 @@ bool HXCaptureReader::next() {
     while (nextLine(&line))
         if (!line.empty() && line[0] != '#') return parseRecord(line);
     return false;
+}
+
+void HXCaptureReader::fill(void *record) const {
+    const auto &fields = _format.records[_kind].fields;
+    for (size_t i = 0; i < fields.size(); i++)
+        if (fields[i].member.exists()) fields[i].member.set(record, number(i));
 }
 
 bool HXCaptureReader::readHeader() {
@@ -153,7 +159,7 @@ bool HXCaptureReader::parseFields(std::string_view rest, const HXRecordForm &for
     _seen = 0;
     _unescaped.clear();
     for (size_t i = 0; i < fieldCount; i++)
-        _values[i] = {form.fields[i].defaultValue, {}};
+        _values[i].number = form.fields[i].defaultValue;
 
     size_t field = 0; // fields mostly come in the table's order
     while (!rest.empty()) {
@@ -171,20 +177,18 @@ bool HXCaptureReader::parseFields(std::string_view rest, const HXRecordForm &for
         _seen |= uint64_t{1} << field;
         if (!parseValue(form.fields[field], part.substr(equals + 1), &_values[field])) return false;
     }
-    for (size_t i = 0; i < fieldCount; i++)
-        if (form.fields[i].need == HXFieldNeed::required && !has(i))
-            return fail("missing field", form.fields[i].name);
-    return true;
+    const uint64_t missing = form.required & ~_seen;
+    return missing == 0 || fail("missing field", form.fields[std::countr_zero(missing)].name);
 }
 
 bool HXCaptureReader::parseValue(const HXFieldForm &form, std::string_view text, Value *value) {
-    if (form.kind == HXFieldKind::text) return unescape(form, text, &value->text);
-    if (form.kind == HXFieldKind::boolean) {
+    if (form.kind() == HXFieldKind::text) return unescape(form, text, &value->text);
+    if (form.kind() == HXFieldKind::boolean) {
         if (text != "0" && text != "1") return fail(std::string(form.name) + " is not 0 or 1:", text);
         value->number = text == "1";
         return true;
     }
-    if (HXParseNumber(text, form.kind, &value->number)) return true;
+    if (HXParseNumber(text, form.kind(), &value->number)) return true;
     return fail(std::string(form.name) + " is no number of its width:", text);
 }
 

@@ -5,6 +5,7 @@
 
 #include <array>
 #include <cstdio>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -53,7 +54,16 @@ class HXCaptureReader {
     // A number or boolean; the default when the field is absent (0 without a default).
     uint64_t number(size_t field) const { return _values[field].number; }
     // A text with its escapes undone, not yet made safe; empty when absent. Valid until `next`.
-    std::string_view text(size_t field) const { return _values[field].text; }
+    std::string_view text(size_t field) const {
+        return has(field) ? _values[field].text : std::string_view();
+    }
+    // Sets every member of `record` that the record's form has a place for.
+    void fill(void *record) const;
+    // The number of a field whose absence has a meaning of its own.
+    template <class Number>
+    std::optional<Number> optionalNumber(size_t field) const {
+        return has(field) ? std::optional(static_cast<Number>(number(field))) : std::nullopt;
+    }
 
   private:
     struct Value {

@@ -18,23 +18,21 @@ void HXCaptureWriter::name(const HXFieldForm &field) {
     _text += '=';
 }
 
-void HXCaptureWriter::number(size_t field, uint64_t value) {
-    if (isDefault(form(field), value)) return;
-    name(form(field));
-    const bool isSigned =
-        form(field).kind == HXFieldKind::signed32 || form(field).kind == HXFieldKind::signed64;
+void HXCaptureWriter::numbers(const void *record) {
+    for (const HXFieldForm &field : _format.records[_record].fields)
+        if (field.member.exists()) write(field, field.member.of(record));
+}
+
+// Signed numbers are given sign-extended.
+void HXCaptureWriter::write(const HXFieldForm &field, uint64_t value) {
+    if (field.need == HXFieldNeed::defaulted && field.defaultValue == value) return;
+    name(field);
+    const bool isSigned = field.kind() == HXFieldKind::signed32 || field.kind() == HXFieldKind::signed64;
+    if (field.isHexadecimal) _text += "0x";
     char digits[24];
     char *const end = digits + sizeof digits;
     const auto [stop, error] = isSigned ? std::to_chars(digits, end, static_cast<int64_t>(value))
-                                        : std::to_chars(digits, end, value);
-    _text.append(digits, stop);
-}
-
-void HXCaptureWriter::hex(size_t field, uint64_t value) {
-    if (isDefault(form(field), value)) return;
-    name(form(field));
-    char digits[24] = "0x";
-    const auto [stop, error] = std::to_chars(digits + 2, digits + sizeof digits, value, 16);
+                                        : std::to_chars(digits, end, value, field.isHexadecimal ? 16 : 10);
     _text.append(digits, stop);
 }
 

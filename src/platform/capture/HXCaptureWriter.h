@@ -3,6 +3,8 @@
 
 #include "platform/capture/HXCaptureFormat.h"
 
+#include <concepts>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -10,8 +12,9 @@
 // Collects records as text. A record's fields are given in any order between `begin` and `end`; those that
 // equal their default are left out.
 //
-//     writer.begin(regionRecord);
-//     writer.hex(Region::address, address);
+//     writer.begin(ownedRecord);
+//     writer.number(Owned::pid, pid);
+//     writer.numbers(&object);
 //     writer.end();
 class HXCaptureWriter {
   public:
@@ -19,10 +22,22 @@ class HXCaptureWriter {
 
     void header();
     void begin(size_t record);
-    // Signed numbers are given sign-extended.
-    void number(size_t field, uint64_t value);
-    void signedNumber(size_t field, int64_t value) { number(field, static_cast<uint64_t>(value)); }
-    void hex(size_t field, uint64_t value);
+    // A record whose first field is a pid.
+    void begin(size_t record, int32_t pid) {
+        begin(record);
+        number(0, pid);
+    }
+    // In decimal or hexadecimal, as the form says.
+    template <std::integral Number>
+    void number(size_t field, Number value) {
+        write(form(field), static_cast<uint64_t>(value));
+    }
+    template <class Number>
+    void number(size_t field, const std::optional<Number> &value) {
+        if (value) number(field, *value);
+    }
+    // Every member of `record` that the record's form has a place for.
+    void numbers(const void *record);
     void text(size_t field, std::string_view text);
     void end() { _text += '\n'; }
 
@@ -30,9 +45,7 @@ class HXCaptureWriter {
     void clear() { _text.clear(); }
 
   private:
-    bool isDefault(const HXFieldForm &field, uint64_t value) const {
-        return field.need == HXFieldNeed::defaulted && field.defaultValue == value;
-    }
+    void write(const HXFieldForm &field, uint64_t value);
     const HXFieldForm &form(size_t field) const { return _format.records[_record].fields[field]; }
     void name(const HXFieldForm &field);
 

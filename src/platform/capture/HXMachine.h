@@ -21,24 +21,15 @@ struct HXMachinePageRun {
     int32_t disposition;
 };
 
-// The fields of a region that most regions share with many others; kept once per combination.
+// The facts of a region that most regions share with many others; kept once per combination. What regions
+// have on their own (HXRegionFields.h) is 0 in `info`.
 struct HXMachineRegionTraits {
-    int32_t prot = 0;
-    int32_t maxProt = 0;
-    uint32_t inheritance = 0;
-    uint32_t tag = 0;
-    uint32_t refs = 0;
-    int32_t behavior = 0;
-    int32_t purge = 0;
-    uint16_t shadowDepth = 0;
-    uint16_t wired = 0;
-    uint8_t pager = 0;
-    uint8_t shareMode = 0;
-    bool hasPurge = false;
+    vm_region_submap_info_64 info{};
+    std::optional<int32_t> purge;
     bool shortRecord = false;
     bool heftOnly = false;
 
-    auto operator<=>(const HXMachineRegionTraits &) const = default;
+    bool operator<(const HXMachineRegionTraits &other) const;
 };
 
 // What few regions have.
@@ -111,9 +102,9 @@ struct HXMachineProcess {
     uint32_t comm = kNoString;
     uint32_t name = kNoString;
     uint32_t argsPath = kNoString;
-    uint32_t argc = 0;
+    uint32_t argc = 1;
     kern_return_t taskError = 0;
-    uint32_t ownedError = 0;
+    uint32_t ownedError = 2; // ENOENT
     std::optional<uint32_t> dirtyFlags;
     bool listed = true;
     bool readable = true;
@@ -169,6 +160,8 @@ class HXMachine {
     const HXMachineRegionExtra &extra(const HXMachineRegion &region) const {
         return regionExtras[region.extra];
     }
+    // All that the leaf query tells of the region, as it is with the heft breakdown.
+    vm_region_submap_info_64 info(const HXMachineRegion &region) const;
     // The symbol whose range holds `address`, or null.
     const HXMachineSymbol *symbol(uint64_t address) const;
 

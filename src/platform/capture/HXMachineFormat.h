@@ -2,18 +2,20 @@
 #pragma once
 
 #include "platform/capture/HXCaptureFormat.h"
+#include "platform/capture/HXRegionFields.h"
 
 namespace HXMachineFormat {
 
+// Those before `processRecord` are of a process that had its own before; their first field is its pid.
 enum Record : size_t {
     regionRecord,
     topRecord,
     pagesRecord,
-    processRecord,
     imageRecord,
     segmentRecord,
     ownedRecord,
     faultRecord,
+    processRecord,
     zoneRecord,
     siteRecord,
     kextRecord,
@@ -22,64 +24,31 @@ enum Record : size_t {
     hostRecord,
 };
 
-// The fields of each record, in the order of its table in HXMachineFormat.cpp.
+// The fields of each record that have no place of their own in a record of the program, in the order of its
+// table in HXMachineFormat.cpp. Those that do come after them.
 namespace Region {
 enum Field : size_t {
     pid,
     address,
     size,
-    prot,
-    maxProt,
-    inheritance,
-    offset,
-    tag,
-    resident,
-    sharedNowPrivate,
-    swapped,
-    dirtied,
-    reusable,
+    firstNumber,
+    fullObjectID = firstNumber + HXRegionFieldCount<&HXRegionField::machine>(),
     dirtiedObject,
-    refs,
-    shadowDepth,
-    pager,
-    shareMode,
-    behavior,
-    objectID,
-    fullObjectID,
-    shortRecord,
-    wired,
     purge,
     path,
-    heftOnly,
     pages,
+    shortRecord,
+    heftOnly,
 };
 }
 namespace Top {
-enum Field : size_t { pid, address, size, prot, maxProt, inheritance, offset, behavior, wired };
+enum Field : size_t { pid, address, size };
 }
 namespace Pages {
 enum Field : size_t { pid, pages };
 }
 namespace Process {
-enum Field : size_t {
-    pid,
-    ppid,
-    flags,
-    comm,
-    name,
-    status,
-    listed,
-    readable,
-    argsPath,
-    argc,
-    taskError,
-    dirtyFlags,
-    heft,
-    heftPeak,
-    pageTable,
-    ownedError,
-    ownedNone,
-};
+enum Field : size_t { pid, comm, name, argsPath, dirtyFlags, heft, pageTable };
 }
 namespace Image {
 enum Field : size_t { pid, path, base };
@@ -87,17 +56,11 @@ enum Field : size_t { pid, path, base };
 namespace Segment {
 enum Field : size_t { pid, name, start, size };
 }
-namespace Owned {
-enum Field : size_t { pid, objectID, virtualSize, resident, wired, reusable, compressed, flags };
-}
 namespace Fault {
 enum Field : size_t { pid, call, from, error, becomes };
 }
-namespace Zone {
-enum Field : size_t { name, count, curSize, elemSize, collectable };
-}
-namespace Site {
-enum Field : size_t { flags, site, size, mapped, tag, zone, name };
+namespace ZoneOrSite {
+enum Field : size_t { name };
 }
 namespace Kext {
 enum Field : size_t { loadTag, bundleID };
@@ -109,17 +72,7 @@ namespace Tag {
 enum Field : size_t { tag, name };
 }
 namespace Host {
-enum Field : size_t {
-    pageSize,
-    argMax,
-    pid,
-    euid,
-    selfRegionHeft,
-    sharedRegion,
-    listPidsError,
-    ledger,
-    memoryInfoError,
-};
+enum Field : size_t { selfRegionHeft, ledger };
 }
 
 // Region sizes above which a region can carry no page dispositions.

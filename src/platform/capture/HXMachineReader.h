@@ -34,9 +34,8 @@ class HXMachineReader {
 
     bool findProcess();
     bool checkMapping(uint64_t address, uint64_t size, uint64_t previousEnd);
-    bool addExtra(HXMachineRegion &region);
+    void keepNumbers(HXMachineRegion &region);
     bool addPageRuns(HXMachineRegion &region, std::string_view text);
-    uint32_t traitsOfRecord();
 
     uint32_t number32(size_t field) const { return static_cast<uint32_t>(_reader.number(field)); }
     int32_t signed32(size_t field) const { return static_cast<int32_t>(_reader.number(field)); }

@@ -7,42 +7,12 @@ namespace HXMemgraphFormat {
 
 enum Record : size_t { regionRecord, processRecord };
 
-// The fields of each record, in the order of its table in HXMemgraphFormat.cpp.
+// The fields that the program names, in the order of their tables in HXMemgraphFormat.cpp.
 namespace Region {
-enum Field : size_t {
-    address,
-    length,
-    type,
-    path,
-    prot,
-    maxProt,
-    offset,
-    userTag,
-    resident,
-    sharedNowPrivate,
-    swapped,
-    dirty,
-    reusable,
-    refCount,
-    externalPager,
-    shareMode,
-    isSubmap,
-    objectID,
-    purgeable,
-};
+enum Field : size_t { address, length, type, path };
 }
 namespace Process {
-enum Field : size_t {
-    pid,
-    name,
-    description,
-    is64bit,
-    pageSize,
-    physHeft,
-    physHeftPeak,
-    showsPhysHeft,
-    sharedRegion,
-};
+enum Field : size_t { pid, name, description };
 }
 
 extern const HXCaptureFormat format;

@@ -22,7 +22,7 @@ uint32_t HXStringTable::add(std::string_view text) {
 }
 
 const char *HXStringTable::store(std::string_view text) {
-    constexpr size_t blockBytes = 16 * 1024;
+    constexpr size_t blockBytes = size_t{16} * 1024;
     const uint32_t length = static_cast<uint32_t>(text.size());
     const size_t bytes = sizeof length + text.size() + 1;
     if (bytes > _freeBytes) {

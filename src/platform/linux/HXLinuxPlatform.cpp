@@ -17,7 +17,6 @@
 
 namespace {
 
-constexpr int32_t kKernelNamespace = 1, kArgumentMaximum = 8, kProcessArguments = 49; // CTL_KERN, KERN_…
 // As long as the arguments of most systems may be together; more is cut (HXPlatform::sysctl).
 constexpr uint32_t kArgumentAreaSize = 131072;
 constexpr const char *kChargeSwitch = "vm.self_region_heft";
@@ -124,9 +123,9 @@ std::string HXLinuxPlatform::hostDescription() {
 }
 
 int32_t HXLinuxPlatform::sysctl(const int32_t *name, uint32_t nameLength, void *old, size_t *oldBytes) {
-    if (nameLength < 2 || name[0] != kKernelNamespace) return failed(ENOENT);
-    if (nameLength == 2 && name[1] == kArgumentMaximum) return copyOut(kArgumentAreaSize, old, oldBytes);
-    if (nameLength != 3 || name[1] != kProcessArguments) return failed(ENOENT);
+    if (nameLength < 2 || name[0] != CTL_KERN) return failed(ENOENT);
+    if (nameLength == 2 && name[1] == KERN_ARGMAX) return copyOut(kArgumentAreaSize, old, oldBytes);
+    if (nameLength != 3 || name[1] != KERN_PROCARGS2) return failed(ENOENT);
     if (name[2] <= 0) return failed(EINVAL);
     return _processes.copyArguments(name[2], old, oldBytes);
 }

@@ -1,5 +1,7 @@
 // Tasks, their mappings, their pages and their images.
 #include "platform/linux/HXLinuxPlatform.h"
+
+#include "platform/HXSafeText.h"
 #include "platform/linux/images/HXImageLayout.h"
 #include "platform/linux/memory/HXTaskFiles.h"
 #include "platform/linux/procfs/HXProcFile.h"
@@ -45,7 +47,7 @@ const HXAddressSpace &HXLinuxPlatform::addressSpaceOf(HXLinuxTask *task) {
 const HXMapping *HXLinuxPlatform::mappingAt(HXLinuxTask *task, uint64_t *address, uint64_t *size,
                                             kern_return_t *error) {
     if (task == nullptr) {
-        *error = KERN_INVALID_ARGUMENT;
+        *error = MACH_SEND_INVALID_DEST;
         return nullptr;
     }
     const HXAddressSpace &addressSpace = addressSpaceOf(task);
@@ -94,14 +96,14 @@ kern_return_t HXLinuxPlatform::mach_vm_region(mach_port_t port, uint64_t *addres
 kern_return_t HXLinuxPlatform::mach_vm_region_recurse(mach_port_t port, uint64_t *address, uint64_t *size,
                                                       uint32_t *nestingDepth, vm_region_submap_info_64 *info,
                                                       uint32_t *infoCount) {
-    if (*infoCount < VM_REGION_SUBMAP_INFO_COUNT_64) return KERN_INVALID_ARGUMENT;
     HXLinuxTask *task = _tasks.find(port);
     kern_return_t error = KERN_SUCCESS;
     const HXMapping *mapping = mappingAt(task, address, size, &error);
     if (mapping == nullptr) return error;
-    *info = infoOf(task, *mapping);
+    const vm_region_submap_info_64 full = infoOf(task, *mapping);
+    *infoCount = std::min(*infoCount, VM_REGION_SUBMAP_INFO_COUNT_64);
+    std::memcpy(static_cast<void *>(info), &full, *infoCount * sizeof(uint32_t));
     *nestingDepth = 0; // there are no submaps
-    *infoCount = VM_REGION_SUBMAP_INFO_COUNT_64;
     return KERN_SUCCESS;
 }
 
@@ -111,7 +113,8 @@ kern_return_t HXLinuxPlatform::mach_vm_page_range_query(mach_port_t port, uint64
     if (task == nullptr) return KERN_INVALID_ARGUMENT;
     const uint64_t mask = _pageSize - 1;
     const uint64_t start = address & ~mask;
-    const uint64_t pages = std::min<uint64_t>((size + (address - start) + mask) / _pageSize, *count);
+    const uint64_t inLastPages = (size & mask) + (address - start) + mask;
+    const uint64_t pages = std::min<uint64_t>(size / _pageSize + inLastPages / _pageSize, *count);
     const HXAddressSpace &addressSpace = addressSpaceOf(task);
     const kern_return_t error =
         task->pages().query(addressSpace, start, std::span(dispositions, static_cast<size_t>(pages)));
@@ -131,10 +134,9 @@ int32_t HXLinuxPlatform::proc_regionfilename(int32_t pid, uint64_t address, char
     if (index == addressSpace.count() || !addressSpace[index].contains(address) ||
         !addressSpace[index].isFile())
         return 0;
-    const std::string &path = addressSpace.path(addressSpace[index].path).text;
-    const size_t length = std::min<size_t>(path.size(), bufferBytes);
-    std::copy_n(path.data(), length, buffer);
-    return static_cast<int32_t>(length);
+    const std::string_view path = HXCutText(addressSpace.path(addressSpace[index].path).text, bufferBytes);
+    std::copy(path.begin(), path.end(), buffer);
+    return static_cast<int32_t>(path.size());
 }
 
 RVSymbolicator *HXLinuxPlatform::RVSymbolicatorCreateWithTaskFlagsAndNotification(mach_port_t port, uint32_t,

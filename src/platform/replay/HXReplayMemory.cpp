@@ -3,6 +3,7 @@
 
 #include "platform/HXRegionTags.h"
 #include "platform/HXSafeText.h"
+#include "platform/capture/HXRegionFields.h"
 
 #include <algorithm>
 #include <cstring>
@@ -57,11 +58,10 @@ kern_return_t HXReplayPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port
 
 void HXReplayPlatform::mach_port_deallocate(mach_port_t, mach_port_t) {}
 
-const HXMachineProcess *HXReplayPlatform::taskProcess(mach_port_t task, State **state) {
+HXReplayPlatform::Task HXReplayPlatform::taskOf(mach_port_t task) {
     const size_t index = size_t{task} - kFirstTask;
-    if (task < kFirstTask || index >= _machine.processes.size()) return nullptr;
-    *state = &_states[index];
-    return &_machine.processes[index];
+    if (task < kFirstTask || index >= _machine.processes.size()) return {};
+    return {&_machine.processes[index], &_states[index]};
 }
 
 HXReplayPlatform::State *HXReplayPlatform::stateOf(int32_t pid) {
@@ -104,8 +104,7 @@ const HXMachineRegion *HXReplayPlatform::regionAt(const HXMachineProcess &proces
 kern_return_t HXReplayPlatform::mach_vm_region(mach_port_t task, uint64_t *address, uint64_t *size,
                                                int32_t flavor, vm_region_basic_info_64 *info,
                                                uint32_t *infoCount) {
-    State *state = nullptr;
-    const HXMachineProcess *const process = taskProcess(task, &state);
+    const auto [process, state] = taskOf(task);
     if (process == nullptr) return MACH_SEND_INVALID_DEST;
     if (const kern_return_t error = countCall(*process, *state, HXMachineCall::region)) return error;
     if (flavor != VM_REGION_BASIC_INFO_64 || *infoCount < VM_REGION_BASIC_INFO_COUNT_64)
@@ -119,57 +118,33 @@ kern_return_t HXReplayPlatform::mach_vm_region(mach_port_t task, uint64_t *addre
     } else {
         const HXMachineRegion *const region = firstRegion(*process, *state, *address);
         if (region == nullptr) return KERN_INVALID_ADDRESS;
-        const HXMachineRegionTraits &traits = _machine.traits(*region);
         *address = region->address;
         *size = region->size;
-        *info = {};
-        info->protection = traits.prot;
-        info->max_protection = traits.maxProt;
-        info->inheritance = traits.inheritance;
-        info->offset = region->offset;
-        info->behavior = traits.behavior;
-        info->user_wired_count = traits.wired;
+        *info = HXBasicInfo(_machine.info(*region));
     }
     *infoCount = VM_REGION_BASIC_INFO_COUNT_64;
     return KERN_SUCCESS;
 }
 
-void HXReplayPlatform::fillInfo(const HXMachineRegion &region, vm_region_submap_info_64 *info) const {
-    const HXMachineRegionTraits &traits = _machine.traits(region);
-    const HXMachineRegionExtra &extra = _machine.extra(region);
-    info->protection = traits.prot;
-    info->max_protection = traits.maxProt;
-    info->inheritance = traits.inheritance;
-    info->offset = region.offset;
-    info->user_tag = hostTag(traits);
-    info->pages_resident = region.residentPages;
-    info->pages_shared_now_private = extra.sharedNowPrivatePages;
-    info->pages_swapped_out = region.swappedPages;
-    info->pages_dirtied = countsHeft() ? region.dirtiedPages : region.dirtiedObjectPages;
-    info->ref_count = traits.refs;
-    info->shadow_depth = traits.shadowDepth;
-    info->external_pager = traits.pager;
-    info->share_mode = traits.shareMode;
-    info->behavior = traits.behavior;
-    info->object_id = region.objectID;
-    info->user_wired_count = traits.wired;
-    info->pages_reusable = extra.reusablePages;
-    info->object_id_full = region.fullObjectID;
+vm_region_submap_info_64 HXReplayPlatform::info(const HXMachineRegion &region) const {
+    vm_region_submap_info_64 info = _machine.info(region);
+    info.user_tag = hostTag(info);
+    if (!countsHeft()) info.pages_dirtied = region.dirtiedObjectPages;
+    return info;
 }
 
 kern_return_t HXReplayPlatform::mach_vm_region_recurse(mach_port_t task, uint64_t *address, uint64_t *size,
-                                                       uint32_t *, vm_region_submap_info_64 *info,
+                                                       uint32_t *nestingDepth, vm_region_submap_info_64 *info,
                                                        uint32_t *infoCount) {
-    State *state = nullptr;
-    const HXMachineProcess *const process = taskProcess(task, &state);
+    const auto [process, state] = taskOf(task);
     if (process == nullptr) return MACH_SEND_INVALID_DEST;
     if (const kern_return_t error = countCall(*process, *state, HXMachineCall::regionRecurse)) return error;
     const HXMachineRegion *const region = firstRegion(*process, *state, *address);
     if (region == nullptr) return KERN_INVALID_ADDRESS;
-    vm_region_submap_info_64 filled{};
-    fillInfo(*region, &filled);
+    const vm_region_submap_info_64 filled = this->info(*region);
     const uint32_t words = _machine.traits(*region).shortRecord ? VM_REGION_SUBMAP_INFO_V1_COUNT_64
                                                                 : VM_REGION_SUBMAP_INFO_COUNT_64;
+    *nestingDepth = 0; // regions are leaves
     *infoCount = std::min(*infoCount, words);
     std::memcpy(static_cast<void *>(info), &filled, *infoCount * sizeof(uint32_t));
     *address = region->address;
@@ -179,8 +154,7 @@ kern_return_t HXReplayPlatform::mach_vm_region_recurse(mach_port_t task, uint64_
 
 kern_return_t HXReplayPlatform::mach_vm_page_range_query(mach_port_t task, uint64_t address, uint64_t size,
                                                          int32_t *dispositions, uint64_t *count) {
-    State *state = nullptr;
-    const HXMachineProcess *const process = taskProcess(task, &state);
+    const auto [process, state] = taskOf(task);
     if (process == nullptr) return KERN_INVALID_ARGUMENT;
     if (const kern_return_t error = countCall(*process, *state, HXMachineCall::pageRangeQuery)) return error;
     const uint64_t pageSize = _machine.host.pageSize;
@@ -213,14 +187,13 @@ kern_return_t HXReplayPlatform::mach_vm_page_range_query(mach_port_t task, uint6
 
 kern_return_t HXReplayPlatform::mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,
                                                          int32_t *purgeState) {
-    State *state = nullptr;
-    const HXMachineProcess *const process = taskProcess(task, &state);
+    const auto [process, state] = taskOf(task);
     if (process == nullptr || control != VM_PURGABLE_GET_STATE) return KERN_INVALID_ARGUMENT;
     const HXMachineRegion *const region = regionAt(*process, *state, address);
     if (region == nullptr) return KERN_INVALID_ADDRESS;
-    const HXMachineRegionTraits &traits = _machine.traits(*region);
-    if (!traits.hasPurge) return KERN_INVALID_ARGUMENT;
-    *purgeState = traits.purge;
+    const std::optional<int32_t> &purge = _machine.traits(*region).purge;
+    if (!purge) return KERN_INVALID_ARGUMENT;
+    *purgeState = *purge;
     return KERN_SUCCESS;
 }
 
@@ -244,12 +217,12 @@ void HXReplayPlatform::mapNamedTags() {
     }
 }
 
-uint32_t HXReplayPlatform::hostTag(const HXMachineRegionTraits &traits) const {
-    const auto found = _namedTags.find(traits.tag);
-    if (found == _namedTags.end()) return traits.tag;
+uint32_t HXReplayPlatform::hostTag(const vm_region_submap_info_64 &info) const {
+    const auto found = _namedTags.find(info.user_tag);
+    if (found == _namedTags.end()) return info.user_tag;
     // As on a live host, names that find no free tag are lost.
     const bool unnamed = found->second == HXHostTagAnonymous;
-    return unnamed && traits.shareMode == SM_SHARED ? HXHostTagSharedAnonymous : found->second;
+    return unnamed && info.share_mode == SM_SHARED ? HXHostTagSharedAnonymous : found->second;
 }
 
 std::optional<std::string>

@@ -1,6 +1,7 @@
 // HXReplayPlatform: processes, settings, images and the kernel's own memory.
 #include "platform/replay/HXReplayPlatform.h"
 
+#include "platform/HXSafeText.h"
 #include "platform/capture/HXFixedText.h"
 
 #include <algorithm>
@@ -10,28 +11,34 @@
 
 namespace {
 
-constexpr std::string_view kPageTableEntry = "page_table";
-constexpr int32_t kCtlKern = 1, kKernArgMax = 8, kKernProcArgs2 = 49;
-
 int32_t failWith(int error) {
     errno = error;
     return -1;
 }
 
 // Hands out as much of a result as there is room for, the way sysctl(3) does: without a buffer its length.
-void handOut(const void *result, size_t bytes, void *old, size_t *oldBytes) {
+int32_t handOut(const void *result, size_t bytes, void *old, size_t *oldBytes) {
     const size_t copied = old == nullptr ? bytes : std::min(bytes, *oldBytes);
     if (old != nullptr) std::memcpy(old, result, copied);
     *oldBytes = copied;
+    return 0;
+}
+
+// Hands out a number, for which there must be room.
+template <class Number>
+int32_t handOutNumber(Number number, void *old, size_t *oldBytes) {
+    if (oldBytes == nullptr) return 0;
+    if (old != nullptr && *oldBytes < sizeof number) return failWith(ENOMEM);
+    return handOut(&number, sizeof number, old, oldBytes);
 }
 
 // A copy of `records` that `vm_deallocate` gives back; null when there is no memory for it.
 template <class Record>
-Record *handedOut(const std::vector<Record> &records) {
+void *copyOf(const std::vector<Record> &records) {
     const size_t bytes = records.size() * sizeof(Record);
     void *const copy = std::malloc(std::max<size_t>(bytes, 1));
     if (copy != nullptr && bytes > 0) std::memcpy(copy, records.data(), bytes);
-    return static_cast<Record *>(copy);
+    return copy;
 }
 
 // `process` is null for the kernel's.
@@ -63,36 +70,34 @@ int32_t HXReplayPlatform::proc_listallpids(int32_t *pids, uint32_t bufferBytes) 
 int32_t HXReplayPlatform::proc_pidinfo(int32_t pid, int32_t flavor, uint64_t, void *buffer,
                                        uint32_t bufferBytes) {
     const HXMachineProcess *const process = _machine.process(pid);
-    const auto failed = [](int error) {
-        errno = error;
-        return 0;
+    const auto failed = [](int error) { return failWith(error) + 1; };
+    const auto answer = [&](const auto &info) {
+        if (bufferBytes < sizeof info) return failed(ENOMEM);
+        std::memcpy(buffer, &info, sizeof info);
+        return static_cast<int32_t>(sizeof info);
     };
     if (process == nullptr) return failed(ESRCH);
     if (flavor == PROC_PIDTBSDINFO) {
-        proc_bsdinfo info{};
         if (!process->readable) return failed(EPERM);
-        if (bufferBytes < sizeof info) return failed(ENOMEM);
+        proc_bsdinfo info{};
         info.pbi_flags = process->flags;
         info.pbi_status = process->status;
         info.pbi_pid = process->pid;
         info.pbi_ppid = process->ppid;
         HXFillText(info.pbi_comm, text(process->comm));
         HXFillText(info.pbi_name, text(process->name));
-        std::memcpy(buffer, &info, sizeof info);
-        return sizeof info;
+        return answer(info);
     }
     if (flavor != PROC_PIDT_SHORTBSDINFO) return failed(EINVAL);
     const HXMachineFate fate = stateOf(pid)->fate;
-    proc_bsdshortinfo info{};
     if (fate == HXMachineFate::gone) return failed(ESRCH);
-    if (bufferBytes < sizeof info) return failed(ENOMEM);
+    proc_bsdshortinfo info{};
     info.pbsi_pid = process->pid;
     info.pbsi_ppid = process->ppid;
     info.pbsi_status = fate == HXMachineFate::zombie ? SZOMB : process->status;
     HXFillText(info.pbsi_comm, text(process->comm));
     info.pbsi_flags = process->flags;
-    std::memcpy(buffer, &info, sizeof info);
-    return sizeof info;
+    return answer(info);
 }
 
 int32_t HXReplayPlatform::proc_pid_rusage(int32_t pid, int32_t flavor, rusage_info_v4 *info) {
@@ -115,23 +120,21 @@ int32_t HXReplayPlatform::proc_get_dirty(int32_t pid, uint32_t *flags) {
 }
 
 int32_t HXReplayPlatform::sysctl(const int32_t *name, uint32_t nameLength, void *old, size_t *oldBytes) {
-    if (nameLength == 2 && name[0] == kCtlKern && name[1] == kKernArgMax) {
-        handOut(&_machine.host.argMax, sizeof _machine.host.argMax, old, oldBytes);
-        return 0;
-    }
-    if (nameLength == 3 && name[0] == kCtlKern && name[1] == kKernProcArgs2)
+    if (nameLength == 2 && name[0] == CTL_KERN && name[1] == KERN_ARGMAX)
+        return handOutNumber(_machine.host.argMax, old, oldBytes);
+    if (nameLength == 3 && name[0] == CTL_KERN && name[1] == KERN_PROCARGS2)
         return argumentArea(name[2], old, oldBytes);
     return failWith(ENOENT);
 }
 
 int32_t HXReplayPlatform::argumentArea(int32_t pid, void *old, size_t *oldBytes) const {
     const HXMachineProcess *const process = _machine.process(pid);
-    if (process == nullptr || process->argsPath == kNoString) return failWith(EINVAL);
+    if (process == nullptr) return failWith(ESRCH);
+    if (process->argsPath == kNoString) return failWith(EINVAL);
     std::string area(reinterpret_cast<const char *>(&process->argc), sizeof process->argc);
     area += text(process->argsPath);
     area += '\0';
-    handOut(area.data(), std::min<size_t>(area.size(), _machine.host.argMax), old, oldBytes);
-    return 0;
+    return handOut(area.data(), std::min<size_t>(area.size(), _machine.host.argMax), old, oldBytes);
 }
 
 int32_t HXReplayPlatform::sysctlbyname(const char *name, void *old, size_t *oldBytes, const void *newValue,
@@ -146,14 +149,10 @@ int32_t HXReplayPlatform::selfRegionHeft(void *old, size_t *oldBytes, const void
     if (!_machine.host.selfRegionHeft) return failWith(ENOENT);
     int32_t value = 0;
     if (newValue != nullptr && newBytes != sizeof value) return failWith(EINVAL);
-    if (oldBytes != nullptr) {
-        value = _selfRegionHeft;
-        handOut(&value, sizeof value, old, oldBytes);
-    }
-    if (newValue != nullptr) {
-        std::memcpy(&value, newValue, sizeof value);
-        _selfRegionHeft = value;
-    }
+    if (handOutNumber(_selfRegionHeft.load(), old, oldBytes) != 0) return -1;
+    if (newValue == nullptr) return 0;
+    std::memcpy(&value, newValue, sizeof value);
+    _selfRegionHeft = value;
     return 0;
 }
 
@@ -161,8 +160,7 @@ int32_t HXReplayPlatform::ownedObjects(void *old, size_t *oldBytes, const void *
     mach_port_t task = 0;
     if (newValue == nullptr || newBytes != sizeof task || oldBytes == nullptr) return failWith(EINVAL);
     std::memcpy(&task, newValue, sizeof task);
-    State *state = nullptr;
-    const HXMachineProcess *const process = taskProcess(task, &state);
+    const HXMachineProcess *const process = taskOf(task).process;
     if (process == nullptr) return failWith(EINVAL);
     if (process->owned.empty() && !process->ownedNone) return failWith(static_cast<int>(process->ownedError));
     const uint64_t count = process->owned.size();
@@ -170,8 +168,7 @@ int32_t HXReplayPlatform::ownedObjects(void *old, size_t *oldBytes, const void *
     std::memcpy(reply.data(), &count, sizeof count);
     if (count > 0)
         std::memcpy(reply.data() + sizeof count, process->owned.data(), reply.size() - sizeof count);
-    handOut(reply.data(), reply.size(), old, oldBytes);
-    return 0;
+    return handOut(reply.data(), reply.size(), old, oldBytes);
 }
 
 int32_t HXReplayPlatform::ledger(int32_t command, int32_t pid, void *buffer, int64_t *count) {
@@ -182,8 +179,7 @@ int32_t HXReplayPlatform::ledger(int32_t command, int32_t pid, void *buffer, int
         auto *const entries = static_cast<ledger_template_info *>(buffer);
         for (size_t i = 0; i < filled; i++) {
             entries[i] = {};
-            HXFillText(entries[i].lti_name,
-                       std::string_view(names[i]).substr(0, sizeof entries[i].lti_name - 1));
+            HXFillText(entries[i].lti_name, HXCutText(names[i], sizeof entries[i].lti_name - 1));
         }
     } else if (command == LEDGER_ENTRY_INFO) {
         const HXMachineProcess *const process = _machine.process(pid);
@@ -203,8 +199,7 @@ int32_t HXReplayPlatform::ledger(int32_t command, int32_t pid, void *buffer, int
 
 RVSymbolicator *HXReplayPlatform::RVSymbolicatorCreateWithTaskFlagsAndNotification(mach_port_t task, uint32_t,
                                                                                    const void *) {
-    State *state = nullptr;
-    const HXMachineProcess *const process = taskProcess(task, &state);
+    const HXMachineProcess *const process = taskOf(task).process;
     return process == nullptr ? nullptr : new Symbolicator(process);
 }
 
@@ -253,15 +248,15 @@ kern_return_t HXReplayPlatform::mach_memory_info(mach_port_t, mach_zone_name **n
                                                  mach_zone_info **zones, uint32_t *zoneCount,
                                                  mach_memory_info_record **records, uint32_t *recordCount) {
     if (_machine.host.memoryInfoError != KERN_SUCCESS) return _machine.host.memoryInfoError;
-    *names = handedOut(_machine.zoneNames);
-    *zones = handedOut(_machine.zones);
-    *records = handedOut(_machine.sites);
-    if (*names == nullptr || *zones == nullptr || *records == nullptr) {
-        std::free(*names);
-        std::free(*zones);
-        std::free(*records);
+    void *const copies[] = {copyOf(_machine.zoneNames), copyOf(_machine.zones), copyOf(_machine.sites)};
+    if (std::find(std::begin(copies), std::end(copies), nullptr) != std::end(copies)) {
+        for (void *copy : copies)
+            std::free(copy);
         return KERN_RESOURCE_SHORTAGE;
     }
+    *names = static_cast<mach_zone_name *>(copies[0]);
+    *zones = static_cast<mach_zone_info *>(copies[1]);
+    *records = static_cast<mach_memory_info_record *>(copies[2]);
     *nameCount = *zoneCount = static_cast<uint32_t>(_machine.zones.size());
     *recordCount = static_cast<uint32_t>(_machine.sites.size());
     return KERN_SUCCESS;

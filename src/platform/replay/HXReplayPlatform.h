@@ -76,15 +76,20 @@ class HXReplayPlatform : public HXPlatform {
         std::atomic<HXMachineFate> fate = HXMachineFate::alive;
     };
 
-    const HXMachineProcess *taskProcess(mach_port_t task, State **state);
+    // A process of the machine and what changes about it; null both for a port that is no task's.
+    struct Task {
+        const HXMachineProcess *process = nullptr;
+        State *state = nullptr;
+    };
+    Task taskOf(mach_port_t task);
     State *stateOf(int32_t pid);
     kern_return_t countCall(const HXMachineProcess &process, State &state, HXMachineCall call);
     bool countsHeft() const { return _selfRegionHeft.load(std::memory_order_relaxed) != 0; }
     bool exists(const HXMachineRegion &region) const;
     const HXMachineRegion *firstRegion(const HXMachineProcess &process, State &state, uint64_t address) const;
     const HXMachineRegion *regionAt(const HXMachineProcess &process, State &state, uint64_t address) const;
-    void fillInfo(const HXMachineRegion &region, vm_region_submap_info_64 *info) const;
-    uint32_t hostTag(const HXMachineRegionTraits &traits) const;
+    vm_region_submap_info_64 info(const HXMachineRegion &region) const;
+    uint32_t hostTag(const vm_region_submap_info_64 &info) const;
     std::string_view text(uint32_t string) const;
     int32_t argumentArea(int32_t pid, void *old, size_t *oldBytes) const;
     int32_t selfRegionHeft(void *old, size_t *oldBytes, const void *newValue, size_t newBytes);

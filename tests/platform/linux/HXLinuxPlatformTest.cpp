@@ -221,7 +221,7 @@ TEST_F(HXLinuxPlatformTest, WalksMappings) {
     ASSERT_EQ(region(task), KERN_SUCCESS);
     EXPECT_EQ(info.pages_dirtied, 2u) << "dirty pages of a file";
     platform.mach_port_deallocate(platform.mach_task_self(), task);
-    EXPECT_EQ(region(task), KERN_INVALID_ARGUMENT);
+    EXPECT_EQ(region(task), MACH_SEND_INVALID_DEST);
 }
 
 TEST_F(HXLinuxPlatformTest, ProcessesVanishAndRefuse) {
