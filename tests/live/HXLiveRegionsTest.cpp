@@ -26,7 +26,7 @@ constexpr int kWrite = MADV_POPULATE_WRITE, kRead = MADV_POPULATE_READ, kGuard =
 constexpr int kReadOnly = HXActProtect - PROT_READ, kReadWrite = PROT_READ | PROT_WRITE;
 constexpr int kOwn = MAP_PRIVATE | MAP_ANONYMOUS, kShared = MAP_SHARED | MAP_ANONYMOUS;
 constexpr int kPool = MAP_HUGETLB | MAP_NORESERVE;
-constexpr size_t kHuge = 512, kWide = size_t{1} << 30;
+constexpr size_t kHuge = 512, kWide = size_t{1} << 26;
 
 const HXMemoryRecipe kRecipes[] = {
     {"PlainAnonymous",

@@ -14,6 +14,7 @@
 #include <cerrno>
 #include <cinttypes>
 #include <cstring>
+#include <filesystem>
 
 namespace {
 
@@ -276,6 +277,23 @@ TEST_F(HXLinuxPlatformTest, ReadsPageTables) {
             << std::hex << item.from;
         EXPECT_EQ(dispositions, item.expected) << std::hex << item.from;
     }
+}
+
+TEST_F(HXLinuxPlatformTest, ReadsNoPageTablesBehindTheLastPage) {
+    constexpr uint64_t bytes = uint64_t{1} << 46, pages = bytes / 4096; // which nobody would read one by one
+    process(10, "p",
+            "0-400000000000 rw-s 0 00:01 8 /memfd:x (deleted)\nRss:                   8 kB\nVmFlags: rd\n");
+    std::string entries(5000 * 8, '\0');
+    entries[7] = entries.back() = static_cast<char>(0xA0); // present, of the object
+    proc.write("10/pagemap", entries);
+    std::filesystem::resize_file(proc / "10/pagemap", pages * 8);
+    std::vector<vm_page_run> runs;
+    uint64_t told = 0;
+    ASSERT_EQ(platform.mach_vm_page_range_query(open(10), 0, bytes, &runs, &told), KERN_SUCCESS);
+    EXPECT_EQ(told, pages);
+    ASSERT_EQ(runs.size(), 2u);
+    EXPECT_EQ(runs[0].address, 0u);
+    EXPECT_EQ(runs[1].address, 4999u * 4096);
 }
 
 TEST_F(HXLinuxPlatformTest, LeavesThePagesOfAnotherProgramAlone) {
