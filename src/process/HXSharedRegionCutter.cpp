@@ -152,12 +152,6 @@ bool HXSharedRegionCutter::_populateMemoryRegionWithPageQueries(HXMemoryRegion &
 bool HXSharedRegionCutter::queryPiece(HXMemoryRegion &region, const Piece &piece, bool firstIsKnown) {
     const uint64_t first = piece.firstPage() + (firstIsKnown ? _pageSize : 0);
     const bool startsWithinPage = !firstIsKnown && piece.startsWithinPage();
-    // What the runs tell of the page at `address`, which is the first or the last that they may reach.
-    const auto pageAt = [this](std::span<const vm_page_run> runs, uint64_t address) {
-        for (const vm_page_run &run : runs)
-            if (run.address <= address && address < run.end(_pageSize)) return run.disposition;
-        return 0;
-    };
     return _query(first, piece.pages() - (firstIsKnown ? 1 : 0),
                   [&](std::span<const vm_page_run> runs, uint64_t toldEnd) {
                       for (const vm_page_run &run : runs) {
@@ -168,15 +162,15 @@ bool HXSharedRegionCutter::queryPiece(HXMemoryRegion &region, const Piece &piece
                       if (startsWithinPage && _pendingUnusedSharedRegion) {
                           // The unused area before this piece ends in this page, which nobody has asked for
                           // until now.
-                          countPages(*_pendingUnusedSharedRegion,
-                                     pageAt(runs.first(std::min<size_t>(runs.size(), 1)), first),
+                          const bool hasFirst = !runs.empty() && runs.front().address == first;
+                          countPages(*_pendingUnusedSharedRegion, hasFirst ? runs.front().disposition : 0,
                                      _pendingUnusedSharedRegion->end() - first);
                           _pendingUnusedSharedRegion = nullptr;
                       }
                       if (piece.endsWithinPage() && toldEnd > piece.lastPage()) {
+                          const bool hasLast = !runs.empty() && runs.back().end(_pageSize) > piece.lastPage();
                           _cachedDispositionAddress = piece.lastPage();
-                          _cachedDisposition =
-                              pageAt(runs.last(std::min<size_t>(runs.size(), 1)), piece.lastPage());
+                          _cachedDisposition = hasLast ? runs.back().disposition : 0;
                       }
                   });
 }

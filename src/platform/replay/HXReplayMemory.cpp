@@ -152,7 +152,7 @@ kern_return_t HXReplayPlatform::mach_vm_region_recurse(mach_port_t task, uint64_
     return KERN_SUCCESS;
 }
 
-// How many calls more succeed before the fault is met.
+// How many calls more succeed before the fault is met; each kPageQueryPages begun are one.
 uint64_t HXReplayPlatform::callsBeforeFault(const HXMachineProcess &process, const State &state,
                                             HXMachineCall call) {
     if (!process.faults) return UINT64_MAX;
@@ -173,7 +173,7 @@ kern_return_t HXReplayPlatform::mach_vm_page_range_query(mach_port_t task, uint6
     const uint64_t inPage = address % pageSize, start = address - inPage;
     const uint64_t asked = size / pageSize + (size % pageSize + inPage + pageSize - 1) / pageSize;
     const uint64_t told =
-        std::min(asked, moreCalls > asked / kPageQueryPages ? asked : moreCalls * kPageQueryPages);
+        moreCalls > asked / kPageQueryPages ? asked : std::min(asked, moreCalls * kPageQueryPages);
     runs->clear();
     const uint64_t found = findRuns(*process, *state, start / pageSize, told, runs);
     *pages = told;
