@@ -127,6 +127,8 @@ TEST(HXMemgraphRecorder, PutsPageTablesWhereTheyFitOrSaysWhyThereIsNoGraph) {
         {process, "\nregion\taddress=0x8000000000000000\tlength=0x3000\ttype=page table"},
         {process + "region  pid=5  address=0x7fffffffffffd000  size=0x4000\n",
          "address=0x8000000000001000\tlength=0x3000"},
+        {process + "region  pid=5  address=0x8000000000003000  size=0x1000\n",
+         "address=0x8000000000000000\tlength=0x3000"},
         {process + "region  pid=5  address=0x8000000000002000  size=0x1000\n",
          "address=0x8000000000003000\tlength=0x3000"},
         {"process  pid=4\n", "No such process"},

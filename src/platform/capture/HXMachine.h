@@ -120,8 +120,6 @@ struct HXMachineProcess {
     std::vector<HXMachineSegment> segments;
     std::vector<owned_vmobject> owned;
     std::unique_ptr<HXMachineFaults> faults;
-
-    size_t regionCount() const { return regions ? regions->size() : 0; }
 };
 
 struct HXMachineSymbol {

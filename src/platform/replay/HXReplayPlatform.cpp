@@ -70,7 +70,10 @@ int32_t HXReplayPlatform::proc_listallpids(int32_t *pids, uint32_t bufferBytes) 
 int32_t HXReplayPlatform::proc_pidinfo(int32_t pid, int32_t flavor, uint64_t, void *buffer,
                                        uint32_t bufferBytes) {
     const HXMachineProcess *const process = _machine.process(pid);
-    const auto failed = [](int error) { return failWith(error) + 1; };
+    const auto failed = [](int error) {
+        errno = error;
+        return 0;
+    };
     const auto answer = [&](const auto &info) {
         if (bufferBytes < sizeof info) return failed(ENOMEM);
         std::memcpy(buffer, &info, sizeof info);
