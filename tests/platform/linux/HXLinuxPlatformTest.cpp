@@ -4,6 +4,7 @@
 #include "platform/linux/memory/HXPageScan.h"
 #include "platform/linux/procfs/HXProcFile.h"
 #include "support/HXCaseFile.h"
+#include "support/HXHostCalls.h"
 #include "support/HXTemporaryFolder.h"
 
 #include <fcntl.h>
@@ -42,11 +43,7 @@ class HXLinuxPlatformTest : public testing::Test {
         proc.write(folder + "smaps", memory);
     }
     void kernelThread(int pid) const { process(pid, "kthreadd", "", 'S', 2129984); }
-    mach_port_t open(int pid) {
-        mach_port_t task = 0;
-        EXPECT_EQ(platform.task_for_pid(platform.mach_task_self(), pid, &task), KERN_SUCCESS) << pid;
-        return task;
-    }
+    mach_port_t open(int pid) { return HXTaskOf(platform, pid); }
     // The region from `address` on.
     kern_return_t region(mach_port_t task) {
         uint32_t depth = UINT32_MAX, words = kRegionWords;
@@ -76,13 +73,6 @@ class HXLinuxPlatformTest : public testing::Test {
         EXPECT_EQ(region(task), KERN_INVALID_ADDRESS);
         platform.mach_port_deallocate(platform.mach_task_self(), task);
         return text.str();
-    }
-    kern_return_t pages(mach_port_t task, uint64_t from, uint64_t bytes, std::vector<int32_t> &dispositions) {
-        uint64_t count = dispositions.size();
-        const kern_return_t error =
-            platform.mach_vm_page_range_query(task, from, bytes, dispositions.data(), &count);
-        dispositions.resize(count);
-        return error;
     }
     std::string nameInArguments(int pid) {
         const int32_t name[] = {1, 49, pid};
@@ -185,15 +175,8 @@ TEST_F(HXLinuxPlatformTest, TellsWhatRegionsMappingsAre) {
 TEST_F(HXLinuxPlatformTest, FindsMappingsInAnyOrder) {
     process(10, "p", "1000-9000 r-xp 00002000 fe:01 5 /bin/a\n10000-18000 rw-p 00000000 00:00 0\n");
     const mach_port_t task = open(10);
-    address = 0x9000;
-    EXPECT_EQ(region(task), KERN_SUCCESS);
-    EXPECT_EQ(address, 0x10000u);
-    address = 0x8fff;
-    vm_region_basic_info_64 basic;
-    uint32_t words = 9;
-    ASSERT_EQ(platform.mach_vm_region(task, &address, &size, 9, &basic, &words), KERN_SUCCESS);
-    EXPECT_EQ(address, 0x1000u);
-    EXPECT_EQ(uint64_t{basic.offset}, 0x2000u);
+    EXPECT_EQ(HXRegionAt(platform, task, 0x9000, &info), "10000+8000");
+    EXPECT_EQ(HXRegionAt(platform, task, 0x8fff, nullptr), "1000+8000");
     platform.mach_port_deallocate(platform.mach_task_self(), task);
     EXPECT_EQ(region(task), MACH_SEND_INVALID_DEST);
 }
@@ -238,37 +221,31 @@ TEST_F(HXLinuxPlatformTest, ReadsPageTables) {
     const mach_port_t task = open(10);
     const struct {
         uint64_t from, bytes;
-        kern_return_t error;
-        std::vector<int32_t> expected;
+        const char *expected;
     } cases[] = {
-        {0x1000, 0x7000, KERN_SUCCESS, {0x81, 0x801, 0x10, 0, 0, 0x9, 0x9}},
-        {0x3001, 0x1fff, KERN_SUCCESS, {0x10, 0}}, // back, and rounded to pages
-        {0x6000, 0x1000, KERN_SUCCESS, {0x9}},     // what lies before has been counted
-        {0x2000, 0x1000, KERN_SUCCESS, {0x801}},
-        {0x9000, 0x5000, KERN_SUCCESS, {0, 0x9, 0, 0x9, 0}}, // a driver's, shared memory, the huge-page pool
-        {0xd000, 0x2000, KERN_INVALID_ADDRESS, {}},          // no mapping
-        {0x20000, 0x1000, KERN_INVALID_ARGUMENT, {}},        // the page tables have gone
+        {0x1000, 0x7000, "81 801 10 0 0 9 9"},
+        {0x3001, 0x1fff, "10 0"}, // back, and rounded to pages
+        {0x6000, 0x1000, "9"},    // what lies before has been counted
+        {0x2000, 0x1000, "801"},
+        {0x9000, 0x5000, "0 9 0 9 0"}, // a driver's, shared memory, the huge-page pool
+        {0xd000, 0x2000, "(os/kern) invalid address"},
+        {0x20000, 0x1000, "(os/kern) invalid argument"}, // the page tables have gone
     };
-    for (const auto &item : cases) {
-        std::vector<int32_t> dispositions(8);
-        ASSERT_EQ(pages(task, item.from, item.bytes, dispositions), item.error) << std::hex << item.from;
-        if (item.error != KERN_SUCCESS) continue;
-        EXPECT_EQ(dispositions, item.expected) << std::hex << item.from;
-    }
+    for (const auto &[from, bytes, expected] : cases)
+        EXPECT_EQ(HXPagesAt(platform, task, from, bytes), expected) << std::hex << from;
 }
 
 TEST_F(HXLinuxPlatformTest, LeavesThePagesOfAnotherProgramAlone) {
     // The fixture's processes have their stack at 0x7ffceac6f000.
-    const std::pair<const char *, kern_return_t> cases[] = {
-        {"7ffceac60000-7ffceac6f000", KERN_SUCCESS},
-        {"7ffceac60000-7ffceac6e000", KERN_INVALID_ARGUMENT},
-        {"7ffceac70000-7ffceac7f000", KERN_INVALID_ARGUMENT}};
+    const std::pair<const char *, const char *> cases[] = {
+        {"7ffceac60000-7ffceac6f000", "0"},
+        {"7ffceac60000-7ffceac6e000", "(os/kern) invalid argument"},
+        {"7ffceac70000-7ffceac7f000", "(os/kern) invalid argument"}};
     int pid = 10;
-    for (const auto &[range, error] : cases) {
+    for (const auto &[range, expected] : cases) {
         process(++pid, "p", "0-1000 rw-p 0 00:00 0\n"s + range + " rw-p 0 00:00 0 [stack]\n");
         proc.write(std::to_string(pid) + "/pagemap", std::string(8, '\0'));
-        std::vector<int32_t> dispositions(1);
-        EXPECT_EQ(pages(open(pid), 0, 0x1000, dispositions), error) << range;
+        EXPECT_EQ(HXPagesAt(platform, open(pid), 0, 0x1000), expected) << range;
     }
 }
 
