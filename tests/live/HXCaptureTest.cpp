@@ -27,7 +27,7 @@ class Captures : public testing::Test {
 
 // A process with anonymous memory, a shared memfd written in part, and a name for some of its memory.
 HXSubject::SetUp sharing(int memfd, size_t from) {
-    return [=]() -> std::vector<HXExpectedRegion> {
+    return [=] {
         constexpr size_t size = 1 << 20;
         void *shared = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED, memfd, 0);
         memset(static_cast<char *>(shared) + from, 1, size / 2);
@@ -35,7 +35,6 @@ HXSubject::SetUp sharing(int memfd, size_t from) {
         memset(own, 1, size / 4);
         constexpr int setVma = 0x53564d41; // PR_SET_VMA, prctl(2)
         syscall(SYS_prctl, setVma, 0, own, size, "arena");
-        return {};
     };
 }
 
@@ -116,14 +115,13 @@ TEST_F(Captures, OfOneProcessGiveItsHeftAndCategories) {
 
 // A listing is written as it is made: it takes no memory that grows with it.
 TEST_F(Captures, AreListedInTheMemoryOfTheirRegions) {
-    const HXSubject subject([]() -> std::vector<HXExpectedRegion> {
+    const HXSubject subject([] {
         constexpr size_t page = 4096;
         constexpr size_t pairs = 25000;
         auto *all = static_cast<char *>(
             mmap(nullptr, 2 * pairs * page, PROT_READ, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0));
         for (size_t i = 0; i < pairs; i++)
             mprotect(all + 2 * i * page, page, PROT_READ | PROT_WRITE);
-        return {};
     });
     ASSERT_TRUE(subject.stopped());
     const std::string pid = std::to_string(subject.pid());

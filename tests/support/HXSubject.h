@@ -10,8 +10,6 @@
 #include <string>
 #include <vector>
 
-struct HXExpectedRegion {}; // what set-ups may answer; not looked at
-
 class HXSubject {
   public:
     using SetUp = std::function<void()>;

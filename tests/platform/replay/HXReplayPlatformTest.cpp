@@ -1,5 +1,6 @@
 // What a replayed machine answers of its own; what every host does is in HXHostContractTest.cpp.
 #include "platform/HXHostGuards.h"
+#include "support/HXHostCalls.h"
 #include "support/HXMadeUpMachine.h"
 #include "support/HXPages.h"
 
@@ -9,40 +10,6 @@
 
 namespace {
 
-mach_port_t taskOf(HXPlatform &host, int32_t pid) {
-    mach_port_t port = 0;
-    EXPECT_EQ(host.task_for_pid(host.mach_task_self(), pid, &port), KERN_SUCCESS);
-    return port;
-}
-
-struct Found {
-    kern_return_t error = KERN_SUCCESS;
-    uint64_t address = 0, size = 0;
-    vm_region_submap_info_64 info{};
-};
-Found recurse(HXPlatform &host, uint64_t address) {
-    Found found{.address = address};
-    uint32_t depth = UINT32_MAX, words = VM_REGION_SUBMAP_INFO_COUNT_64;
-    found.error = host.mach_vm_region_recurse(taskOf(host, 5), &found.address, &found.size, &depth,
-                                              &found.info, &words);
-    return found;
-}
-kern_return_t top(HXPlatform &host, uint64_t address) {
-    uint64_t size = 0;
-    vm_region_basic_info_64 info{};
-    uint32_t words = VM_REGION_BASIC_INFO_COUNT_64;
-    return host.mach_vm_region(taskOf(host, 5), &address, &size, VM_REGION_BASIC_INFO_64, &info, &words);
-}
-// The dispositions as text, or "error N".
-std::string pages(HXPlatform &host, uint64_t address, uint64_t size) {
-    std::vector<int32_t> dispositions;
-    const kern_return_t error = HXPagesOf(host, taskOf(host, 5), address, size, &dispositions);
-    if (error != KERN_SUCCESS) return "error " + std::to_string(error);
-    std::string text;
-    for (const int32_t disposition : dispositions)
-        text += (text.empty() ? "" : " ") + std::to_string(disposition);
-    return text;
-}
 // The status in the short record, or minus the errno.
 int32_t status(HXPlatform &host, int32_t pid) {
     proc_bsdshortinfo info{};
@@ -59,13 +26,16 @@ region  pid=5  address=0x5000  size=0x1000  heft_only=1
 region  pid=5  address=0xfffffffffffe0000  size=0x1000
 )");
     // Each where the search for the one before left off, or anywhere else.
-    const std::pair<uint64_t, uint64_t> cases[] = {
-        {0, 0x1000},      {0x2fff, 0x1000},        {0x3000, 0x3000}, {0x4000, 0xfffffffffffe0000},
-        {0x1000, 0x1000}, {0xffffffffffff0000, 0}, {0x3fff, 0x3000}, {0x5000, 0xfffffffffffe0000}};
-    for (const auto &[asked, start] : cases) {
-        const Found found = recurse(host, asked);
-        EXPECT_EQ(found.error == KERN_SUCCESS ? found.address : 0, start) << asked;
-        EXPECT_EQ(top(host, asked), found.error);
+    const std::pair<uint64_t, const char *> cases[] = {
+        {0, "1000+2000"},      {0x2fff, "1000+2000"},
+        {0x3000, "3000+1000"}, {0x4000, "fffffffffffe0000+1000"},
+        {0x1000, "1000+2000"}, {0xffffffffffff0000, "(os/kern) invalid address"},
+        {0x3fff, "3000+1000"}, {0x5000, "fffffffffffe0000+1000"}};
+    const mach_port_t task = HXTaskOf(host, 5);
+    vm_region_submap_info_64 info;
+    for (const auto &[asked, found] : cases) {
+        EXPECT_EQ(HXRegionAt(host, task, asked, &info), found) << asked;
+        EXPECT_EQ(HXRegionAt(host, task, asked, nullptr), found) << asked;
     }
 }
 
@@ -81,15 +51,15 @@ region  pid=5  address=0x9000  size=0x1000  pages=1*0xffffffff
         uint64_t address, size;
         const char *answer;
     } cases[] = {
-        {0x1000, 0x6000, "9 16 0 0 3 3"},
-        {0x2000, 0x3001, "16 0 0 3"},
-        {0x6000, 0x2000, "error 1"},
-        {0x9000, 0x1000, "-1"},
-        {0x1fff, 2, "9 16"},
-        {0xfffffffffffff000, 0x1000, "error 1"},
+        {0x1000, 0x6000, "9 10 0 0 3 3"},
+        {0x2000, 0x3001, "10 0 0 3"},
+        {0x6000, 0x2000, "(os/kern) invalid address"},
+        {0x9000, 0x1000, "ffffffff"},
+        {0x1fff, 2, "9 10"},
+        {0xfffffffffffff000, 0x1000, "(os/kern) invalid address"},
     };
     for (const auto &test : cases)
-        EXPECT_EQ(pages(host, test.address, test.size), test.answer) << test.address;
+        EXPECT_EQ(HXPagesAt(host, HXTaskOf(host, 5), test.address, test.size), test.answer) << test.address;
 }
 
 // As queries of 4,096 pages each would, though one may tell of more.
@@ -116,7 +86,7 @@ region  pid=5  address=0x115000000  size=0x1000
         HXMadeUpMachine host("host  page_size=4096\nprocess  pid=5" + region + fault + test.fault + "\n");
         std::vector<vm_page_run> runs;
         uint64_t told = 0;
-        const mach_port_t task = taskOf(host, 5);
+        const mach_port_t task = HXTaskOf(host, 5);
         ASSERT_EQ(host.mach_vm_page_range_query(task, 0x100000000, test.size, &runs, &told), KERN_SUCCESS);
         EXPECT_EQ(told, test.told) << test.fault;
         EXPECT_EQ(runs.size(), test.runs) << test.fault;
@@ -129,7 +99,7 @@ region  pid=5  address=0x115000000  size=0x1000
 }
 
 TEST(HXReplay, FaultsFromTheCallOnThatTheyName) {
-    const std::string error = "error 268435459";
+    const std::string error = "(ipc/send) invalid destination port";
     const std::pair<std::string, int32_t> fates[] = {
         {"alive", 2}, {"gone", -ESRCH}, {"zombie", static_cast<int32_t>(SZOMB)}};
     for (const std::string faulty :
@@ -139,12 +109,14 @@ TEST(HXReplay, FaultsFromTheCallOnThatTheyName) {
             HXMadeUpMachine host("process  pid=5\nregion  pid=5  address=0x4000  size=0x4000  pages=1*1\n" +
                                  fault + "  from=9  error=1\n" + fault +
                                  "  from=3  error=268435459  becomes=" + fate + "\n");
+            const mach_port_t task = HXTaskOf(host, 5);
+            vm_region_submap_info_64 info;
             for (int i = 1; i <= 4; i++) {
                 EXPECT_EQ(status(host, 5), i <= 3 ? 2 : statusAfter);
                 const std::pair<std::string, std::string> calls[] = {
-                    {"mach_vm_region", "error " + std::to_string(top(host, 0))},
-                    {"mach_vm_region_recurse", "error " + std::to_string(recurse(host, 0).error)},
-                    {"mach_vm_page_range_query", pages(host, 0x4000, 0x4000)}};
+                    {"mach_vm_region", HXRegionAt(host, task, 0, nullptr)},
+                    {"mach_vm_region_recurse", HXRegionAt(host, task, 0, &info)},
+                    {"mach_vm_page_range_query", HXPagesAt(host, task, 0x4000, 0x4000)}};
                 for (const auto &[call, answer] : calls)
                     EXPECT_EQ(answer == error, i >= 3 && call == faulty) << call << i;
             }
@@ -185,7 +157,7 @@ owned  pid=9  object_id=3
                                                                 {9, 60, 0, 60},
                                                                 {5, sizeof area, EACCES, sizeof area}};
     for (const auto &[pid, room, error, filled] : replies) {
-        const mach_port_t port = taskOf(host, pid);
+        const mach_port_t port = HXTaskOf(host, pid);
         bytes = room;
         const int32_t result = host.sysctlbyname("vm.get_owned_vmobjects", area, &bytes, &port, sizeof port);
         EXPECT_EQ(std::pair(result == 0 ? 0 : errno, bytes), std::pair(error, filled));
@@ -213,7 +185,9 @@ region  pid=5  address=0x4000  size=0x4000  tag=111
         return host.GXRegionTypeDescriptionForTagShareProtAndPager(tag, 0, 0, 0).value_or("none");
     };
     EXPECT_EQ(host.namedTags().tagForName("of a memory graph"), 111U);
-    EXPECT_EQ(nameOf(recurse(host, 0).info.user_tag), "arena");
+    vm_region_submap_info_64 info;
+    HXRegionAt(host, HXTaskOf(host, 5), 0, &info);
+    EXPECT_EQ(nameOf(info.user_tag), "arena");
     EXPECT_EQ(nameOf(111), "of a memory graph");
 }
 

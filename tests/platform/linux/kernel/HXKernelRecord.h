@@ -1,13 +1,8 @@
-// The kernel's record as a test looks at it, and made-up kernels to read it from.
+// The kernel's record as a test looks at it.
 #pragma once
 
 #include "platform/linux/kernel/HXLinuxKernelAccount.h"
 #include "platform/linux/kernel/HXLinuxKernelMemory.h"
-#include "support/HXTemporaryFolder.h"
-
-#include <initializer_list>
-#include <string>
-#include <utility>
 
 struct HXKernelRecord : HXLinuxKernelAccount {
     kern_return_t error = KERN_SUCCESS;
@@ -30,20 +25,4 @@ struct HXKernelRecord : HXLinuxKernelAccount {
     static uint64_t dirtySize(const mach_zone_info &zone) {
         return zone.mzi_collectable ? zone.mzi_count * zone.mzi_elem_size : zone.mzi_cur_size;
     }
-};
-
-// A machine of some files below proc/ and sys/. Its meminfo has the needed figures, all 0 but MemTotal,
-// before those that it is given.
-struct HXMadeUpKernel {
-    HXMadeUpKernel(std::initializer_list<std::pair<std::string, std::string>> files) {
-        const std::string needed =
-            "MemTotal: 1 kB\nSReclaimable: 0 kB\nSUnreclaim: 0 kB\nKernelStack: 0 kB\n";
-        root.write("proc/meminfo", needed);
-        for (const auto &[name, text] : files)
-            root.write(name, name == "proc/meminfo" ? needed + text : text);
-    }
-    HXKernelRecord record() { return HXKernelRecord(memory); }
-
-    HXTemporaryFolder root;
-    HXLinuxKernelMemory memory{root / "proc", root / "sys", 4096};
 };

@@ -1,36 +1,107 @@
-#include "platform/linux/kernel/HXLinuxKernelMemory.h"
-
+// The kernel's memory on made-up machines, of some files below proc/ and sys/. The cases are in
+// tests/cases/linux-kernel.txt.
 #include "platform/linux/kernel/HXKernelRecord.h"
+#include "support/HXCaseFile.h"
+#include "support/HXTemporaryFolder.h"
 
 #include <gtest/gtest.h>
 
+#include <cstring>
+#include <map>
+#include <sstream>
 #include <unistd.h>
 
 namespace {
 
-TEST(HXLinuxKernelMemoryTest, sysfsCountsForMoreThanNames) {
-    HXMadeUpKernel kernel{{"proc/slabinfo", "odd_inode_cache 1 1 1 1 1 : tunables 0 0 0 : slabdata 2 2 0\n"
-                                            "odd 1 1 1 1 1 : tunables 0 0 0 : slabdata 1 1 0\n"
-                                            "odd/../odd 1 1 1 1 1 : tunables 0 0 0 : slabdata 1 1 0\n"
-                                            ". 1 1 1 1 1 : tunables 0 0 0 : slabdata 1 1 0\n"},
-                          {"sys/kernel/slab/reclaim_account", "1\n"},
-                          {"sys/kernel/slab/:0001/reclaim_account", "0\n"},
-                          {"sys/kernel/slab/odd/reclaim_account", "1\n"}};
-    kernel.root.link("sys/kernel/slab/odd_inode_cache", ":0001");
-    const HXKernelRecord record = kernel.record();
-    ASSERT_EQ(record.zones.size(), 4u);
-    EXPECT_STREQ(record.zoneNames[0].mzn_name, "odd_inode_cache");
-    for (size_t i = 0; i < record.zones.size(); i++)
-        EXPECT_EQ(record.zones[i].mzi_collectable, i == 1 ? 1u : 0u) << i;
+struct HXMadeUpKernel {
+    // `files` as in a case. Its meminfo has the needed figures, all 0 but MemTotal, before those of `files`.
+    explicit HXMadeUpKernel(const std::string &files) {
+        std::map<std::string, std::string> texts = {
+            {"proc/meminfo", "MemTotal: 1 kB\nSReclaimable: 0 kB\nSUnreclaim: 0 kB\nKernelStack: 0 kB\n"}};
+        std::string path;
+        for (const std::string &line : HXLinesOf(files)) {
+            const size_t arrow = line.find(" -> ");
+            if (line.starts_with("@ ") && arrow != std::string::npos)
+                root.link(line.substr(2, arrow - 2), line.substr(arrow + 4));
+            else if (line.starts_with("@ "))
+                path = line.substr(2);
+            else
+                texts[path] += line + "\n";
+        }
+        for (const auto &[name, text] : texts)
+            root.write(name, text);
+    }
+    std::string record() {
+        const HXKernelRecord record(memory);
+        std::ostringstream text;
+        const auto kibibytes = [](uint64_t size) { return " " + std::to_string((size + 512) / 1024); };
+        for (size_t i = 0; i < record.zones.size(); i++)
+            text << "zone " << cut(record.zoneNames[i].mzn_name) << kibibytes(record.zones[i].mzi_cur_size)
+                 << " dirty" << kibibytes(HXKernelRecord::dirtySize(record.zones[i])) << "\n";
+        for (const mach_memory_info_record &site : record.records) {
+            text << (site.flags & VM_KERN_SITE_HIDE ? "hidden " : "") << nameOf(site) << kibibytes(site.size)
+                 << "\n";
+            const bool isCounter = (site.flags & VM_KERN_SITE_TYPE) == VM_KERN_SITE_COUNTER;
+            EXPECT_EQ((site.flags & VM_KERN_SITE_WIRED) == 0, isCounter) << text.str();
+        }
+        return text.str();
+    }
+    // `what`: an address, or a function that is known by name alone.
+    std::string symbol(const std::string &what) {
+        const uint64_t address = what.ends_with(']') ? siteOf(what) : std::stoull(what, nullptr, 16);
+        const std::unique_ptr<RVSymbolicator> at(
+            memory.RVSymbolicatorCreateWithMachKernelFlagsAndNotification(0, nullptr));
+        const char *const name = memory.RVSymbolicatorGetSymbolWithAddressAtTime(at.get(), address, 0).name;
+        const auto source = memory.RVSymbolicatorGetSourceInfoWithAddressAtTime(at.get(), address, kRVNow);
+        return std::string(name ? name : "-") + " " +
+               (source.isNull ? "-" : source.path + (":" + std::to_string(source.lineNumber)));
+    }
+
+    HXTemporaryFolder root;
+    HXLinuxKernelMemory memory{root / "proc", root / "sys", 4096};
+
+  private:
+    template <size_t size>
+    static std::string cut(const char (&name)[size]) {
+        return {name, strnlen(name, size)};
+    }
+    // Of "FUNCTION" or "FUNCTION [MODULE]".
+    static uint64_t siteOf(const std::string &name) {
+        const size_t module = name.find(" [");
+        if (module == std::string::npos) return HXKernelSiteForFunction(name, "");
+        return HXKernelSiteForFunction(name.substr(0, module),
+                                       name.substr(module + 2, name.size() - module - 3));
+    }
+    std::string nameOf(const mach_memory_info_record &site) {
+        const uint64_t type = site.flags & VM_KERN_SITE_TYPE;
+        if (type == VM_KERN_SITE_TAG) return "tag " + std::to_string(site.site);
+        if (type == VM_KERN_SITE_COUNTER) return "count " + std::to_string(site.site);
+        if (type == VM_KERN_SITE_KMOD)
+            for (const OSKextInfo &module : memory.OSKextCopyLoadedKextInfo())
+                if (module.OSBundleLoadTag == site.site)
+                    return "module " + module.CFBundleIdentifier.value_or("-");
+        if (!(site.flags & VM_KERN_SITE_NAMED)) return "address " + std::to_string(site.site);
+        const std::string name = cut(site.name);
+        const bool isWhole = name != "vmalloc" && name.size() < sizeof site.name;
+        return isWhole && site.site != siteOf(name) ? "wrong number of " + name : name;
+    }
+};
+
+TEST(HXLinuxKernelMemory, TellsWhatEachCaseExpects) {
+    for (const HXCase &each : HXReadCases("linux-kernel.txt"))
+        for (const auto &[label, expected] : each.expected) {
+            HXMadeUpKernel kernel(each.input);
+            EXPECT_EQ(
+                label == "record"
+                    ? kernel.record()
+                    : HXAnswered(expected, [&](const auto &question) { return kernel.symbol(question); }),
+                expected)
+                << each.title;
+        }
 }
 
-TEST(HXLinuxKernelMemoryTest, takesBackWhatItHandedOut) {
-    HXMadeUpKernel kernel{{"proc/modules", "ext4 4096 1 - Live 0x0\n\"x 0 0 - Live 0x0\n"},
-                          {"proc/meminfo", "SUnreclaim: 4 kB\n"}};
-    const auto modules = kernel.memory.OSKextCopyLoadedKextInfo();
-    ASSERT_EQ(modules.size(), 2u);
-    EXPECT_EQ(modules[0].OSBundleLoadTag, HXKernelLoadTagForModule("ext4"));
-    EXPECT_EQ(modules[1].CFBundleIdentifier, "'x");
+TEST(HXLinuxKernelMemory, TakesBackWhatItHandedOut) {
+    HXMadeUpKernel kernel("@ proc/meminfo\nSUnreclaim: 4 kB\n");
     mach_zone_name *names = nullptr;
     mach_zone_info *zones = nullptr;
     mach_memory_info_record *sites = nullptr;
@@ -44,58 +115,24 @@ TEST(HXLinuxKernelMemoryTest, takesBackWhatItHandedOut) {
     EXPECT_EQ(kernel.memory.vm_deallocate(0, names, 0), KERN_SUCCESS);
 }
 
-TEST(HXLinuxKernelMemoryTest, missingFilesAreNoErrorButMissingRightsAndFiguresAre) {
-    HXMadeUpKernel kernel{{"proc/meminfo", "SReclaimable: 4 kB\nSUnreclaim: 8 kB\n"}};
-    EXPECT_EQ(kernel.record().error, KERN_SUCCESS);
-    EXPECT_EQ(kernel.record().zones.size(), 2u); // from meminfo alone
-    EXPECT_TRUE(kernel.memory.OSKextCopyLoadedKextInfo().empty());
+TEST(HXLinuxKernelMemory, MissingRightsAndFiguresAreErrors) {
+    HXMadeUpKernel kernel("");
+    const auto error = [&] { return HXKernelRecord(kernel.memory).error; };
+    EXPECT_EQ(error(), KERN_SUCCESS);
     const uid_t user = geteuid();
     constexpr uid_t nobody = 65534;
     for (const char *denied : {"proc/slabinfo", "proc/vmallocinfo"}) {
         kernel.root.write(denied, "");
         std::filesystem::permissions(kernel.root / denied, std::filesystem::perms::none);
         ASSERT_EQ(seteuid(user == 0 ? nobody : user), 0);
-        EXPECT_EQ(kernel.record().error, KERN_NO_ACCESS) << denied;
+        EXPECT_EQ(error(), KERN_NO_ACCESS) << denied;
         ASSERT_EQ(seteuid(user), 0);
         kernel.root.remove(denied);
     }
     kernel.root.write("proc/meminfo", "MemTotal: 1000 kB\nSReclaimable: 4 kB\nKernelStack: 16 kB\n");
-    EXPECT_EQ(kernel.record().error, KERN_FAILURE);
+    EXPECT_EQ(error(), KERN_FAILURE);
     kernel.root.remove("proc/meminfo");
-    EXPECT_EQ(kernel.record().error, KERN_FAILURE);
-}
-
-TEST(HXLinuxKernelMemoryTest, symbolsAndSources) {
-    HXMadeUpKernel kernel{
-        {"proc/kallsyms", "0000000000000000 A fixed_percpu_data\nx T broken\nffffffff82000000 T\n"
-                          "ffffffffc0000000 t call\t[mod]\nffffffff81000000 T first\n"
-                          "ffffffff81000000 T alias\nffffffff81000100 w second\nffffffff81000200 D data\n"},
-        {"proc/allocinfo", " 10 1 mm/a.c:1 func:first \n 30 1 mm/a.c:3 func:first accurate:no\n"
-                           " 20 1 mm/a.c:2 func:first\n 1 1 drivers/mod.c:7 [mod] func:call\n"}};
-    const std::unique_ptr<RVSymbolicator> symbolicator(
-        kernel.memory.RVSymbolicatorCreateWithMachKernelFlagsAndNotification(0, nullptr));
-    const struct {
-        uint64_t address;
-        const char *name, *source; // null: none
-        int32_t line;
-    } cases[] = {
-        {0xffffffff80ffffff, nullptr, nullptr, 0},
-        {0xffffffff810000ff, "first", "mm/a.c", 3},
-        {0xffffffff81000100, "second", nullptr, 0},
-        {0xffffffff81000200, nullptr, nullptr, 0},
-        {0xffffffffc003ffff, "call", "drivers/mod.c", 7},
-        {0xffffffffc0040000, nullptr, nullptr, 0},                             // longer than any function
-        {HXKernelSiteForFunction("call", "mod"), nullptr, "drivers/mod.c", 7}, // known by name alone
-    };
-    for (const auto &c : cases) {
-        SCOPED_TRACE(c.address);
-        const auto at = symbolicator.get();
-        EXPECT_STREQ(kernel.memory.RVSymbolicatorGetSymbolWithAddressAtTime(at, c.address, 0).name, c.name);
-        const auto source = kernel.memory.RVSymbolicatorGetSourceInfoWithAddressAtTime(at, c.address, kRVNow);
-        EXPECT_EQ(source.isNull, c.source == nullptr);
-        EXPECT_STREQ(source.path, c.source);
-        EXPECT_EQ(source.lineNumber, c.line);
-    }
+    EXPECT_EQ(error(), KERN_FAILURE);
 }
 
 } // namespace
