@@ -250,7 +250,6 @@ TEST_F(HXLinuxPlatformTest, ReadsNoPageTablesBehindTheLastPage) {
     ASSERT_EQ(platform.mach_vm_page_range_query(open(10), 0, bytes, &runs, &told), KERN_SUCCESS);
     EXPECT_EQ(told, pages);
     ASSERT_EQ(runs.size(), 2u);
-    EXPECT_EQ(runs[0].address, 0u);
     EXPECT_EQ(runs[1].address, 4999u * 4096);
 }
 
