@@ -1,5 +1,7 @@
 #include "support/HXHostCalls.h"
 
+#include "support/HXPages.h"
+
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -29,12 +31,13 @@ std::string HXRegionAt(HXPlatform &host, mach_port_t task, uint64_t address, vm_
     return text.str();
 }
 
-std::string HXPagesAt(HXPlatform &host, mach_port_t task, uint64_t address, uint64_t bytes, uint64_t room) {
-    int32_t dispositions[16] = {};
-    const kern_return_t error = host.mach_vm_page_range_query(task, address, bytes, dispositions, &room);
+std::string HXPagesAt(HXPlatform &host, mach_port_t task, uint64_t address, uint64_t bytes) {
+    std::vector<int32_t> dispositions;
+    const kern_return_t error = HXPagesOf(host, task, address, bytes, &dispositions);
     if (error != KERN_SUCCESS) return host.mach_error_string(error);
     std::ostringstream text;
-    for (uint64_t i = 0; i < room; i++)
-        text << (i == 0 ? "" : " ") << std::hex << dispositions[i];
+    const char *separator = "";
+    for (const int32_t disposition : dispositions)
+        text << std::exchange(separator, " ") << std::hex << disposition;
     return text.str();
 }

@@ -32,7 +32,8 @@ bool hasAddressSpace(const HXDescriptor &process) {
 kern_return_t HXLinuxPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_t *task) {
     HXDescriptor directory = pid > 0 ? _processes.open(pid) : HXDescriptor();
     if (!directory || !hasAddressSpace(directory)) return KERN_FAILURE;
-    *task = _tasks.add(std::make_unique<HXLinuxTask>(pid, std::move(directory)));
+    *task = _tasks.add(
+        std::make_unique<HXLinuxTask>(pid, _identifiers.numberOfProcess(pid), std::move(directory)));
     return KERN_SUCCESS;
 }
 
@@ -64,11 +65,9 @@ const HXMapping *HXLinuxPlatform::mappingAt(HXLinuxTask *task, uint64_t *address
 }
 
 vm_region_submap_info_64 HXLinuxPlatform::infoOf(HXLinuxTask *task, const HXMapping &mapping) {
-    HXRegionContext context;
-    context.pid = task->pid();
-    context.ipcNamespace = addressSpaceOf(task).ipcNamespace;
-    context.reportsCharge = _reportsCharge.load(std::memory_order_relaxed) != 0;
-    return HXRegionInfo(mapping, context);
+    const HXMappingOwner owner{task->pid(), task->number(), addressSpaceOf(task).ipcNamespace};
+    return HXRegionInfo(mapping, _identifiers.of(mapping, owner),
+                        _reportsCharge.load(std::memory_order_relaxed) != 0);
 }
 
 kern_return_t HXLinuxPlatform::mach_vm_region(mach_port_t port, uint64_t *address, uint64_t *size,
@@ -108,18 +107,18 @@ kern_return_t HXLinuxPlatform::mach_vm_region_recurse(mach_port_t port, uint64_t
 }
 
 kern_return_t HXLinuxPlatform::mach_vm_page_range_query(mach_port_t port, uint64_t address, uint64_t size,
-                                                        int32_t *dispositions, uint64_t *count) {
+                                                        std::vector<vm_page_run> *runs, uint64_t *pages) {
     HXLinuxTask *task = _tasks.find(port);
     if (task == nullptr) return KERN_INVALID_ARGUMENT;
     const uint64_t mask = _pageSize - 1;
     const uint64_t start = address & ~mask;
     const uint64_t inLastPages = (size & mask) + (address - start) + mask;
-    const uint64_t pages = std::min<uint64_t>(size / _pageSize + inLastPages / _pageSize, *count);
+    // No mapping reaches into the last page of all.
+    const uint64_t mostPages = (UINT64_MAX - start) / _pageSize;
+    *pages = std::min(size / _pageSize + inLastPages / _pageSize, mostPages);
     const HXAddressSpace &addressSpace = addressSpaceOf(task);
-    const kern_return_t error =
-        task->pages().query(addressSpace, start, std::span(dispositions, static_cast<size_t>(pages)));
-    if (error == KERN_SUCCESS) *count = pages;
-    return error;
+    if (*pages == 0 && size > 0) return KERN_INVALID_ADDRESS;
+    return task->pages().query(addressSpace, start, runs, pages);
 }
 
 int32_t HXLinuxPlatform::proc_regionfilename(int32_t pid, uint64_t address, char *buffer,

@@ -14,6 +14,7 @@
 #include <cerrno>
 #include <cinttypes>
 #include <cstring>
+#include <filesystem>
 #include <sstream>
 
 namespace {
@@ -207,12 +208,13 @@ TEST_F(HXLinuxPlatformTest, ProcessesVanishAndRefuse) {
 }
 
 TEST_F(HXLinuxPlatformTest, ReadsPageTables) {
-    process(10, "p",
-            "1000-9000 rw-p 0 fe:01 5 /x\n"
-            "Rss:                  16 kB\nAnonymous:            12 kB\nLazyFree:              4 kB\n"
-            "Swap:                  4 kB\nVmFlags: rd\n9000-a000 rw-p 0 00:06 7 /dev/driver\nVmFlags: rd\n"
-            "a000-c000 rw-s 0 00:01 8 /memfd:x (deleted)\nVmFlags: rd\n"
-            "c000-e000 rw-s 0 00:0f 9 /pool\nVmFlags: rd ht\n20000-21000 r--p 0 00:00 0\n");
+    process(
+        10, "p",
+        "1000-9000 rw-p 0 fe:01 5 /x\n"
+        "Rss:                  16 kB\nAnonymous:            12 kB\nLazyFree:              4 kB\n"
+        "Swap:                  4 kB\nVmFlags: rd\n9000-a000 rw-p 0 00:06 7 /dev/driver\nVmFlags: rd\n"
+        "a000-c000 rw-s 0 00:01 8 /memfd:x (deleted)\nRss:                   4 kB\nVmFlags: rd\n"
+        "c000-e000 rw-s 0 00:0f 9 /pool\nShared_Hugetlb: 4 kB\nVmFlags: rd ht\n20000-21000 r--p 0 00:00 0\n");
     constexpr uint64_t present = 1ULL << 63, swapped = 1ULL << 62, file = 1ULL << 61, guard = 1ULL << 58;
     const uint64_t entries[] = {
         0,       present | file, present, swapped,        swapped, guard | swapped, present, present, 0,
@@ -233,6 +235,23 @@ TEST_F(HXLinuxPlatformTest, ReadsPageTables) {
     };
     for (const auto &[from, bytes, expected] : cases)
         EXPECT_EQ(HXPagesAt(platform, task, from, bytes), expected) << std::hex << from;
+}
+
+TEST_F(HXLinuxPlatformTest, ReadsNoPageTablesBehindTheLastPage) {
+    constexpr uint64_t bytes = uint64_t{1} << 46, pages = bytes / 4096; // which nobody would read one by one
+    process(10, "p",
+            "0-400000000000 rw-s 0 00:01 8 /memfd:x (deleted)\nRss:                   8 kB\nVmFlags: rd\n");
+    std::string entries(5000 * 8, '\0');
+    entries[7] = entries.back() = static_cast<char>(0xA0); // present, of the object
+    proc.write("10/pagemap", entries);
+    std::filesystem::resize_file(proc / "10/pagemap", pages * 8);
+    std::vector<vm_page_run> runs;
+    uint64_t told = 0;
+    ASSERT_EQ(platform.mach_vm_page_range_query(open(10), 0, bytes, &runs, &told), KERN_SUCCESS);
+    EXPECT_EQ(told, pages);
+    ASSERT_EQ(runs.size(), 2u);
+    EXPECT_EQ(runs[0].address, 0u);
+    EXPECT_EQ(runs[1].address, 4999u * 4096);
 }
 
 TEST_F(HXLinuxPlatformTest, LeavesThePagesOfAnotherProgramAlone) {

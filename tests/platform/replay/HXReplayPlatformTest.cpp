@@ -25,10 +25,9 @@ TEST(HXReplay, FindsRegionsAndPages) {
         EXPECT_EQ(HXAnswered(each.expected.at(0).text,
                              [&](const std::string &question) {
                                  std::istringstream words(question);
-                                 uint64_t address = 0, bytes = 0, room = 0;
+                                 uint64_t address = 0, bytes = 0;
                                  words >> std::hex >> address;
-                                 if (words >> bytes >> room)
-                                     return HXPagesAt(host, task, address, bytes, room);
+                                 if (words >> bytes) return HXPagesAt(host, task, address, bytes);
                                  vm_region_submap_info_64 info;
                                  const std::string found = HXRegionAt(host, task, address, &info);
                                  EXPECT_EQ(HXRegionAt(host, task, address, nullptr), found);
@@ -36,6 +35,42 @@ TEST(HXReplay, FindsRegionsAndPages) {
                              }),
                   each.expected.at(0).text)
             << each.title;
+    }
+}
+
+// As queries of 4,096 pages each would, though one may tell of more.
+TEST(HXReplay, TellsOfAsManyPagesAsCallsSucceed) {
+    const std::string region = R"(
+region  pid=5  address=0x100000000  size=0x10000000  pages=8190*0,8*9,0x2000*0,1*3
+region  pid=5  address=0x110000000  size=0x5000000  pages=1*9
+region  pid=5  address=0x115000000  size=0x1000
+)";
+    static constexpr struct {
+        const char *fault;
+        uint64_t size, told;
+        size_t runs;
+        kern_return_t error; // of the pages behind
+    } cases[] = {
+        {"", 0x14000000, 0x14000, 3, 0},
+        {"", 0x15001000, 0x15000, 3, KERN_INVALID_ADDRESS},
+        {"from=3  error=9", 0x14000000, 0x2000, 1, 9},
+        {"from=4  error=9", 0x14000000, 0x3000, 1, 9},
+        {"from=21  error=9", 0x14000000, 0x14000, 3, 9},
+    };
+    for (const auto &test : cases) {
+        const std::string fault = *test.fault == 0 ? "" : "fault  pid=5  call=mach_vm_page_range_query  ";
+        HXMadeUpMachine host("host  page_size=4096\nprocess  pid=5" + region + fault + test.fault + "\n");
+        std::vector<vm_page_run> runs;
+        uint64_t told = 0;
+        const mach_port_t task = HXTaskOf(host, 5);
+        ASSERT_EQ(host.mach_vm_page_range_query(task, 0x100000000, test.size, &runs, &told), KERN_SUCCESS);
+        EXPECT_EQ(told, test.told) << test.fault;
+        EXPECT_EQ(runs.size(), test.runs) << test.fault;
+        if (test.told == 0x2000) {
+            EXPECT_EQ(runs.back().pages, 2U) << "cut at the end of what is told";
+        }
+        const uint64_t behind = told == 0x14000 ? 0x100000000 : 0x100000000 + told * 4096;
+        EXPECT_EQ(host.mach_vm_page_range_query(task, behind, 0x2000, &runs, &told), test.error);
     }
 }
 

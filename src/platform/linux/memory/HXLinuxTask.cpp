@@ -1,5 +1,6 @@
 #include "platform/linux/memory/HXLinuxTask.h"
 
+#include "platform/linux/memory/HXRepeatedPages.h"
 #include "platform/linux/memory/HXTaskFiles.h"
 
 #include <mutex>
@@ -8,6 +9,7 @@ const HXAddressSpace &HXLinuxTask::addressSpace(const HXReaderSetting &setting, 
     if (!_addressSpace || (needsDirtyPages && !_addressSpace->knowsDirtyPages)) {
         _addressSpace = HXReadAddressSpace({_directory, _status, needsDirtyPages, _opened}, setting);
         _pages.emplace(_directory, setting.pageShift);
+        HXFindRepeatedPages(setting.pageShift, &*_pages, _addressSpace.get());
     }
     return *_addressSpace;
 }

@@ -17,11 +17,14 @@
 // reads fail, whoever has its pid then. Used by one thread at a time.
 class HXLinuxTask {
   public:
-    HXLinuxTask(int32_t pid, HXDescriptor directory) : _pid(pid), _directory(std::move(directory)) {}
+    // `number`: HXObjectIdentifiers::numberOfProcess.
+    HXLinuxTask(int32_t pid, uint32_t number, HXDescriptor directory)
+        : _pid(pid), _number(number), _directory(std::move(directory)) {}
     HXLinuxTask(const HXLinuxTask &) = delete;
     HXLinuxTask &operator=(const HXLinuxTask &) = delete;
 
     int32_t pid() const { return _pid; }
+    uint32_t number() const { return _number; }
     const HXDescriptor &directory() const { return _directory; }
 
     // The address space as it was when this was first asked for; read again when dirty file pages are wanted
@@ -40,6 +43,7 @@ class HXLinuxTask {
 
   private:
     const int32_t _pid;
+    const uint32_t _number;
     const HXDescriptor _directory;
     const std::chrono::steady_clock::time_point _opened = std::chrono::steady_clock::now();
     std::unique_ptr<HXAddressSpace> _addressSpace;
