@@ -3,7 +3,6 @@
 #include "platform/linux/HXLinuxPlatform.h"
 #include "support/HXHostCalls.h"
 #include "support/HXMadeUpMachine.h"
-#include "support/HXPages.h"
 #include "support/HXRun.h"
 #include "support/HXSubject.h"
 #include "support/HXTemporaryFolder.h"

@@ -36,7 +36,8 @@ std::string HXPagesAt(HXPlatform &host, mach_port_t task, uint64_t address, uint
     const kern_return_t error = HXPagesOf(host, task, address, bytes, &dispositions);
     if (error != KERN_SUCCESS) return host.mach_error_string(error);
     std::ostringstream text;
+    const char *separator = "";
     for (const int32_t disposition : dispositions)
-        text << (text.tellp() == 0 ? "" : " ") << std::hex << disposition;
+        text << std::exchange(separator, " ") << std::hex << disposition;
     return text.str();
 }

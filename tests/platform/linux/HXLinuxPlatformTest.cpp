@@ -272,48 +272,32 @@ alignas(4096) char ownPage[4096] = {1};
 
 TEST_F(HXLinuxPlatformTest, CountsFromPageTablesOnlyWhereTheyTellEnough) {
     if (!HXPageScan::isComplete()) GTEST_SKIP() << "the kernel's answers are not complete";
-    const std::string status = "VmLck: 0 kB\nVmRSS: 4 kB\nVmSwap: 0 kB\nHugetlbPages: 0 kB\nThreads: 1\n";
-    const struct {
-        const char *mapping; // behind its addresses
-        std::string status;
-        const char *freedEver, *freed;
-        bool suffice;
-    } cases[] = {
-        {"rw-p 0 00:00 0", status, "0", "1", true},
-        {"rw-p 0 fe:01 5 /bin/x", status, "1", "0", true},
-        {"rw-p 0 00:00 0", status, "1", "4", false},
-        {"rw-s 0 00:01 5 /memfd:x (deleted)", status, "0", "0", true},
-        {"rw-s 0 00:0f 5 /memfd:x (deleted)", status, "0", "0", false}, // of the huge-page pool
-        {"rw-s 0 00:0f 5 /SYSV00000000 (deleted)", status, "0", "0", false},
-        {"rw-p 0 00:0f 5 /anon_hugepage (deleted)", status, "0", "0", false},
-        {"rw-p 0 00:35 5 /huge/x", status, "0", "0", false},
-        {"rw-p 0 00:00 0", "VmLck: 4 kB\n" + status.substr(12), "0", "0", false},
-        {"rw-p 0 00:00 0", "HugetlbPages: 2048 kB\nThreads: 1\n", "0", "0", false},
-        {"rw-p 0 00:00 0", "VmSwap: 4 kB\nThreads: 1\n", "0", "0", false},
-        {"rw-p 0 00:00 0", "VmRSS: 2000 kB\nThreads: 1\n", "1", "0", false}, // too many pages to find out
-    };
     HXFileSystems fileSystems(HXDeviceNumber(0, 1));
     HXNamedTags tags;
     proc.write("mountinfo", "1 1 0:53 / /huge rw - hugetlbfs none rw\n");
     proc.link("pagemap", "/proc/self/pagemap");
     const HXDescriptor directory = HXOpenAt(AT_FDCWD, proc.path().c_str());
-    for (const auto &item : cases) {
+    const auto sourceFor = [&](const std::string &question) -> std::string {
+        const std::vector<std::string> words = HXWordsOf(question);
         char range[64];
         const auto start = reinterpret_cast<uint64_t>(ownPage);
         snprintf(range, sizeof range, "%" PRIx64 "-%" PRIx64 " ", start, start + sizeof ownPage);
         // Behind it one that is large enough to be walked by itself.
-        const std::string maps =
-            range + std::string(item.mapping) + "\n7e0000000000-7e0000400000 rw-p 0 00:00 0\n";
+        const std::string maps = range + words.at(0) + "\n7e0000000000-7e0000400000 rw-p 0 00:00 0\n";
         proc.write("maps", maps);
         proc.write("smaps", maps);
-        proc.write("status", item.status);
-        proc.write("vmstat", "pglazyfree "s + item.freedEver + "\n");
-        proc.write("smaps_rollup", "LazyFree: "s + item.freed + " kB\n");
+        std::string status = words.at(1);
+        std::replace(status.begin(), status.end(), ',', '\n');
+        proc.write("status", status + "\nThreads: 1\n");
+        proc.write("vmstat", "pglazyfree " + words.at(2) + "\n");
+        proc.write("smaps_rollup", "LazyFree: " + words.at(3) + " kB\n");
         HXMachineFacts machine(proc.path());
         const auto read = HXReadAddressSpace({directory, {}, false, std::chrono::steady_clock::now()},
                                              {&fileSystems, &machine, &tags, 12, true});
-        EXPECT_NE(read->knowsDirtyPages, item.suffice) << item.mapping << " " << item.status;
-    }
+        return read->knowsDirtyPages ? "smaps" : "page tables";
+    };
+    for (const HXCase &each : HXReadCases("linux-sources.txt"))
+        EXPECT_EQ(HXAnswered(each.input, sourceFor), each.input);
 }
 
 TEST_F(HXLinuxPlatformTest, FiguresAndLedger) {

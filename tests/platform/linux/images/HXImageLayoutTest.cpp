@@ -28,34 +28,17 @@ TEST(HXElfHeaders, AcceptsSenseAlone) {
     EXPECT_EQ(narrow->loads[3].memorySize, headers->loads[3].memorySize);
     EXPECT_TRUE(headers->loads[3].writable && !headers->loads[3].executable);
 
-    constexpr size_t code = 64 + 56, relocated = 64 + 4 * 56; // program headers (elf(5))
-    constexpr size_t flags = 4, address = 16, memorySize = 40;
-    const struct {
-        size_t position;
-        int byte;
-        const char *what;
-    } senseless[] = {
-        {0, 9, "magic"},
-        {4, 9, "class"},
-        {5, 2, "byte order"},
-        {16, 9, "type"},
-        {32, 63, "program headers inside the file's header"},
-        {39, 9, "program headers far away"},
-        {54, 9, "size of a program header"},
-        {56, 0, "no program header"},
-        {57, 3, "hundreds of program headers"},
-        {code + flags, 4, "no code"},
-        {code + memorySize + 1, 0x20, "more in the file than in memory"},
-        {code + address + 1, 0x10, "overlapping loads"},
-        {code + address + 7, 2, "an address that no process has"},
-        {code + memorySize + 7, 2, "a size that no process has"},
-        {relocated + memorySize + 7, 2, "what is relocated ends nowhere"},
-    };
-    for (const auto &item : senseless) {
+    const auto parsed = [](const std::string &question) {
+        std::istringstream words(question);
+        size_t position = 0;
+        int byte = 0;
+        words >> position >> byte;
         std::string bad = kLibrary;
-        bad[item.position] = static_cast<char>(item.byte);
-        EXPECT_FALSE(parse(bad)) << item.what;
-    }
+        bad.at(position) = static_cast<char>(byte);
+        return parse(bad) ? "accepted" : "refused";
+    };
+    for (const HXCase &each : HXReadCases("linux-elf.txt"))
+        EXPECT_EQ(HXAnswered(each.input, parsed), each.input);
     for (size_t length = 0; length < kLibrary.size(); length++)
         EXPECT_FALSE(parse(kLibrary.substr(0, length))) << length;
 }

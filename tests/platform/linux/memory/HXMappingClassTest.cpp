@@ -1,4 +1,4 @@
-// What a made-up /proc cannot show of it; the rest is in cases/linux-regions.txt.
+// How mappings are classified is in tests/cases/linux-regions.txt; here is what no process can show.
 #include "platform/linux/memory/HXMappingClass.h"
 
 #include "platform/HXRegionTags.h"
@@ -8,6 +8,6 @@
 TEST(HXMappingClass, NamedMemoryForWhichNoTagIsLeftIsAnonymous) {
     HXMapping mapping;
     mapping.flags = HXMappingReadable | HXMappingWritable;
-    HXClassifyMapping(HXPathKindOf("[anon:arena]"), HXFileSystemKind::unknown, 0, 0, &mapping);
+    HXClassifyMapping(HXPathKindOf("[anon:arena]"), HXFileSystemKind::unknown, 1, 0, &mapping);
     EXPECT_EQ(mapping.tag, HXHostTagAnonymous);
 }
