@@ -3,15 +3,12 @@
 // its readers); where it writes to standard error, CASE.err.expected, whose lines are sorted since processes
 // are gathered several at once. A case named MACHINE.RUN is another run over MACHINE.machine.
 #include "support/HXBuilders.h"
+#include "support/HXCaseFile.h"
 #include "support/HXRun.h"
 
 #include <algorithm>
 #include <filesystem>
 #include <gtest/gtest.h>
-#include <iterator>
-#include <numeric>
-#include <set>
-#include <sstream>
 
 namespace {
 namespace fs = std::filesystem;
@@ -26,17 +23,10 @@ std::vector<std::string> caseNames() {
     return names;
 }
 
-std::vector<std::string> wordsOf(const std::string &text) {
-    std::istringstream words(text);
-    return {std::istream_iterator<std::string>(words), {}};
-}
-
-std::string sortedLines(const std::string &text) {
-    std::multiset<std::string> lines;
-    std::istringstream stream(text);
-    for (std::string line; std::getline(stream, line);)
-        lines.insert(line + "\n");
-    return std::accumulate(lines.begin(), lines.end(), std::string());
+std::vector<std::string> sortedLines(const std::string &text) {
+    std::vector<std::string> lines = HXLinesOf(text);
+    std::sort(lines.begin(), lines.end());
+    return lines;
 }
 
 class HXCasesTest : public testing::TestWithParam<std::string> {
@@ -50,12 +40,12 @@ TEST_P(HXCasesTest, PrintsWhatIsExpected) {
     const std::string machine = contentOf(kFolder / machineName);
     ASSERT_TRUE(machine.starts_with("heft-machine 1\n#")) << machineName << " does not say what it shows";
     const std::string records = machine.substr(machine.find('\n') + 1);
-    const std::vector<std::string> arguments = wordsOf(file(".args"));
+    const std::vector<std::string> arguments = HXWordsOf(file(".args"));
 
     const HXRun plain = run(records, arguments);
     EXPECT_EQ(plain.status, 0);
     EXPECT_EQ(plain.out, file(".expected"));
-    EXPECT_EQ(sortedLines(plain.err), file(".err.expected"));
+    EXPECT_EQ(sortedLines(plain.err), sortedLines(file(".err.expected")));
     const std::string document = report(records, arguments).json;
     std::string expected = file(".json.expected");
     std::erase(expected, '\n');

@@ -8,10 +8,10 @@
 // error.
 #include "process/HXProcessSnapshot.h"
 #include "support/HXBuilders.h"
+#include "support/HXCaseFile.h"
 #include "support/HXMadeUpMachine.h"
 
 #include <gtest/gtest.h>
-#include <map>
 #include <sstream>
 
 namespace {
@@ -71,41 +71,18 @@ std::string gathered(const std::string &machine, bool hidden) {
         text += "aux " + aux->jsonRepresentation() + "\n";
         EXPECT_EQ(aux->mergeWithData(nullptr), nullptr); // no process's figure adds to another's
     }
-    std::istringstream lines(printed.err);
-    for (std::string line; std::getline(lines, line);)
+    for (const std::string &line : HXLinesOf(printed.err))
         text += "prints " + line + "\n";
     return text;
-}
-
-struct Case {
-    std::string title;
-    std::string machine;
-    std::map<std::string, std::string> expected; // by mode
-};
-std::vector<Case> cases() {
-    std::vector<Case> cases;
-    std::istringstream lines(contentOf(std::string(TEST_CASES "/gathering.txt")));
-    std::string *text = nullptr;
-    for (std::string line; std::getline(lines, line);) {
-        if (line.starts_with("== ")) {
-            cases.push_back({line.substr(3), {}, {}});
-            text = &cases.back().machine;
-        } else if (line.starts_with("-- ")) {
-            text = &cases.back().expected[line.substr(3)];
-        } else if (!line.empty()) {
-            *text += line + "\n";
-        }
-    }
-    return cases;
 }
 
 } // namespace
 
 TEST(HXGatheringTest, FindsWhatEachCaseExpects) {
     const std::string breakDown = "self_region_heft=1";
-    for (const Case &each : cases())
+    for (const HXCase &each : HXReadCases("gathering.txt"))
         for (const auto &[mode, expected] : each.expected) {
-            std::string machine = each.machine;
+            std::string machine = each.input;
             if (mode == "objects")
                 machine.replace(machine.find(breakDown), breakDown.size(), "self_region_heft=0");
             EXPECT_EQ(gathered(machine, mode == "hidden"), expected) << each.title << ", " << mode;
