@@ -1,8 +1,122 @@
 #include "support/HXBuilders.h"
 
+#include "support/HXCaseFile.h"
 #include "support/HXTemporaryFolder.h"
 
 #include <gtest/gtest.h>
+#include <map>
+#include <sstream>
+#include <utility>
+
+namespace {
+constexpr std::pair<char, uint64_t HXSizes::*> kAmounts[] = {{'d', &HXSizes::dirty},
+                                                             {'s', &HXSizes::swapped},
+                                                             {'c', &HXSizes::clean},
+                                                             {'r', &HXSizes::reclaimable},
+                                                             {'w', &HXSizes::wired}};
+
+const std::map<std::string, void (*)(HXMemoryRegion &)> kRegionWords = {
+    {"wired", [](HXMemoryRegion &region) { region.setWired(true); }},
+    {"owned", [](HXMemoryRegion &region) { region.setOwnedExclusivelyByParentProcess(true); }},
+    {"cache", [](HXMemoryRegion &region) { region.setInSharedCache(true); }},
+    {"unused", [](HXMemoryRegion &region) { region.setUnusedSharedCacheRegion(true); }},
+    {"cow", [](HXMemoryRegion &region) { region.setShare_mode(SM_COW); }},
+    {"private", [](HXMemoryRegion &region) { region.setShare_mode(SM_PRIVATE); }},
+    {"aliased", [](HXMemoryRegion &region) { region.setShare_mode(SM_PRIVATE_ALIASED); }},
+    {"large", [](HXMemoryRegion &region) { region.setShare_mode(SM_LARGE_PAGE); }},
+    {"text", [](HXMemoryRegion &region) { region.setSegment(HXSegmentText); }},
+    {"data", [](HXMemoryRegion &region) { region.setSegment(HXSegmentData); }},
+    {"linkedit", [](HXMemoryRegion &region) { region.setSegment(HXSegmentLinkedit); }},
+};
+
+uint64_t hexadecimal(const std::string &text) {
+    return std::strtoull(text.c_str(), nullptr, 16);
+}
+
+// Reads an amount into `sizes`, anything else fails the test.
+void readAmount(const std::string &word, HXSizes &sizes) {
+    for (const auto &[letter, amount] : kAmounts)
+        if (word[0] == letter) {
+            sizes.*amount = hexadecimal(word.substr(1));
+            return;
+        }
+    ADD_FAILURE() << "not in the notation: " << word;
+}
+
+HXRange rangeOf(const std::string &word) {
+    return {word.starts_with("nowhere") ? kNoAddress : hexadecimal(word),
+            hexadecimal(word.substr(word.find('+') + 1))};
+}
+
+// Any word of a region but an amount.
+bool readFact(const std::string &word, HXMemoryRegion &region) {
+    const auto is = [&](std::string_view start) { return word.starts_with(start); };
+    const std::string value = word.substr(word.find('=') + 1);
+    if (const auto known = kRegionWords.find(word); known != kRegionWords.end()) {
+        known->second(region);
+    } else if (is("name=")) {
+        region.setName(std::string_view(value));
+    } else if (is("detail=")) {
+        region.setDetailedName(std::string_view(value));
+    } else if (is("tag=")) {
+        region.setUser_tag(static_cast<uint32_t>(hexadecimal(value)));
+    } else if (is("#")) {
+        region.setObject_id(hexadecimal(word.substr(1)));
+    } else if (is("@")) {
+        region.setOffset(hexadecimal(word.substr(1)));
+    } else if (word.find('+') != std::string::npos) {
+        region.setStart(rangeOf(word).location);
+        region.setSize(rangeOf(word).length);
+    } else {
+        return false;
+    }
+    return true;
+}
+} // namespace
+
+std::string told(const HXSizes &sizes) {
+    std::ostringstream text;
+    for (const auto &[letter, amount] : kAmounts)
+        if (sizes.*amount != 0) text << ' ' << letter << std::hex << sizes.*amount;
+    return text.str();
+}
+
+std::string told(const HXRangeList &runs) {
+    std::ostringstream text;
+    const char *separator = "";
+    for (const auto &[location, run] : runs.nodes())
+        text << std::exchange(separator, ", ") << std::hex << location << '+' << run.length << told(run);
+    return text.str();
+}
+
+std::vector<HXRangeListNode> runsOf(const std::string &text) {
+    std::vector<HXRangeListNode> runs;
+    for (const std::string &word : HXWordsOf(text))
+        if (word.find('+') != std::string::npos)
+            runs.push_back({rangeOf(word), {}});
+        else
+            readAmount(word, runs.back());
+    return runs;
+}
+
+HXMemoryRegion makeRegion(const std::string &text) {
+    HXMemoryRegion region;
+    region.setShare_mode(SM_SHARED);
+    region.setSegment(HXSegmentNoImage);
+    region.setName(std::string_view("memory"));
+    HXSizes sizes;
+    const size_t bar = std::min(text.find('|'), text.size());
+    for (const std::string &word : HXWordsOf(text.substr(0, bar)))
+        if (!readFact(word, region)) readAmount(word, sizes);
+    region.setDirtySize(sizes.dirty);
+    region.setSwappedSize(sizes.swapped);
+    region.setCleanNonSpecSize(sizes.clean);
+    region.setReclaimableSize(sizes.reclaimable);
+    if (bar < text.size())
+        for (const HXRangeListNode &run : runsOf(text.substr(bar + 1)))
+            region.addSubrange(run, run, 16384);
+    return region;
+}
 
 HXPrinted printedBy(const std::function<void()> &work) {
     testing::internal::CaptureStdout();
