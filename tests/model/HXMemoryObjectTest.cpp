@@ -58,10 +58,12 @@ TEST(HXMemoryObjectTest, IsWhatItsTableSays) {
 }
 
 TEST(HXMemoryObjectTest, CategoriesAddUpObjectsOfOneName) {
+    const HXBarePlatform platform;
     // The last has the same text in other parts.
-    const std::vector<std::string> contents[] = {{"0+10000 d4000 name=a detail=/x", "0+4000 @20000 wired"},
-                                                 {"0+10000 s5 name=a detail=/y"},
-                                                 {"0+4000 c6 \"name=a /x\""}};
+    const std::vector<std::string> contents[] = {
+        {"0+10000 #1 d4000 name=a detail=/x", "0+4000 #1 @20000 wired"},
+        {"0+10000 #2 s5 name=a detail=/y"},
+        {"0+4000 #3 c6 \"name=a /x\""}};
     HXCategoryMap summary(true), detailed(false);
     for (const auto &content : contents) {
         HXMemoryRegionList regions;
