@@ -1,7 +1,7 @@
 #include "analysis/HXHeft.h"
-#include "support/HXBarePlatform.h"
 #include "support/HXBuilders.h"
 #include "support/HXCaseFile.h"
+#include "support/HXMadeUpMachine.h"
 
 #include <cerrno>
 #include <gtest/gtest.h>
@@ -34,7 +34,7 @@ class HXHeftTest : public testing::Test {
         return process.memoryRegions()[region].memoryObject();
     }
 
-    HXBarePlatform _platform;
+    HXMadeUpMachine _platform;
 
   private:
     HXHeft::ProcessList _targets;
@@ -43,7 +43,7 @@ class HXHeftTest : public testing::Test {
 } // namespace
 
 TEST_F(HXHeftTest, RegionsOfOneKeyShareAnObject) {
-    for (const HXCase &each : HXReadCases("tables/keys.txt")) {
+    for (const HXCase &each : HXReadCases("keys.txt")) {
         const auto answer = [&](const std::string &regions) {
             const size_t slash = regions.find('/');
             const auto &first = add(10, {regions.substr(0, slash)});
@@ -110,7 +110,7 @@ TEST_F(HXHeftTest, AnInterruptLeavesOutWhatHasNotBegun) {
 
 TEST_F(HXHeftTest, AnAnalysisSwitchThatCannotBeReadOrSetIsTold) {
     EXPECT_TRUE(HXHeftSwitches::breakDownPhysHeft());
-    struct : HXBarePlatform {
+    struct : HXMadeUpMachine {
         int32_t sysctlbyname(const char *, void *, size_t *, const void *, size_t) override {
             errno = EPERM;
             return -1;

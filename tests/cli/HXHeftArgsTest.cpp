@@ -1,8 +1,8 @@
 #include "cli/HXHeftArgs.h"
 
-#include "support/HXBarePlatform.h"
 #include "support/HXBuilders.h"
 #include "support/HXCaseFile.h"
+#include "support/HXMadeUpMachine.h"
 
 #include <algorithm>
 #include <gtest/gtest.h>
@@ -53,7 +53,7 @@ std::string parsed(const std::string &line) {
 } // namespace
 
 TEST(HXHeftArgsTest, AreWhatTheirTableSays) {
-    const HXBarePlatform platform;
-    for (const HXCase &each : HXReadCases("tables/options.txt"))
+    const HXMadeUpMachine platform;
+    for (const HXCase &each : HXReadCases("options.txt"))
         EXPECT_EQ(HXAnswered(each.input, parsed), each.input) << each.title;
 }

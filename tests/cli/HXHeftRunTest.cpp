@@ -22,7 +22,7 @@ std::string shown(const HXRun &run) {
 } // namespace
 
 TEST(HXHeftRunTest, ChoosesTargetsOrSaysWhyNot) {
-    for (const HXCase &each : HXReadCases("tables/targets.txt"))
+    for (const HXCase &each : HXReadCases("targets.txt"))
         for (const auto &[arguments, expected] : each.expected)
             EXPECT_EQ(shown(run(each.input, HXWordsOf(arguments))), expected) << each.title << arguments;
 }

@@ -58,7 +58,7 @@ TEST(HXProgramsTest, RecordSaysWhatIsWrongWithItsArguments) {
         const std::string firstLine = HXLinesOf(run.out + run.err).at(0);
         return std::regex_replace(firstLine, std::regex(folder.path().native()), "FOLDER");
     };
-    const std::string rows = HXReadCases("tables/record.txt")[0].input;
+    const std::string rows = HXReadCases("record.txt")[0].input;
     EXPECT_EQ(HXAnswered(rows, answer), rows);
     EXPECT_TRUE(fs::is_empty(folder.path())); // nor is a half-written file left behind
 }

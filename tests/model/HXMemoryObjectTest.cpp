@@ -1,8 +1,8 @@
 #include "model/HXHeftSwitches.h"
 #include "model/HXMemoryCategory.h"
-#include "support/HXBarePlatform.h"
 #include "support/HXBuilders.h"
 #include "support/HXCaseFile.h"
+#include "support/HXMadeUpMachine.h"
 
 #include <gtest/gtest.h>
 
@@ -49,8 +49,8 @@ std::string finished(const std::string &lines) {
 } // namespace
 
 TEST(HXMemoryObjectTest, IsWhatItsTableSays) {
-    const HXBarePlatform platform;
-    for (const HXCase &each : HXReadCases("tables/objects.txt"))
+    const HXMadeUpMachine platform;
+    for (const HXCase &each : HXReadCases("objects.txt"))
         for (const auto &[mode, expected] : each.expected) {
             HXHeftSwitches::setBreakDownPhysHeft(mode == "charge");
             EXPECT_EQ(finished(each.input), expected) << each.title << ", " << mode;
@@ -58,7 +58,7 @@ TEST(HXMemoryObjectTest, IsWhatItsTableSays) {
 }
 
 TEST(HXMemoryObjectTest, CategoriesAddUpObjectsOfOneName) {
-    const HXBarePlatform platform;
+    const HXMadeUpMachine platform;
     // The last has the same text in other parts.
     const std::vector<std::string> contents[] = {
         {"0+10000 #1 d4000 name=a detail=/x", "0+4000 #1 @20000 wired"},

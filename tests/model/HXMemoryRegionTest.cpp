@@ -1,4 +1,4 @@
-// Of tests/cases/tables/regions.txt.
+// Of tests/cases/regions.txt.
 #include "support/HXBuilders.h"
 #include "support/HXCaseFile.h"
 #include "support/HXMadeUpMachine.h"
@@ -26,7 +26,7 @@ std::string merged(const std::string &runs) {
 
 TEST(HXMemoryRegionTest, IsWhatItsTableSays) {
     const HXMadeUpMachine machine("tag  tag=100  name=heap\ntag  tag=101  name=Memory Tag 101\n");
-    const auto tables = HXReadCases("tables/regions.txt");
+    const auto tables = HXReadCases("regions.txt");
     std::string (*const answers[])(const std::string &) = {called, worth, merged};
     ASSERT_EQ(tables.size(), std::size(answers));
     for (size_t i = 0; i < tables.size(); i++)

@@ -1,15 +1,15 @@
 #include "output/HXOutputFormatterText.h"
 
-#include "support/HXBarePlatform.h"
 #include "support/HXBuilders.h"
 #include "support/HXCaseFile.h"
+#include "support/HXMadeUpMachine.h"
 #include "support/HXRun.h"
 
 #include <gtest/gtest.h>
 
 TEST(HXOutputFormatterTextTest, WritesSizesInTheChosenFormat) {
-    const HXBarePlatform platform;
-    const std::string rows = HXReadCases("tables/text.txt")[0].input;
+    const HXMadeUpMachine platform;
+    const std::string rows = HXReadCases("text-report.txt")[0].input;
     const auto answer = [](const std::string &size) {
         std::string texts;
         for (const int32_t format : {HXFormatBytes, HXFormatFormatted, HXFormatPages}) {
@@ -23,7 +23,7 @@ TEST(HXOutputFormatterTextTest, WritesSizesInTheChosenFormat) {
 }
 
 TEST(HXOutputFormatterTextTest, SortsRowsByEveryColumn) {
-    const HXCase sorting = HXReadCases("tables/text.txt")[1];
+    const HXCase sorting = HXReadCases("text-report.txt")[1];
     for (const auto &[column, expected] : sorting.expected) {
         std::string order;
         for (const std::string &line : HXLinesOf(run(sorting.input, {"5", "--sort", column}).out))

@@ -22,7 +22,7 @@ TEST(HXImageTest, LookupsOnlyMoveForward) {
         }
         return found;
     };
-    const std::string rows = HXReadCases("tables/images.txt")[0].input;
+    const std::string rows = HXReadCases("images.txt")[0].input;
     EXPECT_EQ(HXAnswered(rows, answer), rows);
 }
 
@@ -32,7 +32,7 @@ TEST(HXImageTest, NamesTellSegments) {
         image.setName(HXString::intern(name));
         return std::to_string(image.segment());
     };
-    const std::string rows = HXReadCases("tables/images.txt")[1].input;
+    const std::string rows = HXReadCases("images.txt")[1].input;
     EXPECT_EQ(HXAnswered(rows, answer), rows);
 }
 

@@ -1,8 +1,8 @@
 #include "process/HXProcessSnapshot.h"
 #include "process/HXUserProcess.h"
-#include "support/HXBarePlatform.h"
 #include "support/HXBuilders.h"
 #include "support/HXCaseFile.h"
+#include "support/HXMadeUpMachine.h"
 #include "support/HXRun.h"
 
 #include <algorithm>
@@ -11,7 +11,7 @@
 
 namespace {
 // Answers the argument area of every process with given bytes.
-class ArgumentAreas : public HXBarePlatform {
+class ArgumentAreas : public HXMadeUpMachine {
   public:
     std::optional<uint32_t> argMax = 64;
     std::optional<std::string> area;
@@ -47,7 +47,7 @@ std::string nameOf(ArgumentAreas &platform, const std::vector<std::string> &word
 
 TEST(HXProcessTest, IsNamedAfterItsExecutableOrItsRecord) {
     ArgumentAreas platform;
-    const std::string rows = HXReadCases("tables/names.txt")[0].input;
+    const std::string rows = HXReadCases("names.txt")[0].input;
     EXPECT_EQ(HXAnswered(rows, [&](const auto &row) { return nameOf(platform, HXWordsOf(row)); }), rows);
     for (const auto argMax : {std::optional<uint32_t>(), std::optional<uint32_t>(0)}) {
         platform.argMax = argMax;
@@ -110,7 +110,7 @@ TEST(HXProcessTest, SearchesForTheLastMappingBelowTheSharedRegion) {
 }
 
 TEST(HXProcessTest, DirtyFlagsAndLayoutsAreTold) {
-    const HXBarePlatform platform;
+    const HXMadeUpMachine platform;
     HXUserProcess process;
     EXPECT_EQ(process.idleExitStatus(), HXIdleExitUnknown);
     for (uint32_t flags = 0; flags < 12; flags++) {
