@@ -4,7 +4,6 @@
 #include "support/HXTemporaryFolder.h"
 
 #include <gtest/gtest.h>
-#include <map>
 #include <sstream>
 #include <utility>
 
@@ -14,20 +13,6 @@ constexpr std::pair<char, uint64_t HXSizes::*> kAmounts[] = {{'d', &HXSizes::dir
                                                              {'c', &HXSizes::clean},
                                                              {'r', &HXSizes::reclaimable},
                                                              {'w', &HXSizes::wired}};
-
-const std::map<std::string, void (*)(HXMemoryRegion &)> kRegionWords = {
-    {"wired", [](HXMemoryRegion &region) { region.setWired(true); }},
-    {"owned", [](HXMemoryRegion &region) { region.setOwnedExclusivelyByParentProcess(true); }},
-    {"cache", [](HXMemoryRegion &region) { region.setInSharedCache(true); }},
-    {"unused", [](HXMemoryRegion &region) { region.setUnusedSharedCacheRegion(true); }},
-    {"cow", [](HXMemoryRegion &region) { region.setShare_mode(SM_COW); }},
-    {"private", [](HXMemoryRegion &region) { region.setShare_mode(SM_PRIVATE); }},
-    {"aliased", [](HXMemoryRegion &region) { region.setShare_mode(SM_PRIVATE_ALIASED); }},
-    {"large", [](HXMemoryRegion &region) { region.setShare_mode(SM_LARGE_PAGE); }},
-    {"text", [](HXMemoryRegion &region) { region.setSegment(HXSegmentText); }},
-    {"data", [](HXMemoryRegion &region) { region.setSegment(HXSegmentData); }},
-    {"linkedit", [](HXMemoryRegion &region) { region.setSegment(HXSegmentLinkedit); }},
-};
 
 uint64_t hexadecimal(const std::string &text) {
     return std::strtoull(text.c_str(), nullptr, 16);
@@ -48,28 +33,38 @@ HXRange rangeOf(const std::string &word) {
             hexadecimal(word.substr(word.find('+') + 1))};
 }
 
+// What a word of a region begins with, and what takes its rest.
+using Region = HXMemoryRegion;
+const std::pair<std::string, void (*)(Region &, const std::string &)> kRegionWords[] = {
+    {"#", [](Region &region, const std::string &rest) { region.setObject_id(hexadecimal(rest)); }},
+    {"@", [](Region &region, const std::string &rest) { region.setOffset(hexadecimal(rest)); }},
+    {"tag=", [](Region &region, const std::string &rest) { region.setUser_tag(hexadecimal(rest)); }},
+    {"name=", [](Region &region, const std::string &rest) { region.setName(HXString::intern(rest)); }},
+    {"detail=",
+     [](Region &region, const std::string &rest) { region.setDetailedName(HXString::intern(rest)); }},
+    {"wired", [](Region &region, const std::string &) { region.setWired(true); }},
+    {"owned", [](Region &region, const std::string &) { region.setOwnedExclusivelyByParentProcess(true); }},
+    {"cache", [](Region &region, const std::string &) { region.setInSharedCache(true); }},
+    {"unused", [](Region &region, const std::string &) { region.setUnusedSharedCacheRegion(true); }},
+    {"cow", [](Region &region, const std::string &) { region.setShare_mode(SM_COW); }},
+    {"private", [](Region &region, const std::string &) { region.setShare_mode(SM_PRIVATE); }},
+    {"aliased", [](Region &region, const std::string &) { region.setShare_mode(SM_PRIVATE_ALIASED); }},
+    {"large", [](Region &region, const std::string &) { region.setShare_mode(SM_LARGE_PAGE); }},
+    {"text", [](Region &region, const std::string &) { region.setSegment(HXSegmentText); }},
+    {"data", [](Region &region, const std::string &) { region.setSegment(HXSegmentData); }},
+    {"linkedit", [](Region &region, const std::string &) { region.setSegment(HXSegmentLinkedit); }},
+};
+
 // Any word of a region but an amount.
 bool readFact(const std::string &word, HXMemoryRegion &region) {
-    const auto is = [&](std::string_view start) { return word.starts_with(start); };
-    const std::string value = word.substr(word.find('=') + 1);
-    if (const auto known = kRegionWords.find(word); known != kRegionWords.end()) {
-        known->second(region);
-    } else if (is("name=")) {
-        region.setName(std::string_view(value));
-    } else if (is("detail=")) {
-        region.setDetailedName(std::string_view(value));
-    } else if (is("tag=")) {
-        region.setUser_tag(static_cast<uint32_t>(hexadecimal(value)));
-    } else if (is("#")) {
-        region.setObject_id(hexadecimal(word.substr(1)));
-    } else if (is("@")) {
-        region.setOffset(hexadecimal(word.substr(1)));
-    } else if (word.find('+') != std::string::npos) {
-        region.setStart(rangeOf(word).location);
-        region.setSize(rangeOf(word).length);
-    } else {
-        return false;
-    }
+    for (const auto &[start, set] : kRegionWords)
+        if (word.starts_with(start)) {
+            set(region, word.substr(start.size()));
+            return true;
+        }
+    if (word.find('+') == std::string::npos) return false;
+    region.setStart(rangeOf(word).location);
+    region.setSize(rangeOf(word).length);
     return true;
 }
 } // namespace

@@ -18,7 +18,7 @@ std::string told(const HXSizes &sizes);
 std::string told(const HXRangeList &runs);
 std::vector<HXRangeListNode> runsOf(const std::string &text);
 
-// A region, in any order: START+SIZE ("nowhere" for none), amounts, what it is (kRegionWords), #OBJECT,
+// A region, in any order: START+SIZE ("nowhere" for none), amounts, what it is (see kRegionWords), #OBJECT,
 // @OFFSET, tag=TAG, name=NAME, detail=DETAIL, and after a bar its page runs. Shared memory that no image
 // covers, unless it says so.
 HXMemoryRegion makeRegion(const std::string &text);
@@ -38,7 +38,6 @@ class HXMadeUpProcess : public HXProcess {
         if (whenGathered) whenGathered();
         _memoryRegions = std::move(_found);
     }
-    void addError(const std::string &text) { _errors.push_back(text); }
 
     std::function<void()> whenGathered;
 
