@@ -32,7 +32,8 @@ class RandomMachine {
     static constexpr uint64_t kPage = 16384;
 
     std::string process(int pid) {
-        std::string text = field("process  pid=", pid) + "  name=" + (one(2) ? "same" : "other") +
+        std::string text = field("process  pid=", pid) +
+                           "  name=" + (pid == 1001 || one(2) ? "same" : "other") +
                            field("  flags=", one(4) ? 0 : 16) + field("  heft=", below(1000000)) +
                            field("  page_table=", below(3) * kPage) + (one(3) ? "  owned_none=1\n" : "\n");
         const bool ownsNothing = text.find("owned_none") != std::string::npos;
@@ -89,11 +90,6 @@ TEST(HXHeftReportTest, EveryReportAddsUp) {
         const std::string machine = random.text();
         const Words arguments = random.arguments();
         SCOPED_TRACE("seed " + std::to_string(seed) + "\n" + machine);
-        const HXRun result = run(machine, arguments);
-        if (result.status == 0) {
-            (void)report(machine, arguments);
-        } else { // no process of that name
-            EXPECT_EQ(arguments[0], "same") << result.err;
-        }
+        (void)report(machine, arguments);
     }
 }

@@ -1,17 +1,12 @@
 #include "analysis/HXHeft.h"
-#include "support/HXBarePlatform.h"
 #include "support/HXBuilders.h"
+#include "support/HXCaseFile.h"
+#include "support/HXMadeUpMachine.h"
 
 #include <cerrno>
 #include <gtest/gtest.h>
 
 namespace {
-constexpr uint64_t kPage = 16384;
-
-HXRegionFacts object(uint64_t id, uint8_t shareMode = SM_SHARED) {
-    return {.object = id, .size = kPage, .dirty = kPage, .shareMode = shareMode};
-}
-
 class HXHeftTest : public testing::Test {
   protected:
     HXHeftTest() {
@@ -22,7 +17,7 @@ class HXHeftTest : public testing::Test {
         HXHeftSwitches::setSharingAnalysisDisabled(false);
         HXProcess::_clearGlobalErrors();
     }
-    HXMadeUpProcess &add(int32_t pid, const std::vector<HXRegionFacts> &regions, bool is64bit = true) {
+    HXMadeUpProcess &add(int32_t pid, const std::vector<std::string> &regions, bool is64bit = true) {
         auto process = std::make_unique<HXMadeUpProcess>(pid, "p", regions);
         HXMadeUpProcess &reference = *process;
         process->setIs64bit(is64bit);
@@ -39,7 +34,7 @@ class HXHeftTest : public testing::Test {
         return process.memoryRegions()[region].memoryObject();
     }
 
-    HXBarePlatform _platform;
+    HXMadeUpMachine _platform;
 
   private:
     HXHeft::ProcessList _targets;
@@ -48,77 +43,60 @@ class HXHeftTest : public testing::Test {
 } // namespace
 
 TEST_F(HXHeftTest, RegionsOfOneKeyShareAnObject) {
-    HXRegionFacts cowDirty = object(7, SM_COW), cowClean = cowDirty;
-    cowClean.dirty = 0;
-    HXRegionFacts text = object(7), data = object(7), cache = object(7);
-    text.segment = HXSegmentText;
-    data.segment = HXSegmentData;
-    cache.sharedCache = true;
-    HXRegionFacts cacheElsewhere = cache, cacheOtherObject = cache, textInCache = cache;
-    cacheElsewhere.start = 0x2000;
-    cacheOtherObject.object = 8;
-    textInCache.segment = HXSegmentText;
-    // A key whose upper half is turned to zero, or to all ones, by the process's pid (10, and 20 beside it).
-    const auto key = [](uint64_t high, uint64_t low, uint8_t mode) { return object(high << 32 | low, mode); };
-    struct {
-        const char *title;
-        HXRegionFacts first, second; // of process 10 and of process 20
-        bool shared;
-        bool both64bit = true;
-    } cases[] = {
-        {"shared", object(7), object(7), true},
-        {"different objects", object(7), object(8), false},
-        {"the upper half counts", object(7), key(1, 7, SM_SHARED), false},
-        {"copied on write", cowDirty, cowDirty, false},
-        {"copied on write by one only", cowDirty, cowClean, false},
-        {"not yet copied", cowClean, cowClean, true},
-        {"a key that looks like the other's copy", cowDirty, key(10, 7, SM_SHARED), true},
-        {"no object", object(0), object(0), false},
-        {"all ones", object(UINT64_MAX), object(UINT64_MAX), false},
-        {"all ones after the turn", key(0xFFFFFFFF ^ 10, 0xFFFFFFFF, SM_COW),
-         key(0xFFFFFFFF ^ 20, 0xFFFFFFFF, SM_COW), false},
-        {"text and data", text, data, false},
-        {"text", text, text, true},
-        {"data and no image", data, object(7), true},
-        {"the shared cache goes by address", cache, cacheOtherObject, true},
-        {"two places of the shared cache", cache, cacheElsewhere, false},
-        {"the shared cache knows no segments", cache, textInCache, true},
-        {"the shared cache of 32 and 64 bits", cache, cache, false, false},
-    };
-    for (const auto &test : cases) {
-        const auto &first = add(10, {test.first});
-        const auto &second = add(20, {test.second}, test.both64bit);
-        gather();
-        EXPECT_EQ(objectOf(first) == objectOf(second), test.shared) << test.title;
+    for (const HXCase &each : HXReadCases("keys.txt")) {
+        const auto answer = [&](const std::string &regions) {
+            const size_t slash = regions.find('/');
+            const auto &first = add(10, {regions.substr(0, slash)});
+            const auto &second = add(20, {regions.substr(slash + 1)}, each.title.starts_with("64-bit"));
+            gather();
+            return objectOf(first) == objectOf(second) ? "one" : "two";
+        };
+        EXPECT_EQ(HXAnswered(each.input, answer), each.input) << each.title;
     }
     // Two regions of one process with no identifier to go by never share.
-    const auto &alone = add(10, {object(0), object(0), object(UINT64_MAX), object(UINT64_MAX)});
+    const std::string nameless = "0+4000 d4000", allOnes = nameless + " #ffffffffffffffff";
+    const auto &alone = add(10, {nameless, nameless, allOnes, allOnes});
     EXPECT_EQ(gather().memoryObjects().size(), 4u);
     EXPECT_EQ(objectOf(alone, 1)->sizes().dirty, 0u);
-    EXPECT_EQ(objectOf(alone, 2)->sizes().dirty, kPage);
+    EXPECT_EQ(objectOf(alone, 2)->sizes().dirty, 0x4000u);
 }
 
 TEST_F(HXHeftTest, OwnersAndViewsFollowTheSwitches) {
-    HXRegionFacts owned = object(7);
-    owned.owned = true;
+    const std::string owned = "0+4000 d4000 #7 owned", shared = "0+4000 d4000 #8";
     for (const bool breakDown : {true, false})
         for (const bool disabled : {true, false}) {
             HXHeftSwitches::setBreakDownPhysHeft(breakDown);
             HXHeftSwitches::setSharingAnalysisDisabled(disabled);
-            const auto &first = add(10, {owned, object(8), object(8)});
-            const auto &second = add(20, {owned, object(8)});
+            const auto &first = add(10, {owned, shared, shared});
+            const auto &second = add(20, {owned, shared});
             gather();
             EXPECT_EQ(objectOf(first)->ownerPid(), breakDown ? 20 : -1); // the later one
             EXPECT_EQ(objectOf(second, 1)->processMemoryRegions().size(), disabled ? 0u : 3u);
         }
 }
 
+// As two memory graphs of one process have: it is one member of a group, whichever of them comes first.
+TEST_F(HXHeftTest, RecordsOfOnePidAreOneMember) {
+    add(10, {"0+4000 #1", "0+4000 #2"});
+    add(20, {"0+4000 #1", "0+4000 #2", "0+4000 #3", "0+4000 #4"});
+    add(10, {"0+4000 #2", "0+4000 #3", "0+4000 #5"});
+    const HXHeftSharingData sharing = gather()._sharingData();
+    std::string groups;
+    for (const HXProcessGroup &group : sharing.groups) {
+        for (const HXRegionOwner *process : group.processes())
+            groups += std::to_string(process->pid()) + " ";
+        groups += "x" + std::to_string(sharing.objectsOfGroup(group).size()) + "\n";
+    }
+    EXPECT_EQ(groups, "10 20 x3\n20 x1\n10 x1\n");
+    EXPECT_EQ(sharing.groupsOfProcess(10)->size(), 2u);
+}
+
 TEST_F(HXHeftTest, AnInterruptLeavesOutWhatHasNotBegun) {
     HXHeft *heft = nullptr;
     HXHeft::ProcessList targets;
-    auto started = std::make_unique<HXMadeUpProcess>(30, "started", std::vector{object(1)});
+    auto started = std::make_unique<HXMadeUpProcess>(30, "started", std::vector<std::string>{"0+4000 #1"});
     started->whenGathered = [&] { heft->cancel(); };
-    targets.push_back(std::make_unique<HXMadeUpProcess>(10, "late", std::vector{object(2)}));
+    targets.push_back(std::make_unique<HXMadeUpProcess>(10, "late", std::vector<std::string>{"0+4000 #2"}));
     targets.push_back(std::move(started));
     HXHeft analysis(std::move(targets));
     heft = &analysis;
@@ -132,7 +110,7 @@ TEST_F(HXHeftTest, AnInterruptLeavesOutWhatHasNotBegun) {
 
 TEST_F(HXHeftTest, AnAnalysisSwitchThatCannotBeReadOrSetIsTold) {
     EXPECT_TRUE(HXHeftSwitches::breakDownPhysHeft());
-    struct : HXBarePlatform {
+    struct : HXMadeUpMachine {
         int32_t sysctlbyname(const char *, void *, size_t *, const void *, size_t) override {
             errno = EPERM;
             return -1;

@@ -48,37 +48,6 @@ std::vector<HXRangeListNode> nodesOf(const HXRangeList &list) {
 }
 } // namespace
 
-TEST(HXRangeListTest, MergesRunsThatShareOrTouchPages) {
-    constexpr uint64_t page = 4096;
-    using Runs = std::vector<HXRangeListNode>; // location and length, then dirty, swapped and clean
-    struct {
-        const char *title;
-        Runs runs, merged;
-    } cases[] = {
-        {"touching runs add", {{{0, page}, {page}}, {{page, page}, {page}}}, {{{0, 2 * page}, {2 * page}}}},
-        {"one page twice counts once", {{{0, page}, {page}}, {{0, page}, {page}}}, {{{0, page}, {page}}}},
-        {"two parts of one page", {{{0, 100}, {page}}, {{200, 100}, {page}}}, {{{0, 300}, {page}}}},
-        {"a page between keeps runs apart",
-         {{{2 * page, page}, {1}}, {{0, page}, {2}}, {{4 * page, 1}, {3}}},
-         {{{0, page}, {2}}, {{2 * page, page}, {1}}, {{4 * page, 1}, {3}}}},
-        {"absorbing measures overlap against the new run alone",
-         {{{0, page}, {page}}, {{2 * page, page}, {page}}, {{0, 3 * page}, {3 * page}}},
-         {{{0, 3 * page}, {3 * page}}}},
-        {"each amount merges by itself",
-         {{{0, 2 * page}, {page, 0, page}}, {{page, 2 * page}, {page, 0, 2 * page}}},
-         {{{0, 3 * page}, {page, 0, 2 * page}}}},
-        {"offsets beyond 4 GiB, and an end beyond the last page",
-         {{{1ULL << 32, page}, {page}}, {{0, page}, {page}}, {{UINT64_MAX - page, 2 * page}, {1}}},
-         {{{0, page}, {page}}, {{1ULL << 32, page}, {page}}, {{UINT64_MAX - page, 2 * page}, {1}}}},
-    };
-    for (const auto &test : cases) {
-        HXRangeList list;
-        for (const HXRangeListNode &run : test.runs)
-            list.addRange(run, page, run);
-        EXPECT_EQ(nodesOf(list), test.merged) << test.title;
-    }
-}
-
 TEST(HXRangeListTest, AgreesWithALinkedListOnRandomRuns) {
     std::mt19937_64 random(20240501);
     const auto below = [&](uint64_t limit) { return random() % limit; };

@@ -1,13 +1,13 @@
 #include "output/HXOutputFormatterJSON.h"
 
-#include "support/HXBarePlatform.h"
+#include "support/HXMadeUpMachine.h"
 
 #include <cerrno>
 #include <filesystem>
 #include <gtest/gtest.h>
 
 TEST(HXOutputFormatterJSONTest, SaysWhenNothingCanBeWritten) {
-    const HXBarePlatform platform;
+    const HXMadeUpMachine platform;
     EXPECT_EQ(HXOutputFormatterJSON::withPath("/no such directory/file"), nullptr);
     EXPECT_EQ(errno, ENOENT);
     if (!std::filesystem::exists("/dev/full")) GTEST_SKIP() << "no /dev/full";

@@ -1,57 +1,34 @@
 #include "output/HXOutputFormatterText.h"
 
-#include "support/HXBarePlatform.h"
 #include "support/HXBuilders.h"
+#include "support/HXCaseFile.h"
+#include "support/HXMadeUpMachine.h"
 #include "support/HXRun.h"
 
 #include <gtest/gtest.h>
-#include <sstream>
 
 TEST(HXOutputFormatterTextTest, WritesSizesInTheChosenFormat) {
-    const HXBarePlatform platform;
-    struct {
-        uint64_t size;
-        const char *texts[3]; // by HXSummaryFormat
-    } cases[] = {
-        {0, {"0 B", "0 B", "0 pages"}},
-        {9999, {"9999 B", "9999 B", "1 pages"}},
-        {10000, {"10000 B", "10 KB", "1 pages"}},
-        {16384, {"16384 B", "16 KB", "1 pages"}},
-        {16385, {"16385 B", "16 KB", "2 pages"}},
-        {10239487, {"10239487 B", "9999 KB", "625 pages"}}, // 9999.499 KB
-        {10239488, {"10239488 B", "10 MB", "625 pages"}},   // 9999.5 KB would need five digits
-        {uint64_t{1} << 40, {"1099511627776 B", "1024 GB", "67108864 pages"}},
+    const HXMadeUpMachine platform;
+    const std::string rows = HXReadCases("text-report.txt")[0].input;
+    const auto answer = [](const std::string &size) {
+        std::string texts;
+        for (const int32_t format : {HXFormatBytes, HXFormatFormatted, HXFormatPages}) {
+            HXOutputFormatterText formatter(format, 0, "Dirty");
+            (void)printedBy([&] { formatter.printProcessHeader(HXMadeUpProcess(1, "p")); });
+            texts += (texts.empty() ? "" : ", ") + formatter.formattedStringForSize(std::stoull(size));
+        }
+        return texts;
     };
-    for (const int32_t format : {HXFormatBytes, HXFormatFormatted, HXFormatPages}) {
-        HXOutputFormatterText formatter(format, 0, "Dirty");
-        (void)printedBy([&] { formatter.printProcessHeader(HXMadeUpProcess(1, "p")); });
-        for (const auto &test : cases)
-            EXPECT_EQ(formatter.formattedStringForSize(test.size), test.texts[format]);
-    }
+    EXPECT_EQ(HXAnswered(rows, answer), rows);
 }
 
 TEST(HXOutputFormatterTextTest, SortsRowsByEveryColumn) {
-    // "d" and "e" tie in all but clean; "a" is dirty by its swapped bytes.
-    const std::string machine =
-        "host  self_region_heft=0\ntag  tag=200  name=a\ntag  tag=201  name=B\ntag  tag=202  name=c\n"
-        "tag  tag=203  name=d\ntag  tag=204  name=e\nprocess  pid=5  name=p\n" +
-        region(5, 0x100000, 0x100000, "tag=202  object_id=1  resident=13  dirtied=10  reusable=1") +
-        region(5, 0x200000, 0x100000, "tag=204  object_id=2  resident=15  dirtied=10  reusable=2") +
-        region(5, 0x300000, 0x100000, "tag=203  object_id=3  resident=14  dirtied=10  reusable=2") +
-        region(5, 0x400000, 0x100000, "tag=200  object_id=4  resident=1  dirtied=1  swapped=40  wired=1") +
-        region(5, 0x500000, 0x100000,
-               "tag=201  object_id=5  resident=27  dirtied=14  reusable=6  swapped=3") +
-        region(5, 0x600000, 0x4000, "tag=201") + region(5, 0x700000, 0x4000, "tag=203") +
-        region(5, 0x704000, 0x4000, "tag=203") + region(5, 0x800000, 0x4000, "tag=202");
-    const char *cases[][2] = {{"dirty", "aBedc"},       {"swapped", "aBcde"}, {"clean", "Becda"},
-                              {"reclaimable", "Bdeca"}, {"wired", "aBcde"},   {"regions", "dBcae"},
-                              {"category", "Bacde"}};
-    for (const auto &[column, expected] : cases) {
-        std::istringstream lines(run(machine, {"5", "--sort", column}).out);
+    const HXCase sorting = HXReadCases("text-report.txt")[1];
+    for (const auto &[column, expected] : sorting.expected) {
         std::string order;
-        for (std::string line; std::getline(lines, line);)
+        for (const std::string &line : HXLinesOf(run(sorting.input, {"5", "--sort", column}).out))
             if (line.size() > 5 && line.rfind("    ") == line.size() - 5) order += line.back();
-        EXPECT_EQ(order, expected) << column; // ties by name
+        EXPECT_EQ(order + "\n", expected) << column;
     }
 }
 

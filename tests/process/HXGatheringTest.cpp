@@ -16,38 +16,19 @@
 
 namespace {
 
-struct Amount {
-    const char *title;
-    uint64_t amount;
-};
-void tell(std::ostream &text, std::initializer_list<Amount> amounts) {
-    for (const Amount &each : amounts)
-        if (each.amount != 0) text << ' ' << each.title << each.amount;
-}
-
 std::string told(const HXMemoryRegion &region) {
     std::ostringstream line;
     line << std::hex;
     region.start() == kNoAddress ? line << "nowhere" : line << region.start();
-    line << '+' << region.size() << ' ' << region.fullName();
-    tell(line, {{"d", region.dirtySize()},
-                {"s", region.swappedSize()},
-                {"c", region.cleanNonSpecSize()},
-                {"r", region.reclaimableSize()}});
+    HXSizes sizes = region.sizes();
+    sizes.wired = 0; // all of it or none
+    line << '+' << region.size() << ' ' << region.fullName() << told(sizes);
     if (region.wired()) line << " wired";
     if (region.ownedExclusivelyByParentProcess()) line << " owned";
     if (region.inSharedCache()) line << (region.unusedSharedCacheRegion() ? " unused" : " cache");
-    tell(line, {{"#", region.object_id()}, {"@", region.offset()}});
-    if (region.subrangeList() == nullptr) return line.str() + "\n";
-    const char *separator = " | ";
-    for (const auto &[location, run] : region.subrangeList()->nodes()) {
-        line << std::exchange(separator, ", ") << location << '+' << run.length;
-        tell(line, {{"d", run.dirty},
-                    {"s", run.swapped},
-                    {"c", run.clean},
-                    {"r", run.reclaimable},
-                    {"w", run.wired}});
-    }
+    if (region.object_id() != 0) line << " #" << region.object_id();
+    if (region.offset() != 0) line << " @" << region.offset();
+    if (region.subrangeList() != nullptr) line << " | " << told(*region.subrangeList());
     return line.str() + "\n";
 }
 

@@ -1,5 +1,6 @@
 #include "process/HXImageEnumerator.h"
 #include "process/HXImageStringCache.h"
+#include "support/HXCaseFile.h"
 
 #include <gtest/gtest.h>
 #include <thread>
@@ -10,43 +11,29 @@ TEST(HXImageTest, LookupsOnlyMoveForward) {
         images[i].setStart(i == 0 ? 0x1000 : 0x2000 + i * 0x1000);
         images[i].setSize(0x1000);
     }
-    constexpr int none = -1;
-    struct {
-        const char *title;
-        std::vector<std::array<uint64_t, 2>> ranges;
-        std::vector<int> found;
-    } cases[] = {
-        {"inside, between, ending inside, and never back",
-         {{0x1800, 0x1900}, {0x2000, 0x3000}, {0x2800, 0x3800}, {0x1800, 0x1900}},
-         {0, none, 1, none}},
-        {"an image answers every range it touches", {{0x1000, 0x1001}, {0x1fff, 0x3000}}, {0, 0}},
-        {"a range around images finds the first", {{0, 0x10000}, {0x2000, 0x10000}}, {0, 1}},
-        {"touching is not overlapping", {{0, 0x1000}, {0x2000, 0x2001}}, {none, none}},
-        {"adjoining images", {{0x3800, 0x4800}, {0x4000, 0x4800}, {0x5000, 0x6000}}, {1, 2, none}},
-    };
-    for (const auto &test : cases) {
+    const auto answer = [&](const std::string &ranges) {
+        std::string found;
         HXImageEnumerator enumerator(images);
-        for (size_t i = 0; i < test.ranges.size(); i++) {
-            const HXImage *image = enumerator.nextImageForStart(test.ranges[i][0], test.ranges[i][1]);
-            EXPECT_EQ(image == nullptr ? none : image - images.data(), test.found[i]) << test.title << i;
+        for (const std::string &range : HXWordsOf(ranges)) {
+            const uint64_t start = std::stoull(range, nullptr, 16);
+            const uint64_t end = std::stoull(range.substr(range.find('-') + 1), nullptr, 16);
+            const HXImage *const image = enumerator.nextImageForStart(start, end);
+            found += image ? std::to_string(image - images.data()) : "-";
         }
-    }
+        return found;
+    };
+    const std::string rows = HXReadCases("images.txt")[0].input;
+    EXPECT_EQ(HXAnswered(rows, answer), rows);
 }
 
 TEST(HXImageTest, NamesTellSegments) {
-    struct {
-        const char *name;
-        HXSegment segment;
-    } cases[] = {
-        {"__TEXT", HXSegmentText},       {"__TEXT_EXEC", HXSegmentText}, {"__LINKEDIT", HXSegmentLinkedit},
-        {"__DATA_CONST", HXSegmentData}, {"__", HXSegmentData},          {"unknown", HXSegmentUnset},
-        {"_TEXT", HXSegmentUnset},       {"", HXSegmentUnset},
-    };
-    for (const auto &test : cases) {
+    const auto answer = [](const std::string &name) {
         HXImage image;
-        image.setName(HXString::intern(test.name));
-        EXPECT_EQ(image.segment(), test.segment) << test.name;
-    }
+        image.setName(HXString::intern(name));
+        return std::to_string(image.segment());
+    };
+    const std::string rows = HXReadCases("images.txt")[1].input;
+    EXPECT_EQ(HXAnswered(rows, answer), rows);
 }
 
 TEST(HXImageTest, CachedStringsAreTheSameInEveryThread) {

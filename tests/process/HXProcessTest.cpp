@@ -1,15 +1,17 @@
 #include "process/HXProcessSnapshot.h"
 #include "process/HXUserProcess.h"
-#include "support/HXBarePlatform.h"
 #include "support/HXBuilders.h"
+#include "support/HXCaseFile.h"
+#include "support/HXMadeUpMachine.h"
 #include "support/HXRun.h"
 
+#include <algorithm>
 #include <cstring>
 #include <gtest/gtest.h>
 
 namespace {
 // Answers the argument area of every process with given bytes.
-class ArgumentAreas : public HXBarePlatform {
+class ArgumentAreas : public HXMadeUpMachine {
   public:
     std::optional<uint32_t> argMax = 64;
     std::optional<std::string> area;
@@ -27,46 +29,29 @@ class ArgumentAreas : public HXBarePlatform {
     }
 };
 
-proc_bsdinfo record(const std::string &name, const std::string &comm) {
+std::string nameOf(ArgumentAreas &platform, const std::vector<std::string> &words) {
+    platform.area.reset();
+    if (words[0] == "empty") platform.area = "";
+    if (words[0] != "-" && words[0] != "empty") {
+        const uint32_t count = static_cast<uint32_t>(std::stoul(words[0]));
+        platform.area = std::string(reinterpret_cast<const char *>(&count), sizeof count) + words[1];
+        std::replace(platform.area->begin(), platform.area->end(), '|', '\0');
+    }
     proc_bsdinfo info{};
     info.pbi_pid = 123;
-    std::memcpy(info.pbi_name, name.data(), name.size());
-    std::memcpy(info.pbi_comm, comm.data(), comm.size());
-    return info;
+    std::memcpy(info.pbi_name, words[2].data(), words[2].size());
+    std::memcpy(info.pbi_comm, words[3].data(), words[3].size());
+    return HXProcess::_nameForBsdInfo(info);
 }
 } // namespace
 
 TEST(HXProcessTest, IsNamedAfterItsExecutableOrItsRecord) {
-    using namespace std::string_literals;
     ArgumentAreas platform;
-    struct {
-        std::optional<std::string> area;
-        std::string name, comm;
-        std::string expected;
-    } cases[] = {
-        {"\1\0\0\0/usr/libexec/tool\0arg\0"s, "n", "c", "tool"},
-        {"\2\1\0\0/usr/bin/many\0"s, "n", "c", "many"}, // 258 arguments: three bytes before the path
-        {"\1\0\0\0\0\0/bin/late\0"s, "n", "c", "late"}, // more zeros before the path
-        {"\1\0\0\0/usr/bin/dir/\0"s, "n", "c", "dir"},  // trailing slashes are ignored
-        {"\1\0\0\0/\0"s, "n", "c", "/"},
-        {"\1\0\0\0/bin/cut"s, "n", "c", "cu"}, // the last byte becomes the zero
-        {"\1\0\0\0\0\0\0\0"s, "n", "c", "n"},  // no path at all
-        {"\1\0\0\0"s, "n", "c", "n"},
-        {""s, "n", "c", "n"},
-        {std::nullopt, "process name", "command", "process name"},
-        {std::nullopt, "", "command", "command"},
-        {std::nullopt, "", "", "Unknown"},
-        {std::nullopt, "", "0123456789abcdef", "0123456789abcdef"},
-        {std::nullopt, "0123456789abcdef0123456789abcdef", "c", "0123456789abcdef0123456789abcdef"},
-    };
-    for (const auto &test : cases) {
-        platform.area = test.area;
-        EXPECT_EQ(HXProcess::_nameForBsdInfo(record(test.name, test.comm)), test.expected);
-    }
-    platform.area = "\1\0\0\0/usr/libexec/tool\0"s;
+    const std::string rows = HXReadCases("names.txt")[0].input;
+    EXPECT_EQ(HXAnswered(rows, [&](const auto &row) { return nameOf(platform, HXWordsOf(row)); }), rows);
     for (const auto argMax : {std::optional<uint32_t>(), std::optional<uint32_t>(0)}) {
         platform.argMax = argMax;
-        EXPECT_EQ(HXProcess::_nameForBsdInfo(record("n", "c")), "n");
+        EXPECT_EQ(nameOf(platform, {"1", "/usr/libexec/tool|", "n", "c"}), "n");
     }
 }
 
@@ -125,7 +110,7 @@ TEST(HXProcessTest, SearchesForTheLastMappingBelowTheSharedRegion) {
 }
 
 TEST(HXProcessTest, DirtyFlagsAndLayoutsAreTold) {
-    const HXBarePlatform platform;
+    const HXMadeUpMachine platform;
     HXUserProcess process;
     EXPECT_EQ(process.idleExitStatus(), HXIdleExitUnknown);
     for (uint32_t flags = 0; flags < 12; flags++) {

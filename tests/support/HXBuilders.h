@@ -8,66 +8,36 @@
 #include <functional>
 #include <memory>
 #include <string>
-#include <utility>
+#include <vector>
 
-// The facts of a region, to be named one by one: HXRegionFacts{.object = 7, .size = 4096}.
-struct HXRegionFacts {
-    uint64_t object = 0;
-    uint64_t start = 0x1000;
-    uint64_t size = 0;
-    uint64_t offset = 0;
-    uint64_t dirty = 0;
-    uint64_t swapped = 0;
-    uint64_t clean = 0;
-    uint64_t reclaimable = 0;
-    uint8_t shareMode = SM_SHARED;
-    uint32_t tag = 0;
-    HXSegment segment = HXSegmentNoImage;
-    const char *name = "memory";
-    const char *detail = nullptr;
-    bool wired = false;
-    bool sharedCache = false;
-    bool unused = false;
-    bool owned = false;
-};
-inline HXMemoryRegion makeRegion(const HXRegionFacts &facts) {
-    HXMemoryRegion region;
-    region.setObject_id(facts.object);
-    region.setStart(facts.start);
-    region.setSize(facts.size);
-    region.setOffset(facts.offset);
-    region.setDirtySize(facts.dirty);
-    region.setSwappedSize(facts.swapped);
-    region.setCleanNonSpecSize(facts.clean);
-    region.setReclaimableSize(facts.reclaimable);
-    region.setShare_mode(facts.shareMode);
-    region.setUser_tag(facts.tag);
-    region.setSegment(facts.segment);
-    region.setName(std::string_view(facts.name));
-    if (facts.detail != nullptr) region.setDetailedName(std::string_view(facts.detail));
-    region.setWired(facts.wired);
-    region.setInSharedCache(facts.sharedCache);
-    region.setUnusedSharedCacheRegion(facts.unused);
-    region.setOwnedExclusivelyByParentProcess(facts.owned);
-    return region;
-}
+// ---- The notation of case files: amounts, runs of pages and regions; all numbers are hexadecimal ----
+
+// dDIRTY sSWAPPED cCLEAN rRECLAIMABLE wWIRED with a blank before each, those that are 0 left out.
+std::string told(const HXSizes &sizes);
+// Each run LOCATION+LENGTH and its amounts; a comma between two.
+std::string told(const HXRangeList &runs);
+std::vector<HXRangeListNode> runsOf(const std::string &text);
+
+// A region, in any order: START+SIZE ("nowhere" for none), amounts, what it is (see kRegionWords), #OBJECT,
+// @OFFSET, tag=TAG, name=NAME, detail=DETAIL, and after a bar its page runs. Shared memory that no image
+// covers, unless it says so.
+HXMemoryRegion makeRegion(const std::string &text);
 
 class HXMadeUpProcess : public HXProcess {
   public:
-    HXMadeUpProcess(int32_t pid, const std::string &name, const std::vector<HXRegionFacts> &regions = {}) {
+    HXMadeUpProcess(int32_t pid, const std::string &name, const std::vector<std::string> &regions = {}) {
         setPid(pid);
         setName(name);
         setDisplayString(name + " [" + std::to_string(pid) + "]");
         setPageSize(16384);
         setIs64bit(true);
-        for (const HXRegionFacts &facts : regions)
-            _found.push_back(makeRegion(facts));
+        for (const std::string &region : regions)
+            _found.push_back(makeRegion(region));
     }
     void gatherData() override {
         if (whenGathered) whenGathered();
         _memoryRegions = std::move(_found);
     }
-    void addError(const std::string &text) { _errors.push_back(text); }
 
     std::function<void()> whenGathered;
 

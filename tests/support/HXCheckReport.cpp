@@ -103,7 +103,7 @@ std::vector<Section> readReport(const std::string &text) {
         } else if (line.starts_with("Shared with ")) {
             for (std::sregex_iterator each(line.begin(), line.end(), other), end; each != end; each++)
                 others += (*each)[1].str() + (*each)[2].str() + " ";
-        } else if (line.ends_with("Regions    Category")) {
+        } else if (!sections.empty() && line.ends_with("Regions    Category")) {
             Rows &rows = sections.back().tables[std::exchange(others, "")];
             while (std::getline(lines, line) && !line.empty())
                 if (line.find("---") == std::string::npos) rows.insert(rowOf(line));

@@ -2,15 +2,11 @@
 
 #include "process/HXProcess.h"
 
+#include <regex>
 #include <stdexcept>
 
 std::unique_ptr<HXMachine> HXLoadMachine(const std::string &records, std::string *reason) {
-    std::string file = "heft-machine 1\n";
-    for (size_t i = 0; i < records.size(); i++) {
-        const bool isTab = records.compare(i, 2, "  ") == 0;
-        file += isTab ? '\t' : records[i];
-        i += isTab;
-    }
+    const std::string file = "heft-machine 1\n" + std::regex_replace(records, std::regex("  "), "\t");
     return HXMachine::loadText(file, reason);
 }
 

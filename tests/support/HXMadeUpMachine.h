@@ -17,9 +17,9 @@ struct HXMadeUpParts {
     std::unique_ptr<const HXMachine> machine;
 };
 
-// The current platform while it lives, loaded by HXLoadMachine.
+// The current platform while it lives, loaded by HXLoadMachine; a machine with nothing on it unless told.
 class HXMadeUpMachine : private HXMadeUpParts, public HXReplayPlatform {
   public:
-    explicit HXMadeUpMachine(const std::string &text);
+    explicit HXMadeUpMachine(const std::string &text = "host  self_region_heft=1\n");
     ~HXMadeUpMachine() override;
 };
