@@ -132,7 +132,7 @@ TEST(HXProgramsTest, ClosedStandardStreamsStayOutOfTheDocument) {
                                     std::string(HEFT_PROGRAM) + " " + std::to_string(getpid())};
     for (const std::string &command : commands)
         for (int closed = 0; closed < 8; closed++) { // a bit for each descriptor
-            std::string line = "exec " + command + " -f bytes -j " + json;
+            std::string line = "exec " + command + " -w -f bytes -j " + json;
             for (int descriptor = 0; descriptor <= 2; descriptor++)
                 if (closed >> descriptor & 1) line += " " + std::to_string(descriptor) + ">&-";
             folder.remove("json");

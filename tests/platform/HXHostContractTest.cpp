@@ -122,7 +122,7 @@ TEST_P(HXHostContract, NoSuchTaskOrProcess) {
     const int32_t gone = vanishing->pid();
     vanishing.reset();
     EXPECT_EQ(mapping(false, port, 0, 19), "(ipc/send) invalid destination port");
-    EXPECT_EQ(host->task_for_pid(host->mach_task_self(), kNobody, &port), KERN_FAILURE);
+    EXPECT_EQ(host->task_for_pid(host->mach_task_self(), kNobody, &port), MACH_SEND_INVALID_DEST);
     for (const bool isTop : {false, true})
         EXPECT_EQ(mapping(isTop, kNoPort, place, 19), "(ipc/send) invalid destination port");
     EXPECT_EQ(pages(kNoPort, place, kPage), "(os/kern) invalid argument");

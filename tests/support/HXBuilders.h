@@ -66,10 +66,11 @@ class HXMadeUpProcess : public HXProcess {
     void gatherData() override {
         if (whenGathered) whenGathered();
         _memoryRegions = std::move(_found);
+        if (whenEnded) whenEnded();
     }
     void addError(const std::string &text) { _errors.push_back(text); }
 
-    std::function<void()> whenGathered;
+    std::function<void()> whenGathered, whenEnded;
 
   private:
     HXMemoryRegionList _found;

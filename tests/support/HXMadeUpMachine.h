@@ -22,4 +22,6 @@ class HXMadeUpMachine : private HXMadeUpParts, public HXReplayPlatform {
   public:
     explicit HXMadeUpMachine(const std::string &text);
     ~HXMadeUpMachine() override;
+
+    using HXMadeUpParts::realServices;
 };

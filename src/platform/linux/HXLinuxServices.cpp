@@ -1,6 +1,7 @@
-// Command line and files; queues and signals are in HXLinuxServicesQueues.cpp.
+// Command line and files; queues and signals have files of their own.
 #include "platform/linux/HXLinuxServices.h"
 
+#include "platform/linux/HXPendingFiles.h"
 #include "platform/linux/procfs/HXProcFile.h"
 
 #include <fcntl.h>
@@ -107,6 +108,7 @@ std::optional<HXPendingFile> HXLinuxServices::createPendingFile(const std::strin
         return std::nullopt;
     }
     descriptor.release(); // the stream's now
+    HXNotePendingFile(file.temporaryPath);
     return file;
 }
 
@@ -116,9 +118,11 @@ bool HXLinuxServices::commitPendingFile(HXPendingFile &file) {
     const bool closed = std::fclose(file.stream) == 0;
     file.stream = nullptr;
     if (closed && failedBefore) errno = EIO;
-    if (closed && !failedBefore && ::rename(file.temporaryPath.c_str(), file.path.c_str()) == 0) return true;
-    removeKeepingError(file.temporaryPath);
-    return false;
+    const bool renamed =
+        closed && !failedBefore && ::rename(file.temporaryPath.c_str(), file.path.c_str()) == 0;
+    if (!renamed) removeKeepingError(file.temporaryPath);
+    HXForgetPendingFile(file.temporaryPath);
+    return renamed;
 }
 
 void HXLinuxServices::discardPendingFile(HXPendingFile &file) {
@@ -126,4 +130,5 @@ void HXLinuxServices::discardPendingFile(HXPendingFile &file) {
     std::fclose(file.stream);
     file.stream = nullptr;
     ::unlink(file.temporaryPath.c_str());
+    HXForgetPendingFile(file.temporaryPath);
 }
