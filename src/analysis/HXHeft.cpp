@@ -2,6 +2,8 @@
 #include "analysis/HXHeft.h"
 
 #include <algorithm>
+#include <cstdio>
+#include <utility>
 
 namespace {
 
@@ -29,14 +31,28 @@ void HXHeft::gatherProcesses() {
     HXServices &services = HXPlatform::current().services();
     const HXDispatchQueue queue = services.dispatch_queue_create(kQueueLabel, QOS_CLASS_UTILITY);
     const std::vector<HXProcess *> ordered = _processesBySortingPidDesc(_processes);
-    services.dispatch_apply(ordered.size(), queue, [&](size_t i) {
-        if (!_earlyExit.load(std::memory_order_relaxed)) ordered[i]->gatherData();
-    });
+    const auto givenUp =
+        services.dispatch_apply(ordered.size(), queue, [ordered, isCancelled = _isCancelled](size_t i) {
+            if (!isCancelled->load(std::memory_order_relaxed)) ordered[i]->gatherData();
+        });
+    for (const size_t i : givenUp)
+        setAside(*ordered[i]);
+}
+
+// What a worker may still be writing lives as long as the program; a record that tells why it is missing
+// takes its place.
+void HXHeft::setAside(const HXProcess &unanswering) {
+    static ProcessList kept;
+    for (auto &process : _processes) {
+        if (process.get() != &unanswering) continue;
+        kept.push_back(std::exchange(process, HXProcess::unansweringProcess(unanswering)));
+        std::fprintf(stderr, "%s\n", process->errors().front().c_str());
+    }
 }
 
 void HXHeft::gatherData() {
     gatherProcesses();
-    if (_earlyExit)
+    if (*_isCancelled)
         HXProcess::_addGlobalError("Heft exited early due to SIGINT and did not finish gathering all data");
     reserveMaps();
     for (const auto &process : _processes)

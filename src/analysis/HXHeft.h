@@ -29,10 +29,11 @@ class HXHeft : public HXHeftSwitches {
     // The targets, in the order given.
     const ProcessList &processes() const { return _processes; }
 
-    // Gathers every process, several at once, then merges and finalises on the calling thread. Once.
+    // Gathers every process, several at once, then merges and finalises on the calling thread. Once. A
+    // process whose gathering is given up has an error instead of regions.
     void gatherData();
     // Ends gathering early: processes not yet started are left out. Any thread.
-    void cancel() { _earlyExit.store(true, std::memory_order_relaxed); }
+    void cancel() { _isCancelled->store(true, std::memory_order_relaxed); }
     // Installs a handler of SIGINT that runs `callback` on a thread of its own; null when standard output is
     // a terminal (the signal then ends the program).
     static std::unique_ptr<HXDispatchSource> installCancelHandler(std::function<void()> callback);
@@ -80,6 +81,7 @@ class HXHeft : public HXHeftSwitches {
     struct Report;
 
     void gatherProcesses();
+    void setAside(const HXProcess &unanswering);
     void reserveMaps();
     ObjectMap &mapForRegion(const HXMemoryRegion &region, const HXProcess &process);
     HXMemoryObject &objectForRegion(const HXMemoryRegion &region, const HXProcess &process);
@@ -102,5 +104,5 @@ class HXHeft : public HXHeftSwitches {
     };
     std::unique_ptr<ObjectMaps> _maps;
     std::vector<HXOutputFormatter *> _outputFormatters;
-    std::atomic<bool> _earlyExit{false};
+    std::shared_ptr<std::atomic<bool>> _isCancelled = std::make_shared<std::atomic<bool>>(false);
 };

@@ -55,11 +55,13 @@ int fileFailed(const std::string &path, int failure) {
     return 1;
 }
 
-// An interrupt from the keyboard ends gathering early, if standard output is no terminal.
+// An interrupt from the keyboard ends gathering early, if standard output is no terminal; a second one does
+// not wait for it.
 void gatherInterruptibly(HXHeft &heft) {
     HXServices &services = HXPlatform::current().services();
-    const auto source = HXHeft::installCancelHandler([&heft] {
+    const auto source = HXHeft::installCancelHandler([&heft, &services] {
         heft.cancel();
+        services.signal(HX_SIGINT, HXSignalDisposition::byDefault);
         fputs("Exiting early due to SIGINT\n", stderr);
     });
     heft.gatherData();

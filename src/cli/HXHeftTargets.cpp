@@ -70,6 +70,7 @@ void HXHeftArgs::addChildren(HXProcessSnapshot &snapshot) {
 }
 
 void HXHeftArgs::addTargets(HXProcessSnapshot &snapshot, HXProcess::Map &processes) const {
+    snapshot.openTasks(_targetPids.pids());
     for (const auto &[pid, name] : _targetPids.entries()) {
         if (auto process = HXProcess::processWithPid(pid, snapshot))
             processes[pid] = std::move(process);

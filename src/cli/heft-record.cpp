@@ -97,10 +97,11 @@ int recordMemgraph(HXPlatform &host, const Words &words, bool vmObjectDirty) {
     const auto info = snapshot.bsdInfoOfPid(*pid);
     if (!info) return fail(words[0], std::strerror(errno));
     return writeFile(host.services(), std::string(words[1]), [&](std::FILE *out) {
-        HXMemgraphRecorder recorder(
-            host, out, [](uint32_t tag) { return HXMemoryRegion::categoryNameForTag(tag).str(); });
         std::string reason;
-        if (recorder.record(*pid, snapshot.nameOf(*info), !vmObjectDirty, &reason)) return true;
+        const auto categoryName = [](uint32_t tag) { return HXMemoryRegion::categoryNameForTag(tag).str(); };
+        if (HXMemgraphRecorder::record(host, out, categoryName,
+                                       {*pid, snapshot.nameOf(*info), !vmObjectDirty}, &reason))
+            return true;
         fail(words[0], reason);
         return false;
     });
@@ -130,7 +131,7 @@ int main(int argc, char *argv[]) {
         return 0;
     }
     static HXLinuxPlatform live;
-    live.prepareProcess();
+    live.prepareProcess("heft-record");
     HXPlatform::setCurrent(&live);
     for (const Capture &capture : kCaptures) {
         if (words[0] != capture.name) continue;
@@ -139,7 +140,7 @@ int main(int argc, char *argv[]) {
         if (words.size() < capture.fewestWords || words.size() > capture.mostWords ||
             words[0].starts_with('-'))
             return failUsage();
-        return capture.record(live, words, hasOption);
+        return live.services().finish(capture.record(live, words, hasOption));
     }
     return failUsage();
 }

@@ -25,7 +25,7 @@ int main(int argc, char *argv[]) {
         return 0;
     }
     static HXLinuxPlatform live;
-    live.prepareProcess();
+    live.prepareProcess("heft-replay");
     std::string reason;
     static std::unique_ptr<HXMachine> machine;
     machine = HXMachine::load(live.services(), argv[1], &reason);
@@ -39,5 +39,5 @@ int main(int argc, char *argv[]) {
     std::vector<char *> arguments = {argv[0]};
     arguments.insert(arguments.end(), argv + 2, argv + argc);
     arguments.push_back(nullptr);
-    return HXHeftMain(argc - 1, arguments.data());
+    return live.services().finish(HXHeftMain(argc - 1, arguments.data()));
 }

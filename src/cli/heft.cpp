@@ -5,7 +5,7 @@
 
 int main(int argc, char *argv[]) {
     static HXLinuxPlatform platform;
-    platform.prepareProcess();
+    platform.prepareProcess("heft");
     HXPlatform::setCurrent(&platform);
-    return HXHeftMain(argc, argv);
+    return platform.services().finish(HXHeftMain(argc, argv));
 }

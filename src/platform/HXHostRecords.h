@@ -20,6 +20,7 @@ inline constexpr kern_return_t KERN_INVALID_ARGUMENT = 4;
 inline constexpr kern_return_t KERN_FAILURE = 5;
 inline constexpr kern_return_t KERN_RESOURCE_SHORTAGE = 6;
 inline constexpr kern_return_t KERN_NO_ACCESS = 8;
+inline constexpr kern_return_t KERN_OPERATION_TIMED_OUT = 49;
 inline constexpr kern_return_t MACH_SEND_INVALID_DEST = 0x10000003;
 
 inline constexpr int32_t VM_PROT_READ = 1;

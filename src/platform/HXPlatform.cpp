@@ -47,6 +47,7 @@ const char *HXPlatform::mach_error_string(kern_return_t error) {
         {KERN_FAILURE, "(os/kern) failure"},
         {KERN_RESOURCE_SHORTAGE, "(os/kern) resource shortage"},
         {KERN_NO_ACCESS, "(os/kern) no access"},
+        {KERN_OPERATION_TIMED_OUT, "(os/kern) operation timed out"},
         {MACH_SEND_INVALID_DEST, "(ipc/send) invalid destination port"},
     };
     for (const auto &entry : texts)

@@ -47,8 +47,8 @@ class HXPlatform {
     virtual mach_port_t mach_task_self() = 0;
 
     // Opens the task of `pid` and stores a port to it, which stays bound to that very process even when its
-    // pid is given to another one later. KERN_FAILURE (5) when the process is gone, is a zombie or may not be
-    // examined.
+    // pid is given to another one later. MACH_SEND_INVALID_DEST when there is no such process any more, or
+    // but a zombie, KERN_FAILURE when it may not be examined.
     virtual kern_return_t task_for_pid(mach_port_t self, int32_t pid, mach_port_t *task) = 0;
 
     // Gives a task port back, and with it all that the platform holds for the task. The port must not be used
@@ -126,6 +126,7 @@ class HXPlatform {
     virtual int32_t proc_regionfilename(int32_t pid, uint64_t address, char *buffer,
                                         uint32_t bufferBytes) = 0;
 
+    // The number of the running process among those of the host; one that no process has when it is none.
     virtual int32_t getpid() = 0;
     virtual uint32_t geteuid() = 0;
 

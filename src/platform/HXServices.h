@@ -89,10 +89,17 @@ class HXServices {
 
     virtual HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) = 0;
 
-    // Calls `work` with 0 … iterations − 1, starting them in that order, several at once; returns when all
-    // have returned.
-    virtual void dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
-                                const std::function<void(size_t)> &work) = 0;
+    // Calls `work` with 0 … iterations − 1, starting them in that order, several at once. Returns when each
+    // has returned or was given up: those whose thread has waited in the kernel for so long, without a moment
+    // of processor time, that it may never come back. Answers the ones given up, in ascending order. They go
+    // on when the kernel lets them, maybe after this has returned: whatever `work` touches must be owned by
+    // it or live as long as the program, which must end with `finish`.
+    virtual std::vector<size_t> dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
+                                               std::function<void(size_t)> work) = 0;
+
+    // What main returns: `status`. Does not return when an iteration was given up: the program then ends
+    // here, standard output written, before the objects that it may still use are destroyed.
+    virtual int finish(int status) = 0;
 
     // A source of events for a signal, not yet running; null when there can be none. From here until `signal`
     // sets the disposition anew the signal reaches no other thread.
@@ -103,7 +110,8 @@ class HXServices {
     // No handler runs after this has returned.
     virtual void dispatch_source_cancel(HXDispatchSource &source) = 0;
 
-    // Sets a signal's disposition. A signal that came between `dispatch_source_cancel` and this call is not
-    // lost.
+    // Sets a signal's disposition, and lets it reach the calling thread. A signal that came between
+    // `dispatch_source_cancel` and this call is not lost. By default it ends the program, after what is
+    // temporary of pending files has been removed; a source's handler can have the next one do so.
     virtual void signal(int signal, HXSignalDisposition disposition) = 0;
 };

@@ -52,7 +52,7 @@ class HXKernelProcess : public HXProcess {
                                   const SiteNames &names);
 
   protected:
-    bool _populateTask() override { return true; }
+    bool _populateTask(HXProcessSnapshot *) override { return true; }
     bool _isAlive() const override { return true; }
 
   private:

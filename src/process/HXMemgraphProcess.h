@@ -19,7 +19,7 @@ class HXMemgraphProcess : public HXUserProcess {
     void enumerateRegions(const HXRegionCallback &callback) override;
 
   protected:
-    bool _populateTask() override { return true; }
+    bool _populateTask(HXProcessSnapshot *) override { return true; }
     bool _isAlive() const override { return false; }
     uint32_t _gatherPageSize() override { return _graph->vmPageSize(); }
     bool _hostHasSharedRegion() const override { return _graph->hasSharedRegion(); }

@@ -56,10 +56,22 @@ std::unique_ptr<HXProcess> HXProcess::processWithPid(int32_t pid, HXProcessSnaps
     return info ? processWithBsdInfo(*info, snapshot) : nullptr;
 }
 
+std::unique_ptr<HXProcess> HXProcess::unansweringProcess(const HXProcess &process) {
+    auto record = std::make_unique<HXProcess>();
+    record->setPid(process.pid());
+    record->setName(process.name());
+    record->setDisplayString(process.displayString());
+    record->setPageSize(process.pageSize());
+    record->setIs64bit(process.is64bit());
+    record->setHiddenFromDisplay(process.hiddenFromDisplay());
+    record->_errors.push_back(record->displayString() + ": not answering");
+    return record;
+}
+
 bool HXProcess::initWithBsdInfo(const proc_bsdinfo &info, HXProcessSnapshot *snapshot) {
     setPid(info.pbi_pid);
     _is64bit = (info.pbi_flags & PROC_FLAG_LP64) != 0;
-    if (!_populateTask()) return false;
+    if (!_populateTask(snapshot)) return false;
     _name = snapshot ? snapshot->nameOf(info) : _nameForBsdInfoCommName(info);
     _displayString = _name + " [" + std::to_string(pid()) + "]";
     setPageSize(_gatherPageSize());

@@ -36,6 +36,10 @@ class HXProcess : public HXRegionOwner {
     // The same by pid; null also when there is no such process.
     static std::unique_ptr<HXProcess> processWithPid(int32_t pid, HXProcessSnapshot &snapshot);
 
+    // A record of the same process with nothing but an error: it does not answer. Reads only what gathering
+    // does not write.
+    static std::unique_ptr<HXProcess> unansweringProcess(const HXProcess &process);
+
     // Construction from process information: takes the task, the name and the page size. Without a snapshot
     // the name is the one in the record. False when the record cannot be; it must then be dropped.
     virtual bool initWithBsdInfo(const proc_bsdinfo &info, HXProcessSnapshot *snapshot);
@@ -84,7 +88,7 @@ class HXProcess : public HXRegionOwner {
   protected:
     // Hooks of construction and gathering.
     virtual uint32_t _gatherPageSize();
-    virtual bool _populateTask() { return false; }
+    virtual bool _populateTask(HXProcessSnapshot *) { return false; }
     virtual bool _isAlive() const { return false; }
 
     HXMemoryRegionList _memoryRegions;

@@ -85,12 +85,42 @@ const std::string &HXProcessSnapshot::nameOf(const proc_bsdinfo &info) {
     return name->second;
 }
 
+void HXProcessSnapshot::openTasks(const std::vector<int32_t> &pids) {
+    const auto openings = std::make_shared<std::vector<Opening>>();
+    for (size_t i = 0; i < pids.size(); i++)
+        openings->push_back({HXTaskPort(_host), KERN_FAILURE});
+    HXServices &services = _host.services();
+    const HXDispatchQueue queue = services.dispatch_queue_create("org.heft.opentasks", QOS_CLASS_UTILITY);
+    const auto givenUp = services.dispatch_apply(pids.size(), queue, [pids, openings](size_t i) {
+        Opening &opening = (*openings)[i];
+        opening.error = opening.task.open(pids[i]);
+    });
+    for (size_t i = 0; i < pids.size(); i++) {
+        const bool isGivenUp = std::binary_search(givenUp.begin(), givenUp.end(), i);
+        _opened.insert_or_assign(pids[i], isGivenUp ? Opening{HXTaskPort(_host), KERN_OPERATION_TIMED_OUT}
+                                                    : std::move((*openings)[i]));
+    }
+}
+
+kern_return_t HXProcessSnapshot::takeTask(int32_t pid, HXTaskPort *task) {
+    if (!_opened.contains(pid)) openTasks({pid});
+    Opening opening = std::move(_opened.extract(pid).mapped());
+    *task = std::move(opening.task);
+    return opening.error;
+}
+
 // Adds every process that the description means; whether there was one.
 bool HXProcessSnapshot::matchDescription(const std::string &description, HXPidDescriptions &result) {
     const std::optional<int32_t> number = leadingInteger(description);
+    // To read a name is to ask its process. Where a process has the number, only those whose record says so
+    // are taken to be called by it.
+    const bool isPid = number && description == std::to_string(*number) && _positions.contains(*number);
+    const auto mayBeNamed = [&](const proc_bsdinfo &info) {
+        return !isPid || description == HXProcess::_nameForBsdInfoCommName(info);
+    };
     bool matched = false;
     for (const proc_bsdinfo &info : _records) {
-        if (description == nameOf(info)) {
+        if (mayBeNamed(info) && description == nameOf(info)) {
             result.set(info.pbi_pid, description);
             matched = true;
         } else if (number == info.pbi_pid) {
@@ -136,6 +166,11 @@ std::optional<std::vector<int32_t>> HXProcessSnapshot::childPidsForPids(const st
 std::optional<HXProcess::Map>
 HXProcessSnapshot::allProcessesExcludingPids(const std::set<int32_t> &excluded) {
     if (!listAllBsdInfo()) return std::nullopt;
+    std::vector<int32_t> pids;
+    for (const proc_bsdinfo &info : _records)
+        if (!excluded.contains(info.pbi_pid) && !(info.pbi_flags & PROC_FLAG_SYSTEM))
+            pids.push_back(info.pbi_pid);
+    openTasks(pids);
     HXProcess::Map result;
     for (const proc_bsdinfo &info : _records) {
         if (excluded.contains(info.pbi_pid)) continue;

@@ -1,6 +1,7 @@
 // The machine's processes as one run sees them.
 #pragma once
 
+#include "platform/HXHostGuards.h"
 #include "platform/HXPlatform.h"
 #include "process/HXProcess.h"
 
@@ -47,6 +48,12 @@ class HXProcessSnapshot {
     // HXProcess::_nameForBsdInfo. Valid as long as the snapshot.
     const std::string &nameOf(const proc_bsdinfo &info);
 
+    // Opens tasks, several at once, for `takeTask`.
+    void openTasks(const std::vector<int32_t> &pids);
+    // Hands over the task of a process, opened now if not before; or answers the error of `task_for_pid`,
+    // KERN_OPERATION_TIMED_OUT when opening was given up.
+    kern_return_t takeTask(int32_t pid, HXTaskPort *task);
+
     // A record of every listed process whose pid is not in `excluded`; none when the list cannot be read. A
     // process that cannot be opened is left out.
     std::optional<HXProcess::Map> allProcessesExcludingPids(const std::set<int32_t> &excluded);
@@ -62,9 +69,15 @@ class HXProcessSnapshot {
     bool readList();
     bool matchDescription(const std::string &description, HXPidDescriptions &result);
 
+    struct Opening {
+        HXTaskPort task;
+        kern_return_t error;
+    };
+
     HXPlatform &_host;
     std::optional<bool> _isListed; // none until somebody asks
     std::vector<proc_bsdinfo> _records;
     std::unordered_map<int32_t, size_t> _positions; // of pids in _records
     std::unordered_map<int32_t, std::string> _names;
+    std::unordered_map<int32_t, Opening> _opened; // and not taken yet
 };

@@ -3,6 +3,7 @@
 
 #include "platform/HXPlatform.h"
 #include "process/HXImageStringCache.h"
+#include "process/HXProcessSnapshot.h"
 
 #include <algorithm>
 
@@ -15,10 +16,11 @@ bool HXUserProcess::initWithBsdInfo(const proc_bsdinfo &info, HXProcessSnapshot 
     return true;
 }
 
-bool HXUserProcess::_populateTask() {
+bool HXUserProcess::_populateTask(HXProcessSnapshot *snapshot) {
     HXPlatform &platform = HXPlatform::current();
-    const kern_return_t error = _task.open(pid());
+    const kern_return_t error = snapshot ? snapshot->takeTask(pid(), &_task) : _task.open(pid());
     if (error == KERN_SUCCESS) return true;
+    if (error == MACH_SEND_INVALID_DEST) return false; // ended meanwhile: no failure of anybody
     platform.mach_error("task_for_pid", error);
     _addGlobalError("task_for_pid [" + std::to_string(pid()) + "] " + platform.mach_error_string(error));
     return false;

@@ -46,7 +46,7 @@ class HXUserProcess : public HXProcess {
     void _processMachVMError(kern_return_t error, kern_return_t expected);
 
   protected:
-    bool _populateTask() override;
+    bool _populateTask(HXProcessSnapshot *snapshot) override;
     bool _isAlive() const override { return true; }
     // Whether the process's host has a shared region at all.
     virtual bool _hostHasSharedRegion() const;

@@ -3,6 +3,7 @@
 #include "platform/HXRegionTags.h"
 #include "platform/capture/HXFixedText.h"
 #include "platform/capture/HXMachineFormat.h"
+#include "record/HXAnswer.h"
 #include "record/HXLedger.h"
 #include "record/HXProcessRecorder.h"
 #include "record/HXRegionHeftSetting.h"
@@ -37,20 +38,33 @@ bool HXMachineRecorder::record(const std::vector<int32_t> &pids) {
     recordHost(setting.found());
     if (!write(_writer.written()) || !write(kernel)) return false;
 
-    HXProcessRecorder process(_host, _facts, setting, _anonymize ? &_anonymizer : nullptr);
+    const auto newRecorder = [&] {
+        return std::make_shared<HXProcessRecorder>(_host, _facts, setting,
+                                                   _anonymize ? &_anonymizer : nullptr);
+    };
+    auto process = newRecorder();
+    std::set<uint32_t> tags;
     const int32_t self = _host.getpid();
     for (const int32_t pid : pids.empty() ? _listed.value_or(std::vector<int32_t>()) : pids) {
         if (pid == self) continue;
         const bool listed = !_listed || std::binary_search(_sorted.begin(), _sorted.end(), pid);
-        if (!process.record(pid, listed)) {
-            std::fprintf(stderr, "heft-record: %d is left out: %s\n", pid, process.problem().c_str());
+        const auto isWhole = std::make_shared<bool>(false);
+        const bool isAnswered = HXIsAnswered(
+            _host.services(), [process, isWhole, pid, listed] { *isWhole = process->record(pid, listed); });
+        if (!isAnswered || !*isWhole) {
+            const char *problem = isAnswered ? process->problem().c_str() : kNotAnswering;
+            std::fprintf(stderr, "heft-record: %d is left out: %s\n", pid, problem);
+            if (isAnswered) continue;
+            process->abandon();
+            process = newRecorder();
             continue;
         }
-        if (!write(process.head()) || !write(process.body())) return false;
+        if (!write(process->head()) || !write(process->body())) return false;
+        tags.insert(process->tags().begin(), process->tags().end());
         _processCount++;
     }
     _writer.clear();
-    recordTags(process.tags());
+    recordTags(tags);
     return write(_writer.written()) && std::fflush(_out) == 0;
 }
 

@@ -20,8 +20,8 @@ class HXMachineRecorder {
     HXMachineRecorder(HXPlatform &host, std::FILE *out, bool anonymize);
 
     // Records the host and the processes of `pids`, or all but the recording one. Processes that cannot be
-    // recorded (they vanished meanwhile) are left out and said so on standard error; the kernel's own memory
-    // is recorded with pid 0. False with errno set when writing failed.
+    // recorded (they vanished meanwhile, or do not answer) are left out and said so on standard error; the
+    // kernel's own memory is recorded with pid 0. False with errno set when writing failed.
     bool record(const std::vector<int32_t> &pids);
 
     size_t processCount() const { return _processCount; }

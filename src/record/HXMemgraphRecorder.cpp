@@ -3,19 +3,20 @@
 #include "platform/HXRegionTags.h"
 #include "platform/capture/HXMemgraphFormat.h"
 #include "platform/capture/HXRegionFields.h"
+#include "record/HXAnswer.h"
 #include "record/HXLedger.h"
 #include "record/HXRegionHeftSetting.h"
 
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <memory>
 #include <span>
 
 using namespace HXMemgraphFormat;
 
 namespace {
 
-constexpr size_t kFlushBytes = 1 << 16;
 // No process maps memory from here to the small area at the end of the address space: the page tables, which
 // have no address, are put into the first gap.
 constexpr uint64_t kPageTablePlace = uint64_t{1} << 63;
@@ -28,62 +29,61 @@ constexpr uint32_t kPageTableTag = HXHostTagLastNamed;
 
 } // namespace
 
-HXMemgraphRecorder::HXMemgraphRecorder(HXPlatform &host, std::FILE *out, CategoryName categoryName)
-    : _host(host), _task(host), _out(out), _categoryName(std::move(categoryName)),
-      _pageSize(host.vm_kernel_page_size()), _writer(format) {}
+HXMemgraphRecorder::HXMemgraphRecorder(HXPlatform &host, CategoryName categoryName)
+    : _host(host), _task(host), _categoryName(std::move(categoryName)), _pageSize(host.vm_kernel_page_size()),
+      _writer(format) {}
 
-bool HXMemgraphRecorder::record(int32_t pid, const std::string &name, bool breakDownPhysHeft,
-                                std::string *reason) {
-    proc_bsdinfo info{};
-    if (_host.proc_pidinfo(pid, PROC_PIDTBSDINFO, 0, &info, sizeof info) != int32_t{sizeof info}) {
-        *reason = std::strerror(errno);
-        return false;
-    }
-    if ((info.pbi_flags & PROC_FLAG_SYSTEM) != 0) {
-        *reason = "the kernel has no memory graph";
-        return false;
-    }
-    const kern_return_t error = _task.open(pid);
-    if (error != KERN_SUCCESS) {
-        *reason = _host.mach_error_string(error);
-        return false;
-    }
-    HXRegionHeftSetting setting(_host);
-    setting.set(breakDownPhysHeft ? 1 : 0);
-    const auto ledger = breakDownPhysHeft ? HXLedgerNames(_host) : std::nullopt;
-    const int64_t balance = ledger ? HXPageTableBalance(_host, *ledger, pid).value_or(0) : 0;
-    const auto pageTableBytes = static_cast<uint64_t>(std::max<int64_t>(balance, 0));
-    recordProcess(pid, info, name, breakDownPhysHeft);
-    gatherImages();
-    const bool whole = recordRegions(pid, pageTableBytes, reason);
-    _task.close();
-    if (!whole) return false;
-    if (flush() && std::fflush(_out) == 0) return true;
+bool HXMemgraphRecorder::record(HXPlatform &host, std::FILE *out, CategoryName categoryName,
+                                const Subject &subject, std::string *reason) {
+    const auto recorder = std::make_shared<HXMemgraphRecorder>(host, std::move(categoryName));
+    const bool isAnswered = HXIsAnswered(host.services(), [recorder, subject] { recorder->gather(subject); });
+    *reason = isAnswered ? recorder->_reason : kNotAnswering;
+    if (!reason->empty()) return false;
+    const std::string &text = recorder->_writer.written();
+    if (std::fwrite(text.data(), 1, text.size(), out) == text.size() && std::fflush(out) == 0) return true;
     *reason = std::strerror(errno);
     return false;
 }
 
-bool HXMemgraphRecorder::flush() {
-    const std::string &text = _writer.written();
-    const bool written = std::fwrite(text.data(), 1, text.size(), _out) == text.size();
-    _writer.clear();
-    return written;
+// Fills the writer, or says why it cannot.
+void HXMemgraphRecorder::gather(const Subject &subject) {
+    const int32_t pid = subject.pid;
+    proc_bsdinfo info{};
+    if (_host.proc_pidinfo(pid, PROC_PIDTBSDINFO, 0, &info, sizeof info) != int32_t{sizeof info}) {
+        _reason = std::strerror(errno);
+        return;
+    }
+    if ((info.pbi_flags & PROC_FLAG_SYSTEM) != 0) {
+        _reason = "the kernel has no memory graph";
+        return;
+    }
+    if (const kern_return_t error = _task.open(pid); error != KERN_SUCCESS) {
+        _reason = _host.mach_error_string(error);
+        return;
+    }
+    HXRegionHeftSetting setting(_host);
+    setting.set(subject.breakDownPhysHeft ? 1 : 0);
+    const auto ledger = subject.breakDownPhysHeft ? HXLedgerNames(_host) : std::nullopt;
+    const int64_t balance = ledger ? HXPageTableBalance(_host, *ledger, pid).value_or(0) : 0;
+    recordProcess(subject, info);
+    gatherImages();
+    recordRegions(pid, static_cast<uint64_t>(std::max<int64_t>(balance, 0)));
+    _task.close();
 }
 
-void HXMemgraphRecorder::recordProcess(int32_t pid, const proc_bsdinfo &info, const std::string &name,
-                                       bool breakDownPhysHeft) {
+void HXMemgraphRecorder::recordProcess(const Subject &subject, const proc_bsdinfo &info) {
     rusage_info_v4 usage{};
-    if (_host.proc_pid_rusage(pid, RUSAGE_INFO_V4, &usage) != 0) usage = {};
+    if (_host.proc_pid_rusage(subject.pid, RUSAGE_INFO_V4, &usage) != 0) usage = {};
     // Leaf mappings are written, also where a shared region lies: nothing is left to be cut.
     const GXProcessFacts facts{.pageSize = _pageSize,
                                .physicalHeft = usage.ri_phys_heft,
                                .physicalHeftPeak = usage.ri_lifetime_max_phys_heft,
                                .is64bit = (info.pbi_flags & PROC_FLAG_LP64) != 0,
-                               .showsPhysHeft = breakDownPhysHeft,
+                               .showsPhysHeft = subject.breakDownPhysHeft,
                                .hasSharedRegion = false};
     _writer.header();
-    _writer.begin(processRecord, pid);
-    _writer.text(Process::name, name);
+    _writer.begin(processRecord, subject.pid);
+    _writer.text(Process::name, subject.name);
     _writer.text(Process::description, _host.hostDescription());
     _writer.numbers(&facts);
     _writer.end();
@@ -119,7 +119,7 @@ const HXMemgraphRecorder::Segment *HXMemgraphRecorder::nextSegment(uint64_t star
     return nullptr;
 }
 
-bool HXMemgraphRecorder::recordRegions(int32_t pid, uint64_t pageTableBytes, std::string *reason) {
+void HXMemgraphRecorder::recordRegions(int32_t pid, uint64_t pageTableBytes) {
     bool needsPageTable = pageTableBytes > 0;
     // Puts the page tables between `from` and `to` if they are still to be put and fit.
     const auto putPageTable = [&](uint64_t from, uint64_t to) {
@@ -138,19 +138,15 @@ bool HXMemgraphRecorder::recordRegions(int32_t pid, uint64_t pageTableBytes, std
             error == KERN_SUCCESS && (size == 0 || address > UINT64_MAX - size || address + size <= asked);
         if (error == KERN_INVALID_ADDRESS || isLast) {
             putPageTable(asked, UINT64_MAX);
-            return true;
+            return;
         }
         if (error != KERN_SUCCESS) {
-            *reason = _host.mach_error_string(error);
-            return false;
+            _reason = _host.mach_error_string(error);
+            return;
         }
         if (words <= VM_REGION_SUBMAP_INFO_V1_COUNT_64) info.object_id_full = info.object_id;
         putPageTable(asked, address);
         recordRegion(pid, address, size, info);
-        if (_writer.written().size() > kFlushBytes && !flush()) {
-            *reason = std::strerror(errno);
-            return false;
-        }
     }
 }
 

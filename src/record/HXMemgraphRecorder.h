@@ -18,13 +18,21 @@ class HXMemgraphRecorder {
     // What the program calls memory of a user tag.
     using CategoryName = std::function<std::string(uint32_t tag)>;
 
-    // Writes to `out`, which stays the caller's.
-    HXMemgraphRecorder(HXPlatform &host, std::FILE *out, CategoryName categoryName);
+    // What to record: the process `pid` under `name`, with the heft breakdown or else with what the memory
+    // objects see.
+    struct Subject {
+        int32_t pid;
+        std::string name;
+        bool breakDownPhysHeft;
+    };
+    // Writes the graph to `out`, which stays the caller's. The setting "vm.self_region_heft" is changed
+    // meanwhile. False with the reason when the process cannot be examined, vanishes meanwhile or does not
+    // answer, or when writing fails.
+    static bool record(HXPlatform &host, std::FILE *out, CategoryName categoryName, const Subject &subject,
+                       std::string *reason);
 
-    // Records the process `pid` under `name`: with the heft breakdown, or else with what the memory objects
-    // see. The setting "vm.self_region_heft" is changed meanwhile. False with the reason when the process
-    // cannot be examined, vanishes meanwhile, or writing fails.
-    bool record(int32_t pid, const std::string &name, bool breakDownPhysHeft, std::string *reason);
+    // For `record`.
+    HXMemgraphRecorder(HXPlatform &host, CategoryName categoryName);
 
   private:
     struct Segment {
@@ -34,21 +42,19 @@ class HXMemgraphRecorder {
         std::string path;
     };
 
-    void recordProcess(int32_t pid, const proc_bsdinfo &info, const std::string &name,
-                       bool breakDownPhysHeft);
+    void gather(const Subject &subject);
+    void recordProcess(const Subject &subject, const proc_bsdinfo &info);
     void gatherImages();
-    bool recordRegions(int32_t pid, uint64_t pageTableBytes, std::string *reason);
+    void recordRegions(int32_t pid, uint64_t pageTableBytes);
     void recordRegion(int32_t pid, uint64_t address, uint64_t size, const vm_region_submap_info_64 &info);
     void recordPageTable(uint64_t address, uint64_t size);
     void writeRegion(const GXVMRegion &region);
     const Segment *nextSegment(uint64_t start, uint64_t end);
     uint32_t graphObjectID(uint64_t fullID, uint32_t preferred);
     uint32_t freeObjectID(uint32_t preferred);
-    bool flush();
 
     HXPlatform &_host;
     HXTaskPort _task; // of the process being recorded
-    std::FILE *const _out;
     const CategoryName _categoryName;
     const uint32_t _pageSize;
     std::vector<Segment> _segments; // by start
@@ -56,4 +62,5 @@ class HXMemgraphRecorder {
     std::unordered_map<uint64_t, uint32_t> _objectIDs; // of the graph, by full id
     std::unordered_set<uint32_t> _takenObjectIDs;
     HXCaptureWriter _writer;
+    std::string _reason; // why there is no graph; empty when there is one
 };

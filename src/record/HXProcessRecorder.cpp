@@ -49,8 +49,8 @@ class RunsText {
 
 HXProcessRecorder::HXProcessRecorder(HXPlatform &host, const HXMachineHost &facts,
                                      HXRegionHeftSetting &setting, HXAnonymizer *anonymizer)
-    : _host(host), _facts(facts), _task(host), _setting(setting), _anonymizer(anonymizer),
-      _argumentArea(facts.argMax), _head(format), _body(format) {}
+    : _host(host), _facts(facts), _task(host), _setting(setting), _hasSetting(setting.found()),
+      _anonymizer(anonymizer), _argumentArea(facts.argMax), _head(format), _body(format) {}
 
 bool HXProcessRecorder::fail(const std::string &problem) {
     _problem = problem;
@@ -58,11 +58,17 @@ bool HXProcessRecorder::fail(const std::string &problem) {
 }
 
 std::string HXProcessRecorder::pathName(std::string_view path) {
+    if (_isAbandoned) return {};
     return _anonymizer ? _anonymizer->path(path) : std::string(path);
 }
 
 std::string HXProcessRecorder::programName(std::string_view name) {
+    if (_isAbandoned) return {};
     return _anonymizer ? _anonymizer->programName(name) : std::string(name);
+}
+
+void HXProcessRecorder::setSetting(int32_t value) {
+    if (!_isAbandoned) _setting.set(value);
 }
 
 bool HXProcessRecorder::record(int32_t pid, bool listed) {
@@ -137,8 +143,8 @@ void HXProcessRecorder::recordFigures(int32_t pid) {
 // Lets the host read what both values of the setting need before the first region is recorded: it may read a
 // process anew for the other value, and regions of two readings do not fit together.
 void HXProcessRecorder::readAtOnce() {
-    if (!_setting.found()) return;
-    _setting.set(0);
+    if (!_hasSetting) return;
+    setSetting(0);
     vm_region_submap_info_64 info{};
     uint64_t address = 0, size = 0;
     uint32_t depth = UINT32_MAX, words = VM_REGION_SUBMAP_INFO_COUNT_64;
@@ -147,7 +153,7 @@ void HXProcessRecorder::readAtOnce() {
 
 bool HXProcessRecorder::recordMemory(int32_t pid) {
     readAtOnce();
-    _setting.set(1);
+    setSetting(1);
     recordOwned(pid);
     recordImages(pid);
     if (_facts.sharedRegion) recordTops(pid);
@@ -159,7 +165,7 @@ bool HXProcessRecorder::recordRegions(int32_t pid) {
         vm_region_submap_info_64 info{};
         uint32_t depth = UINT32_MAX, words = VM_REGION_SUBMAP_INFO_COUNT_64;
         const uint64_t asked = address;
-        _setting.set(1);
+        setSetting(1);
         const kern_return_t error =
             _host.mach_vm_region_recurse(_task.get(), &address, &size, &depth, &info, &words);
         if (error == KERN_INVALID_ADDRESS) return true;
@@ -218,14 +224,14 @@ void HXProcessRecorder::recordPages(int32_t pid, uint64_t address, uint64_t size
 // with `heftOnly` set where it is not there.
 std::optional<uint32_t> HXProcessRecorder::pagesDirtiedOfObject(uint64_t address, uint64_t size,
                                                                 HXMachineRegionTraits *traits) {
-    if (!_setting.found()) return std::nullopt;
-    _setting.set(0);
+    if (!_hasSetting) return std::nullopt;
+    setSetting(0);
     vm_region_submap_info_64 object{};
     uint64_t start = address, length = 0;
     uint32_t depth = UINT32_MAX, words = VM_REGION_SUBMAP_INFO_COUNT_64;
     const kern_return_t error =
         _host.mach_vm_region_recurse(_task.get(), &start, &length, &depth, &object, &words);
-    _setting.set(1);
+    setSetting(1);
     if (error == KERN_SUCCESS && start == address && length == size) return object.pages_dirtied;
     traits->heftOnly = error == KERN_INVALID_ADDRESS || (error == KERN_SUCCESS && start >= address + size);
     return std::nullopt;

@@ -7,6 +7,7 @@
 #include "record/HXAnonymizer.h"
 #include "record/HXRegionHeftSetting.h"
 
+#include <atomic>
 #include <optional>
 #include <set>
 #include <string>
@@ -14,7 +15,8 @@
 
 class HXProcessRecorder {
   public:
-    // `facts` are those of the host. `anonymizer` may be null: names are then kept.
+    // `facts` are those of the host. `anonymizer` may be null: names are then kept. Neither it nor `setting`
+    // is used after `abandon`.
     HXProcessRecorder(HXPlatform &host, const HXMachineHost &facts, HXRegionHeftSetting &setting,
                       HXAnonymizer *anonymizer);
 
@@ -22,6 +24,10 @@ class HXProcessRecorder {
     // `head` (the process) and `body` (its memory), to be written in that order. False, with why in
     // `problem`, when the process vanished meanwhile or its memory could not be walked to the end.
     bool record(int32_t pid, bool listed);
+
+    // For a `record` that does not return: when it goes on after all, on its thread, it leaves alone what
+    // others use. Its answers mean nothing then.
+    void abandon() { _isAbandoned = true; }
 
     const std::string &head() const { return _head.written(); }
     const std::string &body() const { return _body.written(); }
@@ -54,11 +60,13 @@ class HXProcessRecorder {
     std::optional<std::vector<std::string>> pageRuns(uint64_t address, uint64_t size);
     std::string pathName(std::string_view path);
     std::string programName(std::string_view name);
+    void setSetting(int32_t value);
 
     HXPlatform &_host;
-    const HXMachineHost &_facts;
+    const HXMachineHost _facts;
     HXTaskPort _task; // of the process being recorded
     HXRegionHeftSetting &_setting;
+    const bool _hasSetting;
     HXAnonymizer *const _anonymizer;
     std::vector<char> _argumentArea;
 
@@ -66,4 +74,5 @@ class HXProcessRecorder {
     HXCaptureWriter _head, _body;
     std::set<uint32_t> _tags;
     std::string _problem;
+    std::atomic<bool> _isAbandoned = false;
 };

@@ -4,6 +4,7 @@
 #include "support/HXMadeUpMachine.h"
 
 #include <cerrno>
+#include <future>
 #include <gtest/gtest.h>
 
 namespace {
@@ -35,10 +36,10 @@ class HXHeftTest : public testing::Test {
     }
 
     HXMadeUpMachine _platform;
+    std::unique_ptr<HXHeft> _heft;
 
   private:
     HXHeft::ProcessList _targets;
-    std::unique_ptr<HXHeft> _heft;
 };
 } // namespace
 
@@ -92,6 +93,7 @@ TEST_F(HXHeftTest, RecordsOfOnePidAreOneMember) {
 }
 
 TEST_F(HXHeftTest, AnInterruptLeavesOutWhatHasNotBegun) {
+    _platform.realServices.setWorkerCount(1);
     HXHeft *heft = nullptr;
     HXHeft::ProcessList targets;
     auto started = std::make_unique<HXMadeUpProcess>(30, "started", std::vector<std::string>{"0+4000 #1"});
@@ -106,6 +108,25 @@ TEST_F(HXHeftTest, AnInterruptLeavesOutWhatHasNotBegun) {
     EXPECT_EQ(
         HXProcess::globalErrors(),
         std::vector<std::string>{"Heft exited early due to SIGINT and did not finish gathering all data"});
+}
+
+TEST_F(HXHeftTest, AProcessThatDoesNotAnswerIsToldBesideTheOthers) {
+    _platform.realServices.setAnswerTime(std::chrono::milliseconds(100));
+    static std::promise<void> answer, written; // of a worker that outlives the analysis
+    auto &stuck = add(10, {"0+4000 #1"});
+    stuck.setHiddenFromDisplay(true);
+    stuck.whenGathered = [] { answer.get_future().wait(); };
+    stuck.whenEnded = [] { written.set_value(); };
+    add(20, {"0+4000 #2"});
+    const HXPrinted printed = printedBy([&] { gather(); });
+    const HXProcess &told = *_heft->processes()[0];
+    EXPECT_EQ(told.errors(), std::vector<std::string>{"p [10]: not answering"});
+    EXPECT_EQ(printed.err, "p [10]: not answering\n");
+    EXPECT_TRUE(told.pid() == 10 && told.hiddenFromDisplay() && told.is64bit() && told.pageSize() == 0x4000);
+    EXPECT_EQ(_heft->memoryObjects().size(), 1u);
+    answer.set_value();
+    written.get_future().wait();
+    EXPECT_EQ(told.memoryRegions().size(), 0u);
 }
 
 TEST_F(HXHeftTest, AnAnalysisSwitchThatCannotBeReadOrSetIsTold) {

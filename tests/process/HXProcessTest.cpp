@@ -7,6 +7,7 @@
 
 #include <algorithm>
 #include <cstring>
+#include <future>
 #include <gtest/gtest.h>
 
 namespace {
@@ -78,13 +79,39 @@ TEST(HXProcessTest, AListAndItsNamesAreReadOnceWhenSomebodyAsks) {
 
     HXProcessSnapshot snapshot;
     snapshot.pidsForStringDescriptions({"2"}, nullptr);
-    EXPECT_EQ(machine.names, 3); // a process listed before the pid could be called 2
+    EXPECT_EQ(machine.names, 1) << "a number asks no process for its name";
     EXPECT_EQ(snapshot.pidsForStringDescriptions({"b", "4", "c"}, nullptr)->entries().size(), 3u);
     EXPECT_EQ(snapshot.childPidsForPids({3}), (std::vector<int32_t>{3, 4}));
     EXPECT_EQ(snapshot.allProcessesExcludingPids({2})->size(), 3u);
     EXPECT_EQ(HXProcess::processWithPid(5, snapshot)->name(), "unlisted");
     EXPECT_EQ(machine.lists, 1);
     EXPECT_EQ(machine.names, 6);
+}
+
+TEST(HXProcessTest, OnlyWhatRunsAndCannotBeOpenedIsAnError) {
+    class Opened : public HXMadeUpMachine {
+      public:
+        using HXMadeUpMachine::HXMadeUpMachine;
+        std::promise<void> answer;
+        kern_return_t task_for_pid(mach_port_t self, int32_t pid, mach_port_t *task) override {
+            if (pid == 1) {
+                answer.get_future().wait(); // until the machine is no more
+                return KERN_FAILURE;
+            }
+            return pid == 2 ? MACH_SEND_INVALID_DEST : HXMadeUpMachine::task_for_pid(self, pid, task);
+        }
+    };
+    Opened machine("process  pid=1\nprocess  pid=2\nprocess  pid=3  task_error=5\nprocess  pid=4\n");
+    machine.realServices.setAnswerTime(std::chrono::milliseconds(100));
+    HXProcessSnapshot snapshot;
+    HXProcess::Map processes;
+    const HXPrinted printed =
+        printedBy([&] { processes = *snapshot.allProcessesExcludingPids(std::set<int32_t>()); });
+    EXPECT_TRUE(processes.size() == 1 && processes.contains(4));
+    EXPECT_EQ(HXProcess::globalErrors(),
+              (std::vector<std::string>{"task_for_pid [1] (os/kern) operation timed out",
+                                        "task_for_pid [3] (os/kern) failure"}));
+    EXPECT_EQ(printed.err, "task_for_pid: (os/kern) operation timed out\ntask_for_pid: (os/kern) failure\n");
 }
 
 // A bisection by addresses, down to 16 MiB.

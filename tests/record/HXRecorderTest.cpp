@@ -4,6 +4,7 @@
 #include "support/HXBuilders.h"
 #include "support/HXMadeUpMachine.h"
 
+#include <future>
 #include <gtest/gtest.h>
 
 namespace {
@@ -32,8 +33,8 @@ std::string graphOf(const std::string &records, bool breakDown = true) {
     HXMadeUpMachine host(records);
     std::string reason;
     std::string text = written([&](std::FILE *file) {
-        HXMemgraphRecorder recorder(host, file, [](uint32_t tag) { return "tag " + std::to_string(tag); });
-        recorder.record(5, "worker", breakDown, &reason);
+        const auto categoryName = [](uint32_t tag) { return "tag " + std::to_string(tag); };
+        HXMemgraphRecorder::record(host, file, categoryName, {5, "worker", breakDown}, &reason);
     });
     if (!reason.empty()) return reason;
     const size_t description = text.find("\tdescription=");
@@ -95,6 +96,23 @@ TEST(HXMachineRecorder, LeavesOutItselfAndWhatVanishes) {
     check(zombie, {6, 7}, "7 is left out: no such process", "host\tpid=99\nprocess\tpid=6\n");
     Exiting exiting;
     check(exiting, {5}, "5 is left out: it exited meanwhile", "host\n");
+}
+
+TEST(HXMachineRecorder, LeavesOutWhatDoesNotAnswer) {
+    struct Waiting : HXMadeUpMachine {
+        using HXMadeUpMachine::HXMadeUpMachine;
+        std::promise<void> answer;
+        bool isFirst = true;
+        void mach_port_deallocate(mach_port_t, mach_port_t) override {
+            if (std::exchange(isFirst, false)) answer.get_future().wait(); // until the machine is no more
+        }
+    } host("host\nprocess  pid=5  name=a\nprocess  pid=6  name=b\n");
+    host.realServices.setAnswerTime(std::chrono::milliseconds(100));
+    std::string file;
+    const HXPrinted printed = printedBy([&] { file = recorded(host); });
+    EXPECT_EQ(printed.err, "heft-record: 5 is left out: not answering\n");
+    EXPECT_EQ(file.find("pid=5"), std::string::npos) << file;
+    EXPECT_NE(file.find("pid=6"), std::string::npos) << file;
 }
 
 TEST(HXMachineRecorder, GoesOnWithPagesThatOneRecordCannotHold) {

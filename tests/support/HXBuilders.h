@@ -37,9 +37,10 @@ class HXMadeUpProcess : public HXProcess {
     void gatherData() override {
         if (whenGathered) whenGathered();
         _memoryRegions = std::move(_found);
+        if (whenEnded) whenEnded();
     }
 
-    std::function<void()> whenGathered;
+    std::function<void()> whenGathered, whenEnded;
 
   private:
     HXMemoryRegionList _found;

@@ -22,4 +22,6 @@ class HXMadeUpMachine : private HXMadeUpParts, public HXReplayPlatform {
   public:
     explicit HXMadeUpMachine(const std::string &text = "host  self_region_heft=1\n");
     ~HXMadeUpMachine() override;
+
+    using HXMadeUpParts::realServices;
 };

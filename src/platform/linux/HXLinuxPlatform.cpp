@@ -3,17 +3,20 @@
 
 #include "platform/HXRegionTags.h"
 #include "platform/HXSafeText.h"
+#include "platform/linux/HXTemporaryFiles.h"
 #include "platform/linux/memory/HXTaskFiles.h"
 
 #include <fcntl.h>
 #include <malloc.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/uio.h>
 #include <sys/utsname.h>
 
 #include <bit>
 #include <cerrno>
 #include <cstring>
+#include <new>
 
 namespace {
 
@@ -36,6 +39,18 @@ int32_t copyOut(const Value &value, void *old, size_t *oldBytes) {
     return 0;
 }
 
+const char *programName = "";
+
+// On whichever thread: what others do meanwhile is lost, like all that was not written yet.
+[[noreturn]] void endOutOfMemory() {
+    static char problem[] = ": out of memory\n";
+    const iovec text[] = {{const_cast<char *>(programName), std::strlen(programName)},
+                          {problem, sizeof problem - 1}};
+    [[maybe_unused]] const ssize_t written = ::writev(STDERR_FILENO, text, std::size(text));
+    HXRemoveTemporaryFiles();
+    ::_exit(1);
+}
+
 } // namespace
 
 HXLinuxPlatform::HXLinuxPlatform(const Setting &setting)
@@ -46,7 +61,9 @@ HXLinuxPlatform::HXLinuxPlatform(const Setting &setting)
       _imageHeaders(_fileSystems, _pageSize), _processes(setting.procPath),
       _kernelMemory(setting.procPath, setting.sysPath, _pageSize) {}
 
-void HXLinuxPlatform::prepareProcess() {
+void HXLinuxPlatform::prepareProcess(const char *program) {
+    programName = program;
+    std::set_new_handler(endOutOfMemory);
     for (int descriptor = 0; descriptor <= 2; descriptor++) {
         if (::fcntl(descriptor, F_GETFD) >= 0 || errno != EBADF) continue;
         // The lowest free descriptor is this one.

@@ -31,9 +31,10 @@ class HXLinuxPlatform final : public HXPlatform {
     HXLinuxPlatform() : HXLinuxPlatform(Setting()) {}
     explicit HXLinuxPlatform(const Setting &setting);
 
-    // Readies the running process for examining thousands of others: as many open files as it may have, and
-    // no file of its own on the descriptors of the standard streams, should one be closed. For main.
-    static void prepareProcess();
+    // Readies the running process for examining thousands of others: as many open files as it may have, no
+    // file of its own on the descriptors of the standard streams, should one be closed, and a message of
+    // `program` and status 1 as the end when memory runs out. For main; `program` lives for ever.
+    static void prepareProcess(const char *program);
 
     mach_port_t mach_task_self() override { return kSelfPort; }
     kern_return_t task_for_pid(mach_port_t self, int32_t pid, mach_port_t *task) override;
@@ -60,7 +61,7 @@ class HXLinuxPlatform final : public HXPlatform {
     int32_t proc_pid_rusage(int32_t pid, int32_t flavor, rusage_info_v4 *info) override;
     int32_t proc_get_dirty(int32_t pid, uint32_t *flags) override;
     int32_t proc_regionfilename(int32_t pid, uint64_t address, char *buffer, uint32_t bufferBytes) override;
-    int32_t getpid() override { return ::getpid(); }
+    int32_t getpid() override { return _processes.ownPid(); }
     // "Linux RELEASE, X86-64".
     std::string hostDescription() override;
     uint32_t geteuid() override { return ::geteuid(); }

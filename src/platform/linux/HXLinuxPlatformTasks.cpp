@@ -27,11 +27,19 @@ bool hasAddressSpace(const HXDescriptor &process) {
     return stat && !stat->isZombie() && !stat->isKernelThread();
 }
 
+// Whether that is why a file of the process, or its directory, could not be read.
+bool hasEnded(const HXDescriptor &process) {
+    const auto stat = process ? HXReadStat(process) : std::nullopt;
+    return stat ? stat->isZombie() : errno == ENOENT || errno == ESRCH;
+}
+
 } // namespace
 
 kern_return_t HXLinuxPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_t *task) {
-    HXDescriptor directory = pid > 0 ? _processes.open(pid) : HXDescriptor();
-    if (!directory || !hasAddressSpace(directory)) return KERN_FAILURE;
+    if (pid <= 0) return KERN_FAILURE;
+    HXDescriptor directory = _processes.open(pid);
+    if (!directory || !hasAddressSpace(directory))
+        return hasEnded(directory) ? MACH_SEND_INVALID_DEST : KERN_FAILURE;
     *task = _tasks.add(
         std::make_unique<HXLinuxTask>(pid, _identifiers.numberOfProcess(pid), std::move(directory)));
     return KERN_SUCCESS;

@@ -1,4 +1,4 @@
-// Command line and files; queues and signals are in HXLinuxServicesQueues.cpp.
+// Command line and files; queues and signals have files of their own.
 #include "platform/linux/HXLinuxServices.h"
 
 #include "platform/linux/HXTemporaryFiles.h"

@@ -3,12 +3,16 @@
 
 #include "platform/HXServices.h"
 
+#include <chrono>
 #include <cstddef>
 
 class HXLinuxServices : public HXServices {
   public:
     // How many workers `dispatch_apply` has; 0: one for each usable processor. They are batch-scheduled.
     void setWorkerCount(size_t count) { _workerCount = count; }
+    // How long an iteration of `dispatch_apply` may wait in the kernel before it is given up, at least 100
+    // ms; to within a hundredth.
+    void setAnswerTime(std::chrono::milliseconds time) { _answerTime = time; }
 
     HXOptionScan getopt_long(int argc, char *const argv[], const char *shortOptions,
                              const std::vector<HXLongOption> &options, bool restart) override;
@@ -20,8 +24,9 @@ class HXLinuxServices : public HXServices {
     void discardPendingFile(HXPendingFile &file) override;
     bool isatty(int descriptor) override;
     HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) override;
-    void dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
-                        const std::function<void(size_t)> &work) override;
+    std::vector<size_t> dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
+                                       std::function<void(size_t)> work) override;
+    int finish(int status) override;
     std::unique_ptr<HXDispatchSource> dispatch_source_create(int signal) override;
     void dispatch_source_set_event_handler(HXDispatchSource &source, std::function<void()> handler) override;
     void dispatch_resume(HXDispatchSource &source) override;
@@ -30,4 +35,6 @@ class HXLinuxServices : public HXServices {
 
   private:
     size_t _workerCount = 0;
+    std::chrono::milliseconds _answerTime{10000};
+    bool _hasGivenUp = false;
 };

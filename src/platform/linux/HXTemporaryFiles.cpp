@@ -35,8 +35,7 @@ bool hasFiles() {
 
 // Only what signal-safety(7) allows.
 void removeFilesAndEnd(int signal) {
-    for (const Slot &slot : slots)
-        if (slot.isUsed) ::unlink(slot.path);
+    HXRemoveTemporaryFiles();
     ::signal(signal, SIG_DFL);
     ::raise(signal); // acts on return, which unblocks it
 }
@@ -100,6 +99,11 @@ void HXRemoveTemporaryFile(const std::string &temporaryPath) {
     ::unlink(temporaryPath.c_str());
     forget(temporaryPath);
     errno = kept;
+}
+
+void HXRemoveTemporaryFiles() {
+    for (const Slot &slot : slots)
+        if (slot.isUsed) ::unlink(slot.path);
 }
 
 Handler HXDefaultSignalHandler(int signal) {

@@ -13,6 +13,9 @@ bool HXRenameTemporaryFile(const std::string &temporaryPath, const std::string &
 // Keeps errno.
 void HXRemoveTemporaryFile(const std::string &temporaryPath);
 
+// Removes all of them, for a program that ends in a hurry: safe in a signal handler and without memory.
+void HXRemoveTemporaryFiles();
+
 // What a signal does by default: it ends the program, and while there are temporary files removes them
 // before. For sigaction(2).
 void (*HXDefaultSignalHandler(int signal))(int);

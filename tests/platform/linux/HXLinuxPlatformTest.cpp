@@ -186,8 +186,13 @@ TEST_F(HXLinuxPlatformTest, ProcessesVanishAndRefuse) {
     mach_port_t task = 0;
     kernelThread(2);
     process(3, "zombie", "", 'Z');
-    for (const int32_t pid : {2, 3, 4, 0, -1})
+    EXPECT_EQ(platform.getpid(), -1) << "none of these processes";
+    proc.link("self", "2");
+    EXPECT_EQ(platform.getpid(), 2);
+    for (const int32_t pid : {2, 0, -1})
         EXPECT_EQ(platform.task_for_pid(1, pid, &task), KERN_FAILURE) << pid;
+    for (const int32_t pid : {3, 4})
+        EXPECT_EQ(platform.task_for_pid(1, pid, &task), MACH_SEND_INVALID_DEST) << pid << " has ended";
 
     process(10, "empty", "");
     process(11, "vanishes", kMapping);

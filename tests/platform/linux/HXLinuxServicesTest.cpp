@@ -1,6 +1,7 @@
 // Work queues, signals and the command line's own files on the live host.
 #include "platform/linux/HXLinuxServices.h"
 
+#include "platform/linux/HXLinuxPlatform.h"
 #include "support/HXBuilders.h"
 #include "support/HXTemporaryFolder.h"
 
@@ -14,6 +15,7 @@
 #include <csignal>
 #include <filesystem>
 #include <future>
+#include <new>
 
 namespace {
 
@@ -30,6 +32,35 @@ TEST(HXLinuxDispatch, LoopCallsEachIterationOnce) {
             EXPECT_EQ(count, 1);
         services.dispatch_apply(0, queue, [](size_t) { ADD_FAILURE(); });
     }
+}
+
+// Waits in the kernel while the others' iterations come to an end, or uses the processor for longer than
+// that.
+TEST(HXLinuxDispatch, GivesUpWhatWaitsAlone) {
+    HXLinuxServices services;
+    services.setWorkerCount(2);
+    services.setAnswerTime(std::chrono::milliseconds(100));
+    const auto queue = services.dispatch_queue_create("q", QOS_CLASS_UTILITY);
+    struct Shared {
+        std::promise<void> answer;
+        std::shared_future<void> answered{answer.get_future()};
+        std::atomic<int> calls[8] = {};
+        std::promise<void> lateEnd;
+    };
+    const auto shared = std::make_shared<Shared>();
+    const auto givenUp = services.dispatch_apply(8, queue, [shared](size_t i) {
+        const auto waits = i == 1 || i == 2 || i == 5;
+        if (waits) shared->answered.wait();
+        timespec used{};
+        while (i == 3 && used.tv_sec * 1000 + used.tv_nsec / 1000000 < 150)
+            clock_gettime(CLOCK_THREAD_CPUTIME_ID, &used);
+        if (++shared->calls[i]; i == 2) shared->lateEnd.set_value();
+    });
+    EXPECT_EQ(givenUp, (std::vector<size_t>{1, 2, 5}));
+    for (const size_t i : {0, 3, 4, 6, 7})
+        EXPECT_EQ(shared->calls[i], 1) << i;
+    shared->answer.set_value();
+    shared->lateEnd.get_future().wait(); // a late one finds what it works on
 }
 
 // In a process of its own, for signals are the whole process's.
@@ -68,6 +99,41 @@ TEST(HXLinuxDispatch, SignalsGoToTheSourceThenToTheDisposition) {
         return 2;
     });
     EXPECT_TRUE(WIFSIGNALED(ended) && WTERMSIG(ended) == SIGINT) << ended;
+}
+
+// Both remove what has not got its final name yet.
+TEST(HXLinuxDispatch, ASecondSignalAndLackOfMemoryEndTheProgram) {
+    const HXTemporaryFolder folder;
+    HXLinuxServices services;
+    const int interrupted = statusOf([&] {
+        const auto file = services.createPendingFile(folder / "x");
+        std::promise<void> ready;
+        const auto source = services.dispatch_source_create(SIGINT);
+        services.dispatch_source_set_event_handler(*source, [&] {
+            services.signal(SIGINT, HXSignalDisposition::byDefault);
+            ready.set_value();
+            std::promise<void>().get_future().wait_for(std::chrono::hours(1)); // does not return
+        });
+        services.dispatch_resume(*source);
+        kill(getpid(), SIGINT);
+        ready.get_future().wait();
+        kill(getpid(), SIGINT);
+        pause();
+        return 2;
+    });
+    EXPECT_TRUE(WIFSIGNALED(interrupted) && WTERMSIG(interrupted) == SIGINT) << interrupted;
+    int exhausted = -1;
+    const HXPrinted printed = printedBy([&] {
+        exhausted = statusOf([&] {
+            HXLinuxPlatform::prepareProcess("name");
+            const auto file = services.createPendingFile(folder / "x");
+            services.dispatch_apply(2, {}, [](size_t) { std::get_new_handler()(); });
+            return 2;
+        });
+    });
+    EXPECT_TRUE(WIFEXITED(exhausted) && WEXITSTATUS(exhausted) == 1) << exhausted;
+    EXPECT_TRUE(printed.err.starts_with("name: out of memory\n")) << printed.err;
+    EXPECT_EQ(std::distance(fs::directory_iterator(folder.path()), {}), 0);
 }
 
 // Whatever is no regular file is refused at once, whether or not somebody writes to it.

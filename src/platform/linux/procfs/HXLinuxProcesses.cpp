@@ -158,6 +158,13 @@ HXDescriptor HXLinuxProcesses::open(int32_t pid) {
     return HXOpenAt(directory(), std::to_string(pid).c_str(), O_PATH | O_DIRECTORY);
 }
 
+int32_t HXLinuxProcesses::ownPid() {
+    char buffer[32];
+    const auto link = HXReadLink(directory(), "self", buffer);
+    int32_t pid = 0;
+    return link && HXIsNumber(*link, &pid) ? pid : -1;
+}
+
 std::optional<HXStatRecord> HXLinuxProcesses::readStat(int32_t pid) {
     char buffer[2048]; // 52 numbers and a short name
     const auto text = HXReadOnce(directory(), (std::to_string(pid) + "/stat").c_str(), buffer);

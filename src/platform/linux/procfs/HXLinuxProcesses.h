@@ -23,6 +23,9 @@ class HXLinuxProcesses {
     // The directory of a process; not open with errno set.
     HXDescriptor open(int32_t pid);
 
+    // The number of the running process here, which need not be the one that getpid(2) tells: /proc may be
+    // that of another pid namespace (pid_namespaces(7)). -1 when the process is not in it.
+    int32_t ownPid();
     // As HXPlatform says.
     int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes);
     int32_t proc_pidinfo(int32_t pid, int32_t flavor, void *buffer, uint32_t bufferBytes);

@@ -1,0 +1,123 @@
+#include "platform/linux/HXWorkLoop.h"
+
+#include "platform/linux/procfs/HXProcFile.h"
+#include "platform/linux/procfs/HXProcText.h"
+
+#include <fcntl.h>
+#include <pthread.h>
+#include <sched.h>
+
+#include <algorithm>
+#include <climits>
+#include <system_error>
+
+namespace {
+
+constexpr int kLooks = 100;      // without progress, until an iteration is given up
+constexpr int kPatientLooks = 3; // until another worker joins
+
+// The stat file of the calling thread, by its number in the namespace that /proc is of.
+std::string ownStatPath() {
+    char link[PATH_MAX];
+    const auto thread = HXReadLink(AT_FDCWD, "/proc/thread-self", link);
+    return thread ? "/proc/" + std::string(*thread) + "/stat" : std::string();
+}
+
+// Whether the thread sleeps, for a signal or without. One that may run but gets no processor does not, nor
+// does one that is stopped.
+bool isAsleep(const std::string &statPath) {
+    char buffer[2048]; // 52 numbers and a short name
+    const auto text = HXReadOnce(AT_FDCWD, statPath.c_str(), buffer);
+    const auto stat = text ? HXParseStat(*text) : std::nullopt;
+    return !stat || stat->state == 'S' || stat->state == 'D';
+}
+
+} // namespace
+
+std::vector<size_t> HXWorkLoop::run(size_t iterations, size_t workers, std::chrono::milliseconds answerTime,
+                                    std::function<void(size_t)> work) {
+    const auto loop = std::make_shared<HXWorkLoop>(iterations, std::move(work));
+    std::unique_lock lock(loop->_mutex);
+    for (size_t i = 0; i < std::min(iterations, workers); i++)
+        if (!loop->startWorker()) break;
+    loop->watch(lock, answerTime);
+    lock.unlock(); // no worker starts from here on
+    for (const auto &worker : loop->_workers)
+        worker->isGivenUp ? worker->thread.detach() : worker->thread.join();
+    std::sort(loop->_givenUp.begin(), loop->_givenUp.end());
+    return loop->_givenUp;
+}
+
+// False when no thread may be had: those that run share the work.
+bool HXWorkLoop::startWorker() {
+    Worker &worker = *_workers.emplace_back(std::make_unique<Worker>());
+    try {
+        worker.thread = std::thread([loop = shared_from_this(), &worker] { loop->runWorker(worker); });
+    } catch (const std::system_error &) {
+        _workers.pop_back();
+        return false;
+    }
+    _running++;
+    return true;
+}
+
+void HXWorkLoop::runWorker(Worker &worker) {
+    const sched_param parameter{};
+    ::pthread_setschedparam(::pthread_self(), SCHED_BATCH, &parameter);
+    worker.statPath = ownStatPath();
+    ::pthread_getcpuclockid(::pthread_self(), &worker.clock);
+    std::unique_lock lock(_mutex);
+    while (!worker.isGivenUp && _next < _iterations) {
+        worker.iteration = _next++;
+        lock.unlock();
+        _work(*worker.iteration);
+        lock.lock();
+    }
+    worker.iteration.reset();
+    worker.hasEnded = true;
+    if (!worker.isGivenUp) _running--;
+    if (_running == 0) _ended.notify_all();
+}
+
+void HXWorkLoop::watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds answerTime) {
+    const auto pause = std::max(answerTime / kLooks, std::chrono::milliseconds(1));
+    for (;;) {
+        while (_running > 0)
+            if (_ended.wait_for(lock, pause) == std::cv_status::timeout)
+                for (size_t i = 0; i < _workers.size(); i++)
+                    look(*_workers[i]);
+        if (_next == _iterations || startWorker()) {
+            if (_running == 0) return;
+            continue;
+        }
+        // No thread may be had at all: this one does the work.
+        const size_t iteration = _next++;
+        lock.unlock();
+        _work(iteration);
+        lock.lock();
+    }
+}
+
+void HXWorkLoop::look(Worker &worker) {
+    if (worker.hasEnded || worker.isGivenUp) return;
+    if (!worker.iteration || hasProgressed(worker)) {
+        worker.looksWithoutProgress = 0;
+        return;
+    }
+    worker.looksWithoutProgress++;
+    if (worker.looksWithoutProgress == kPatientLooks && _next < _iterations) startWorker();
+    if (worker.looksWithoutProgress < kLooks) return;
+    worker.isGivenUp = true;
+    _running--;
+    _givenUp.push_back(*worker.iteration);
+}
+
+bool HXWorkLoop::hasProgressed(Worker &worker) {
+    timespec time{};
+    ::clock_gettime(worker.clock, &time);
+    const bool isSame = time.tv_sec == worker.lastTime.tv_sec && time.tv_nsec == worker.lastTime.tv_nsec &&
+                        *worker.iteration == worker.lastIteration;
+    worker.lastTime = time;
+    worker.lastIteration = *worker.iteration;
+    return !isSame || !isAsleep(worker.statPath);
+}

@@ -1,0 +1,60 @@
+// A loop whose iterations run on several threads, each of which may get stuck in the kernel.
+#pragma once
+
+#include <chrono>
+#include <condition_variable>
+#include <cstddef>
+#include <ctime>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+// The calling thread only watches: whatever a process can keep from answering is asked by a worker. One that
+// waits in the kernel is soon joined by another, so that many that wait cost no more time than one; after the
+// answer time it is left to itself. It keeps the loop alive, touches nothing but its iteration and ends after
+// it.
+class HXWorkLoop : public std::enable_shared_from_this<HXWorkLoop> {
+  public:
+    // As HXServices::dispatch_apply says. A thread counts as waiting while it has used no processor time and
+    // sleeps; time is counted by looks at it, so that nobody is given up while the program was stopped.
+    static std::vector<size_t> run(size_t iterations, size_t workers, std::chrono::milliseconds answerTime,
+                                   std::function<void(size_t)> work);
+
+    // For `run`.
+    HXWorkLoop(size_t iterations, std::function<void(size_t)> work)
+        : _iterations(iterations), _work(std::move(work)) {}
+
+  private:
+    // What the watching thread knows of a worker, under the loop's lock.
+    struct Worker {
+        std::thread thread = {};
+        clockid_t clock = 0;                  // of the thread's processor time
+        std::string statPath;                 // of the thread, in /proc
+        std::optional<size_t> iteration = {}; // none: not begun, or ended
+        timespec lastTime = {};
+        size_t lastIteration = 0;
+        int looksWithoutProgress = 0;
+        bool isGivenUp = false;
+        bool hasEnded = false;
+    };
+
+    bool startWorker();
+    void runWorker(Worker &worker);
+    void watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds answerTime);
+    void look(Worker &worker);
+    static bool hasProgressed(Worker &worker);
+
+    const size_t _iterations;
+    const std::function<void(size_t)> _work;
+    std::mutex _mutex;
+    std::condition_variable _ended;
+    // What follows, under the lock.
+    size_t _next = 0;
+    size_t _running = 0; // workers neither ended nor given up
+    std::vector<std::unique_ptr<Worker>> _workers;
+    std::vector<size_t> _givenUp;
+};
