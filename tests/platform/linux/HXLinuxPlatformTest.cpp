@@ -8,6 +8,8 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -121,6 +123,7 @@ TEST_F(HXLinuxPlatformTest, ReadsStatusBehindLongListsOfGroups) {
         {"Groups:\t" + groups + figures + "Threads:\t1\n", 0},
         {"Groups:\t" + groups + figures, -1},
     };
+    process(300, "p", kMapping);
     for (size_t i = 0; i < std::size(cases); i++) {
         proc.write("300/status", cases[i].text);
         rusage_info_v4 usage{};
@@ -129,39 +132,62 @@ TEST_F(HXLinuxPlatformTest, ReadsStatusBehindLongListsOfGroups) {
     }
 }
 
-TEST_F(HXLinuxPlatformTest, NamesProcessesByWhatWasExecuted) {
+TEST_F(HXLinuxPlatformTest, NamesProcessesAsPsDoes) {
     const struct {
         const char *exe;
         const char *comm;
-        std::string arguments;
         std::string expected;
     } cases[] = {
-        {"/usr/bin/sleep", "sleep", "sleep\0100\0"s, "/usr/bin/sleep"},
-        {"/usr/bin/sleep (deleted)", "sleep", "sleep\0"s, "/usr/bin/sleep"},
-        {"/usr/bin/a-rather-long-program", "a-rather-long-p", "x\0"s, "/usr/bin/a-rather-long-program"},
-        {"/usr/bin/python3.11", "tool.py", "/usr/bin/python3\0/opt/tool.py\0-v\0"s, "/opt/tool.py"},
-        {"/usr/bin/perl", "tool", "perl\0-w\0./tool\0x\0"s, "./tool"},
-        {"/usr/bin/python3.11", "python3", "python3\0/opt/tool.py\0"s, "/usr/bin/python3.11"}, // no #! line
-        {"/usr/bin/node", "MainThread", "node\0server.js\0"s, "/usr/bin/node"},
-        {"/usr/bin/x\x1b\"\n", "renamed", "", "/usr/bin/x?'?"},
-        {"/usr/bin/none", "other", std::string(512, '\0'), "/usr/bin/none"}, // 256 arguments and more
+        {"/usr/bin/sleep", "sleep", "/usr/bin/sleep"},
+        {"/usr/bin/sleep (deleted)", "sleep", "/usr/bin/sleep"},
+        {"/usr/bin/a-rather-long-program", "a-rather-long-p", "/usr/bin/a-rather-long-program"},
+        {"/usr/bin/a-rather-long-program (deleted)", "a-rather-long-p", "/usr/bin/a-rather-long-program"},
+        {"/usr/bin/sleeper", "sleep", "/usr/bin/sleep"},
+        {"/usr/bin/python3.11", "a-rather-long-s", "/usr/bin/a-rather-long-s"}, // a script
+        {"/usr/bin/redis-check-rdb", "redis-server", "/usr/bin/redis-server"},  // a link
+        {"/memfd:x (deleted)", "3", "/3"},
+        {"/usr/bin/x", "a\x1b\"\n", "/usr/bin/a?'?"},
+        {"/usr/bin/x", "kworker/0:1", "error 2"}, // the last component would be another name
+        {"/usr/bin/x", "", "error 2"},
     };
     int pid = 1000;
     for (const auto &item : cases) {
         const std::string folder = std::to_string(++pid) + "/";
         process(pid, item.comm, kMapping);
         proc.link(folder + "exe", item.exe);
-        proc.write(folder + "cmdline", item.arguments);
         EXPECT_EQ(nameInArguments(pid), item.expected);
     }
     process(2000, "kthread", "");
     EXPECT_EQ(nameInArguments(2000), "error " + std::to_string(ENOENT));
     EXPECT_EQ(nameInArguments(3000), "error " + std::to_string(ESRCH));
-    // Where the process's memory tells the path that was executed, it decides.
-    EXPECT_EQ(HXExecutedPath({"/usr/bin/python3", "worker", "python3\0-c\0/opt/worker\0"sv, "/opt/worker"}),
-              "/opt/worker");
-    EXPECT_EQ(HXExecutedPath({"/usr/bin/node", "server.js", "node\0server.js\0"sv, "/usr/bin/node"}),
-              "/usr/bin/node");
+}
+
+// The leader of process 10 has ended; thread 12 runs.
+TEST_F(HXLinuxPlatformTest, ReadsProcessesThroughALiveThread) {
+    const auto stat = [](int pid, const char *state, const char *threads, const char *stack) {
+        return std::to_string(pid) + " (worker) " + state + " 7 8 9 0 -1 64 1 2 3 4 5 6 7 8 20 0 " + threads +
+               " 0 4242 1000 200 0 0 0 " + stack + " 0 0\n";
+    };
+    process(10, "worker", "");
+    process(11, "worker", "");
+    process(12, "worker", kMapping);
+    proc.write("10/stat", stat(10, "Z", "3", "0"));
+    proc.write("11/stat", stat(11, "Z", "3", "0"));
+    proc.write("12/stat", stat(12, "S", "3", "4294967040"));
+    proc.link("12/exe", "/bin/worker");
+    for (const char *const thread : {"10/task/10/stat", "10/task/11/stat", "10/task/12/stat"})
+        proc.write(thread, "");
+    proc_bsdinfo long_;
+    ASSERT_EQ(platform.proc_pidinfo(10, 3, 0, &long_, sizeof long_), 136);
+    EXPECT_EQ(long_.pbi_flags, 0u) << "the thread's stack lies low";
+    proc_bsdshortinfo brief;
+    ASSERT_EQ(platform.proc_pidinfo(10, 13, 1, &brief, sizeof brief), 64);
+    EXPECT_EQ(brief.pbsi_status, 0u);
+    EXPECT_EQ(nameInArguments(10), "/bin/worker");
+    EXPECT_EQ(region(open(10)), KERN_SUCCESS);
+    proc.write("12/stat", stat(12, "Z", "3", "0"));
+    mach_port_t task = 0;
+    EXPECT_EQ(platform.task_for_pid(1, 10, &task), KERN_FAILURE) << "all have ended by now";
 }
 
 std::string smaps(const std::string &header, uint64_t rss, uint64_t anonymous, uint64_t dirty) {
@@ -249,6 +275,41 @@ TEST_F(HXLinuxPlatformTest, ProcessesVanishAndRefuse) {
     EXPECT_NE(platform.proc_pid_rusage(11, 4, &usage), 0);
 }
 
+// With fewer descriptors than processes.
+TEST_F(HXLinuxPlatformTest, ReadsMoreProcessesThanItMayOpenFiles) {
+    rlimit before, few;
+    ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &before), 0);
+    constexpr int count = 60;
+    for (int pid = 1; pid <= count; pid++)
+        process(pid, "p", kMapping);
+    // Those that are open already, and ten.
+    few = before;
+    few.rlim_cur = static_cast<rlim_t>(::open("/dev/null", O_RDONLY | O_CLOEXEC)) + 10;
+    setrlimit(RLIMIT_NOFILE, &few);
+    std::vector<mach_port_t> tasks;
+    for (int pid = 1; pid <= count; pid++)
+        tasks.push_back(open(pid));
+    for (size_t i = 0; i < tasks.size() / 2; i++) {
+        address = 0;
+        EXPECT_EQ(region(tasks[i]), KERN_SUCCESS) << i;
+        platform.mach_port_deallocate(1, tasks[i]);
+    }
+    std::vector<HXDescriptor> taken; // none is left
+    while (taken.empty() || taken.back())
+        taken.push_back(HXOpenAt(AT_FDCWD, "/dev/null"));
+    address = 0;
+    mach_port_t refused = 0;
+    EXPECT_EQ(region(tasks[count - 2]), KERN_RESOURCE_SHORTAGE);
+    EXPECT_EQ(platform.task_for_pid(1, 1, &refused), KERN_RESOURCE_SHORTAGE);
+    int32_t pids[count];
+    EXPECT_EQ(platform.proc_listallpids(pids, sizeof pids), -1);
+    taken.clear();
+    setrlimit(RLIMIT_NOFILE, &before);
+    ::close(static_cast<int>(few.rlim_cur) - 10);
+    proc.write("60/stat", "60 (p) S 7 8 9 0 -1 64 1 2 3 4 5 6 7 8 20 0 1 0 4243 1000 200 0 0 0 0 0 0\n");
+    EXPECT_EQ(region(tasks[count - 1]), MACH_SEND_INVALID_DEST) << "another process has the pid now";
+}
+
 TEST_F(HXLinuxPlatformTest, ReadsPageTables) {
     process(10, "p",
             "1000-9000 rw-p 0 fe:01 5 /x\n"
@@ -298,6 +359,40 @@ TEST_F(HXLinuxPlatformTest, LeavesThePagesOfAnotherProgramAlone) {
     }
 }
 
+TEST_F(HXLinuxPlatformTest, TellsWhenMemoryMovedWhileItWasRead) {
+    const std::string anonymous = smaps("10000000-40000000 rw-p 00000000 00:00 0 ", 204800, 204800, 0);
+    const std::string memfd =
+        smaps("50000000-90000000 rw-s 00000000 00:01 5 /memfd:x (deleted)", 102400, 0, 0);
+    const std::string driver = smaps("a0000000-b0000000 rw-s 00000000 00:05 5 /dev/dri/card0", 102400, 0, 0);
+    const struct {
+        std::string memory;
+        uint64_t rssAnon, rssShmem, swap;                      // KiB
+        std::optional<std::pair<uint64_t, uint64_t>> expected; // KiB
+    } cases[] = {
+        {anonymous, 204800, 0, 0, {}},
+        {anonymous, 206800, 0, 0, {}}, // less than 1 %
+        {anonymous, 150000, 0, 60000, std::pair(204800, 210000)},
+        {anonymous, 100000, 0, 0, std::pair(204800, 100000)},
+        {anonymous + memfd, 204800, 102400, 0, {}},
+        {anonymous + memfd, 204800, 204800, 0, std::pair(307200, 409600)},
+        {anonymous + driver, 204800, 0, 0, {}}, // which a driver counts or not
+        {anonymous + driver, 204800, 102400, 0, {}},
+    };
+    int pid = 10;
+    for (const auto &item : cases) {
+        process(++pid, "p", item.memory);
+        proc.write(std::to_string(pid) + "/status", "RssAnon: " + std::to_string(item.rssAnon) +
+                                                        " kB\nRssShmem: " + std::to_string(item.rssShmem) +
+                                                        " kB\nVmSwap: " + std::to_string(item.swap) +
+                                                        " kB\nVmPTE: 4 kB\nVmRSS: 1 kB\nThreads: 1\n");
+        const auto shortfall = platform.walkShortfall(open(pid));
+        ASSERT_EQ(shortfall.has_value(), item.expected.has_value()) << pid;
+        if (!shortfall) continue;
+        EXPECT_EQ(shortfall->regionsSize, item.expected->first * 1024) << pid;
+        EXPECT_EQ(shortfall->countersSize, item.expected->second * 1024) << pid;
+    }
+}
+
 // A page of the test's own, in a made-up process that has the test's page tables.
 alignas(4096) char ownPage[4096] = {1};
 
@@ -323,7 +418,7 @@ TEST_F(HXLinuxPlatformTest, CountsFromPageTablesOnlyWhereTheyTellEnough) {
         {"rw-p 0 00:00 0", "VmSwap: 4 kB\nThreads: 1\n", "0", "0", false},
         {"rw-p 0 00:00 0", "VmRSS: 2000 kB\nThreads: 1\n", "1", "0", false}, // too many pages to find out
     };
-    HXFileSystems fileSystems(HXDeviceNumber(0, 1));
+    HXFileSystems fileSystems(proc.path(), HXDeviceNumber(0, 1));
     HXNamedTags tags;
     proc.write("mountinfo", "1 1 0:53 / /huge rw - hugetlbfs none rw\n");
     proc.link("pagemap", "/proc/self/pagemap");
@@ -382,17 +477,6 @@ TEST_F(HXLinuxPlatformTest, FiguresAndLedger) {
     EXPECT_NE(platform.sysctl(otherNames, 2, &value, &length), 0);
     EXPECT_NE(platform.sysctlbyname("vm.get_owned_vmobjects", nullptr, &length, &task, 4), 0);
     EXPECT_EQ(errno, ENOENT);
-
-    // The figures may stand behind long lists of groups; what is cut has none.
-    std::string groups = "Groups:\t";
-    for (int i = 0; i < 65536; i++)
-        groups += std::to_string(1000000 + i) + " ";
-    for (const std::string end : {"Threads:\t1\n", ""}) {
-        proc.write("10/status", groups + "\nRssAnon:\t    8 kB\nVmPTE:\t    4 kB\n" + end);
-        usage = {};
-        EXPECT_EQ(platform.proc_pid_rusage(10, RUSAGE_INFO_V4, &usage), end.empty() ? -1 : 0);
-        EXPECT_EQ(usage.ri_phys_heft, end.empty() ? 0u : 12288u);
-    }
 }
 
 } // namespace
