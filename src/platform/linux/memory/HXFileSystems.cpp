@@ -83,11 +83,12 @@ bool HXFileSystems::isLocalNow(const HXDescriptor &process, uint32_t device,
     if (!table) return false;
     // After the table: nobody comes from a namespace of his own into one of the machine's root.
     const bool isRoots = isMountedByRoot(process);
-    const auto host = HXReadText(AT_FDCWD, (_procPath + "/1/mountinfo").c_str(), kTableLimit);
+    const HXDescriptor first = HXOpenAt(AT_FDCWD, (_procPath + "/1").c_str(), O_PATH | O_DIRECTORY);
+    const auto host = first ? HXReadText(first, "mountinfo", kTableLimit) : std::nullopt;
     const std::string_view hostTable = host ? std::string_view(*host) : std::string_view();
-    // A file may have been opened in another namespace before.
-    return HXIsLocalMount({*table, isRoots, hostTable}, device, mount) ||
-           HXIsLocalMount({hostTable, true, hostTable}, device, mount);
+    if (HXIsLocalMount({*table, isRoots, hostTable}, device, mount)) return true;
+    // The file may have been opened in another namespace before.
+    return HXIsLocalMount({hostTable, host && isMountedByRoot(first), hostTable}, device, mount);
 }
 
 HXDescriptor HXFileSystems::openLocal(const HXDescriptor &process, const HXMapping &mapping,
