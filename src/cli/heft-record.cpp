@@ -27,7 +27,8 @@ constexpr char kUsage[] =
     "--anonymize      replace the names of programs, files and memory by made-up ones\n"
     "--vmObjectDirty  write what the memory objects see, not the breakdown of the heft\n"
     "\n"
-    "FILE appears when it is complete, readable by its owner alone.\n";
+    "FILE appears when it is complete, readable by its owner alone; a pipe or device is written as it "
+    "stands.\n";
 
 using Words = std::vector<std::string_view>;
 
@@ -61,6 +62,7 @@ std::optional<int32_t> parsePid(HXPlatform &host, std::string_view word) {
 int writeFile(HXServices &services, const std::string &path, const std::function<bool(std::FILE *)> &write) {
     std::optional<HXPendingFile> file = services.createPendingFile(path);
     if (!file) return fail(path, std::strerror(errno));
+    services.signal(HX_SIGPIPE, HXSignalDisposition::ignored); // a reader that goes away is a failed write
     if (!write(file->stream)) {
         services.discardPendingFile(*file);
         return 1;

@@ -19,12 +19,13 @@ std::string escaped(const std::string &text) {
 } // namespace
 
 std::unique_ptr<HXOutputFormatterJSON> HXOutputFormatterJSON::withPath(const std::string &path) {
-    std::FILE *stream = HXPlatform::current().services().fopen(path, "w+");
-    if (!stream) return nullptr;
-    return std::unique_ptr<HXOutputFormatterJSON>(new HXOutputFormatterJSON(stream));
+    auto file = HXPlatform::current().services().createPendingFile(path);
+    if (!file) return nullptr;
+    return std::unique_ptr<HXOutputFormatterJSON>(new HXOutputFormatterJSON(std::move(*file)));
 }
 
-HXOutputFormatterJSON::HXOutputFormatterJSON(std::FILE *stream) : _stream(stream) {
+HXOutputFormatterJSON::HXOutputFormatterJSON(HXPendingFile file)
+    : _file(std::move(file)), _stream(_file.stream) {
     open('{');
     key("unit");
     text("byte");
@@ -38,7 +39,7 @@ HXOutputFormatterJSON::HXOutputFormatterJSON(std::FILE *stream) : _stream(stream
 }
 
 HXOutputFormatterJSON::~HXOutputFormatterJSON() {
-    if (_stream) fclose(_stream);
+    HXPlatform::current().services().discardPendingFile(_file);
 }
 
 void HXOutputFormatterJSON::noteFailure() {
@@ -231,10 +232,7 @@ void HXOutputFormatterJSON::end() {
     if (_pageSize == 0) _pageSize = HXPlatform::current().vm_kernel_page_size();
     member("page size", _pageSize);
     close('}');
-    errno = 0;
-    if (fflush(_stream) != 0 || ferror(_stream)) noteFailure();
-    if (fclose(_stream) != 0) noteFailure();
-    _stream = nullptr;
+    if (!HXPlatform::current().services().commitPendingFile(_file)) noteFailure();
 }
 
 void HXOutputFormatterJSON::JSONForCategories(const HXCategoryMap &categories) {

@@ -2,6 +2,7 @@
 #pragma once
 
 #include "analysis/HXOutputFormatter.h"
+#include "platform/HXServices.h"
 
 #include <cstdio>
 #include <optional>
@@ -10,8 +11,8 @@
 
 class HXOutputFormatterJSON : public HXOutputFormatter {
   public:
-    // Opens (creates or truncates) the file and begins the document; null with errno set when the file cannot
-    // be opened.
+    // Opens the file and begins the document; null with errno set when the file cannot be opened. A regular
+    // or new file appears, in place of an old one, when the document is complete.
     static std::unique_ptr<HXOutputFormatterJSON> withPath(const std::string &path);
     ~HXOutputFormatterJSON() override;
 
@@ -28,7 +29,7 @@ class HXOutputFormatterJSON : public HXOutputFormatter {
     void printSummaryCategories(const HXCategoryMap &categories, const HXMemoryTotal &total,
                                 bool hadErrors) override;
     void printGlobalAuxData(const HXAuxDictionary *data) override;
-    // Completes the document and closes the file.
+    // Completes the document and closes the file; an incomplete one is discarded.
     void end() override;
     bool printsAtlasLikeOutput() const override { return true; }
     void printAtlasLikeOutputForProcess(const HXProcess &, const HXMemoryRegionList &) override {
@@ -48,7 +49,7 @@ class HXOutputFormatterJSON : public HXOutputFormatter {
         std::optional<int32_t> specificToPid; // whose view it is
     };
 
-    explicit HXOutputFormatterJSON(std::FILE *stream);
+    explicit HXOutputFormatterJSON(HXPendingFile file);
     void separate(); // the comma before the next key or element, where one is needed
     void key(std::string_view name);
     void open(char bracket);
@@ -66,7 +67,8 @@ class HXOutputFormatterJSON : public HXOutputFormatter {
     std::vector<SharedEntry> _shared;
     std::unordered_set<const HXProcessGroup *> _addedProcessGroups; // those without a process view
     uint32_t _pageSize = 0;                                         // that of the first process
-    std::FILE *_stream;
+    HXPendingFile _file;
+    std::FILE *const _stream; // the file's, until `end`
     bool _needsComma = false;
     int _writeError = 0;
 };

@@ -48,6 +48,16 @@ inline constexpr int32_t VM_PAGE_QUERY_PAGE_PAGED_OUT = 0x10;
 inline constexpr int32_t VM_PAGE_QUERY_PAGE_EXTERNAL = 0x80;
 inline constexpr int32_t VM_PAGE_QUERY_PAGE_REUSABLE = 0x800;
 
+// Consecutive pages of one disposition.
+struct vm_page_run {
+    uint64_t address; // of the first page
+    uint64_t pages;
+    int32_t disposition; // VM_PAGE_QUERY_… bits
+
+    // The address behind the last page, of pages of `pageSize` bytes.
+    uint64_t end(uint64_t pageSize) const { return address + pages * pageSize; }
+};
+
 // The longest path of a mapped file that is asked for; longer ones are cut.
 inline constexpr size_t kMaxPathBytes = 1024;
 

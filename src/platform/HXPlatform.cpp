@@ -4,6 +4,13 @@
 
 static HXPlatform *currentPlatform = nullptr;
 
+void HXCutRuns(uint64_t end, uint64_t pageSize, std::vector<vm_page_run> *runs) {
+    while (!runs->empty() && runs->back().address >= end)
+        runs->pop_back();
+    if (!runs->empty() && runs->back().end(pageSize) > end)
+        runs->back().pages = (end - runs->back().address) / pageSize;
+}
+
 HXPlatform &HXPlatform::current() {
     HXRequire(currentPlatform != nullptr, "HXPlatform current", "a platform was set");
     return *currentPlatform;

@@ -35,6 +35,9 @@ struct HXWalkShortfall {
     uint64_t countersSize;
 };
 
+// Takes from `runs`, which ascend, the pages from the address `end` on.
+void HXCutRuns(uint64_t end, uint64_t pageSize, std::vector<vm_page_run> *runs);
+
 class HXPlatform {
   public:
     virtual ~HXPlatform() = default;
@@ -74,11 +77,16 @@ class HXPlatform {
                                                  uint32_t *nestingDepth, vm_region_submap_info_64 *info,
                                                  uint32_t *infoCount) = 0;
 
-    // The dispositions (VM_PAGE_QUERY_… bits) of the pages of [address, address + size), one word a page.
-    // *count: entries there is room for, then entries filled. KERN_INVALID_ADDRESS when a page lies in no
-    // mapping, KERN_INVALID_ARGUMENT when the process is gone or the port is no task's.
+    // The pages of [address, address + size) that have a disposition: stores their runs, ascending and apart,
+    // in `runs` in place of what it holds. The cost follows the runs, however large the holes between them.
+    // *pages: how many pages from that of `address` on have been told of, the holes included; fewer than were
+    // asked for where the runs are many or a later page cannot be told of, and then a multiple of
+    // kPageQueryPages, so that the caller goes on from there. Each kPageQueryPages begun count as one call.
+    // KERN_INVALID_ADDRESS when one of the first of them lies in no mapping, KERN_INVALID_ARGUMENT when the
+    // process is gone or the port is no task's.
+    static constexpr uint64_t kPageQueryPages = 4096;
     virtual kern_return_t mach_vm_page_range_query(mach_port_t task, uint64_t address, uint64_t size,
-                                                   int32_t *dispositions, uint64_t *count) = 0;
+                                                   std::vector<vm_page_run> *runs, uint64_t *pages) = 0;
 
     // With VM_PURGABLE_GET_STATE: the purgeable state (VM_PURGABLE_…) of the object mapped at `address`.
     // Fails for objects that are not purgeable.

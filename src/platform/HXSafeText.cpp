@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <iterator>
 
 namespace {
 
@@ -29,6 +30,22 @@ size_t sequenceLength(std::string_view text, uint32_t *c) {
     return overlong || surrogate || *c > 0x10FFFF ? 0 : length;
 }
 
+// What a terminal or an editor does not show as a character but acts on.
+bool isUnsafe(uint32_t c) {
+    constexpr struct {
+        uint32_t first, last;
+    } unsafe[] = {
+        {0x0000, 0x001F},                   // control characters
+        {'\\', '\\'},                       // escapes of the JSON document
+        {0x007F, 0x009F},                   // control characters
+        {0x061C, 0x061C}, {0x200E, 0x200F}, // marks of writing direction
+        {0x2028, 0x202E}, // separators of lines and paragraphs; embedded directions, overrides
+        {0x2066, 0x2069}, // isolated directions
+    };
+    return std::any_of(std::begin(unsafe), std::end(unsafe),
+                       [c](const auto &range) { return c >= range.first && c <= range.last; });
+}
+
 bool isPlain(std::string_view text) {
     return std::all_of(text.begin(), text.end(), [](char c) { return c >= 0x20 && c < 0x7F && c != '\\'; });
 }
@@ -42,7 +59,7 @@ std::string HXSafeText(std::string_view text) {
     while (!text.empty()) {
         uint32_t c = 0;
         const size_t length = sequenceLength(text, &c);
-        if (length == 0 || c < 0x20 || (c >= 0x7F && c <= 0x9F) || c == '\\')
+        if (length == 0 || isUnsafe(c))
             safe += '?';
         else
             safe += text.substr(0, length);

@@ -5,7 +5,8 @@
 #include <string_view>
 
 // `text` with every byte that is not part of valid UTF-8, every control character (U+0000 to U+001F, U+007F
-// to U+009F) and every backslash replaced by one '?' each.
+// to U+009F), every separator of lines or paragraphs (U+2028, U+2029), every control of the writing direction
+// (U+061C, U+200E, U+200F, U+202A to U+202E, U+2066 to U+2069) and every backslash replaced by one '?' each.
 std::string HXSafeText(std::string_view text);
 
 // The same, with double quotes turned into single ones: for names of processes and of kernel records, which

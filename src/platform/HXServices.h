@@ -44,11 +44,11 @@ enum class HXSignalDisposition { byDefault, ignored };
 inline constexpr int HX_SIGINT = 2;
 inline constexpr int HX_SIGPIPE = 13;
 
-// A file written beside its final place, readable by its owner alone, and renamed when it is complete.
+// A file to write; made by `createPendingFile`.
 struct HXPendingFile {
     std::FILE *stream = nullptr; // owned by the platform until commit or discard
-    std::string path;
-    std::string temporaryPath;
+    std::string path;            // its place, links followed
+    std::string temporaryPath;   // where it is written until commit; empty: at its place
 };
 
 class HXServices {
@@ -65,20 +65,23 @@ class HXServices {
     // Whether a file system object exists at `path`; links are followed.
     virtual bool stat(const std::string &path) = 0;
 
-    // fopen(3): a stream, which the caller closes with std::fclose, or null with errno set.
+    // fopen(3): a stream, which the caller closes with std::fclose, or null with errno set. Reading waits for
+    // a fifo's writer, but for one that does not come within ten seconds no longer (ETIMEDOUT).
     virtual std::FILE *fopen(const std::string &path, const char *mode) = 0;
 
-    // The whole content of a file that exists when the call begins; none with errno set when it cannot be
-    // read or is longer than `limit` bytes (EFBIG). Never waits on a fifo or a device (EINVAL).
-    virtual std::optional<std::string> readFile(const std::string &path, uint64_t limit) = 0;
-    // The first `bytes` of such a file, or all of a shorter one.
-    virtual std::optional<std::string> readFileStart(const std::string &path, size_t bytes) = 0;
+    // The same for reading a regular file. Never waits: a folder (EISDIR) and a fifo or device (EINVAL) are
+    // not even opened.
+    virtual std::FILE *openRegularFile(const std::string &path) = 0;
 
-    // Begins a file that becomes visible at `path` only as a whole; none with errno set.
+    // Begins a file; none with errno set. A regular or new file is written beside its place, readable by its
+    // owner alone, where a signal that ends the program removes it; `path` shows the old one until commit. Of
+    // a symbolic link the file that it leads to is meant. Anything else (a fifo, whose reader is waited for;
+    // a device; an open file of the process, such as /dev/stdout) is written as it stands.
     virtual std::optional<HXPendingFile> createPendingFile(const std::string &path) = 0;
-    // Closes and renames it; false with errno set (the temporary file is then removed).
+    // Closes it and renames what was written beside its place; false with errno set when that or an earlier
+    // write failed (the file is then discarded).
     virtual bool commitPendingFile(HXPendingFile &file) = 0;
-    // Closes and removes it.
+    // Closes it and removes what was written beside its place; nothing when it is closed. Keeps errno.
     virtual void discardPendingFile(HXPendingFile &file) = 0;
 
     // Whether the stream of that descriptor (1: standard output) is a terminal.

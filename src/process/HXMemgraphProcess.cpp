@@ -4,12 +4,10 @@
 #include "platform/capture/HXRegionFields.h"
 
 #include <cerrno>
+#include <cstdio>
 #include <system_error>
 
 namespace {
-
-// Longer than any graph of a process; what is longer is no graph.
-constexpr uint64_t kLongestFile = uint64_t{4} << 30;
 
 // Codes of HXHeftErrorDomain.
 constexpr int kInitializationFailed = 1, kUnknownPlatform = 2;
@@ -39,16 +37,15 @@ std::unique_ptr<HXMemgraphProcess> HXMemgraphProcess::processWithMemgraph(const 
 
 bool HXMemgraphProcess::initWithMemgraph(const std::string &path, HXError *error) {
     if (error) *error = HXError();
-    // What does not begin as a graph is not read on: it may be a core dump or a disk image.
-    auto data = HXPlatform::current().services().readFileStart(path, GXProcessObjectGraph::header.size());
-    if (data && *data == GXProcessObjectGraph::header)
-        data = HXPlatform::current().services().readFile(path, kLongestFile);
-    if (!data) {
+    const std::unique_ptr<std::FILE, int (*)(std::FILE *)> stream(
+        HXPlatform::current().services().openRegularFile(path), std::fclose);
+    if (!stream) {
         const std::error_code failure(errno, std::generic_category());
         return fail(error, HXPOSIXErrorDomain, failure.value(), failure.message());
     }
     std::string reason;
-    _graph = GXProcessObjectGraph::directedGraphWithData(*data, HXPlatform::current().namedTags(), &reason);
+    _graph = GXProcessObjectGraph::directedGraphWithStream(stream.get(), HXPlatform::current().namedTags(),
+                                                           &reason);
     if (!_graph)
         return fail(error, HXHeftErrorDomain, kInitializationFailed,
                     reason.empty() ? "memgraph initialization failed with unknown error" : reason);

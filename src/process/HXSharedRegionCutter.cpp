@@ -24,8 +24,8 @@ bool countsAsDirty(int32_t disposition) {
     return disposition & VM_PAGE_QUERY_PAGE_DIRTY || (disposition & residence) == VM_PAGE_QUERY_PAGE_PRESENT;
 }
 
-// Adds the bytes that a region holds of one page.
-void countPage(HXMemoryRegion &region, int32_t disposition, uint64_t bytes) {
+// Adds the bytes that a region holds of pages.
+void countPages(HXMemoryRegion &region, int32_t disposition, uint64_t bytes) {
     if (countsAsDirty(disposition))
         region.setDirtySize(region.dirtySize() + bytes);
     else if (disposition & VM_PAGE_QUERY_PAGE_PAGED_OUT)
@@ -66,7 +66,6 @@ class HXSharedRegionCutter::Piece {
     bool startsWithinPage() const { return _start != _firstPage; }
     bool endsWithinPage() const { return _end != _pagesEnd; }
     uint64_t bytesInFirstPage() const { return std::min(_end, _firstPage + _pageSize) - _start; }
-    uint64_t bytesInLastPage() const { return _end - lastPage(); }
 
   private:
     uint64_t _start, _end, _pageSize, _firstPage, _pagesEnd;
@@ -139,7 +138,7 @@ bool HXSharedRegionCutter::populate(HXMemoryRegion &region, const vm_region_subm
 bool HXSharedRegionCutter::_populateMemoryRegionWithPageQueries(HXMemoryRegion &region) {
     const Piece piece(region, _pageSize);
     const bool firstIsKnown = piece.pages() > 0 && _cachedDispositionAddress == piece.firstPage();
-    if (firstIsKnown) countPage(region, _cachedDisposition, piece.bytesInFirstPage());
+    if (firstIsKnown) countPages(region, _cachedDisposition, piece.bytesInFirstPage());
     if (!region.unusedSharedCacheRegion()) return queryPiece(region, piece, firstIsKnown);
     // Nobody has used an unused area's pages but by the pieces that share them, so no page is asked for.
     HXRequire(firstIsKnown || !piece.startsWithinPage(), "_populateMemoryRegionWithPageQueries",
@@ -151,28 +150,27 @@ bool HXSharedRegionCutter::_populateMemoryRegionWithPageQueries(HXMemoryRegion &
 
 // Asks for the pages of a piece but the first where that is known from the piece before.
 bool HXSharedRegionCutter::queryPiece(HXMemoryRegion &region, const Piece &piece, bool firstIsKnown) {
-    const auto countNext = [&](int32_t disposition, bool isFirst, bool isLast) {
-        const uint64_t bytes = isFirst  ? piece.bytesInFirstPage()
-                               : isLast ? piece.bytesInLastPage()
-                                        : _pageSize;
-        countPage(region, disposition, bytes);
-        if (isFirst && _pendingUnusedSharedRegion) {
-            // The unused area before this piece ends in this page, which nobody has asked for until now.
-            countPage(*_pendingUnusedSharedRegion, disposition,
-                      _pendingUnusedSharedRegion->end() - piece.firstPage());
-            _pendingUnusedSharedRegion = nullptr;
-        }
-        if (isLast) {
-            _cachedDispositionAddress = piece.lastPage();
-            _cachedDisposition = disposition;
-        }
-    };
-    const uint64_t known = firstIsKnown ? 1 : 0;
+    const uint64_t first = piece.firstPage() + (firstIsKnown ? _pageSize : 0);
     const bool startsWithinPage = !firstIsKnown && piece.startsWithinPage();
-    return _query(piece.firstPage() + known * _pageSize, piece.pages() - known,
-                  [&](const int32_t *dispositions, uint64_t count, uint64_t chunk, uint64_t chunkCount) {
-                      for (uint64_t i = 0; i < count; i++)
-                          countNext(dispositions[i], chunk == 0 && i == 0 && startsWithinPage,
-                                    chunk == chunkCount - 1 && i == count - 1 && piece.endsWithinPage());
+    return _query(first, piece.pages() - (firstIsKnown ? 1 : 0),
+                  [&](std::span<const vm_page_run> runs, uint64_t toldEnd) {
+                      for (const vm_page_run &run : runs) {
+                          const uint64_t start = std::max(run.address, region.start());
+                          const uint64_t end = std::min(run.end(_pageSize), region.end());
+                          if (start < end) countPages(region, run.disposition, end - start);
+                      }
+                      if (startsWithinPage && _pendingUnusedSharedRegion) {
+                          // The unused area before this piece ends in this page, which nobody has asked for
+                          // until now.
+                          const bool hasFirst = !runs.empty() && runs.front().address == first;
+                          countPages(*_pendingUnusedSharedRegion, hasFirst ? runs.front().disposition : 0,
+                                     _pendingUnusedSharedRegion->end() - first);
+                          _pendingUnusedSharedRegion = nullptr;
+                      }
+                      if (piece.endsWithinPage() && toldEnd > piece.lastPage()) {
+                          const bool hasLast = !runs.empty() && runs.back().end(_pageSize) > piece.lastPage();
+                          _cachedDispositionAddress = piece.lastPage();
+                          _cachedDisposition = hasLast ? runs.back().disposition : 0;
+                      }
                   });
 }

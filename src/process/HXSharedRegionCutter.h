@@ -7,6 +7,7 @@
 #include <cstdint>
 #include <functional>
 #include <optional>
+#include <span>
 
 // Address-space layouts of the shared region.
 enum HXSharedRegionPlatform : int32_t {
@@ -32,15 +33,14 @@ struct HXSharedRegion {
 // What the walk tells of an entry, which it does not descend into.
 vm_region_submap_info_64 HXInfoOfSharedRegionEntry(const vm_region_basic_info_64 &basic);
 
-// A chunk of page dispositions (valid during the call), the number of its entries, its index and the number
-// of chunks.
-using HXDispositionCallback =
-    std::function<void(const int32_t *dispositions, uint64_t count, uint64_t chunk, uint64_t chunkCount)>;
+// Runs of pages (valid during the call), each behind those of the call before, and the address up to which
+// all pages have been told of by now.
+using HXDispositionCallback = std::function<void(std::span<const vm_page_run> runs, uint64_t toldEnd)>;
 
 // Serves the walk of one process, entry by entry in ascending order.
 class HXSharedRegionCutter {
   public:
-    // Tells the dispositions of `pages` pages from the page-aligned `start` on; false when a query failed.
+    // Tells of `pages` pages from the page-aligned `start` on; false when a query failed.
     using PageQuery = std::function<bool(uint64_t start, uint64_t pages, const HXDispositionCallback &block)>;
 
     // Cuts by `images` and appends to `regions`, which both belong to the caller and outlive the cutter.

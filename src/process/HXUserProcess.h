@@ -60,7 +60,7 @@ class HXUserProcess : public HXProcess {
 
     // Cuts a region into runs of pages of one kind.
     void _addSubrangesForRegion(HXMemoryRegion &region, int32_t purgeState);
-    // Queries `pages` pages from the page-aligned `start` on, in chunks; false when a query failed.
+    // Queries `pages` pages from the page-aligned `start` on, step by step; false when a query failed.
     bool _enumerateDispositionChunksWithStartAddr(uint64_t start, uint64_t pages,
                                                   const HXDispositionCallback &block);
     // Adds a warning with the text of the current errno and prints it.

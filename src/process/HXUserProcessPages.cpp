@@ -2,11 +2,7 @@
 #include "platform/HXPlatform.h"
 #include "process/HXUserProcess.h"
 
-#include <algorithm>
-
 namespace {
-
-constexpr uint64_t kChunkPages = 4096; // a buffer of 16 KiB
 
 // What a page counts as; null: it is not resident.
 using PageKind = uint64_t HXMemoryTotal::*;
@@ -22,16 +18,23 @@ PageKind kindOfPage(int32_t disposition, int32_t reclaimableMask) {
 struct PageRun {
     HXMemoryRegion &region;
     uint32_t pageSize;
-    uint64_t offset;
+    uint64_t offset; // of the run, in its object
     PageKind kind = nullptr;
     uint64_t length = 0;
 
-    void addPage(PageKind next) {
-        if (length != 0 && kind != next) flush();
+    // Goes on to `next`, an offset not before the end of the run.
+    void skipTo(uint64_t next) {
+        if (next == offset + length) return;
+        flush();
+        offset = next;
+    }
+    void add(PageKind next, uint64_t bytes) {
+        if (kind != next) flush();
         kind = next;
-        (kind ? length : offset) += pageSize;
+        (kind ? length : offset) += bytes;
     }
     void flush() {
+        if (length == 0) return;
         HXMemoryTotal total;
         total.*kind = length;
         if (region.wired()) total.wired = length;
@@ -46,21 +49,21 @@ struct PageRun {
 bool HXUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uint64_t pages,
                                                              const HXDispositionCallback &block) {
     HXPlatform &platform = HXPlatform::current();
-    const uint64_t chunkPages = std::min(pages, kChunkPages);
-    const uint64_t chunkCount = pages / kChunkPages + (pages % kChunkPages != 0);
-    std::vector<int32_t> dispositions(chunkPages);
-    for (uint64_t chunk = 0; chunk < chunkCount; chunk++) {
-        const uint64_t asked = std::min(pages - kChunkPages * chunk, chunkPages);
-        uint64_t count = asked;
+    std::vector<vm_page_run> runs;
+    while (pages > 0) {
+        uint64_t told = 0;
         const kern_return_t error =
-            platform.mach_vm_page_range_query(_task.get(), start + kChunkPages * chunk * pageSize(),
-                                              asked * pageSize(), dispositions.data(), &count);
+            platform.mach_vm_page_range_query(_task.get(), start, pages * pageSize(), &runs, &told);
         if (error != KERN_SUCCESS) {
             platform.mach_error("mach_vm_page_range_query", error);
             _processMachVMError(error, KERN_INVALID_ARGUMENT);
             return false;
         }
-        block(dispositions.data(), std::min(count, asked), chunk, chunkCount);
+        HXRequire(told > 0 && told <= pages, "_enumerateDispositionChunksWithStartAddr",
+                  "a query goes on, and not too far");
+        start += told * pageSize();
+        pages -= told;
+        block(runs, start);
     }
     return true;
 }
@@ -81,11 +84,14 @@ void HXUserProcess::_addSubrangesForRegion(HXMemoryRegion &region, int32_t purge
     const int32_t reclaimableMask =
         purgeState == VM_PURGABLE_VOLATILE ? VM_PAGE_QUERY_PAGE_PRESENT : VM_PAGE_QUERY_PAGE_REUSABLE;
     PageRun run{.region = region, .pageSize = pageSize(), .offset = region.offset()};
+    const auto offsetOf = [&](uint64_t address) { return region.offset() + (address - start); };
     const bool complete = _enumerateDispositionChunksWithStartAddr(
-        start, (end - start) / pageSize(),
-        [&](const int32_t *dispositions, uint64_t count, uint64_t, uint64_t) {
-            for (uint64_t i = 0; i < count; i++)
-                run.addPage(kindOfPage(dispositions[i], reclaimableMask));
+        start, (end - start) / pageSize(), [&](std::span<const vm_page_run> runs, uint64_t toldEnd) {
+            for (const vm_page_run &found : runs) {
+                run.skipTo(offsetOf(found.address));
+                run.add(kindOfPage(found.disposition, reclaimableMask), found.pages * pageSize());
+            }
+            run.skipTo(offsetOf(toldEnd));
         });
-    if (complete) run.addPage(nullptr);
+    if (complete) run.flush();
 }

@@ -15,16 +15,15 @@ using namespace HXMachineFormat;
 
 namespace {
 
-constexpr uint64_t kChunkPages = 4096;
 constexpr size_t kRunsTextBytes = kMaxCaptureRecordBytes / 2; // in one record, other fields beside them
 
 // Run-length text of dispositions, in pieces that each fit a record. Zeros at the end are left out.
 class RunsText {
   public:
-    void add(int32_t disposition) {
+    void add(int32_t disposition, uint64_t count) {
         if (disposition != _disposition) flush();
         _disposition = disposition;
-        _count++;
+        _count += count;
     }
     std::vector<std::string> take() {
         if (_disposition != 0) flush();
@@ -51,7 +50,7 @@ class RunsText {
 HXProcessRecorder::HXProcessRecorder(HXPlatform &host, const HXMachineHost &facts,
                                      HXRegionHeftSetting &setting, HXAnonymizer *anonymizer)
     : _host(host), _facts(facts), _task(host), _setting(setting), _anonymizer(anonymizer),
-      _argumentArea(facts.argMax), _dispositions(kChunkPages), _head(format), _body(format) {}
+      _argumentArea(facts.argMax), _head(format), _body(format) {}
 
 bool HXProcessRecorder::fail(const std::string &problem) {
     _problem = problem;
@@ -245,18 +244,25 @@ bool HXProcessRecorder::isPageQueried(uint64_t size, const vm_region_submap_info
 
 // The runs of the region's pages in pieces of text; none when they cannot be queried.
 std::optional<std::vector<std::string>> HXProcessRecorder::pageRuns(uint64_t address, uint64_t size) {
-    RunsText runs;
+    RunsText text;
+    std::vector<vm_page_run> runs;
     const uint64_t pages = size / _facts.pageSize;
-    for (uint64_t page = 0; page < pages; page += kChunkPages) {
-        uint64_t count = std::min(kChunkPages, pages - page);
-        if (_host.mach_vm_page_range_query(_task.get(), address + page * _facts.pageSize,
-                                           count * _facts.pageSize, _dispositions.data(),
-                                           &count) != KERN_SUCCESS)
+    for (uint64_t done = 0, told = 0; done < pages; done += told) {
+        const uint64_t start = address + done * _facts.pageSize;
+        if (_host.mach_vm_page_range_query(_task.get(), start, (pages - done) * _facts.pageSize, &runs,
+                                           &told) != KERN_SUCCESS ||
+            told == 0)
             return std::nullopt;
-        for (uint64_t i = 0; i < count; i++)
-            runs.add(_dispositions[i]);
+        uint64_t next = 0; // page from `start` on
+        for (const vm_page_run &run : runs) {
+            const uint64_t first = (run.address - start) / _facts.pageSize;
+            if (first > next) text.add(0, first - next);
+            text.add(run.disposition, run.pages);
+            next = first + run.pages;
+        }
+        if (told > next) text.add(0, told - next);
     }
-    return runs.take();
+    return text.take();
 }
 
 // The first top-level mapping that ends above *address; false when there is none.

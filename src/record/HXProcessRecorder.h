@@ -61,7 +61,6 @@ class HXProcessRecorder {
     HXRegionHeftSetting &_setting;
     HXAnonymizer *const _anonymizer;
     std::vector<char> _argumentArea;
-    std::vector<int32_t> _dispositions;
 
     HXMachineProcess _process; // the numbers of the one being recorded
     HXCaptureWriter _head, _body;

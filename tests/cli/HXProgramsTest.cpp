@@ -9,6 +9,7 @@
 #include <algorithm>
 #include <csignal>
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -131,7 +132,7 @@ TEST(HXProgramsTest, ClosedStandardStreamsStayOutOfTheDocument) {
                                     std::string(HEFT_PROGRAM) + " " + std::to_string(getpid())};
     for (const std::string &command : commands)
         for (int closed = 0; closed < 8; closed++) { // a bit for each descriptor
-            std::string line = "exec " + command + " -f bytes -j " + json;
+            std::string line = "exec " + command + " -w -f bytes -j " + json;
             for (int descriptor = 0; descriptor <= 2; descriptor++)
                 if (closed >> descriptor & 1) line += " " + std::to_string(descriptor) + ">&-";
             folder.remove("json");
@@ -143,4 +144,34 @@ TEST(HXProgramsTest, ClosedStandardStreamsStayOutOfTheDocument) {
             if (hasText) checkReport(run.out, document);
             EXPECT_TRUE(document.starts_with("{") && document.ends_with("}")) << line << document;
         }
+}
+
+// The reader leaves after a byte of a document that no pipe holds whole.
+TEST(HXProgramsTest, AReaderThatGoesAwayIsAFailedWrite) {
+    const HXTemporaryFolder folder;
+    folder.write("machine", failingMachine(2000));
+    ASSERT_EQ(mkfifo((folder / "fifo").c_str(), 0600), 0);
+    const std::string line = "cd " + folder.path().string() + " && (head -c 1 fifo >&2 & exec " +
+                             HEFT_REPLAY_PROGRAM + " machine -a -j fifo)";
+    const HXProgramRun run = HXRunProgram({"/bin/sh", "-c", line});
+    EXPECT_EQ(run.status, 1);
+    EXPECT_TRUE(run.err.ends_with("heft: fifo: Broken pipe\n"));
+    EXPECT_TRUE(contains(run.out, "Summary")) << "the text is complete";
+}
+
+TEST(HXProgramsTest, CapturesAreReadInPieces) {
+    const HXTemporaryFolder folder;
+    folder.write("machine", failingMachine(1));
+    folder.write("sparse", "heft-memgraph 1\n");
+    fs::resize_file(folder / "sparse", uint64_t{1} << 30);
+    const HXProgramRun refused = HXRunProgram({HEFT_REPLAY_PROGRAM, folder / "machine", folder / "sparse"});
+    EXPECT_TRUE(contains(refused.err, "sparse: line 2: the record is longer than 1 MiB\n")) << refused.err;
+    EXPECT_LT(refused.peakKilobytes, 500 << 10);
+    // From a fifo, too.
+    ASSERT_EQ(mkfifo((folder / "fifo").c_str(), 0600), 0);
+    const std::string line =
+        "cd " + folder.path().string() + " && (cat machine >fifo & exec " + HEFT_REPLAY_PROGRAM + " fifo -a)";
+    const HXProgramRun run = HXRunProgram({"/bin/sh", "-c", line});
+    EXPECT_EQ(run.status, 0);
+    EXPECT_TRUE(contains(run.out, "p [101]")) << run.err;
 }

@@ -19,10 +19,12 @@ void askRegions(HXReplayPlatform &host, int32_t pid, mach_port_t task) {
         const uint64_t asked = address;
         if (host.mach_vm_region_recurse(task, &address, &size, &depth, &info, &words) != KERN_SUCCESS) return;
         require(size > 0 && address + size > asked);
-        int32_t dispositions[64] = {};
-        uint64_t count = 64;
-        host.mach_vm_page_range_query(task, address, size, dispositions, &count);
-        require(count <= 64);
+        std::vector<vm_page_run> runs;
+        uint64_t pages = 0;
+        if (host.mach_vm_page_range_query(task, address, size, &runs, &pages) == KERN_SUCCESS)
+            require(pages * host.vm_kernel_page_size() <= size);
+        for (const vm_page_run &run : runs)
+            require(run.address >= address && run.end(host.vm_kernel_page_size()) <= address + size);
         char path[16];
         require(host.proc_regionfilename(pid, address, path, sizeof path) <= int32_t{sizeof path});
         vm_region_basic_info_64 basic{};

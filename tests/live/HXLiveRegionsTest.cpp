@@ -26,7 +26,7 @@ constexpr int kWrite = MADV_POPULATE_WRITE, kRead = MADV_POPULATE_READ, kGuard =
 constexpr int kReadOnly = HXActProtect - PROT_READ, kReadWrite = PROT_READ | PROT_WRITE;
 constexpr int kOwn = MAP_PRIVATE | MAP_ANONYMOUS, kShared = MAP_SHARED | MAP_ANONYMOUS;
 constexpr int kPool = MAP_HUGETLB | MAP_NORESERVE;
-constexpr size_t kHuge = 512;
+constexpr size_t kHuge = 512, kWide = size_t{1} << 26;
 
 const HXMemoryRecipe kRecipes[] = {
     {"PlainAnonymous",
@@ -59,10 +59,23 @@ const HXMemoryRecipe kRecipes[] = {
       {8, kReadWrite, MAP_SHARED, "/var/tmp", {{kRead}, {kWrite, 0, 1}}, "mapped file", 0, 8}}},
     {"TmpfsTwice", // by writing, since reading would map the neighbours, too
      {{8, kReadWrite, MAP_SHARED, "/dev/shm", {{kWrite}}, "deleted shared memory", 8},
-      {8, kReadWrite, MAP_SHARED, "/dev/shm", {{kWrite, 0, 6}}, "deleted shared memory", 6, 0, 0, false, 4}}},
+      {8, kReadWrite, MAP_SHARED, "/dev/shm", {{kWrite, 0, 6}}, "deleted shared memory", 2, 4, 0, false, 4}}},
+    // Pages are charged where their object is mapped first; others show them as clean.
+    {"OneObjectManyTimes",
+     {{64, kReadWrite, MAP_SHARED, "memfd", {{kWrite, 0, 64, 2}}, "memfd", 32},
+      {64, kReadWrite, MAP_SHARED, "memfd", {{kWrite}}, "memfd", 32, 32},
+      {32, kReadWrite, MAP_SHARED, "memfd", {{kWrite}}, "memfd", 16, 16, 0, false, 48},
+      {64, kReadWrite, MAP_PRIVATE, "memfd", {{kRead}, {kWrite, 0, 8}}, "memfd", 8, 56},
+      {64, kReadWrite, MAP_SHARED, "memfd", {}, "memfd"},
+      // On a machine with swap, what is taken out of one mapping is out of all.
+      {64, kReadWrite, MAP_SHARED, "/dev/shm", {{kWrite}, {MADV_PAGEOUT}}},
+      {64, kReadWrite, MAP_SHARED, "/dev/shm", {}}}},
+    // Two touched pages far apart: the cost follows pages, not addresses.
+    {"Sparse",
+     {{kWide, kReadWrite, MAP_SHARED, "memfd", {{kWrite, 0, 1}, {kWrite, kWide - 1, 1}}, "memfd", 2}}},
     {"SharedMemory",
      {{16, kReadWrite, MAP_SHARED, "memfd", {{kWrite, 0, 5}}, "memfd", 5},
-      {16, kReadWrite, MAP_PRIVATE, "memfd", {{kRead, 0, 5}, {kWrite, 0, 1}}, "memfd", 5},
+      {16, kReadWrite, MAP_PRIVATE, "memfd", {{kRead, 0, 5}, {kWrite, 0, 1}}, "memfd", 1, 4},
       {16, kReadWrite, kShared, nullptr, {{kWrite, 0, 7}}, "shared anonymous", 7},
       {16, kReadWrite, MAP_SHARED, "SysV", {{kWrite, 0, 3}}, "System V shared memory", 3}}},
     // On a machine with swap, what the kernel takes out is told as swapped; elsewhere it stays.
@@ -78,8 +91,8 @@ const HXMemoryRecipe kRecipes[] = {
       {64, kReadWrite, MAP_PRIVATE, "/dev/zero", {{kRead, 0, 32}, {kWrite, 8, 4}}},
       {64, kReadWrite, kOwn, nullptr, {{kWrite}, {kGuard, 0, 8}, {HXActProtect, 0, 32}}}}},
     {"CopiesAmongFiles",
-     {{512, kReadWrite, MAP_SHARED, "memfd", {{kWrite, 0, 100, 7}}},
-      {512, kReadWrite, MAP_PRIVATE, "memfd", {{kRead, 0, 50}, {kWrite, 20, 50}}},
+     {{512, kReadWrite, MAP_SHARED, "memfd", {{kWrite, 0, 100, 7}}, "memfd", 15},
+      {512, kReadWrite, MAP_PRIVATE, "memfd", {{kRead, 0, 50}, {kWrite, 20, 50}}, "memfd", 67, 3},
       {16, kReadWrite, MAP_PRIVATE, "/proc/self/exe", {{kRead}, {kWrite, 3, 4}}, "mapped file", 4, 12},
       {16, PROT_READ, MAP_SHARED, "/proc/self/exe", {{kRead}}, "mapped file", 0, 16}}},
     {"MoreRunsThanOneRequestFinds",
@@ -123,6 +136,16 @@ class HXLiveRegions : public testing::TestWithParam<HXMemoryRecipe> {
         if (process) process->gatherData();
         return std::unique_ptr<HXUserProcess>(static_cast<HXUserProcess *>(process.release()));
     }
+    // What a swap-backed mapping has clean, others of the process are charged for.
+    uint64_t repeatedAt(uint64_t start) const {
+        for (size_t i = 0; i < GetParam().mappings.size(); i++) {
+            const HXMemoryMapping &mapping = GetParam().mappings[i];
+            const bool isSwapBacked = mapping.file && (mapping.file == std::string("memfd") ||
+                                                       mapping.file == std::string("/dev/shm"));
+            if (HXPlaceOf(GetParam(), i) == start && isSwapBacked) return mapping.clean * kPage;
+        }
+        return 0;
+    }
     uint64_t status(const char *field) const { return HXReadStatus(subject.pid(), field); }
 
     const HXSubject subject{[] { HXFollow(GetParam()); }};
@@ -141,7 +164,8 @@ TEST_P(HXLiveRegions, AgreeWithTheKernelsFiles) {
         EXPECT_EQ(region->end(), entry.end);
         const uint64_t rss = entry["Rss"], anonymous = entry["Anonymous"], lazyFree = entry["LazyFree"];
         const uint64_t shared = isSwapBacked(entry) ? rss - anonymous : 0;
-        const uint64_t dirty = anonymous - lazyFree + shared + entry.hugePages();
+        const uint64_t repeated = repeatedAt(entry.start);
+        const uint64_t dirty = anonymous - lazyFree + shared + entry.hugePages() - repeated;
         const uint64_t clean = rss + entry.hugePages() - dirty - lazyFree;
         EXPECT_EQ(sizesOf(*region), (Sizes{dirty, entry["Swap"], clean, lazyFree}))
             << entry.path << " at " << std::hex << entry.start;
@@ -204,13 +228,19 @@ std::string regionsAndPages(HXLinuxPlatform &platform, pid_t pid) {
         text << std::hex << address << " " << size << " " << info.object_id_full << std::dec << " "
              << info.user_tag << " " << info.pages_resident << " " << info.pages_dirtied << " "
              << info.pages_swapped_out << " " << int{info.share_mode} << int{info.external_pager} << "\n";
-        // Nobody would go through reservations, and sanitizers' terabytes, page by page.
-        if (size > uint64_t{1} << 31) continue;
-        std::vector<int32_t> pages(size / kPage);
-        uint64_t count = pages.size();
-        EXPECT_EQ(platform.mach_vm_page_range_query(task, address, size, pages.data(), &count), KERN_SUCCESS);
+        std::vector<vm_page_run> all, runs;
+        for (uint64_t at = address, told = 0; at < address + size; at += told * kPage) {
+            const uint64_t left = address + size - at;
+            const kern_return_t error = platform.mach_vm_page_range_query(task, at, left, &runs, &told);
+            EXPECT_EQ(error, KERN_SUCCESS);
+            if (error != KERN_SUCCESS) break;
+            all.insert(all.end(), runs.begin(), runs.end());
+        }
         const auto pagesThatAre = [&](int32_t bit) {
-            return std::count_if(pages.begin(), pages.end(), [=](int32_t page) { return (page & bit) != 0; });
+            uint64_t pages = 0;
+            for (const vm_page_run &run : all)
+                pages += run.disposition & bit ? run.pages : 0;
+            return pages;
         };
         EXPECT_EQ(pagesThatAre(VM_PAGE_QUERY_PAGE_DIRTY), info.pages_dirtied) << std::hex << address;
         EXPECT_EQ(pagesThatAre(VM_PAGE_QUERY_PAGE_PRESENT), info.pages_resident) << std::hex << address;

@@ -21,13 +21,22 @@ uint32_t tagOfThisRun(const GXVMRegion &region, HXNamedTags &tags) {
 
 } // namespace
 
-std::unique_ptr<GXProcessObjectGraph>
-GXProcessObjectGraph::directedGraphWithData(std::string_view data, HXNamedTags &tags, std::string *reason) {
+std::unique_ptr<GXProcessObjectGraph> GXProcessObjectGraph::graphOf(HXCaptureReader &&reader,
+                                                                    HXNamedTags &tags, std::string *reason) {
     auto graph = std::make_unique<GXProcessObjectGraph>();
-    HXCaptureReader reader(format, data);
     if (graph->read(reader, tags)) return graph;
     *reason = reader.reason();
     return nullptr;
+}
+
+std::unique_ptr<GXProcessObjectGraph>
+GXProcessObjectGraph::directedGraphWithStream(std::FILE *stream, HXNamedTags &tags, std::string *reason) {
+    return graphOf(HXCaptureReader(format, stream), tags, reason);
+}
+
+std::unique_ptr<GXProcessObjectGraph>
+GXProcessObjectGraph::directedGraphWithData(std::string_view data, HXNamedTags &tags, std::string *reason) {
+    return graphOf(HXCaptureReader(format, data), tags, reason);
 }
 
 void GXProcessObjectGraph::enumerateRegionsWithBlock(

@@ -5,6 +5,7 @@
 #include "platform/capture/HXStringTable.h"
 
 #include <cstdint>
+#include <cstdio>
 #include <deque>
 #include <functional>
 #include <memory>
@@ -53,9 +54,12 @@ class GXProcessObjectGraph {
     // How every memory-graph file begins.
     static constexpr std::string_view header = "heft-memgraph 1";
 
-    // The graph that the content of a memory-graph file describes; null with the reason when it breaks the
-    // form. The content is not needed afterwards. Tags that programs name become those that `tags` has for
-    // the names.
+    // The graph that a memory-graph file describes; null with the reason when it breaks the form, is too long
+    // for any graph or cannot be read. The stream is read on from where it is, in pieces, and stays open.
+    // Tags that programs name become those that `tags` has for the names.
+    static std::unique_ptr<GXProcessObjectGraph> directedGraphWithStream(std::FILE *stream, HXNamedTags &tags,
+                                                                         std::string *reason);
+    // The same from a file's content, which is not needed afterwards.
     static std::unique_ptr<GXProcessObjectGraph>
     directedGraphWithData(std::string_view data, HXNamedTags &tags, std::string *reason);
 
@@ -76,6 +80,8 @@ class GXProcessObjectGraph {
     void enumerateRegionsWithBlock(const std::function<void(const GXVMRegion &, bool *stop)> &each) const;
 
   private:
+    static std::unique_ptr<GXProcessObjectGraph> graphOf(HXCaptureReader &&reader, HXNamedTags &tags,
+                                                         std::string *reason);
     bool read(HXCaptureReader &reader, HXNamedTags &tags);
     bool readProcess(HXCaptureReader &reader);
     bool readRegion(HXCaptureReader &reader, HXNamedTags &tags);

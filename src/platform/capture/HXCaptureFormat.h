@@ -107,6 +107,7 @@ struct HXCaptureFormat {
     std::string_view header;        // the first line
     std::string_view headerProblem; // the reason given for any other first line
     std::span<const HXRecordForm> records;
+    uint64_t longestFile = UINT64_MAX; // bytes
 };
 
 inline constexpr size_t kMaxCaptureRecordBytes = 1 << 20; // without the newline

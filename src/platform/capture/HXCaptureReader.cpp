@@ -136,8 +136,12 @@ bool HXCaptureReader::refill() {
     }
     const size_t count = std::fread(_buffer.data() + kept, 1, _buffer.size() - kept, _stream);
     _window = std::string_view(_buffer.data(), kept + count);
-    if (count > 0) return true;
-    if (std::ferror(_stream) != 0) _reason = std::strerror(errno);
+    _bytesRead += count;
+    if (count > 0 && _bytesRead <= _format.longestFile) return true;
+    if (count > 0)
+        _reason = std::strerror(EFBIG);
+    else if (std::ferror(_stream) != 0)
+        _reason = std::strerror(errno);
     _stream = nullptr;
     return false;
 }

@@ -81,6 +81,7 @@ class HXCaptureReader {
 
     const HXCaptureFormat &_format;
     std::FILE *_stream = nullptr; // null when all content is in memory
+    uint64_t _bytesRead = 0;      // from the stream
     std::vector<char> _buffer;
     std::string_view _window; // read and not yet consumed
     bool _skipsLine = false;  // the window begins within a comment

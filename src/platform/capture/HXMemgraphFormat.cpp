@@ -31,6 +31,10 @@ constexpr HXRecordForm records[] = {{"region", regionFields}, {"process", proces
 static_assert(regionFields[HXMemgraphFormat::Region::path].name == "path");
 static_assert(processFields[HXMemgraphFormat::Process::description].name == "description");
 
+// Longer than any graph of a process: a file may have any length without taking any room.
+constexpr uint64_t kLongestFile = uint64_t{4} << 30;
+
 } // namespace
 
-const HXCaptureFormat HXMemgraphFormat::format = {"heft-memgraph 1", "not a memory graph", records};
+const HXCaptureFormat HXMemgraphFormat::format = {"heft-memgraph 1", "not a memory graph", records,
+                                                  kLongestFile};

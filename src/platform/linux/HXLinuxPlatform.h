@@ -7,6 +7,7 @@
 #include "platform/linux/kernel/HXLinuxKernelMemory.h"
 #include "platform/linux/memory/HXFileSystems.h"
 #include "platform/linux/memory/HXLinuxTask.h"
+#include "platform/linux/memory/HXObjectIdentifiers.h"
 #include "platform/linux/procfs/HXLinuxProcesses.h"
 
 #include <unistd.h>
@@ -43,7 +44,7 @@ class HXLinuxPlatform final : public HXPlatform {
                                          uint32_t *nestingDepth, vm_region_submap_info_64 *info,
                                          uint32_t *infoCount) override;
     kern_return_t mach_vm_page_range_query(mach_port_t task, uint64_t address, uint64_t size,
-                                           int32_t *dispositions, uint64_t *count) override;
+                                           std::vector<vm_page_run> *runs, uint64_t *pages) override;
     kern_return_t mach_vm_purgable_control(mach_port_t, uint64_t, int32_t, int32_t *) override {
         return KERN_INVALID_ARGUMENT; // nothing is purgeable here
     }
@@ -125,6 +126,7 @@ class HXLinuxPlatform final : public HXPlatform {
     HXLinuxProcesses _processes;
     HXLinuxKernelMemory _kernelMemory;
     HXDescriptorTurns _turns;
+    HXObjectIdentifiers _identifiers;
     HXTaskTable _tasks;
     std::atomic<uint32_t> _reportsCharge = 0; // "vm.self_region_heft"
     HXLinuxServices _services;

@@ -40,8 +40,9 @@ kern_return_t HXLinuxPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_
     if (!process) return errorOfOpening(errno);
     if (process->stat.hasEnded() || process->stat.isKernelThread()) return KERN_FAILURE;
     if (!HXOpenAt(process->directory, "maps")) return errorOfOpening(errno);
-    *task = _tasks.add(std::make_unique<HXLinuxTask>(pid, std::move(*process),
-                                                     maySpareDescriptor(_tasks.count()), _processes, _turns));
+    *task =
+        _tasks.add(std::make_unique<HXLinuxTask>(pid, _identifiers.numberOfProcess(pid), std::move(*process),
+                                                 maySpareDescriptor(_tasks.count()), _processes, _turns));
     return KERN_SUCCESS;
 }
 
@@ -73,11 +74,9 @@ const HXMapping *HXLinuxPlatform::mappingAt(HXLinuxTask *task, uint64_t *address
 }
 
 vm_region_submap_info_64 HXLinuxPlatform::infoOf(HXLinuxTask *task, const HXMapping &mapping) {
-    HXRegionContext context;
-    context.pid = task->pid();
-    context.ipcNamespace = addressSpaceOf(task).ipcNamespace;
-    context.reportsCharge = _reportsCharge.load(std::memory_order_relaxed) != 0;
-    return HXRegionInfo(mapping, context);
+    const HXMappingOwner owner{task->pid(), task->number(), addressSpaceOf(task).ipcNamespace};
+    return HXRegionInfo(mapping, _identifiers.of(mapping, owner),
+                        _reportsCharge.load(std::memory_order_relaxed) != 0);
 }
 
 kern_return_t HXLinuxPlatform::mach_vm_region(mach_port_t port, uint64_t *address, uint64_t *size,
@@ -117,19 +116,23 @@ kern_return_t HXLinuxPlatform::mach_vm_region_recurse(mach_port_t port, uint64_t
 }
 
 kern_return_t HXLinuxPlatform::mach_vm_page_range_query(mach_port_t port, uint64_t address, uint64_t size,
-                                                        int32_t *dispositions, uint64_t *count) {
+                                                        std::vector<vm_page_run> *runs, uint64_t *pages) {
     HXLinuxTask *task = _tasks.find(port);
     if (task == nullptr) return KERN_INVALID_ARGUMENT;
     const uint64_t mask = _pageSize - 1;
     const uint64_t start = address & ~mask;
     const uint64_t inLastPages = (size & mask) + (address - start) + mask;
-    const uint64_t pages = std::min<uint64_t>(size / _pageSize + inLastPages / _pageSize, *count);
+    // No mapping reaches into the last page of all.
+    const uint64_t mostPages = (UINT64_MAX - start) / _pageSize;
+    *pages = std::min(size / _pageSize + inLastPages / _pageSize, mostPages);
     const HXAddressSpace &addressSpace = addressSpaceOf(task);
+    if (*pages == 0 && size > 0) return KERN_INVALID_ADDRESS;
+    const uint64_t asked = *pages;
     kern_return_t error = KERN_SUCCESS;
     const bool suffice = task->withDescriptors([&] {
-        error = task->pages().query(addressSpace, start, std::span(dispositions, static_cast<size_t>(pages)));
+        *pages = asked;
+        error = task->pages().query(addressSpace, start, runs, pages);
     });
-    if (error == KERN_SUCCESS) *count = pages;
     return error != KERN_SUCCESS && !suffice ? KERN_RESOURCE_SHORTAGE : error;
 }
 

@@ -1,16 +1,23 @@
 // Command line and files; queues and signals are in HXLinuxServicesQueues.cpp.
 #include "platform/linux/HXLinuxServices.h"
 
+#include "platform/linux/HXTemporaryFiles.h"
 #include "platform/linux/procfs/HXProcFile.h"
+#include "platform/linux/procfs/HXTextNumber.h"
 
 #include <fcntl.h>
 #include <getopt.h>
+#include <linux/magic.h>
+#include <poll.h>
 #include <sys/stat.h>
+#include <sys/vfs.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cerrno>
-#include <cstdlib>
+#include <cstdio>
+#include <filesystem>
+#include <system_error>
+#include <utility>
 
 HXOptionScan HXLinuxServices::getopt_long(int argc, char *const argv[], const char *shortOptions,
                                           const std::vector<HXLongOption> &options, bool restart) {
@@ -31,99 +38,132 @@ bool HXLinuxServices::stat(const std::string &path) {
     return ::stat(path.c_str(), &status) == 0;
 }
 
-std::FILE *HXLinuxServices::fopen(const std::string &path, const char *mode) {
-    const std::string closedOnExecution = std::string(mode) + "e";
-    return std::fopen(path.c_str(), closedOnExecution.c_str());
-}
-
 bool HXLinuxServices::isatty(int descriptor) {
     return ::isatty(descriptor) == 1;
 }
 
 namespace {
 
-int otherKindError(const struct ::stat &status) {
-    return S_ISDIR(status.st_mode) ? EISDIR : EINVAL;
+namespace fs = std::filesystem;
+
+// A stream over the descriptor, which it owns from then on; null with errno set.
+std::FILE *openStream(HXDescriptor descriptor, const char *mode) {
+    std::FILE *const stream = descriptor ? ::fdopen(descriptor.get(), mode) : nullptr;
+    if (stream != nullptr) descriptor.release();
+    return stream;
 }
 
-void removeKeepingError(const std::string &path) {
+// Waits until somebody writes to the fifo, which is open without blocking, as long as it has a writer at all;
+// false with errno set when none comes.
+bool waitForWriter(std::FILE *fifo) {
+    constexpr int patience = 10000; // ms
+    pollfd wait = {::fileno(fifo), POLLIN, 0};
+    if (::poll(&wait, 1, patience) == 0) {
+        // Nothing to read is the end without a writer, and EAGAIN with one.
+        const int c = std::fgetc(fifo);
+        if (c == EOF && std::feof(fifo) != 0) {
+            errno = ETIMEDOUT;
+            return false;
+        }
+        std::clearerr(fifo);
+        if (c != EOF) std::ungetc(c, fifo);
+    }
+    return ::fcntl(::fileno(fifo), F_SETFL, 0) == 0; // from now on reads wait
+}
+
+std::FILE *openFifo(const std::string &path) {
+    std::FILE *const fifo = openStream(HXOpenAt(AT_FDCWD, path.c_str()), "r");
+    if (fifo == nullptr || waitForWriter(fifo)) return fifo;
     const int error = errno;
-    ::unlink(path.c_str());
+    std::fclose(fifo);
     errno = error;
+    return nullptr;
 }
 
-// At most the first `most` bytes of a regular file; none with errno set, EFBIG when it has more than `limit`.
-std::optional<std::string> readRegularFile(const std::string &path, uint64_t most, uint64_t limit) {
-    struct ::stat status;
-    const HXDescriptor file = HXOpenAt(AT_FDCWD, path.c_str());
-    if (!file || ::fstat(file.get(), &status) != 0) return std::nullopt;
-    const auto size = static_cast<uint64_t>(status.st_size);
-    if (!S_ISREG(status.st_mode) || size > limit) {
-        errno = S_ISREG(status.st_mode) ? EFBIG : otherKindError(status);
-        return std::nullopt;
+// Follows the symbolic links of `path`, whether or not they lead to something; not those by which the kernel
+// names open files, for these need not have a path (proc(5)).
+fs::path followLinks(fs::path path) {
+    constexpr int mostLinks = 40; // path_resolution(7)
+    std::error_code error;
+    for (int links = 0; links < mostLinks && fs::is_symlink(path, error); links++) {
+        const fs::path folder = path.has_parent_path() ? path.parent_path() : ".";
+        struct ::statfs system;
+        if (::statfs(folder.c_str(), &system) != 0 || system.f_type == PROC_SUPER_MAGIC) break;
+        path = folder / fs::read_symlink(path, error);
     }
-    std::string content;
-    // The size is a hint: the kernel's own files tell none, and a file may grow.
-    constexpr uint64_t step = 65536;
-    for (uint64_t next = size + 1;; next = std::max(step, content.size())) {
-        const size_t length = content.size();
-        const size_t room = std::min(next, most - length);
-        content.resize(length + room);
-        const ssize_t got = file.readFully(std::span(content).subspan(length));
-        if (got < 0) return std::nullopt;
-        content.resize(length + static_cast<size_t>(got));
-        if (static_cast<size_t>(got) < room || content.size() == most) break;
-    }
-    if (content.size() <= limit) return content;
-    errno = EFBIG;
-    return std::nullopt;
+    return path;
+}
+
+// Opens what is no regular file for writing.
+HXDescriptor openAsItStands(const fs::path &path) {
+    // An open file of the process is not opened anew: what is written follows what was, and sockets do.
+    std::error_code error;
+    const std::string name = path.filename();
+    int number = 0;
+    if (HXIsNumber(name, &number) && fs::equivalent(path.parent_path(), "/proc/self/fd", error))
+        return HXDescriptor(::fcntl(number, F_DUPFD_CLOEXEC, 3));
+    return HXDescriptor(::open(path.c_str(), O_WRONLY | O_CLOEXEC | O_NOCTTY));
 }
 
 } // namespace
 
-std::optional<std::string> HXLinuxServices::readFileStart(const std::string &path, size_t bytes) {
-    return readRegularFile(path, bytes, UINT64_MAX);
+std::FILE *HXLinuxServices::fopen(const std::string &path, const char *mode) {
+    struct ::stat status;
+    if (mode[0] == 'r' && ::stat(path.c_str(), &status) == 0 && S_ISFIFO(status.st_mode))
+        return openFifo(path);
+    const std::string closedOnExecution = std::string(mode) + "e";
+    return std::fopen(path.c_str(), closedOnExecution.c_str());
 }
 
-std::optional<std::string> HXLinuxServices::readFile(const std::string &path, uint64_t limit) {
-    return readRegularFile(path, limit + 1, limit);
+std::FILE *HXLinuxServices::openRegularFile(const std::string &path) {
+    struct ::stat status;
+    if (::stat(path.c_str(), &status) != 0) return nullptr;
+    if (S_ISREG(status.st_mode)) {
+        HXDescriptor file = HXOpenAt(AT_FDCWD, path.c_str());
+        if (!file || ::fstat(file.get(), &status) != 0) return nullptr;
+        if (S_ISREG(status.st_mode)) return openStream(std::move(file), "r"); // not exchanged meanwhile
+    }
+    errno = S_ISDIR(status.st_mode) ? EISDIR : EINVAL;
+    return nullptr;
 }
 
 std::optional<HXPendingFile> HXLinuxServices::createPendingFile(const std::string &path) {
-    // Renaming over a device or a pipe would take it away.
+    const fs::path place = followLinks(path);
     struct ::stat status;
-    if (::stat(path.c_str(), &status) == 0 && !S_ISREG(status.st_mode)) {
-        errno = otherKindError(status);
-        return std::nullopt;
+    const bool exists = ::lstat(place.c_str(), &status) == 0;
+    const bool isNew = !exists && errno == ENOENT && place.has_filename();
+    HXPendingFile file{nullptr, place, ""};
+    HXDescriptor descriptor;
+    if (exists && !S_ISREG(status.st_mode)) {
+        descriptor = openAsItStands(place);
+    } else if (isNew || (exists && ::faccessat(AT_FDCWD, place.c_str(), W_OK, AT_EACCESS) == 0)) {
+        file.temporaryPath = place.parent_path() / ".heft-XXXXXX";
+        descriptor = HXCreateTemporaryFile(&file.temporaryPath);
     }
-    HXPendingFile file;
-    file.path = path;
-    file.temporaryPath = path + ".XXXXXX";
-    HXDescriptor descriptor(::mkostemp(file.temporaryPath.data(), O_CLOEXEC)); // mode 0600
-    if (!descriptor) return std::nullopt;
-    file.stream = ::fdopen(descriptor.get(), "w");
-    if (file.stream == nullptr) {
-        removeKeepingError(file.temporaryPath);
-        return std::nullopt;
-    }
-    descriptor.release(); // the stream's now
-    return file;
+    file.stream = openStream(std::move(descriptor), "w");
+    if (file.stream != nullptr) return file;
+    if (!file.temporaryPath.empty()) HXRemoveTemporaryFile(file.temporaryPath);
+    return std::nullopt;
 }
 
 bool HXLinuxServices::commitPendingFile(HXPendingFile &file) {
-    // A failed write may show only in the stream's error mark or when the rest is written.
-    const bool failedBefore = std::ferror(file.stream) != 0;
-    const bool closed = std::fclose(file.stream) == 0;
-    file.stream = nullptr;
-    if (closed && failedBefore) errno = EIO;
-    if (closed && !failedBefore && ::rename(file.temporaryPath.c_str(), file.path.c_str()) == 0) return true;
-    removeKeepingError(file.temporaryPath);
+    errno = 0;
+    if (std::fflush(file.stream) != 0 || std::ferror(file.stream) != 0) {
+        if (errno == 0) errno = EIO; // an earlier write failed, why is lost
+        discardPendingFile(file);
+        return false;
+    }
+    const bool closed = std::fclose(std::exchange(file.stream, nullptr)) == 0;
+    if (file.temporaryPath.empty()) return closed;
+    if (closed && HXRenameTemporaryFile(file.temporaryPath, file.path)) return true;
+    HXRemoveTemporaryFile(file.temporaryPath);
     return false;
 }
 
 void HXLinuxServices::discardPendingFile(HXPendingFile &file) {
     if (file.stream == nullptr) return;
-    std::fclose(file.stream);
-    file.stream = nullptr;
-    ::unlink(file.temporaryPath.c_str());
+    const int kept = errno;
+    std::fclose(std::exchange(file.stream, nullptr));
+    if (!file.temporaryPath.empty()) HXRemoveTemporaryFile(file.temporaryPath);
+    errno = kept;
 }

@@ -14,8 +14,7 @@ class HXLinuxServices : public HXServices {
                              const std::vector<HXLongOption> &options, bool restart) override;
     bool stat(const std::string &path) override;
     std::FILE *fopen(const std::string &path, const char *mode) override;
-    std::optional<std::string> readFile(const std::string &path, uint64_t limit) override;
-    std::optional<std::string> readFileStart(const std::string &path, size_t bytes) override;
+    std::FILE *openRegularFile(const std::string &path) override;
     std::optional<HXPendingFile> createPendingFile(const std::string &path) override;
     bool commitPendingFile(HXPendingFile &file) override;
     void discardPendingFile(HXPendingFile &file) override;

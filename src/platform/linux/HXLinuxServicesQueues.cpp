@@ -1,5 +1,6 @@
 // Work queues and signals.
 #include "platform/linux/HXLinuxServices.h"
+#include "platform/linux/HXTemporaryFiles.h"
 #include "platform/linux/procfs/HXDescriptor.h"
 
 #include <poll.h>
@@ -153,7 +154,8 @@ void HXLinuxServices::signal(int signal, HXSignalDisposition disposition) {
     // alone keeps it from acting.
     if (disposition == HXSignalDisposition::ignored && isBlocked(signal)) return;
     struct sigaction action {};
-    action.sa_handler = disposition == HXSignalDisposition::ignored ? SIG_IGN : SIG_DFL;
+    action.sa_handler =
+        disposition == HXSignalDisposition::ignored ? SIG_IGN : HXDefaultSignalHandler(signal);
     ::sigaction(signal, &action, nullptr);
     // One that is pending acts by the new disposition.
     sigset_t set;

@@ -152,37 +152,73 @@ kern_return_t HXReplayPlatform::mach_vm_region_recurse(mach_port_t task, uint64_
     return KERN_SUCCESS;
 }
 
+// How many calls more succeed before the fault is met; each kPageQueryPages begun are one.
+uint64_t HXReplayPlatform::callsBeforeFault(const HXMachineProcess &process, const State &state,
+                                            HXMachineCall call) {
+    if (!process.faults) return UINT64_MAX;
+    const HXMachineFault &fault = process.faults->ofCall[static_cast<size_t>(call)];
+    const uint64_t calls = state.calls[static_cast<size_t>(call)] + 1;
+    if (fault.error == 0) return UINT64_MAX;
+    return fault.from > calls ? fault.from - calls : 0;
+}
+
 kern_return_t HXReplayPlatform::mach_vm_page_range_query(mach_port_t task, uint64_t address, uint64_t size,
-                                                         int32_t *dispositions, uint64_t *count) {
+                                                         std::vector<vm_page_run> *runs, uint64_t *pages) {
     const auto [process, state] = taskOf(task);
     if (process == nullptr) return KERN_INVALID_ARGUMENT;
-    if (const kern_return_t error = countCall(*process, *state, HXMachineCall::pageRangeQuery)) return error;
+    constexpr HXMachineCall call = HXMachineCall::pageRangeQuery;
+    const uint64_t moreCalls = callsBeforeFault(*process, *state, call);
+    if (const kern_return_t error = countCall(*process, *state, call)) return error;
     const uint64_t pageSize = _machine.host.pageSize;
-    const uint64_t inPage = address % pageSize;
-    const uint64_t pages = size / pageSize + (size % pageSize + inPage + pageSize - 1) / pageSize;
-    const uint64_t wanted = std::min(pages, *count);
-    uint64_t page = address - inPage;
-    uint64_t filled = 0;
-    while (filled < wanted) {
-        const HXMachineRegion *const region = regionAt(*process, *state, page);
-        if (region == nullptr || !_machine.extra(*region).hasPageRuns) return KERN_INVALID_ADDRESS;
-        const HXMachineRegionExtra &extra = _machine.extra(*region);
-        const auto runs = _machine.pageRuns.begin() + static_cast<std::ptrdiff_t>(extra.firstPageRun);
-        const auto runsEnd = runs + extra.pageRunCount;
-        uint64_t index = (page - region->address) / pageSize;
-        const uint64_t endIndex = std::min(region->size / pageSize, index + wanted - filled);
-        auto run = std::upper_bound(runs, runsEnd, index, [](uint64_t pageIndex, const HXMachinePageRun &r) {
-            return pageIndex < r.endPage;
-        });
-        for (; index < endIndex; index++) {
-            while (run != runsEnd && run->endPage <= index)
-                ++run;
-            dispositions[filled++] = run == runsEnd ? 0 : run->disposition;
-        }
-        page = region->address + endIndex * pageSize;
+    const uint64_t inPage = address % pageSize, start = address - inPage;
+    const uint64_t asked = size / pageSize + (size % pageSize + inPage + pageSize - 1) / pageSize;
+    const uint64_t told =
+        moreCalls > asked / kPageQueryPages ? asked : std::min(asked, moreCalls * kPageQueryPages);
+    runs->clear();
+    const uint64_t found = findRuns(*process, *state, start / pageSize, told, runs);
+    *pages = told;
+    if (found < told) {
+        *pages = found / kPageQueryPages * kPageQueryPages;
+        if (*pages == 0) return KERN_INVALID_ADDRESS;
+        HXCutRuns(start + *pages * pageSize, pageSize, runs);
     }
-    *count = filled;
+    state->calls[static_cast<size_t>(call)] += *pages == 0 ? 0 : (*pages - 1) / kPageQueryPages;
     return KERN_SUCCESS;
+}
+
+// Adds the runs of `pages` pages from number `first` on; how many lie in regions with known pages, up to the
+// first one that does not.
+uint64_t HXReplayPlatform::findRuns(const HXMachineProcess &process, State &state, uint64_t first,
+                                    uint64_t pages, std::vector<vm_page_run> *runs) const {
+    const uint64_t pageSize = _machine.host.pageSize;
+    uint64_t found = 0;
+    while (found < pages && first + found <= UINT64_MAX / pageSize) {
+        const HXMachineRegion *const region = regionAt(process, state, (first + found) * pageSize);
+        if (region == nullptr || !_machine.extra(*region).hasPageRuns) break;
+        const uint64_t index = first + found - region->address / pageSize;
+        const uint64_t count = std::min(region->size / pageSize - index, pages - found);
+        addRuns(*region, index, index + count, runs);
+        found += count;
+    }
+    return found;
+}
+
+// Adds the runs of a region's pages from `index` to the one before `endIndex`.
+void HXReplayPlatform::addRuns(const HXMachineRegion &region, uint64_t index, uint64_t endIndex,
+                               std::vector<vm_page_run> *runs) const {
+    const uint64_t pageSize = _machine.host.pageSize;
+    const HXMachineRegionExtra &extra = _machine.extra(region);
+    const auto first = _machine.pageRuns.begin() + static_cast<std::ptrdiff_t>(extra.firstPageRun);
+    const auto last = first + extra.pageRunCount;
+    auto run = std::upper_bound(first, last, index, [](uint64_t wanted, const HXMachinePageRun &each) {
+        return wanted < each.endPage;
+    });
+    for (; run != last && index < endIndex; ++run) {
+        const uint64_t end = std::min<uint64_t>(run->endPage, endIndex);
+        if (run->disposition != 0)
+            runs->push_back({region.address + index * pageSize, end - index, run->disposition});
+        index = end;
+    }
 }
 
 kern_return_t HXReplayPlatform::mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,

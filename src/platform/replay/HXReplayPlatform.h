@@ -24,7 +24,7 @@ class HXReplayPlatform : public HXPlatform {
                                          uint32_t *nestingDepth, vm_region_submap_info_64 *info,
                                          uint32_t *infoCount) override;
     kern_return_t mach_vm_page_range_query(mach_port_t task, uint64_t address, uint64_t size,
-                                           int32_t *dispositions, uint64_t *count) override;
+                                           std::vector<vm_page_run> *runs, uint64_t *pages) override;
     kern_return_t mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,
                                            int32_t *state) override;
     uint32_t vm_kernel_page_size() override { return _machine.host.pageSize; }
@@ -83,12 +83,17 @@ class HXReplayPlatform : public HXPlatform {
     };
     Task taskOf(mach_port_t task);
     State *stateOf(int32_t pid);
+    static uint64_t callsBeforeFault(const HXMachineProcess &process, const State &state, HXMachineCall call);
     kern_return_t countCall(const HXMachineProcess &process, State &state, HXMachineCall call);
     bool countsHeft() const { return _selfRegionHeft.load(std::memory_order_relaxed) != 0; }
     bool exists(const HXMachineRegion &region) const;
     const HXMachineRegion *firstRegion(const HXMachineProcess &process, State &state, uint64_t address) const;
     const HXMachineRegion *regionAt(const HXMachineProcess &process, State &state, uint64_t address) const;
     vm_region_submap_info_64 info(const HXMachineRegion &region) const;
+    uint64_t findRuns(const HXMachineProcess &process, State &state, uint64_t first, uint64_t pages,
+                      std::vector<vm_page_run> *runs) const;
+    void addRuns(const HXMachineRegion &region, uint64_t index, uint64_t endIndex,
+                 std::vector<vm_page_run> *runs) const;
     uint32_t hostTag(const vm_region_submap_info_64 &info) const;
     std::string_view text(uint32_t string) const;
     int32_t argumentArea(int32_t pid, void *old, size_t *oldBytes) const;

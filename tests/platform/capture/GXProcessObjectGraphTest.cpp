@@ -2,9 +2,11 @@
 #include "platform/capture/GXProcessObjectGraph.h"
 #include "support/HXBuilders.h"
 #include "support/HXRun.h"
-#include "support/HXTwoWorkers.h"
 
 #include <gtest/gtest.h>
+
+#include <fstream>
+#include <sstream>
 
 #include <algorithm>
 #include <fstream>
@@ -72,7 +74,8 @@ TEST(GXProcessObjectGraph, IsReportedBesideLiveProcesses) {
         pathOf("process|pid=42|name=g|description=ARM64|page_size=16384|phys_heft=65536\n"
                "region|address=0x4000|length=0x10000|type=mapped file|path=/data/file.db|prot=3|max_prot=3"
                "|resident=65536|dirty=32768|external_pager=1|share_mode=4|object_id=0x32\n");
-    const std::string out = run(kTwoWorkers, {"-f", "bytes", "beta", path}).out;
+    const std::string machine = contentOf(TEST_CASES "/two-workers.machine");
+    const std::string out = run(machine.substr(machine.find('\n')), {"-f", "bytes", "beta", path}).out;
     const std::string header = "      Dirty         Clean   Reclaimable    Regions    Category\n"
                                "        ---           ---           ---        ---    ---\n";
     for (const std::string with : {"Shared with g [42] (memgraph):\n", "Shared with beta [200]:\n"})

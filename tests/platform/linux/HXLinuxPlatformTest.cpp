@@ -4,6 +4,7 @@
 #include "platform/HXRegionTags.h"
 #include "platform/linux/memory/HXPageScan.h"
 #include "platform/linux/procfs/HXProcFile.h"
+#include "support/HXPages.h"
 #include "support/HXTemporaryFolder.h"
 
 #include <fcntl.h>
@@ -15,6 +16,7 @@
 #include <cerrno>
 #include <cinttypes>
 #include <cstring>
+#include <filesystem>
 
 namespace {
 
@@ -52,13 +54,6 @@ class HXLinuxPlatformTest : public testing::Test {
     kern_return_t region(mach_port_t task) {
         uint32_t depth = UINT32_MAX, words = kRegionWords;
         return platform.mach_vm_region_recurse(task, &address, &size, &depth, &info, &words);
-    }
-    kern_return_t pages(mach_port_t task, uint64_t from, uint64_t bytes, std::vector<int32_t> &dispositions) {
-        uint64_t count = dispositions.size();
-        const kern_return_t error =
-            platform.mach_vm_page_range_query(task, from, bytes, dispositions.data(), &count);
-        dispositions.resize(count);
-        return error;
     }
     std::string nameInArguments(int pid) {
         const int32_t name[] = {1, 49, pid};
@@ -311,12 +306,13 @@ TEST_F(HXLinuxPlatformTest, ReadsMoreProcessesThanItMayOpenFiles) {
 }
 
 TEST_F(HXLinuxPlatformTest, ReadsPageTables) {
-    process(10, "p",
-            "1000-9000 rw-p 0 fe:01 5 /x\n"
-            "Rss:                  16 kB\nAnonymous:            12 kB\nLazyFree:              4 kB\n"
-            "Swap:                  4 kB\nVmFlags: rd\n9000-a000 rw-p 0 00:06 7 /dev/driver\nVmFlags: rd\n"
-            "a000-c000 rw-s 0 00:01 8 /memfd:x (deleted)\nVmFlags: rd\n"
-            "c000-e000 rw-s 0 00:0f 9 /pool\nVmFlags: rd ht\n20000-21000 r--p 0 00:00 0\n");
+    process(
+        10, "p",
+        "1000-9000 rw-p 0 fe:01 5 /x\n"
+        "Rss:                  16 kB\nAnonymous:            12 kB\nLazyFree:              4 kB\n"
+        "Swap:                  4 kB\nVmFlags: rd\n9000-a000 rw-p 0 00:06 7 /dev/driver\nVmFlags: rd\n"
+        "a000-c000 rw-s 0 00:01 8 /memfd:x (deleted)\nRss:                   4 kB\nVmFlags: rd\n"
+        "c000-e000 rw-s 0 00:0f 9 /pool\nShared_Hugetlb: 4 kB\nVmFlags: rd ht\n20000-21000 r--p 0 00:00 0\n");
     constexpr uint64_t present = 1ULL << 63, swapped = 1ULL << 62, file = 1ULL << 61, guard = 1ULL << 58;
     const uint64_t entries[] = {
         0,       present | file, present, swapped,        swapped, guard | swapped, present, present, 0,
@@ -337,11 +333,28 @@ TEST_F(HXLinuxPlatformTest, ReadsPageTables) {
         {0x20000, 0x1000, KERN_INVALID_ARGUMENT, {}},        // the page tables have gone
     };
     for (const auto &item : cases) {
-        std::vector<int32_t> dispositions(8);
-        ASSERT_EQ(pages(task, item.from, item.bytes, dispositions), item.error) << std::hex << item.from;
-        if (item.error != KERN_SUCCESS) continue;
+        std::vector<int32_t> dispositions;
+        ASSERT_EQ(HXPagesOf(platform, task, item.from, item.bytes, &dispositions), item.error)
+            << std::hex << item.from;
         EXPECT_EQ(dispositions, item.expected) << std::hex << item.from;
     }
+}
+
+TEST_F(HXLinuxPlatformTest, ReadsNoPageTablesBehindTheLastPage) {
+    constexpr uint64_t bytes = uint64_t{1} << 46, pages = bytes / 4096; // which nobody would read one by one
+    process(10, "p",
+            "0-400000000000 rw-s 0 00:01 8 /memfd:x (deleted)\nRss:                   8 kB\nVmFlags: rd\n");
+    std::string entries(5000 * 8, '\0');
+    entries[7] = entries.back() = static_cast<char>(0xA0); // present, of the object
+    proc.write("10/pagemap", entries);
+    std::filesystem::resize_file(proc / "10/pagemap", pages * 8);
+    std::vector<vm_page_run> runs;
+    uint64_t told = 0;
+    ASSERT_EQ(platform.mach_vm_page_range_query(open(10), 0, bytes, &runs, &told), KERN_SUCCESS);
+    EXPECT_EQ(told, pages);
+    ASSERT_EQ(runs.size(), 2u);
+    EXPECT_EQ(runs[0].address, 0u);
+    EXPECT_EQ(runs[1].address, 4999u * 4096);
 }
 
 TEST_F(HXLinuxPlatformTest, LeavesThePagesOfAnotherProgramAlone) {
@@ -354,8 +367,8 @@ TEST_F(HXLinuxPlatformTest, LeavesThePagesOfAnotherProgramAlone) {
     for (const auto &[range, error] : cases) {
         process(++pid, "p", "0-1000 rw-p 0 00:00 0\n"s + range + " rw-p 0 00:00 0 [stack]\n");
         proc.write(std::to_string(pid) + "/pagemap", std::string(8, '\0'));
-        std::vector<int32_t> dispositions(1);
-        EXPECT_EQ(pages(open(pid), 0, 0x1000, dispositions), error) << range;
+        std::vector<int32_t> dispositions;
+        EXPECT_EQ(HXPagesOf(platform, open(pid), 0, 0x1000, &dispositions), error) << range;
     }
 }
 

@@ -1,6 +1,7 @@
 // Work queues, signals and the command line's own files on the live host.
 #include "platform/linux/HXLinuxServices.h"
 
+#include "support/HXBuilders.h"
 #include "support/HXTemporaryFolder.h"
 
 #include <gtest/gtest.h>
@@ -69,48 +70,102 @@ TEST(HXLinuxDispatch, SignalsGoToTheSourceThenToTheDisposition) {
     EXPECT_TRUE(WIFSIGNALED(ended) && WTERMSIG(ended) == SIGINT) << ended;
 }
 
-TEST(HXLinuxFiles, ReadsPlainFilesAlone) {
+// Whatever is no regular file is refused at once, whether or not somebody writes to it.
+TEST(HXLinuxFiles, RegularFilesAreOpenedAlone) {
     HXLinuxServices services;
     const HXTemporaryFolder folder;
-    folder.write("plain", std::string(100000, 'x'));
+    folder.write("plain", "text");
     mkfifo((folder / "fifo").c_str(), 0600);
-    EXPECT_EQ(services.readFile(folder / "plain", 100000)->size(), 100000u);
-    EXPECT_EQ(services.readFileStart(folder / "plain", 99999)->size(), 99999u);
-    EXPECT_EQ(services.readFileStart(folder / "plain", 100001)->size(), 100000u);
-    EXPECT_GT(services.readFile("/proc/self/status", 100000).value_or("").size(), 100u) << "of no size";
-    const std::pair<std::string, int> cases[] = {{folder / "plain", EFBIG},
-                                                 {folder / "fifo", EINVAL},
-                                                 {"/dev/zero", EINVAL},
-                                                 {folder.path(), EISDIR},
-                                                 {folder / "none", ENOENT}};
-    for (const auto &item : cases) {
-        EXPECT_FALSE(services.readFile(item.first, 99999)) << item.first;
-        EXPECT_EQ(errno, item.second) << item.first;
+    const std::pair<std::string, int> cases[] = {
+        {folder / "fifo", EINVAL}, {"/dev/zero", EINVAL}, {folder.path(), EISDIR}, {folder / "none", ENOENT}};
+    for (const auto &[path, error] : cases) {
+        EXPECT_EQ(services.openRegularFile(path), nullptr) << path;
+        EXPECT_EQ(errno, error) << path;
     }
+    for (const std::string &path : {(folder / "plain").string(), std::string("/proc/self/status")})
+        EXPECT_FALSE(contentOf(services.openRegularFile(path)).empty()) << path;
 }
 
 TEST(HXLinuxFiles, PendingFilesAppearWhole) {
     HXLinuxServices services;
     const HXTemporaryFolder folder;
-    const std::string path = folder / "report";
-    auto file = services.createPendingFile(path);
-    ASSERT_TRUE(file);
-    std::fputs("text", file->stream);
-    EXPECT_FALSE(services.stat(path));
-    EXPECT_TRUE(services.commitPendingFile(*file));
-    EXPECT_EQ(services.readFile(path, 10), "text");
-    EXPECT_EQ(fs::status(path).permissions(), fs::perms(0600));
-
-    auto discarded = services.createPendingFile(path);
-    services.discardPendingFile(*discarded);
-    auto lost = services.createPendingFile(folder / "sub" / "x");
-    EXPECT_FALSE(lost);
+    folder.write("old", "old");
+    fs::permissions(folder / "old", fs::perms(0644));
+    folder.link("link", "sub/../old");
+    folder.link("dangling", "new");
     fs::create_directory(folder / "sub");
-    lost = services.createPendingFile(folder / "sub" / "x");
+    for (const auto &[name, place] : {std::pair("old", "old"), {"link", "old"}, {"dangling", "new"}}) {
+        const std::string before = contentOf(folder / place);
+        auto discarded = services.createPendingFile(folder / name),
+             file = services.createPendingFile(folder / name);
+        ASSERT_TRUE(file && discarded) << name;
+        for (const auto &each : {&*discarded, &*file})
+            std::fputs(name, each->stream);
+        services.discardPendingFile(*discarded);
+        EXPECT_EQ(contentOf(folder / place), before) << name;
+        EXPECT_TRUE(services.commitPendingFile(*file)) << name;
+        EXPECT_EQ(contentOf(folder / place), name);
+        EXPECT_EQ(fs::status(folder / place).permissions(), fs::perms(0600)) << name;
+    }
+    EXPECT_TRUE(fs::is_symlink(folder / "link") && fs::is_symlink(folder / "dangling"));
+
+    auto lost = services.createPendingFile(folder / "sub" / "x");
     fs::create_directory(folder / "sub" / "x"); // in the way
     EXPECT_FALSE(services.commitPendingFile(*lost));
-    EXPECT_EQ(std::distance(fs::directory_iterator(folder.path()), {}), 2) << "nothing is left over";
+    EXPECT_EQ(errno, EISDIR);
+    const std::pair<std::string, int> nowhere[] = {{folder / "none/x", ENOENT},
+                                                   {folder / "sub", EISDIR},
+                                                   {"", ENOENT},
+                                                   {folder / std::string(300, 'n'), ENAMETOOLONG}};
+    for (const auto &[path, error] : nowhere) {
+        EXPECT_FALSE(services.createPendingFile(path)) << path;
+        EXPECT_EQ(errno, error) << path;
+    }
+    EXPECT_EQ(std::distance(fs::directory_iterator(folder.path()), {}), 5) << "nothing is left over";
     EXPECT_EQ(std::distance(fs::directory_iterator(folder / "sub"), {}), 1);
+}
+
+// What was written to an open file before stays, and it goes on where that ended.
+TEST(HXLinuxFiles, OpenFilesAreWrittenAsTheyStand) {
+    HXLinuxServices services;
+    const HXTemporaryFolder folder;
+    std::FILE *const open = std::fopen((folder / "open").c_str(), "w");
+    std::fputs("before ", open);
+    std::fflush(open);
+    folder.link("link", "/dev/fd/" + std::to_string(fileno(open)));
+    auto file = services.createPendingFile(folder / "link");
+    ASSERT_TRUE(file);
+    std::fputs("after", file->stream);
+    EXPECT_TRUE(services.commitPendingFile(*file));
+    std::fclose(open);
+    EXPECT_EQ(contentOf(folder / "open"), "before after");
+}
+
+TEST(HXLinuxFiles, SignalsLeaveTheOldFileAndNothingElse) {
+    const HXTemporaryFolder folder;
+    folder.write("report", "old");
+    for (const int signal : {SIGINT, SIGTERM, SIGHUP}) {
+        const int ended = statusOf([&] {
+            HXLinuxServices services;
+            auto kept = services.createPendingFile(folder / "report"),
+                 gone = services.createPendingFile(folder / "gone");
+            std::fputs("half", kept->stream);
+            services.discardPendingFile(*gone);
+            services.signal(signal, HXSignalDisposition::byDefault); // as when gathering has ended
+            return raise(signal);
+        });
+        EXPECT_TRUE(WIFSIGNALED(ended) && WTERMSIG(ended) == signal) << ended;
+        EXPECT_EQ(contentOf(folder / "report"), "old");
+        EXPECT_EQ(std::distance(fs::directory_iterator(folder.path()), {}), 1) << signal;
+    }
+    // A signal that is ignored stays so.
+    EXPECT_EQ(statusOf([&] {
+                  signal(SIGHUP, SIG_IGN);
+                  HXLinuxServices services;
+                  auto file = services.createPendingFile(folder / "report");
+                  return raise(SIGHUP);
+              }),
+              0);
 }
 
 } // namespace

@@ -1,6 +1,7 @@
 // What a replayed machine answers of its own; what every host does is in HXHostContractTest.cpp.
 #include "platform/HXHostGuards.h"
 #include "support/HXMadeUpMachine.h"
+#include "support/HXPages.h"
 
 #include <gtest/gtest.h>
 
@@ -33,14 +34,13 @@ kern_return_t top(HXPlatform &host, uint64_t address) {
     return host.mach_vm_region(taskOf(host, 5), &address, &size, VM_REGION_BASIC_INFO_64, &info, &words);
 }
 // The dispositions as text, or "error N".
-std::string pages(HXPlatform &host, uint64_t address, uint64_t size, uint64_t room = 16) {
-    int32_t dispositions[16] = {};
-    const kern_return_t error =
-        host.mach_vm_page_range_query(taskOf(host, 5), address, size, dispositions, &room);
+std::string pages(HXPlatform &host, uint64_t address, uint64_t size) {
+    std::vector<int32_t> dispositions;
+    const kern_return_t error = HXPagesOf(host, taskOf(host, 5), address, size, &dispositions);
     if (error != KERN_SUCCESS) return "error " + std::to_string(error);
     std::string text;
-    for (uint64_t i = 0; i < room; i++)
-        text += (i == 0 ? "" : " ") + std::to_string(dispositions[i]);
+    for (const int32_t disposition : dispositions)
+        text += (text.empty() ? "" : " ") + std::to_string(disposition);
     return text;
 }
 // The status in the short record, or minus the errno.
@@ -78,19 +78,54 @@ region  pid=5  address=0x7000  size=0x1000
 region  pid=5  address=0x9000  size=0x1000  pages=1*0xffffffff
 )");
     static constexpr struct {
-        uint64_t address, size, room;
+        uint64_t address, size;
         const char *answer;
     } cases[] = {
-        {0x1000, 0x6000, 16, "9 16 0 0 3 3"},
-        {0x1000, 0x6000, 2, "9 16"},
-        {0x2000, 0x3001, 16, "16 0 0 3"},
-        {0x6000, 0x2000, 16, "error 1"},
-        {0x9000, 0x1000, 16, "-1"},
-        {0x1fff, 2, 16, "9 16"},
-        {0xfffffffffffff000, 0x1000, 16, "error 1"},
+        {0x1000, 0x6000, "9 16 0 0 3 3"},
+        {0x2000, 0x3001, "16 0 0 3"},
+        {0x6000, 0x2000, "error 1"},
+        {0x9000, 0x1000, "-1"},
+        {0x1fff, 2, "9 16"},
+        {0xfffffffffffff000, 0x1000, "error 1"},
     };
     for (const auto &test : cases)
-        EXPECT_EQ(pages(host, test.address, test.size, test.room), test.answer) << test.address;
+        EXPECT_EQ(pages(host, test.address, test.size), test.answer) << test.address;
+}
+
+// As queries of 4,096 pages each would, though one may tell of more.
+TEST(HXReplay, TellsOfAsManyPagesAsCallsSucceed) {
+    const std::string region = R"(
+region  pid=5  address=0x100000000  size=0x10000000  pages=8190*0,8*9,0x2000*0,1*3
+region  pid=5  address=0x110000000  size=0x5000000  pages=1*9
+region  pid=5  address=0x115000000  size=0x1000
+)";
+    static constexpr struct {
+        const char *fault;
+        uint64_t size, told;
+        size_t runs;
+        kern_return_t error; // of the pages behind
+    } cases[] = {
+        {"", 0x14000000, 0x14000, 3, 0},
+        {"", 0x15001000, 0x15000, 3, KERN_INVALID_ADDRESS},
+        {"from=3  error=9", 0x14000000, 0x2000, 1, 9},
+        {"from=4  error=9", 0x14000000, 0x3000, 1, 9},
+        {"from=21  error=9", 0x14000000, 0x14000, 3, 9},
+    };
+    for (const auto &test : cases) {
+        const std::string fault = *test.fault == 0 ? "" : "fault  pid=5  call=mach_vm_page_range_query  ";
+        HXMadeUpMachine host("host  page_size=4096\nprocess  pid=5" + region + fault + test.fault + "\n");
+        std::vector<vm_page_run> runs;
+        uint64_t told = 0;
+        const mach_port_t task = taskOf(host, 5);
+        ASSERT_EQ(host.mach_vm_page_range_query(task, 0x100000000, test.size, &runs, &told), KERN_SUCCESS);
+        EXPECT_EQ(told, test.told) << test.fault;
+        EXPECT_EQ(runs.size(), test.runs) << test.fault;
+        if (test.told == 0x2000) {
+            EXPECT_EQ(runs.back().pages, 2U) << "cut at the end of what is told";
+        }
+        const uint64_t behind = told == 0x14000 ? 0x100000000 : 0x100000000 + told * 4096;
+        EXPECT_EQ(host.mach_vm_page_range_query(task, behind, 0x2000, &runs, &told), test.error);
+    }
 }
 
 TEST(HXReplay, FaultsFromTheCallOnThatTheyName) {

@@ -11,12 +11,19 @@
 #include <string>
 #include <string_view>
 #include <unordered_map>
+#include <vector>
 
 // A path that mappings name; `text` is safe.
 struct HXMappedPath {
     std::string text;
     HXPathKind kind = HXPathKind::none;
     uint8_t namedTag = 0; // of the name that the program gave the memory
+};
+
+// Addresses [start, end).
+struct HXAddressRange {
+    uint64_t start;
+    uint64_t end;
 };
 
 class HXAddressSpace {
@@ -28,6 +35,8 @@ class HXAddressSpace {
     kern_return_t endError = KERN_INVALID_ADDRESS;
     bool knowsDirtyPages = false;
     uint64_t ipcNamespace = 0; // read when there is System V memory
+    // Where mappings show pages of their object that a mapping at a lower address shows, too; ascending.
+    std::vector<HXAddressRange> repeated;
 
     size_t count() const { return _mappings.size(); }
     HXMapping &operator[](size_t index) { return _mappings[index]; }

@@ -1,5 +1,6 @@
 #include "platform/linux/memory/HXLinuxTask.h"
 
+#include "platform/linux/memory/HXRepeatedPages.h"
 #include "platform/linux/memory/HXTaskFiles.h"
 
 #include <cerrno>
@@ -21,9 +22,9 @@ bool HXDescriptorTurns::run(const std::function<void()> &read) {
     return !watch.seen();
 }
 
-HXLinuxTask::HXLinuxTask(int32_t pid, HXOpenProcess process, bool keepsOpen, HXLinuxProcesses &processes,
-                         HXDescriptorTurns &turns)
-    : _pid(pid), _startTime(process.stat.startTime), _processes(processes), _turns(turns) {
+HXLinuxTask::HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, bool keepsOpen,
+                         HXLinuxProcesses &processes, HXDescriptorTurns &turns)
+    : _pid(pid), _number(number), _startTime(process.stat.startTime), _processes(processes), _turns(turns) {
     if (keepsOpen) _directory = std::move(process.directory);
 }
 
@@ -50,6 +51,7 @@ const HXAddressSpace &HXLinuxTask::addressSpace(const HXReaderSetting &setting, 
             _addressSpace->endError = KERN_RESOURCE_SHORTAGE;
         }
         _pages.emplace(_directory, setting.pageShift);
+        withDescriptors([&] { HXFindRepeatedPages(setting.pageShift, &*_pages, _addressSpace.get()); });
     }
     return *_addressSpace;
 }

@@ -32,13 +32,15 @@ class HXDescriptorTurns {
 // then. When it is opened again, the process's start time must be the same. Used by one thread at a time.
 class HXLinuxTask {
   public:
-    // `keepsOpen`: hold the directory open until the task ends. What else is given outlives this.
-    HXLinuxTask(int32_t pid, HXOpenProcess process, bool keepsOpen, HXLinuxProcesses &processes,
-                HXDescriptorTurns &turns);
+    // `number`: HXObjectIdentifiers::numberOfProcess. `keepsOpen`: hold the directory open until the task
+    // ends. What else is given outlives this.
+    HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, bool keepsOpen,
+                HXLinuxProcesses &processes, HXDescriptorTurns &turns);
     HXLinuxTask(const HXLinuxTask &) = delete;
     HXLinuxTask &operator=(const HXLinuxTask &) = delete;
 
     int32_t pid() const { return _pid; }
+    uint32_t number() const { return _number; }
     const HXDescriptor &directory() const { return _directory; }
 
     // Runs `read` by turns; if descriptors do not suffice, the address space, once read, ends with that
@@ -69,6 +71,7 @@ class HXLinuxTask {
     void compare(const HXReaderSetting &setting, bool isFirst);
 
     const int32_t _pid;
+    const uint32_t _number;
     const uint64_t _startTime; // clock ticks since boot
     HXLinuxProcesses &_processes;
     HXDescriptorTurns &_turns;

@@ -51,7 +51,10 @@ struct HXMapping {
     uint32_t swappedPages = 0;
     uint32_t dirtyPages = 0; // Shared_Dirty and Private_Dirty
     uint32_t hugePages = 0;  // Shared_Hugetlb and Private_Hugetlb, in base pages
-    uint16_t flags = 0;      // HXMappingFlag
+    // Of these, pages of the object that a mapping at a lower address shows, too (HXRepeatedPages.h).
+    uint32_t repeatedPages = 0;
+    uint32_t repeatedSwappedPages = 0;
+    uint16_t flags = 0; // HXMappingFlag
     HXPathKind kind = HXPathKind::none;
     uint8_t tag = 0; // user tag
 
@@ -60,4 +63,4 @@ struct HXMapping {
     bool has(uint16_t wanted) const { return (flags & wanted) != 0; }
     bool contains(uint64_t address) const { return address >= start && address < end; }
 };
-static_assert(sizeof(HXMapping) == 72);
+static_assert(sizeof(HXMapping) == 80);

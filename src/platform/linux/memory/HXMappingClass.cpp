@@ -10,29 +10,8 @@ constexpr std::string_view kDeletedSuffix = " (deleted)";
 constexpr std::string_view kAnonymousPrefix = "[anon:";
 constexpr std::string_view kSharedPrefix = "[anon_shmem:";
 
-// Finaliser of a 64-bit linear generator; every bit of the result depends on every bit of the value.
-uint64_t mix(uint64_t value) {
-    value += 0x9E3779B97F4A7C15;
-    value = (value ^ (value >> 30)) * 0xBF58476D1CE4E5B9;
-    value = (value ^ (value >> 27)) * 0x94D049BB133111EB;
-    return value ^ (value >> 31);
-}
-
-// Keep the identifiers of different kinds of objects apart.
-enum IdentifierClass : uint64_t { fileClass = 1, mappingClass, systemVClass, vdsoClass };
-
-uint64_t identifier(IdentifierClass kind, uint64_t first, uint64_t second) {
-    const uint64_t id = mix(mix(mix(kind) ^ first) ^ second);
-    return id == 0 || id == UINT64_MAX ? kind : id;
-}
-
 bool isAccessible(const HXMapping &mapping) {
     return mapping.has(HXMappingReadable | HXMappingWritable | HXMappingExecutable);
-}
-
-bool isPrivateAnonymous(const HXMapping &mapping) {
-    if (mapping.has(HXMappingShared)) return false;
-    return !mapping.isFile() || mapping.kind == HXPathKind::anonymousHuge;
 }
 
 uint64_t residentPages(const HXMapping &mapping) {
@@ -48,30 +27,11 @@ uint64_t difference(uint64_t whole, uint64_t part) {
 }
 
 // Resident pages that the kernel cannot drop without swapping, and that go with their last mapping. Lazily
-// freed pages are not among them.
+// freed pages are not among them, nor what a mapping at a lower address is charged for.
 uint64_t chargedPages(const HXMapping &mapping) {
     uint64_t pages = difference(mapping.anonymousPages, mapping.lazyFreePages) + mapping.hugePages;
     if (mapping.has(HXMappingSwapBacked)) pages += difference(mapping.residentPages, mapping.anonymousPages);
-    return pages;
-}
-
-// Whether a private mapping holds pages of its own.
-bool holdsOwnPages(const HXMapping &mapping) {
-    if (mapping.has(HXMappingShared) || mapping.kind == HXPathKind::vdso) return false;
-    return isPrivateAnonymous(mapping) || mapping.anonymousPages > 0 || mapping.swappedPages > 0 ||
-           mapping.hugePages > 0;
-}
-
-// Never 0 or all ones.
-uint64_t objectIdentifier(const HXMapping &mapping, const HXRegionContext &context) {
-    if (holdsOwnPages(mapping))
-        return identifier(mappingClass, static_cast<uint32_t>(context.pid), mapping.start);
-    if (mapping.kind == HXPathKind::vdso) return identifier(vdsoClass, 0, mapping.end - mapping.start);
-    // System V memory's inode number is its identifier, which says nothing outside its namespace and which
-    // other shared memory may have, too.
-    if (mapping.kind == HXPathKind::systemV)
-        return identifier(systemVClass, context.ipcNamespace, mapping.inode ^ uint64_t{mapping.device} << 32);
-    return identifier(fileClass, mapping.device, mapping.inode);
+    return difference(pages, mapping.repeatedPages);
 }
 
 uint8_t tagOf(const HXMapping &mapping, uint8_t namedTag) {
@@ -118,7 +78,7 @@ uint8_t shareModeOf(const HXMapping &mapping) {
     if (!isAccessible(mapping) && residentPages(mapping) == 0 && mapping.swappedPages == 0) return SM_EMPTY;
     if (mapping.has(HXMappingShared)) return SM_SHARED;
     if (mapping.kind == HXPathKind::vdso) return SM_COW;
-    return isPrivateAnonymous(mapping) ? SM_PRIVATE : SM_COW;
+    return HXIsPrivateAnonymous(mapping) ? SM_PRIVATE : SM_COW;
 }
 
 uint32_t reportedDirtyPages(const HXMapping &mapping, bool reportsCharge) {
@@ -161,6 +121,17 @@ std::string_view HXGivenName(std::string_view path) {
     return {};
 }
 
+bool HXIsPrivateAnonymous(const HXMapping &mapping) {
+    if (mapping.has(HXMappingShared)) return false;
+    return !mapping.isFile() || mapping.kind == HXPathKind::anonymousHuge;
+}
+
+bool HXHoldsOwnPages(const HXMapping &mapping) {
+    if (mapping.has(HXMappingShared) || mapping.kind == HXPathKind::vdso) return false;
+    return HXIsPrivateAnonymous(mapping) || mapping.anonymousPages > 0 || mapping.swappedPages > 0 ||
+           mapping.hugePages > 0;
+}
+
 void HXClassifyMapping(HXPathKind kind, HXFileSystemKind fileSystem, uint32_t sharedMemoryDevice,
                        uint8_t namedTag, HXMapping *mapping) {
     const bool huge = mapping->has(HXMappingHugePages);
@@ -173,23 +144,24 @@ void HXClassifyMapping(HXPathKind kind, HXFileSystemKind fileSystem, uint32_t sh
     mapping->tag = tagOf(*mapping, namedTag);
 }
 
-vm_region_submap_info_64 HXRegionInfo(const HXMapping &mapping, const HXRegionContext &context) {
+vm_region_submap_info_64 HXRegionInfo(const HXMapping &mapping, uint64_t objectID, bool reportsCharge) {
     constexpr uint32_t inheritCopy = 1, inheritNone = 2; // VM_INHERIT_…
     vm_region_submap_info_64 info{};
     info.protection = protectionOf(mapping, HXMappingReadable, HXMappingWritable, HXMappingExecutable);
     info.max_protection = protectionOf(mapping, HXMappingMayRead, HXMappingMayWrite, HXMappingMayExecute);
     info.inheritance = mapping.has(HXMappingNotInherited) ? inheritNone : inheritCopy;
-    info.offset = isPrivateAnonymous(mapping) ? 0 : mapping.offset;
+    info.offset = HXIsPrivateAnonymous(mapping) ? 0 : mapping.offset;
     info.user_tag = mapping.tag;
     info.pages_resident = saturated(residentPages(mapping));
-    info.pages_swapped_out = mapping.swappedPages;
-    info.pages_dirtied = reportedDirtyPages(mapping, context.reportsCharge);
+    info.pages_swapped_out =
+        static_cast<uint32_t>(difference(mapping.swappedPages, mapping.repeatedSwappedPages));
+    info.pages_dirtied = reportedDirtyPages(mapping, reportsCharge);
     info.ref_count = 1;
     info.external_pager = mapping.has(HXMappingHasPager) ? 1 : 0;
     info.share_mode = shareModeOf(mapping);
     info.user_wired_count = mapping.has(HXMappingLocked | HXMappingHugePages) ? 1 : 0;
     info.pages_reusable = mapping.lazyFreePages;
-    info.object_id_full = objectIdentifier(mapping, context);
+    info.object_id_full = objectID;
     info.object_id = static_cast<uint32_t>(info.object_id_full ^ info.object_id_full >> 32);
     if (info.object_id == 0) info.object_id = 1;
     return info;

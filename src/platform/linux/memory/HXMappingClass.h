@@ -20,11 +20,11 @@ std::string_view HXGivenName(std::string_view path);
 void HXClassifyMapping(HXPathKind kind, HXFileSystemKind fileSystem, uint32_t sharedMemoryDevice,
                        uint8_t namedTag, HXMapping *mapping);
 
-// What a region record needs beyond the mapping.
-struct HXRegionContext {
-    int32_t pid = 0;
-    uint64_t ipcNamespace = 0;  // tells System V identifiers of different namespaces apart
-    bool reportsCharge = false; // "vm.self_region_heft"
-};
-// The record of a classified mapping.
-vm_region_submap_info_64 HXRegionInfo(const HXMapping &mapping, const HXRegionContext &context);
+// Whether a mapping's pages belong to the process alone, and come from no file.
+bool HXIsPrivateAnonymous(const HXMapping &mapping);
+// Whether a private mapping holds pages of its own.
+bool HXHoldsOwnPages(const HXMapping &mapping);
+
+// The record of a classified mapping. `objectID`: of what it maps (HXObjectIdentifiers.h), below 2^53.
+// `reportsCharge`: "vm.self_region_heft".
+vm_region_submap_info_64 HXRegionInfo(const HXMapping &mapping, uint64_t objectID, bool reportsCharge);

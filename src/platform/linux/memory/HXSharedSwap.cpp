@@ -1,7 +1,5 @@
 #include "platform/linux/memory/HXSharedSwap.h"
 
-#include "platform/HXHostRecords.h"
-
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -23,56 +21,55 @@ struct CacheFigures {
 };
 constexpr long kCacheStatCall = 451; // on every machine
 
-class Marker {
+class Finder {
   public:
-    Marker(const HXCountSwapped &countSwapped, uint64_t limit) : _countSwapped(countSwapped), _left(limit) {}
+    Finder(const HXCountSwapped &countSwapped, HXSwapSearch &search)
+        : _countSwapped(countSwapped), _search(search) {}
 
-    void mark(uint64_t first, std::span<int32_t> dispositions) {
-        if (_left == 0 || dispositions.empty()) return;
+    void find(const HXPageSpan &span) {
+        if (_search.pagesLeft == 0 || span.count == 0) return;
         std::optional<uint64_t> counted;
-        if (_callsLeft > 0) counted = _countSwapped(first, dispositions.size());
-        _callsLeft = counted ? _callsLeft - 1 : 0;
-        const uint64_t swapped = counted.value_or(dispositions.size());
+        if (_search.callsLeft > 0) counted = _countSwapped(span);
+        _search.callsLeft = counted ? _search.callsLeft - 1 : 0;
+        const uint64_t swapped = std::min(counted.value_or(span.count), span.count);
         if (swapped == 0) return;
-        if (swapped >= dispositions.size() || _callsLeft == 0) return markFirst(swapped, dispositions);
-        const size_t half = dispositions.size() / 2;
-        mark(first, dispositions.first(half));
-        mark(first + half, dispositions.subspan(half));
+        if (swapped == span.count || _search.callsLeft == 0) return add({span.first, swapped});
+        const uint64_t half = span.count / 2;
+        find({span.first, half});
+        find({span.first + half, span.count - half});
     }
-    uint64_t left() const { return _left; }
+    std::vector<HXPageSpan> found;
 
   private:
-    void markFirst(uint64_t swapped, std::span<int32_t> dispositions) {
-        for (int32_t &disposition : dispositions) {
-            if (_left == 0 || swapped == 0) return;
-            if (disposition != 0) continue;
-            disposition = VM_PAGE_QUERY_PAGE_PAGED_OUT;
-            swapped--;
-            _left--;
-        }
+    void add(HXPageSpan span) {
+        span.count = std::min(span.count, _search.pagesLeft);
+        _search.pagesLeft -= span.count;
+        if (!found.empty() && found.back().first + found.back().count == span.first)
+            found.back().count += span.count;
+        else
+            found.push_back(span);
     }
 
     const HXCountSwapped &_countSwapped;
-    uint64_t _left;
-    uint32_t _callsLeft = 16384; // some 10 ms for pages that are swapped here and there
+    HXSwapSearch &_search;
 };
 
 } // namespace
 
-uint64_t HXMarkSwapped(const HXCountSwapped &countSwapped, uint64_t first, uint64_t limit,
-                       std::span<int32_t> dispositions) {
-    Marker marker(countSwapped, limit);
-    marker.mark(first, dispositions);
-    return limit - marker.left();
+std::vector<HXPageSpan> HXFindSwapped(const HXCountSwapped &countSwapped, const HXPageSpan &span,
+                                      HXSwapSearch *search) {
+    Finder finder(countSwapped, *search);
+    finder.find(span);
+    return std::move(finder.found);
 }
 
-uint64_t HXMarkSwapped(const HXDescriptor &file, uint64_t first, uint32_t pageShift, uint64_t limit,
-                       std::span<int32_t> dispositions) {
-    const HXCountSwapped countSwapped = [&](uint64_t page, uint64_t count) -> std::optional<uint64_t> {
-        CacheRange range{page << pageShift, count << pageShift};
+std::vector<HXPageSpan> HXFindSwapped(const HXDescriptor &file, uint32_t pageShift, const HXPageSpan &span,
+                                      HXSwapSearch *search) {
+    const HXCountSwapped countSwapped = [&](const HXPageSpan &part) -> std::optional<uint64_t> {
+        CacheRange range{part.first << pageShift, part.count << pageShift};
         CacheFigures figures{};
         if (!file || ::syscall(kCacheStatCall, file.get(), &range, &figures, 0) != 0) return std::nullopt;
         return figures.evicted;
     };
-    return HXMarkSwapped(countSwapped, first, limit, dispositions);
+    return HXFindSwapped(countSwapped, span, search);
 }

@@ -6,16 +6,28 @@
 #include <cstdint>
 #include <functional>
 #include <optional>
-#include <span>
+#include <vector>
 
-// How many of `count` pages from page `first` of the object on are swapped out; none when the kernel does not
-// tell.
-using HXCountSwapped = std::function<std::optional<uint64_t>(uint64_t first, uint64_t count)>;
+// Pages of an object, by their numbers.
+struct HXPageSpan {
+    uint64_t first;
+    uint64_t count;
 
-// Marks, among the dispositions of the pages from page `first` of the object on, at most `limit` pages that
-// are not there as paged out: those that are swapped out, or, where that cannot be told, the first ones.
-// Answers how many.
-uint64_t HXMarkSwapped(const HXDescriptor &file, uint64_t first, uint32_t pageShift, uint64_t limit,
-                       std::span<int32_t> dispositions);
-uint64_t HXMarkSwapped(const HXCountSwapped &countSwapped, uint64_t first, uint64_t limit,
-                       std::span<int32_t> dispositions);
+    bool operator==(const HXPageSpan &) const = default;
+};
+
+// How many pages of `span` are swapped out; none when the kernel does not tell.
+using HXCountSwapped = std::function<std::optional<uint64_t>(const HXPageSpan &span)>;
+
+// How far a search goes on.
+struct HXSwapSearch {
+    uint64_t pagesLeft = 0; // to be found
+    uint32_t callsLeft = 0; // of the kernel
+};
+
+// The pages of `span`, of which none is resident in the process, that are swapped out, at most as many as are
+// left; or, where that cannot be told, the first ones.
+std::vector<HXPageSpan> HXFindSwapped(const HXDescriptor &file, uint32_t pageShift, const HXPageSpan &span,
+                                      HXSwapSearch *search);
+std::vector<HXPageSpan> HXFindSwapped(const HXCountSwapped &countSwapped, const HXPageSpan &span,
+                                      HXSwapSearch *search);

@@ -62,7 +62,7 @@ TEST(HXMappingClass, TagsPagersAndShareModes) {
     for (const auto &item : cases) {
         const HXMapping mapping =
             classified(item.path, item.flags, item.device, item.tag == kGiven ? kGiven : 0);
-        const auto info = HXRegionInfo(mapping, {1, 0, true});
+        const auto info = HXRegionInfo(mapping, 1, true);
         const std::string what = std::string(item.path) + " " + std::to_string(item.flags);
         EXPECT_EQ(info.user_tag, item.tag) << what;
         EXPECT_EQ(info.external_pager, item.pager) << what;
@@ -76,9 +76,9 @@ TEST(HXMappingClass, TagsPagersAndShareModes) {
     EXPECT_EQ(classified("[anon:arena]", R | W, 0).tag, HXHostTagAnonymous) << "no tag was left";
     HXMapping empty = classified("", 0, 0);
     empty.residentPages = 0;
-    EXPECT_EQ(HXRegionInfo(empty, {}).share_mode, SM_EMPTY);
+    EXPECT_EQ(HXRegionInfo(empty, 1, false).share_mode, SM_EMPTY);
     empty.swappedPages = 1;
-    EXPECT_EQ(HXRegionInfo(empty, {}).share_mode, SM_PRIVATE);
+    EXPECT_EQ(HXRegionInfo(empty, 1, false).share_mode, SM_PRIVATE);
 }
 
 TEST(HXMappingClass, FiguresThatFewMachinesShow) {
@@ -86,51 +86,15 @@ TEST(HXMappingClass, FiguresThatFewMachinesShow) {
     mapping.anonymousPages = 1; // read at another moment than
     mapping.lazyFreePages = 5;
     mapping.swappedPages = 4;
-    auto info = HXRegionInfo(mapping, {1, 0, true});
+    auto info = HXRegionInfo(mapping, 1, true);
     EXPECT_EQ(info.pages_dirtied, 0u);
     EXPECT_EQ(info.pages_swapped_out, 4u);
     mapping = classified("/anon_hugepage (deleted)", R | W | S | H, kPool);
     mapping.hugePages = 1024;
-    info = HXRegionInfo(mapping, {1, 0, true});
+    info = HXRegionInfo(mapping, 1, true);
     EXPECT_EQ(info.pages_dirtied, 1024u);
     EXPECT_EQ(info.pages_resident, 1032u);
-    EXPECT_EQ(HXRegionInfo(mapping, {1, 0, false}).pages_dirtied, 1032u) << "what its object sees";
-}
-
-uint64_t id(const HXMapping &mapping, int32_t pid, uint64_t ipcNamespace = 0) {
-    return HXRegionInfo(mapping, {pid, ipcNamespace, true}).object_id_full;
-}
-
-TEST(HXMappingClass, Identifiers) {
-    const HXMapping file = classified("/usr/lib/libc.so", R, kDisk);
-    HXMapping written = file, swappedOut = file, huge = file, elsewhere = file;
-    written.anonymousPages = swappedOut.swappedPages = huge.hugePages = 1;
-    elsewhere.start = 0x1000;
-    EXPECT_EQ(id(file, 1), id(elsewhere, 2)) << "one object for every mapping of a file";
-    for (const HXMapping &own : {written, swappedOut, huge, classified("", R | W, 0)})
-        EXPECT_NE(id(own, 1), id(own, 2)) << "pages of its own";
-
-    const HXMapping systemV = classified("/SYSV00000001 (deleted)", R | W | S, kKernel);
-    const HXMapping memfd = classified("/memfd:x (deleted)", R | W | S, kKernel);
-    const HXMapping vdso = classified("[vdso]", R | X, 0);
-    EXPECT_EQ(id(vdso, 1), id(vdso, 2));
-    HXMapping narrowVdso = vdso, otherFile = file, sameNumber = file, otherSegment = systemV;
-    narrowVdso.end += 0x1000;
-    otherFile.inode++;
-    sameNumber.device++;
-    otherSegment.inode++;
-    // Files of which the mixed numbers are those that no object may have.
-    HXMapping zero = file, allOnes = file;
-    zero.inode = 0x6c08cdee6ac8ca52;
-    allOnes.inode = 0x3ca2c15e915c7812;
-    EXPECT_EQ(id(zero, 1), id(allOnes, 1));
-    // What must not be taken for each other, the same inode number in different roles among it.
-    const std::set<uint64_t> ids = {
-        id(file, 1),       id(written, 1), id(otherFile, 1),       id(sameNumber, 1),
-        id(systemV, 1, 8), id(memfd, 1),   id(systemV, 1, 9),      id(vdso, 1),
-        id(narrowVdso, 1), id(zero, 1),    id(otherSegment, 1, 8), 0,
-        UINT64_MAX};
-    EXPECT_EQ(ids.size(), 13u);
+    EXPECT_EQ(HXRegionInfo(mapping, 1, false).pages_dirtied, 1032u) << "what its object sees";
 }
 
 } // namespace

@@ -7,30 +7,31 @@
 namespace {
 
 TEST(HXSharedSwap, FindsSwappedPagesByCounting) {
-    constexpr int32_t dirty = 0x9, pagedOut = 0x10;
+    using Spans = std::vector<HXPageSpan>;
     const std::set<uint64_t> swapped = {103, 104, 110, 163};
-    const HXCountSwapped countSwapped = [&](uint64_t first, uint64_t count) {
-        const auto found = std::distance(swapped.lower_bound(first), swapped.lower_bound(first + count));
-        return std::optional<uint64_t>(found);
+    const HXCountSwapped countSwapped = [&](const HXPageSpan &span) {
+        const auto end = swapped.lower_bound(span.first + span.count);
+        return std::optional<uint64_t>(std::distance(swapped.lower_bound(span.first), end));
     };
-    std::vector<int32_t> pages(64);
-    EXPECT_EQ(HXMarkSwapped(countSwapped, 100, 10, pages), 4u);
-    for (uint64_t i = 0; i < pages.size(); i++)
-        EXPECT_EQ(pages[i], swapped.contains(100 + i) ? pagedOut : 0) << i;
-    std::vector<int32_t> few(64);
-    EXPECT_EQ(HXMarkSwapped(countSwapped, 100, 2, few), 2u) << "no more than the mapping has";
+    constexpr uint32_t calls = 16384;
+    HXSwapSearch search{10, calls};
+    EXPECT_EQ(HXFindSwapped(countSwapped, {100, 64}, &search), (Spans{{103, 2}, {110, 1}, {163, 1}}));
+    EXPECT_EQ(search.pagesLeft, 6u);
+    EXPECT_EQ(HXFindSwapped(countSwapped, {0, uint64_t{1} << 34}, &search).size(), 3u) << "a wide hole";
+    EXPECT_GT(search.callsLeft, calls - 300);
+    search = {2, calls};
+    EXPECT_EQ(HXFindSwapped(countSwapped, {100, 64}, &search), (Spans{{103, 2}})) << "no more than are left";
     // Every other page: not asked for one by one for ever.
-    uint32_t calls = 0;
-    const HXCountSwapped scattered = [&](uint64_t, uint64_t count) {
-        return calls++, std::optional((count + 1) / 2);
+    const HXCountSwapped scattered = [](const HXPageSpan &span) {
+        return std::optional((span.count + 1) / 2);
     };
-    std::vector<int32_t> many(1 << 16);
-    HXMarkSwapped(scattered, 0, many.size(), many);
-    EXPECT_EQ(calls, 16384u);
-    const HXCountSwapped unknown = [](uint64_t, uint64_t) { return std::nullopt; };
-    std::vector<int32_t> mixed = {dirty, 0, dirty, 0, 0};
-    EXPECT_EQ(HXMarkSwapped(unknown, 0, 2, mixed), 2u);
-    EXPECT_EQ(mixed, (std::vector<int32_t>{dirty, pagedOut, dirty, pagedOut, 0}));
+    search = {1 << 16, calls};
+    HXFindSwapped(scattered, {0, 1 << 16}, &search);
+    EXPECT_EQ(search.callsLeft, 0u);
+    const HXCountSwapped unknown = [](const HXPageSpan &) { return std::nullopt; };
+    search = {3, calls};
+    EXPECT_EQ(HXFindSwapped(unknown, {7, 2}, &search), (Spans{{7, 2}}));
+    EXPECT_EQ(HXFindSwapped(unknown, {20, 9}, &search), (Spans{{20, 1}}));
 }
 
 } // namespace

@@ -1,0 +1,89 @@
+#include "platform/linux/memory/HXObjectIdentifiers.h"
+
+#include "platform/linux/memory/HXMappingClass.h"
+
+#include <sys/random.h>
+
+namespace {
+
+constexpr uint32_t kProcessBits = 17, kPageBits = 35; // and one: 53
+constexpr uint32_t kSmallestPageShift = 12;
+// Of the table's identifiers: the higher bits, all set, far from the kernel's own and from those of memory
+// graphs, which are small; and where the lower ones begin, behind what the kernel's own have there.
+constexpr uint64_t kHighBits = uint64_t{0x1FFFFF} << 32;
+constexpr uint32_t kFirstLowBits = 1 << 16;
+
+// Finaliser of a 64-bit linear generator; every bit of the result depends on every bit of the value.
+uint64_t mix(uint64_t value) {
+    value += 0x9E3779B97F4A7C15;
+    value = (value ^ (value >> 30)) * 0xBF58476D1CE4E5B9;
+    value = (value ^ (value >> 27)) * 0x94D049BB133111EB;
+    return value ^ (value >> 31);
+}
+
+uint64_t newSeed() {
+    uint64_t seed = 0;
+    // Without it the table is only slower for whoever chooses his keys.
+    [[maybe_unused]] const ssize_t got = ::getrandom(&seed, sizeof seed, GRND_NONBLOCK);
+    return seed;
+}
+
+} // namespace
+
+std::optional<uint32_t> HXNumberPool::take(uint32_t preferred) {
+    if (preferred < _limit && _given.insert(preferred).second) return preferred;
+    while (_next < _limit)
+        if (_given.insert(_next++).second) return _next - 1;
+    return std::nullopt;
+}
+
+size_t HXObjectIdentifiers::KeyHash::operator()(const Key &key) const {
+    return mix(mix(mix(seed ^ static_cast<uint64_t>(key.kind) << 32 ^ key.device) ^ key.first) ^ key.second);
+}
+
+HXObjectIdentifiers::HXObjectIdentifiers() : _processPool((1 << kProcessBits) - 1) {
+    constexpr uint32_t lowest = kFirstLowBits / 2, limit = uint32_t{1} << 31;
+    const KeyHash hash{newSeed()};
+    for (uint32_t i = 0; i < kShards; i++) {
+        Shard &shard = _shards.emplace_back();
+        shard.numbers = std::unordered_map<Key, uint32_t, KeyHash>(0, hash);
+        shard.pool = HXNumberPool((limit - lowest) / kShards);
+    }
+}
+
+uint32_t HXObjectIdentifiers::numberOfProcess(int32_t pid) {
+    const std::lock_guard lock(_processMutex);
+    const auto [entry, isNew] = _processNumbers.try_emplace(pid, 0);
+    if (!isNew) return entry->second;
+    const uint32_t preferred = static_cast<uint32_t>(pid) % ((1 << kProcessBits) - 1);
+    const auto number = _processPool.take(preferred);
+    entry->second = number ? *number + 1 : 0;
+    return entry->second;
+}
+
+uint64_t HXObjectIdentifiers::interned(const Key &key) {
+    // Not by the seed: it is to be the same in every run.
+    const auto preferred = static_cast<uint32_t>(KeyHash{0}(key) >> 33);
+    const uint32_t shardIndex = preferred % kShards;
+    Shard &shard = _shards[shardIndex];
+    const std::lock_guard lock(shard.mutex);
+    const auto [entry, isNew] = shard.numbers.try_emplace(key, 0);
+    // As many as there are have room in no memory.
+    if (isNew) entry->second = shard.pool.take(preferred / kShards).value_or(0);
+    return kHighBits | (kFirstLowBits + uint64_t{2} * (entry->second * kShards + shardIndex));
+}
+
+uint64_t HXObjectIdentifiers::of(const HXMapping &mapping, const HXMappingOwner &owner) {
+    if (mapping.kind == HXPathKind::vdso) return interned({Kind::vdso, 0, 0, mapping.end - mapping.start});
+    if (HXHoldsOwnPages(mapping)) {
+        const uint64_t page = mapping.start >> kSmallestPageShift;
+        if (HXIsPrivateAnonymous(mapping) && owner.processNumber != 0 && page >> kPageBits == 0)
+            return uint64_t{owner.processNumber} << (kPageBits + 1) | page << 1 | 1;
+        return interned({Kind::mapping, 0, static_cast<uint32_t>(owner.pid), mapping.start});
+    }
+    // System V memory's inode number is its identifier, which says nothing outside its namespace and which
+    // other shared memory may have, too.
+    if (mapping.kind == HXPathKind::systemV)
+        return interned({Kind::systemV, mapping.device, owner.ipcNamespace, mapping.inode});
+    return interned({Kind::file, mapping.device, 0, mapping.inode});
+}

@@ -1,0 +1,87 @@
+// Identifiers of memory objects: two objects never have the same one in a run, whatever addresses and inode
+// numbers a program manages to get.
+//
+// All are below 2^53. Their lowest bit tells two kinds apart:
+//
+//   1  A private mapping without a file: the number of its process, from bit 36 on, and the number of its
+//   page,
+//      from bit 1 on. Distinct by construction, which no table is needed for.
+//   0  Everything else, by a table. The number's lower 32 bits are its own; the higher ones are the same for
+//   all
+//      of these.
+//
+// What a process has copied on write is told apart from others' by its pid in the bits from 32 on (HXHeft),
+// which happens to the second kind alone; so its lower bits decide.
+#pragma once
+
+#include "platform/linux/memory/HXMapping.h"
+
+#include <cstdint>
+#include <deque>
+#include <mutex>
+#include <optional>
+#include <unordered_map>
+#include <unordered_set>
+
+// Whose a mapping is.
+struct HXMappingOwner {
+    int32_t pid = 0;
+    uint32_t processNumber = 0; // HXObjectIdentifiers::numberOfProcess
+    uint64_t ipcNamespace = 0;  // tells System V identifiers of different namespaces apart
+};
+
+// Numbers below `limit` of which each is given once.
+class HXNumberPool {
+  public:
+    explicit HXNumberPool(uint32_t limit = 0) : _limit(limit) {}
+    // `preferred` if it is free, else any that is; none when all are given. Takes no longer the more are.
+    std::optional<uint32_t> take(uint32_t preferred);
+
+  private:
+    uint32_t _limit;
+    uint32_t _next = 0; // all below have been given
+    std::unordered_set<uint32_t> _given;
+};
+
+// Any thread.
+class HXObjectIdentifiers {
+  public:
+    HXObjectIdentifiers();
+
+    // The number of a process, from 1 on: equal for equal pids and another for another; 0 when none is left.
+    uint32_t numberOfProcess(int32_t pid);
+
+    // The identifier of what a classified mapping maps. The same in every run for what is the same on the
+    // machine, unless something else has taken its number first.
+    uint64_t of(const HXMapping &mapping, const HXMappingOwner &owner);
+
+  private:
+    enum class Kind : uint32_t { file = 1, mapping, systemV, vdso };
+    struct Key {
+        Kind kind;
+        uint32_t device;
+        uint64_t first;
+        uint64_t second;
+
+        bool operator==(const Key &) const = default;
+    };
+    // With a seed of this run, so that nobody can choose keys that meet in one bucket.
+    struct KeyHash {
+        uint64_t seed;
+        size_t operator()(const Key &key) const;
+    };
+    // Keys are spread by the number that they prefer, and so each shard has numbers of its own.
+    struct Shard {
+        std::mutex mutex;
+        std::unordered_map<Key, uint32_t, KeyHash> numbers;
+        HXNumberPool pool;
+    };
+    static constexpr uint32_t kShards = 64;
+
+    uint64_t interned(const Key &key);
+
+    std::deque<Shard> _shards;
+    std::mutex _processMutex;
+    std::unordered_map<int32_t, uint32_t> _processNumbers;
+    HXNumberPool _processPool;
+};
