@@ -29,6 +29,12 @@ struct HXHostCache {
     int64_t ledgerEntryCount = 0;
 };
 
+// Bytes, as HXPlatform::walkShortfall tells them.
+struct HXWalkShortfall {
+    uint64_t regionsSize;
+    uint64_t countersSize;
+};
+
 // Takes from `runs`, which ascend, the pages from the address `end` on.
 void HXCutRuns(uint64_t end, uint64_t pageSize, std::vector<vm_page_run> *runs);
 
@@ -47,8 +53,9 @@ class HXPlatform {
     virtual mach_port_t mach_task_self() = 0;
 
     // Opens the task of `pid` and stores a port to it, which stays bound to that very process even when its
-    // pid is given to another one later. MACH_SEND_INVALID_DEST when there is no such process any more, or
-    // but a zombie, KERN_FAILURE when it may not be examined.
+    // pid is given to another one later. KERN_FAILURE (5) when the process is gone or is a zombie,
+    // KERN_NO_ACCESS (8) when the caller may not examine it, KERN_RESOURCE_SHORTAGE (6) when the program has
+    // no descriptor left for it.
     virtual kern_return_t task_for_pid(mach_port_t self, int32_t pid, mach_port_t *task) = 0;
 
     // Gives a task port back, and with it all that the platform holds for the task. The port must not be used
@@ -85,6 +92,11 @@ class HXPlatform {
     // Fails for objects that are not purgeable.
     virtual kern_return_t mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,
                                                    int32_t *state) = 0;
+
+    // After the walk of a task whose memory moved while it was read: what its regions and what its own
+    // counters add up to, which differ by more than 1 % and 1 MiB even on a second reading. None where they
+    // agree, and on hosts whose memory stands still.
+    virtual std::optional<HXWalkShortfall> walkShortfall(mach_port_t) { return std::nullopt; }
 
     // Bytes in a page of the machine, a power of two.
     virtual uint32_t vm_kernel_page_size() = 0;

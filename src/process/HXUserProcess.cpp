@@ -16,11 +16,22 @@ bool HXUserProcess::initWithBsdInfo(const proc_bsdinfo &info, HXProcessSnapshot 
     return true;
 }
 
+// Whether a process has gone, or become a zombie, since its record was read.
+static bool hasEndedMeanwhile(int32_t pid, HXProcessSnapshot *snapshot) {
+    proc_bsdshortinfo now{};
+    errno = 0;
+    if (HXPlatform::current().proc_pidinfo(pid, PROC_PIDT_SHORTBSDINFO, 1, &now, sizeof now) !=
+        int32_t{sizeof now})
+        return errno == ESRCH;
+    const auto before = snapshot ? snapshot->bsdInfoOfPid(pid) : std::nullopt;
+    return now.pbsi_status == SZOMB && before && before->pbi_status != SZOMB;
+}
+
 bool HXUserProcess::_populateTask(HXProcessSnapshot *snapshot) {
     HXPlatform &platform = HXPlatform::current();
     const kern_return_t error = snapshot ? snapshot->takeTask(pid(), &_task) : _task.open(pid());
     if (error == KERN_SUCCESS) return true;
-    if (error == MACH_SEND_INVALID_DEST) return false; // ended meanwhile: no failure of anybody
+    if (error == KERN_FAILURE && hasEndedMeanwhile(pid(), snapshot)) return false; // nobody's failure
     platform.mach_error("task_for_pid", error);
     _addGlobalError("task_for_pid [" + std::to_string(pid()) + "] " + platform.mach_error_string(error));
     return false;

@@ -88,6 +88,7 @@ class HXUserProcess : public HXProcess {
                     int32_t purgeState, std::optional<std::string_view> path);
     void chargeOwnedObject(HXMemoryRegion &region, Gathering &gathering, const vm_region_submap_info_64 &info,
                            int32_t purgeState);
+    void warnOfMovedMemory();
     void addUnmappedOwnedObjects(Gathering &gathering);
     void addUnmappedHeft(Gathering &gathering);
     void addPageTables(Gathering &gathering);

@@ -110,10 +110,20 @@ void HXUserProcess::_gatherMemoryData() {
                          int32_t purgeState, std::optional<std::string_view> path) {
         return addRegion(gathering, start, size, info, purgeState, path);
     });
+    warnOfMovedMemory();
     addUnmappedOwnedObjects(gathering);
     addUnmappedHeft(gathering);
     addPageTables(gathering);
     _memoryRegions = std::move(gathering.regions);
+}
+
+void HXUserProcess::warnOfMovedMemory() {
+    if (!_isAlive()) return;
+    const auto shortfall = HXPlatform::current().walkShortfall(_task.get());
+    if (!shortfall) return;
+    _warnings.push_back(displayString() + ": memory changed while it was read: regions " +
+                        std::to_string(shortfall->regionsSize) + " bytes, counters " +
+                        std::to_string(shortfall->countersSize) + " bytes");
 }
 
 // Returns true to stop the walk.

@@ -1,14 +1,20 @@
 // The built program on processes of the user's own.
+#include "support/HXBuilders.h"
 #include "support/HXProgramRun.h"
 #include "support/HXSubject.h"
 #include "support/HXTemporaryFolder.h"
 
 #include <gtest/gtest.h>
 
+#include <csignal>
 #include <cstring>
 #include <filesystem>
 #include <optional>
+#include <sched.h>
 #include <sys/mman.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <thread>
 #include <unistd.h>
 
 namespace {
@@ -93,6 +99,33 @@ TEST(HXProgram, PrintsHostileNamesAsPlainText) {
     for (const char c : run.out)
         EXPECT_TRUE(c == '\n' || c == '\t' || static_cast<unsigned char>(c) >= 0x20);
     EXPECT_EQ(query(json, ".processes[0].heft > 0"), "true\n");
+}
+
+// A thread holds 32 MiB; the leading one has ended.
+TEST(HXProgram, FindsProcessesWhoseLeadingThreadHasEnded) {
+    static int ready[2];
+    ASSERT_EQ(pipe(ready), 0);
+    const pid_t pid = fork();
+    if (pid == 0) {
+        std::thread([] {
+            constexpr size_t size = 32 << 20;
+            memset(mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0), 1, size);
+            if (write(ready[1], "", 1) != 1) _exit(1);
+            for (;;)
+                pause();
+        }).detach();
+        syscall(SYS_exit, 0); // of this thread alone
+    }
+    char byte;
+    ASSERT_EQ(read(ready[0], &byte, 1), 1);
+    const std::string stat = "/proc/" + std::to_string(pid) + "/stat";
+    while (!contains(contentOf(stat), ") Z "))
+        sched_yield();
+    const HXProgramRun run = HXRunHeft({std::to_string(pid)});
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+    EXPECT_EQ(run.status, 0) << run.err;
+    EXPECT_TRUE(contains(run.out, "[" + std::to_string(pid) + "]: 64-bit\tHeft: 3")) << run.out;
 }
 
 TEST(HXProgram, TellsThirtyTwoBitProgramsApart) {

@@ -98,7 +98,13 @@ TEST(HXProcessTest, OnlyWhatRunsAndCannotBeOpenedIsAnError) {
                 answer.get_future().wait(); // until the machine is no more
                 return KERN_FAILURE;
             }
-            return pid == 2 ? MACH_SEND_INVALID_DEST : HXMadeUpMachine::task_for_pid(self, pid, task);
+            return pid == 2 ? KERN_FAILURE : HXMadeUpMachine::task_for_pid(self, pid, task);
+        }
+        int32_t proc_pidinfo(int32_t pid, int32_t flavor, uint64_t argument, void *buffer,
+                             uint32_t bytes) override {
+            errno = ESRCH;
+            if (pid == 2 && flavor == PROC_PIDT_SHORTBSDINFO) return 0; // it has ended
+            return HXMadeUpMachine::proc_pidinfo(pid, flavor, argument, buffer, bytes);
         }
     };
     Opened machine("process  pid=1\nprocess  pid=2\nprocess  pid=3  task_error=5\nprocess  pid=4\n");

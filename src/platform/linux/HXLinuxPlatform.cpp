@@ -54,11 +54,12 @@ const char *programName = "";
 } // namespace
 
 HXLinuxPlatform::HXLinuxPlatform(const Setting &setting)
-    : _pageSize(static_cast<uint32_t>(::sysconf(_SC_PAGESIZE))), _fileSystems(setting.sharedMemoryDevice),
+    : _pageSize(static_cast<uint32_t>(::sysconf(_SC_PAGESIZE))),
+      _fileSystems(setting.procPath, setting.sharedMemoryDevice),
       _machine(setting.procPath), _readerSetting{&_fileSystems, &_machine, &namedTags(),
                                                  static_cast<uint32_t>(std::countr_zero(_pageSize)),
                                                  setting.mayScanPageTables},
-      _imageHeaders(_fileSystems, _pageSize), _processes(setting.procPath),
+      _imageHeaders(_fileSystems), _processes(setting.procPath),
       _kernelMemory(setting.procPath, setting.sysPath, _pageSize) {}
 
 void HXLinuxPlatform::prepareProcess(const char *program) {
@@ -100,12 +101,9 @@ int32_t HXLinuxPlatform::proc_get_dirty(int32_t, uint32_t *) {
 std::optional<HXStatusRecord> HXLinuxPlatform::statusOf(int32_t pid, HXLinuxTask::StatusUse use) {
     HXLinuxTask *task = _tasks.findByPid(pid);
     if (task != nullptr) return task->status(use);
-    const HXDescriptor directory = pid > 0 ? _processes.open(pid) : HXDescriptor();
-    if (!directory) {
-        errno = ESRCH;
-        return std::nullopt;
-    }
-    return HXReadStatus(directory);
+    errno = ESRCH;
+    const auto process = pid > 0 ? _processes.open(pid) : std::nullopt;
+    return process ? HXReadStatus(process->directory) : std::nullopt;
 }
 
 int32_t HXLinuxPlatform::ledger(int32_t command, int32_t pid, void *buffer, int64_t *count) {

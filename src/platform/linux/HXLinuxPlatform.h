@@ -49,6 +49,7 @@ class HXLinuxPlatform final : public HXPlatform {
     kern_return_t mach_vm_purgable_control(mach_port_t, uint64_t, int32_t, int32_t *) override {
         return KERN_INVALID_ARGUMENT; // nothing is purgeable here
     }
+    std::optional<HXWalkShortfall> walkShortfall(mach_port_t task) override;
     uint32_t vm_kernel_page_size() override { return _pageSize; }
     bool hasSharedRegion() override { return false; }
 
@@ -125,6 +126,7 @@ class HXLinuxPlatform final : public HXPlatform {
     HXImageHeaders _imageHeaders;
     HXLinuxProcesses _processes;
     HXLinuxKernelMemory _kernelMemory;
+    HXDescriptorTurns _turns;
     HXObjectIdentifiers _identifiers;
     HXTaskTable _tasks;
     std::atomic<uint32_t> _reportsCharge = 0; // "vm.self_region_heft"

@@ -6,6 +6,8 @@
 #include "platform/linux/memory/HXTaskFiles.h"
 #include "platform/linux/procfs/HXProcFile.h"
 
+#include <sys/resource.h>
+
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
@@ -17,31 +19,30 @@ class TaskSymbolicator final : public RVSymbolicator {
     std::vector<HXLoadedImage> images;
 };
 
-bool hasAddressSpace(const HXDescriptor &process) {
-    const HXDescriptor maps = HXOpenAt(process, "maps");
-    char byte;
-    if (!maps) return false;
-    if (maps.readAt(0, &byte, sizeof byte) > 0) return true;
-    // No mapping at all: a kernel thread, a process that has ended, or one that has unmapped everything.
-    const auto stat = HXReadStat(process);
-    return stat && !stat->isZombie() && !stat->isKernelThread();
+// Whether one more task may keep a descriptor: three quarters of them are for reading.
+bool maySpareDescriptor(size_t taskCount) {
+    constexpr rlim_t share = 4;
+    rlimit limit;
+    return ::getrlimit(RLIMIT_NOFILE, &limit) == 0 && taskCount < limit.rlim_cur / share;
 }
 
-// Whether that is why a file of the process, or its directory, could not be read.
-bool hasEnded(const HXDescriptor &process) {
-    const auto stat = process ? HXReadStat(process) : std::nullopt;
-    return stat ? stat->isZombie() : errno == ENOENT || errno == ESRCH;
+kern_return_t errorOfOpening(int error) {
+    if (HXShortageWatch::isShortage(error)) return KERN_RESOURCE_SHORTAGE;
+    return error == EACCES || error == EPERM ? KERN_NO_ACCESS : KERN_FAILURE;
 }
 
 } // namespace
 
+// Looks at no mapping: that could wait for another thread of the process as long as that likes.
 kern_return_t HXLinuxPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_t *task) {
     if (pid <= 0) return KERN_FAILURE;
-    HXDescriptor directory = _processes.open(pid);
-    if (!directory || !hasAddressSpace(directory))
-        return hasEnded(directory) ? MACH_SEND_INVALID_DEST : KERN_FAILURE;
-    *task = _tasks.add(
-        std::make_unique<HXLinuxTask>(pid, _identifiers.numberOfProcess(pid), std::move(directory)));
+    auto process = _processes.open(pid);
+    if (!process) return errorOfOpening(errno);
+    if (process->stat.hasEnded() || process->stat.isKernelThread()) return KERN_FAILURE;
+    if (!HXOpenAt(process->directory, "maps")) return errorOfOpening(errno);
+    *task =
+        _tasks.add(std::make_unique<HXLinuxTask>(pid, _identifiers.numberOfProcess(pid), std::move(*process),
+                                                 maySpareDescriptor(_tasks.count()), _processes, _turns));
     return KERN_SUCCESS;
 }
 
@@ -126,7 +127,22 @@ kern_return_t HXLinuxPlatform::mach_vm_page_range_query(mach_port_t port, uint64
     *pages = std::min(size / _pageSize + inLastPages / _pageSize, mostPages);
     const HXAddressSpace &addressSpace = addressSpaceOf(task);
     if (*pages == 0 && size > 0) return KERN_INVALID_ADDRESS;
-    return task->pages().query(addressSpace, start, runs, pages);
+    const uint64_t asked = *pages;
+    kern_return_t error = KERN_SUCCESS;
+    const bool suffice = task->withDescriptors([&] {
+        *pages = asked;
+        error = task->pages().query(addressSpace, start, runs, pages);
+    });
+    return error != KERN_SUCCESS && !suffice ? KERN_RESOURCE_SHORTAGE : error;
+}
+
+std::optional<HXWalkShortfall> HXLinuxPlatform::walkShortfall(mach_port_t port) {
+    HXLinuxTask *task = _tasks.find(port);
+    if (task == nullptr) return std::nullopt;
+    addressSpaceOf(task);
+    const auto &difference = task->difference();
+    if (!difference) return std::nullopt;
+    return HXWalkShortfall{difference->regionsSize, difference->countersSize};
 }
 
 int32_t HXLinuxPlatform::proc_regionfilename(int32_t pid, uint64_t address, char *buffer,
@@ -152,8 +168,10 @@ RVSymbolicator *HXLinuxPlatform::RVSymbolicatorCreateWithTaskFlagsAndNotificatio
     if (task == nullptr) return nullptr;
     const HXAddressSpace &addressSpace = addressSpaceOf(task);
     auto symbolicator = std::make_unique<TaskSymbolicator>();
-    symbolicator->images = HXFindImages(addressSpace, _pageSize, [&](size_t index) {
-        return _imageHeaders.headersOf(addressSpace, index, task->directory());
+    task->withDescriptors([&] {
+        symbolicator->images = HXFindImages(addressSpace, _pageSize, [&](size_t index) {
+            return _imageHeaders.headersOf(addressSpace, index, task->directory());
+        });
     });
     return symbolicator.release();
 }

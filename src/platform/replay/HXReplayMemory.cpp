@@ -50,7 +50,7 @@ mach_port_t HXReplayPlatform::mach_host_self() {
 
 kern_return_t HXReplayPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_t *task) {
     const auto found = _machine.processIndices.find(pid);
-    if (found == _machine.processIndices.end()) return MACH_SEND_INVALID_DEST;
+    if (found == _machine.processIndices.end()) return KERN_FAILURE;
     const kern_return_t error = _machine.processes[found->second].taskError;
     if (error == KERN_SUCCESS) *task = kFirstTask + found->second;
     return error;

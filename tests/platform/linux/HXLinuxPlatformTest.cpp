@@ -9,6 +9,8 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -125,39 +127,62 @@ TEST_F(HXLinuxPlatformTest, ListsAndDescribesProcesses) {
     EXPECT_EQ(errno, ESRCH);
 }
 
-TEST_F(HXLinuxPlatformTest, NamesProcessesByWhatWasExecuted) {
+TEST_F(HXLinuxPlatformTest, NamesProcessesAsPsDoes) {
     const struct {
         const char *exe;
         const char *comm;
-        std::string arguments;
         std::string expected;
     } cases[] = {
-        {"/usr/bin/sleep", "sleep", "sleep\0100\0"s, "/usr/bin/sleep"},
-        {"/usr/bin/sleep (deleted)", "sleep", "sleep\0"s, "/usr/bin/sleep"},
-        {"/usr/bin/a-rather-long-program", "a-rather-long-p", "x\0"s, "/usr/bin/a-rather-long-program"},
-        {"/usr/bin/python3.11", "tool.py", "/usr/bin/python3\0/opt/tool.py\0-v\0"s, "/opt/tool.py"},
-        {"/usr/bin/perl", "tool", "perl\0-w\0./tool\0x\0"s, "./tool"},
-        {"/usr/bin/python3.11", "python3", "python3\0/opt/tool.py\0"s, "/usr/bin/python3.11"}, // no #! line
-        {"/usr/bin/node", "MainThread", "node\0server.js\0"s, "/usr/bin/node"},
-        {"/usr/bin/x\x1b\"\n", "renamed", "", "/usr/bin/x?'?"},
-        {"/usr/bin/none", "other", std::string(512, '\0'), "/usr/bin/none"}, // 256 arguments and more
+        {"/usr/bin/sleep", "sleep", "/usr/bin/sleep"},
+        {"/usr/bin/sleep (deleted)", "sleep", "/usr/bin/sleep"},
+        {"/usr/bin/a-rather-long-program", "a-rather-long-p", "/usr/bin/a-rather-long-program"},
+        {"/usr/bin/a-rather-long-program (deleted)", "a-rather-long-p", "/usr/bin/a-rather-long-program"},
+        {"/usr/bin/sleeper", "sleep", "/usr/bin/sleep"},
+        {"/usr/bin/python3.11", "a-rather-long-s", "/usr/bin/a-rather-long-s"}, // a script
+        {"/usr/bin/redis-check-rdb", "redis-server", "/usr/bin/redis-server"},  // a link
+        {"/memfd:x (deleted)", "3", "/3"},
+        {"/usr/bin/x", "a\x1b\"\n", "/usr/bin/a?'?"},
+        {"/usr/bin/x", "kworker/0:1", "error 2"}, // the last component would be another name
+        {"/usr/bin/x", "", "error 2"},
     };
     int pid = 1000;
     for (const auto &item : cases) {
         const std::string folder = std::to_string(++pid) + "/";
         process(pid, item.comm, kMapping);
         proc.link(folder + "exe", item.exe);
-        proc.write(folder + "cmdline", item.arguments);
         EXPECT_EQ(nameInArguments(pid), item.expected);
     }
     process(2000, "kthread", "");
     EXPECT_EQ(nameInArguments(2000), "error " + std::to_string(ENOENT));
     EXPECT_EQ(nameInArguments(3000), "error " + std::to_string(ESRCH));
-    // Where the process's memory tells the path that was executed, it decides.
-    EXPECT_EQ(HXExecutedPath({"/usr/bin/python3", "worker", "python3\0-c\0/opt/worker\0"sv, "/opt/worker"}),
-              "/opt/worker");
-    EXPECT_EQ(HXExecutedPath({"/usr/bin/node", "server.js", "node\0server.js\0"sv, "/usr/bin/node"}),
-              "/usr/bin/node");
+}
+
+// The leader of process 10 has ended; thread 12 runs.
+TEST_F(HXLinuxPlatformTest, ReadsProcessesThroughALiveThread) {
+    const auto stat = [](int pid, const char *state, const char *threads, const char *stack) {
+        return std::to_string(pid) + " (worker) " + state + " 7 8 9 0 -1 64 1 2 3 4 5 6 7 8 20 0 " + threads +
+               " 0 4242 1000 200 0 0 0 " + stack + " 0 0\n";
+    };
+    process(10, "worker", "");
+    process(11, "worker", "");
+    process(12, "worker", kMapping);
+    proc.write("10/stat", stat(10, "Z", "3", "0"));
+    proc.write("11/stat", stat(11, "Z", "3", "0"));
+    proc.write("12/stat", stat(12, "S", "3", "4294967040"));
+    proc.link("12/exe", "/bin/worker");
+    for (const char *const thread : {"10/task/10/stat", "10/task/11/stat", "10/task/12/stat"})
+        proc.write(thread, "");
+    proc_bsdinfo long_;
+    ASSERT_EQ(platform.proc_pidinfo(10, 3, 0, &long_, sizeof long_), 136);
+    EXPECT_EQ(long_.pbi_flags, 0u) << "the thread's stack lies low";
+    proc_bsdshortinfo brief;
+    ASSERT_EQ(platform.proc_pidinfo(10, 13, 1, &brief, sizeof brief), 64);
+    EXPECT_EQ(brief.pbsi_status, 0u);
+    EXPECT_EQ(nameInArguments(10), "/bin/worker");
+    EXPECT_EQ(region(open(10)), KERN_SUCCESS);
+    proc.write("12/stat", stat(12, "Z", "3", "0"));
+    mach_port_t task = 0;
+    EXPECT_EQ(platform.task_for_pid(1, 10, &task), KERN_FAILURE) << "all have ended by now";
 }
 
 TEST_F(HXLinuxPlatformTest, TellsWhatRegionsMappingsAre) {
@@ -189,10 +214,8 @@ TEST_F(HXLinuxPlatformTest, ProcessesVanishAndRefuse) {
     EXPECT_EQ(platform.getpid(), -1) << "none of these processes";
     proc.link("self", "2");
     EXPECT_EQ(platform.getpid(), 2);
-    for (const int32_t pid : {2, 0, -1})
+    for (const int32_t pid : {3, 4, 2, 0, -1})
         EXPECT_EQ(platform.task_for_pid(1, pid, &task), KERN_FAILURE) << pid;
-    for (const int32_t pid : {3, 4})
-        EXPECT_EQ(platform.task_for_pid(1, pid, &task), MACH_SEND_INVALID_DEST) << pid << " has ended";
 
     process(10, "empty", "");
     process(11, "vanishes", kMapping);
@@ -210,6 +233,41 @@ TEST_F(HXLinuxPlatformTest, ProcessesVanishAndRefuse) {
     }
     rusage_info_v4 usage;
     EXPECT_NE(platform.proc_pid_rusage(11, 4, &usage), 0);
+}
+
+// With fewer descriptors than processes.
+TEST_F(HXLinuxPlatformTest, ReadsMoreProcessesThanItMayOpenFiles) {
+    rlimit before, few;
+    ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &before), 0);
+    constexpr int count = 60;
+    for (int pid = 1; pid <= count; pid++)
+        process(pid, "p", kMapping);
+    // Those that are open already, and ten.
+    few = before;
+    few.rlim_cur = static_cast<rlim_t>(::open("/dev/null", O_RDONLY | O_CLOEXEC)) + 10;
+    setrlimit(RLIMIT_NOFILE, &few);
+    std::vector<mach_port_t> tasks;
+    for (int pid = 1; pid <= count; pid++)
+        tasks.push_back(open(pid));
+    for (size_t i = 0; i < tasks.size() / 2; i++) {
+        address = 0;
+        EXPECT_EQ(region(tasks[i]), KERN_SUCCESS) << i;
+        platform.mach_port_deallocate(1, tasks[i]);
+    }
+    std::vector<HXDescriptor> taken; // none is left
+    while (taken.empty() || taken.back())
+        taken.push_back(HXOpenAt(AT_FDCWD, "/dev/null"));
+    address = 0;
+    mach_port_t refused = 0;
+    EXPECT_EQ(region(tasks[count - 2]), KERN_RESOURCE_SHORTAGE);
+    EXPECT_EQ(platform.task_for_pid(1, 1, &refused), KERN_RESOURCE_SHORTAGE);
+    int32_t pids[count];
+    EXPECT_EQ(platform.proc_listallpids(pids, sizeof pids), -1);
+    taken.clear();
+    setrlimit(RLIMIT_NOFILE, &before);
+    ::close(static_cast<int>(few.rlim_cur) - 10);
+    proc.write("60/stat", "60 (p) S 7 8 9 0 -1 64 1 2 3 4 5 6 7 8 20 0 1 0 4243 1000 200 0 0 0 0 0 0\n");
+    EXPECT_EQ(region(tasks[count - 1]), MACH_SEND_INVALID_DEST) << "another process has the pid now";
 }
 
 TEST_F(HXLinuxPlatformTest, ReadsPageTables) {
@@ -272,12 +330,47 @@ TEST_F(HXLinuxPlatformTest, LeavesThePagesOfAnotherProgramAlone) {
     }
 }
 
+TEST_F(HXLinuxPlatformTest, TellsWhenMemoryMovedWhileItWasRead) {
+    const std::string anonymous = "10000000-40000000 rw-p 00000000 00:00 0 \n"
+                                  "Rss:              204800 kB\nAnonymous:        204800 kB\nVmFlags: rd \n";
+    const std::string resident = "\nRss:              102400 kB\nVmFlags: rd \n";
+    const std::string memfd = "50000000-90000000 rw-s 00000000 00:01 5 /memfd:x (deleted)" + resident;
+    const std::string driver = "a0000000-b0000000 rw-s 00000000 00:05 5 /dev/dri/card0" + resident;
+    const struct {
+        std::string memory;
+        uint64_t rssAnon, rssShmem, swap;                      // KiB
+        std::optional<std::pair<uint64_t, uint64_t>> expected; // KiB
+    } cases[] = {
+        {anonymous, 204800, 0, 0, {}},
+        {anonymous, 206800, 0, 0, {}}, // less than 1 %
+        {anonymous, 150000, 0, 60000, std::pair(204800, 210000)},
+        {anonymous, 100000, 0, 0, std::pair(204800, 100000)},
+        {anonymous + memfd, 204800, 102400, 0, {}},
+        {anonymous + memfd, 204800, 204800, 0, std::pair(307200, 409600)},
+        {anonymous + driver, 204800, 0, 0, {}}, // which a driver counts or not
+        {anonymous + driver, 204800, 102400, 0, {}},
+    };
+    int pid = 10;
+    for (const auto &item : cases) {
+        process(++pid, "p", item.memory);
+        proc.write(std::to_string(pid) + "/status", "RssAnon: " + std::to_string(item.rssAnon) +
+                                                        " kB\nRssShmem: " + std::to_string(item.rssShmem) +
+                                                        " kB\nVmSwap: " + std::to_string(item.swap) +
+                                                        " kB\nVmPTE: 4 kB\nVmRSS: 1 kB\nThreads: 1\n");
+        const auto shortfall = platform.walkShortfall(open(pid));
+        ASSERT_EQ(shortfall.has_value(), item.expected.has_value()) << pid;
+        if (!shortfall) continue;
+        EXPECT_EQ(shortfall->regionsSize, item.expected->first * 1024) << pid;
+        EXPECT_EQ(shortfall->countersSize, item.expected->second * 1024) << pid;
+    }
+}
+
 // A page of the test's own, in a made-up process that has the test's page tables.
 alignas(4096) char ownPage[4096] = {1};
 
 TEST_F(HXLinuxPlatformTest, CountsFromPageTablesOnlyWhereTheyTellEnough) {
     if (!HXPageScan::isComplete()) GTEST_SKIP() << "the kernel's answers are not complete";
-    HXFileSystems fileSystems(HXDeviceNumber(0, 1));
+    HXFileSystems fileSystems(proc.path(), HXDeviceNumber(0, 1));
     HXNamedTags tags;
     proc.write("mountinfo", "1 1 0:53 / /huge rw - hugetlbfs none rw\n");
     proc.link("pagemap", "/proc/self/pagemap");

@@ -13,8 +13,7 @@
 
 class HXImageHeaders {
   public:
-    HXImageHeaders(HXFileSystems &fileSystems, uint64_t pageSize)
-        : _fileSystems(fileSystems), _pageSize(pageSize) {}
+    explicit HXImageHeaders(HXFileSystems &fileSystems) : _fileSystems(fileSystems) {}
 
     // The headers of the file that the mapping maps; null when it is no image or can't be read. `process`:
     // its directory in /proc. Any thread; never waits on a file system that may hang. What is handed out
@@ -34,7 +33,6 @@ class HXImageHeaders {
     };
 
     HXFileSystems &_fileSystems;
-    const uint64_t _pageSize;
     std::mutex _mutex;
     std::map<FileKey, File> _files;
 };

@@ -48,8 +48,7 @@ class Reader {
 
 kern_return_t errorOfOpening(int error) {
     if (error == EACCES || error == EPERM) return KERN_NO_ACCESS;
-    const bool lacksResources = error == EMFILE || error == ENFILE || error == ENOMEM;
-    return lacksResources ? KERN_RESOURCE_SHORTAGE : MACH_SEND_INVALID_DEST;
+    return HXShortageWatch::isShortage(error) ? KERN_RESOURCE_SHORTAGE : MACH_SEND_INVALID_DEST;
 }
 
 uint64_t readIpcNamespace(const HXDescriptor &process) {
@@ -201,7 +200,7 @@ kern_return_t Reader::endError(const HXDescriptor &file) const {
     if (isAlive(file)) return KERN_INVALID_ADDRESS;
     if (_addressSpace->count() > 0) return MACH_SEND_INVALID_DEST;
     const auto stat = HXReadStat(_request.process);
-    return stat && !stat->isZombie() ? KERN_INVALID_ADDRESS : MACH_SEND_INVALID_DEST;
+    return stat && !stat->hasEnded() ? KERN_INVALID_ADDRESS : MACH_SEND_INVALID_DEST;
 }
 
 bool Reader::isSingleThreaded() const {

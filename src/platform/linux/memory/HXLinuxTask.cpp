@@ -3,15 +3,83 @@
 #include "platform/linux/memory/HXRepeatedPages.h"
 #include "platform/linux/memory/HXTaskFiles.h"
 
+#include <cerrno>
 #include <mutex>
+#include <utility>
+
+bool HXDescriptorTurns::run(const std::function<void()> &read) {
+    {
+        const std::shared_lock lock(_mutex);
+        const HXShortageWatch watch;
+        read();
+        if (!watch.seen()) return true;
+    }
+    // Somebody who reads may be stuck.
+    const std::unique_lock lock(_mutex, std::chrono::seconds(1));
+    if (!lock) return false;
+    const HXShortageWatch watch;
+    read();
+    return !watch.seen();
+}
+
+HXLinuxTask::HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, bool keepsOpen,
+                         HXLinuxProcesses &processes, HXDescriptorTurns &turns)
+    : _pid(pid), _number(number), _startTime(process.stat.startTime), _processes(processes), _turns(turns) {
+    if (keepsOpen) _directory = std::move(process.directory);
+}
+
+// Not open with errno set.
+HXDescriptor HXLinuxTask::reopen() {
+    auto process = _processes.open(_pid);
+    if (!process) return {};
+    if (process->stat.startTime == _startTime) return std::move(process->directory);
+    errno = ESRCH;
+    return {};
+}
+
+bool HXLinuxTask::withDescriptors(const std::function<void()> &read) {
+    const bool suffice = _turns.run(read);
+    if (!suffice && _addressSpace) _addressSpace->endError = KERN_RESOURCE_SHORTAGE;
+    return suffice;
+}
 
 const HXAddressSpace &HXLinuxTask::addressSpace(const HXReaderSetting &setting, bool needsDirtyPages) {
     if (!_addressSpace || (needsDirtyPages && !_addressSpace->knowsDirtyPages)) {
-        _addressSpace = HXReadAddressSpace({_directory, _status, needsDirtyPages, _opened}, setting);
+        withDescriptors([&] { read(setting, needsDirtyPages); });
+        if (!_addressSpace) { // nobody gave way
+            _addressSpace = std::make_unique<HXAddressSpace>();
+            _addressSpace->endError = KERN_RESOURCE_SHORTAGE;
+        }
         _pages.emplace(_directory, setting.pageShift);
-        HXFindRepeatedPages(setting.pageShift, &*_pages, _addressSpace.get());
+        withDescriptors([&] { HXFindRepeatedPages(setting.pageShift, &*_pages, _addressSpace.get()); });
     }
     return *_addressSpace;
+}
+
+void HXLinuxTask::read(const HXReaderSetting &setting, bool needsDirtyPages) {
+    if (!_directory) _directory = reopen();
+    readOnce(setting, needsDirtyPages);
+    compare(setting, true);
+    if (!_difference) return;
+    readOnce(setting, needsDirtyPages);
+    compare(setting, false);
+}
+
+void HXLinuxTask::readOnce(const HXReaderSetting &setting, bool needsDirtyPages) {
+    _addressSpace = HXReadAddressSpace({_directory, _status, needsDirtyPages, _opened}, setting);
+}
+
+// The first reading is compared with the counters behind it alone, so that most processes cost one more small
+// file, which also answers the next question for the status.
+void HXLinuxTask::compare(const HXReaderSetting &setting, bool isFirst) {
+    _difference.reset();
+    if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return;
+    const auto before = std::exchange(_status, HXReadStatus(_directory));
+    _used[0] = _used[1] = false;
+    if (!_status) return;
+    const uint64_t error = setting.machine->counterErrorPages(_status->threadCount.value_or(1));
+    _difference = HXFindWalkDifference(*_addressSpace, isFirst || !before ? *_status : *before, *_status,
+                                       {setting.pageShift, error << setting.pageShift});
 }
 
 size_t HXLinuxTask::find(uint64_t address) {
@@ -22,7 +90,9 @@ size_t HXLinuxTask::find(uint64_t address) {
 std::optional<HXStatusRecord> HXLinuxTask::status(StatusUse use) {
     bool &used = _used[use == StatusUse::ledger];
     if (!_status || used) {
-        _status = HXReadStatus(_directory);
+        const HXDescriptor reopened = _directory ? HXDescriptor() : reopen();
+        if (!_directory && !reopened) return std::nullopt;
+        _status = HXReadStatus(_directory ? _directory : reopened);
         _used[0] = _used[1] = false;
     }
     used = true;
@@ -44,6 +114,11 @@ void HXTaskTable::remove(uint32_t port) {
     const auto byPid = _portsByPid.find(found->second->pid());
     if (byPid != _portsByPid.end() && byPid->second == port) _portsByPid.erase(byPid);
     _tasks.erase(found);
+}
+
+size_t HXTaskTable::count() const {
+    const std::shared_lock lock(_mutex);
+    return _tasks.size();
 }
 
 HXLinuxTask *HXTaskTable::find(uint32_t port) const {

@@ -3,23 +3,39 @@
 
 #include "platform/linux/memory/HXAddressSpaceReader.h"
 #include "platform/linux/memory/HXPageReader.h"
+#include "platform/linux/memory/HXWalkDifference.h"
 #include "platform/linux/procfs/HXDescriptor.h"
+#include "platform/linux/procfs/HXLinuxProcesses.h"
 #include "platform/linux/procfs/HXProcText.h"
 
 #include <chrono>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <shared_mutex>
 #include <unordered_map>
 
-// Everything is read through the process's directory in /proc, held open: once the process is gone those
-// reads fail, whoever has its pid then. Used by one thread at a time.
+// Lets those who read processes take turns when there are few descriptors. Any thread.
+class HXDescriptorTurns {
+  public:
+    // Runs `read`; if it runs out of descriptors once more, with no other thread reading. Whether they
+    // sufficed in the end.
+    bool run(const std::function<void()> &read);
+
+  private:
+    std::shared_timed_mutex _mutex;
+};
+
+// Everything is read through the process's directory in /proc, which is held open, from the beginning or from
+// the first reading of the address space on: once the process is gone those reads fail, whoever has its pid
+// then. When it is opened again, the process's start time must be the same. Used by one thread at a time.
 class HXLinuxTask {
   public:
-    // `number`: HXObjectIdentifiers::numberOfProcess.
-    HXLinuxTask(int32_t pid, uint32_t number, HXDescriptor directory)
-        : _pid(pid), _number(number), _directory(std::move(directory)) {}
+    // `number`: HXObjectIdentifiers::numberOfProcess. `keepsOpen`: hold the directory open until the task
+    // ends. What else is given outlives this.
+    HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, bool keepsOpen,
+                HXLinuxProcesses &processes, HXDescriptorTurns &turns);
     HXLinuxTask(const HXLinuxTask &) = delete;
     HXLinuxTask &operator=(const HXLinuxTask &) = delete;
 
@@ -27,14 +43,21 @@ class HXLinuxTask {
     uint32_t number() const { return _number; }
     const HXDescriptor &directory() const { return _directory; }
 
+    // Runs `read` by turns; if descriptors do not suffice, the address space, once read, ends with that
+    // error. Whether they do.
+    bool withDescriptors(const std::function<void()> &read);
+
     // The address space as it was when this was first asked for; read again when dirty file pages are wanted
-    // of one that was read without them.
+    // of one that was read without them, and once more when the first reading disagrees with the process's
+    // own counters.
     const HXAddressSpace &addressSpace(const HXReaderSetting &setting, bool needsDirtyPages);
     // The index in the address space, once read, of the first mapping that ends above `address`. A walk in
     // ascending order costs no search.
     size_t find(uint64_t address);
     // Of the address space, once read.
     HXPageReader &pages() { return *_pages; }
+    // How the address space, once read, differs from the counters all the same; none when it does not.
+    const std::optional<HXWalkDifference> &difference() const { return _difference; }
 
     // The process's status; none with errno set. `usage` and `ledger` share one reading when they are asked
     // for one after the other; a second one of either kind reads anew.
@@ -42,14 +65,23 @@ class HXLinuxTask {
     std::optional<HXStatusRecord> status(StatusUse use);
 
   private:
+    HXDescriptor reopen();
+    void read(const HXReaderSetting &setting, bool needsDirtyPages);
+    void readOnce(const HXReaderSetting &setting, bool needsDirtyPages);
+    void compare(const HXReaderSetting &setting, bool isFirst);
+
     const int32_t _pid;
     const uint32_t _number;
-    const HXDescriptor _directory;
+    const uint64_t _startTime; // clock ticks since boot
+    HXLinuxProcesses &_processes;
+    HXDescriptorTurns &_turns;
+    HXDescriptor _directory;
     const std::chrono::steady_clock::time_point _opened = std::chrono::steady_clock::now();
     std::unique_ptr<HXAddressSpace> _addressSpace;
     size_t _cursor = 0;
     std::optional<HXPageReader> _pages;
     std::optional<HXStatusRecord> _status;
+    std::optional<HXWalkDifference> _difference;
     bool _used[2] = {};
 };
 
@@ -61,6 +93,7 @@ class HXTaskTable {
     void remove(uint32_t port);
     // Null for a port that is none.
     HXLinuxTask *find(uint32_t port) const;
+    size_t count() const;
     // The task of `pid` that was opened last and is open still; null when there is none.
     HXLinuxTask *findByPid(int32_t pid) const;
 

@@ -5,10 +5,29 @@
 
 #include <fcntl.h>
 #include <sys/sysinfo.h>
+#include <sys/utsname.h>
+
+#include <algorithm>
+#include <cstdio>
 
 bool HXMachineFacts::usesSwap() const {
     struct sysinfo info;
     return ::sysinfo(&info) != 0 || info.freeswap != info.totalswap;
+}
+
+uint64_t HXMachineFacts::counterErrorPages(uint64_t threads) const {
+    constexpr uint64_t counters = 3;                      // of anonymous, shared and swapped pages
+    constexpr uint64_t threadBatch = 64, leastBatch = 32; // TASK_RSS_EVENTS_THRESH; lib/percpu_counter.c
+    static const bool countsByThread = [] {               // before 6.2
+        utsname names{};
+        unsigned major = 0, minor = 0;
+        ::uname(&names);
+        return std::sscanf(names.release, "%u.%u", &major, &minor) == 2 &&
+               (major < 6 || (major == 6 && minor < 2));
+    }();
+    const auto processors = static_cast<uint64_t>(::get_nprocs());
+    return counters *
+           (countsByThread ? threads * threadBatch : processors * std::max(leastBatch, 2 * processors));
 }
 
 bool HXMachineFacts::hasFreedLazily(std::chrono::steady_clock::time_point since) {

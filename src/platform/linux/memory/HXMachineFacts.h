@@ -2,6 +2,7 @@
 #pragma once
 
 #include <chrono>
+#include <cstdint>
 #include <mutex>
 #include <string>
 
@@ -12,6 +13,9 @@ class HXMachineFacts {
 
     // Whether any page is swapped out now.
     bool usesSwap() const;
+    // By how many pages in all a process's counters of resident memory may be off: the kernel adds up what it
+    // counted for each processor, or each of the process's `threads`, only now and then.
+    uint64_t counterErrorPages(uint64_t threads) const;
     // Whether any process had ever freed pages lazily at some moment after `since`: one lookup serves all
     // processes that were opened before it.
     bool hasFreedLazily(std::chrono::steady_clock::time_point since);

@@ -1,6 +1,7 @@
 #include "platform/linux/memory/HXMappedFile.h"
 
 #include "platform/linux/procfs/HXProcFile.h"
+#include "platform/linux/procfs/HXProcText.h"
 
 #include <fcntl.h>
 #include <linux/openat2.h>
@@ -11,13 +12,32 @@
 #include <cinttypes>
 #include <cstdio>
 
+namespace {
+
 // Never waits for a server: the attributes may be old ones, but not the identity.
+bool readIdentity(const HXDescriptor &place, struct statx *status) {
+    constexpr int flags = AT_EMPTY_PATH | AT_STATX_DONT_SYNC;
+    return ::statx(place.get(), "", flags, STATX_TYPE | STATX_INO, status) == 0;
+}
+
+} // namespace
+
 bool HXIsMappedFile(const HXMapping &mapping, const HXDescriptor &place) {
     struct statx status;
-    if (::statx(place.get(), "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_TYPE | STATX_INO, &status) != 0)
-        return false;
-    // The device is not compared: file systems with subvolumes tell another one here than in maps.
-    return S_ISREG(status.stx_mode) && status.stx_ino == mapping.inode;
+    return readIdentity(place, &status) && S_ISREG(status.stx_mode) && status.stx_ino == mapping.inode;
+}
+
+uint32_t HXDeviceOf(const HXDescriptor &place) {
+    struct statx status;
+    if (!readIdentity(place, &status)) return UINT32_MAX;
+    return HXDeviceNumber(status.stx_dev_major, status.stx_dev_minor);
+}
+
+std::optional<uint64_t> HXMountOf(const HXDescriptor &place) {
+    char buffer[512]; // three or four short lines
+    const std::string name = "/proc/self/fdinfo/" + std::to_string(place.get());
+    const auto text = HXReadOnce(AT_FDCWD, name.c_str(), buffer);
+    return text ? HXParseLabelled(*text, "mnt_id:") : std::nullopt;
 }
 
 HXDescriptor HXLocateMapped(const HXDescriptor &process, const HXMapping &mapping) {
@@ -38,6 +58,7 @@ HXDescriptor HXLocateBelowRoot(const HXDescriptor &process, const std::string &p
     for (int i = 0; i < tries; i++) {
         HXDescriptor file(
             static_cast<int>(::syscall(SYS_openat2, root.get(), path.c_str(), &how, sizeof how)));
+        if (!file) HXShortageWatch::note(errno);
         if (file || errno != EAGAIN) return file;
     }
     return {};
@@ -50,7 +71,7 @@ HXDescriptor HXOpenLocated(const HXDescriptor &place) {
 
 HXDescriptor HXOpenMappedFile(const HXDescriptor &process, const HXMapping &mapping) {
     const HXDescriptor place = HXLocateMapped(process, mapping);
-    // Opening a device may do anything.
-    if (!place || !HXIsMappedFile(mapping, place)) return {};
+    // Opening a device may do anything, and a file of another device may have been mapped meanwhile.
+    if (!place || !HXIsMappedFile(mapping, place) || HXDeviceOf(place) != mapping.device) return {};
     return HXOpenLocated(place);
 }

@@ -5,10 +5,16 @@
 #include "platform/linux/memory/HXMapping.h"
 #include "platform/linux/procfs/HXDescriptor.h"
 
+#include <optional>
 #include <string>
 
 // Whether a descriptor (of any kind) is of the plain file that the mapping maps.
 bool HXIsMappedFile(const HXMapping &mapping, const HXDescriptor &place);
+// The device (HXDeviceNumber) of the file that a descriptor is of. File systems with subvolumes tell another
+// one here than in maps. UINT32_MAX when it cannot be told.
+uint32_t HXDeviceOf(const HXDescriptor &place);
+// The identifier (HXMount) of the mount through which a descriptor has been opened.
+std::optional<uint64_t> HXMountOf(const HXDescriptor &place);
 
 // A descriptor that only names what the mapping maps, which may be a device; not open without the right to.
 HXDescriptor HXLocateMapped(const HXDescriptor &process, const HXMapping &mapping);
@@ -20,5 +26,5 @@ HXDescriptor HXLocateBelowRoot(const HXDescriptor &process, const std::string &p
 // Opens a plain file for reading that has been located and checked.
 HXDescriptor HXOpenLocated(const HXDescriptor &place);
 
-// Opens the plain file that a mapping maps; not open without the right to.
+// Opens the plain file that a mapping of shared memory maps; not open without the right to.
 HXDescriptor HXOpenMappedFile(const HXDescriptor &process, const HXMapping &mapping);

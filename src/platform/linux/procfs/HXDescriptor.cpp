@@ -1,7 +1,5 @@
 #include "platform/linux/procfs/HXDescriptor.h"
 
-#include <cerrno>
-
 void HXDescriptor::reset(int descriptor) {
     if (_descriptor >= 0) {
         const int kept = errno;

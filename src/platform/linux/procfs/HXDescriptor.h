@@ -3,6 +3,7 @@
 
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstddef>
 #include <cstdint>
 #include <span>
@@ -37,6 +38,23 @@ class HXDescriptor {
 
   private:
     int _descriptor = -1;
+};
+
+// Tells a thread whether something could not be opened for want of descriptors or memory, which must not be
+// taken for something that is not there. Watches may be nested.
+class HXShortageWatch {
+  public:
+    HXShortageWatch() : _before(_count) {}
+    bool seen() const { return _count != _before; }
+
+    // Whether `error` says that the process or the machine has run out of descriptors or memory.
+    static bool isShortage(int error) { return error == EMFILE || error == ENFILE || error == ENOMEM; }
+    // For whoever failed to open something: `error` is why.
+    static void note(int error) { _count += isShortage(error); }
+
+  private:
+    static inline thread_local uint64_t _count = 0;
+    const uint64_t _before;
 };
 
 // An open directory that names are relative to: a look at a descriptor, or AT_FDCWD.

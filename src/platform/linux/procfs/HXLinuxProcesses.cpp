@@ -1,6 +1,7 @@
 #include "platform/linux/procfs/HXLinuxProcesses.h"
 
 #include "platform/HXSafeText.h"
+#include "platform/linux/memory/HXTaskFiles.h"
 #include "platform/linux/procfs/HXProcFile.h"
 #include "platform/linux/procfs/HXTextNumber.h"
 
@@ -8,8 +9,6 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <array>
-#include <bit>
 #include <cerrno>
 #include <climits>
 #include <cstring>
@@ -51,7 +50,7 @@ proc_bsdshortinfo shortInfo(const HXStatRecord &stat, uint32_t flags) {
     info.pbsi_pid = stat.pid;
     info.pbsi_ppid = stat.ppid;
     info.pbsi_pgid = stat.pgid;
-    info.pbsi_status = stat.isZombie() ? SZOMB : 0;
+    info.pbsi_status = stat.hasEnded() ? SZOMB : 0;
     info.pbsi_flags = flags;
     copyName(info.pbsi_comm, HXSafeName(stat.comm()));
     return info;
@@ -65,109 +64,67 @@ HXStatRecord kernelStat() {
     return stat;
 }
 
-std::optional<HXAuxiliaryVector> readAuxiliaryVector(HXDirectoryView directory, const char *name) {
-    char buffer[2048]; // some twenty entries of 16 bytes
-    const auto bytes = HXReadOnce(directory, name, buffer);
-    return bytes ? HXParseAuxiliaryVector(*bytes) : std::nullopt;
-}
-
-// Whether a page is in memory and no file's: reading another one might wait for a file system that the
-// process mapped there, or for the process itself.
-bool isPresentAndOwn(const HXDescriptor &pagemap, uint64_t page) {
-    constexpr uint64_t present = uint64_t{1} << 63, ofFile = uint64_t{1} << 61; // pagemap of proc(5)
-    std::array<char, sizeof(uint64_t)> bytes;
-    if (pagemap.readAt(page * bytes.size(), bytes.data(), bytes.size()) != static_cast<ssize_t>(bytes.size()))
-        return false;
-    return (std::bit_cast<uint64_t>(bytes) & (present | ofFile)) == present;
-}
-
-// The text at `address` of the process's memory up to its zero byte.
-std::optional<std::string> readPresentText(const HXDescriptor &process, uint64_t address) {
-    const HXDescriptor memory = HXOpenAt(process, "mem");
-    const HXDescriptor pagemap = HXOpenAt(process, "pagemap");
-    if (!memory || !pagemap) return std::nullopt;
-    const auto pageSize = static_cast<uint64_t>(::sysconf(_SC_PAGESIZE));
-    std::string text;
-    char buffer[PATH_MAX];
-    while (text.size() < PATH_MAX) {
-        const size_t length = std::min<uint64_t>(pageSize - address % pageSize, sizeof buffer);
-        if (!isPresentAndOwn(pagemap, address / pageSize) ||
-            memory.readAt(address, buffer, length) != static_cast<ssize_t>(length))
-            return std::nullopt;
-        const std::string_view piece(buffer, length);
-        const size_t end = piece.find('\0');
-        text += piece.substr(0, end);
-        if (end != std::string_view::npos) return text;
-        address += length;
-    }
-    return std::nullopt;
-}
-
-// The path that was executed, from the process's own memory.
-std::optional<std::string> readExecutedPath(const HXDescriptor &process) {
-    const auto vector = readAuxiliaryVector(process, "auxv");
-    if (!vector || !vector->execFileName) return std::nullopt;
-    return readPresentText(process, *vector->execFileName);
-}
-
-bool isNamed(std::string_view path, std::string_view comm) {
-    return HXBaseName(path).substr(0, kCommLength) == comm;
-}
-
-// The area in the layout that HXPlatform::sysctl tells.
-std::string argumentArea(std::string_view path, std::string_view arguments) {
-    // Readers find the path behind the first zero byte, which works for counts of one byte only.
-    constexpr size_t maximumCount = 255;
-    const auto count = static_cast<uint32_t>(std::min(HXSplitArguments(arguments).size(), maximumCount));
-    std::string area(sizeof count, '\0');
-    std::memcpy(area.data(), &count, sizeof count);
-    area += HXSafeName(path);
-    area += '\0';
-    area += arguments;
-    if (!arguments.empty() && arguments.back() != '\0') area += '\0';
-    return area;
+// What of `executable` (/proc/PID/exe) and `comm` names the program; none when only `comm` by itself does.
+std::optional<std::string> programPath(std::string_view executable, std::string_view comm) {
+    // As a path such names would say something else. The process's record has them as they are.
+    if (comm.empty() || comm.find('/') != std::string_view::npos) return std::nullopt;
+    if (executable.ends_with(kDeletedSuffix)) executable.remove_suffix(kDeletedSuffix.size());
+    const size_t nameStart = executable.rfind('/') + 1; // 0 without a slash
+    const bool isCut = comm.size() == kCommLength && executable.substr(nameStart).starts_with(comm);
+    return std::string(executable.substr(0, nameStart)).append(isCut ? executable.substr(nameStart) : comm);
 }
 
 } // namespace
 
-bool HXMayBeScript(const HXProgramName &name) {
-    return !isNamed(name.executable, name.comm);
+std::string HXLinuxProcesses::pathOf(int32_t pid, const char *file) const {
+    return _procPath + '/' + std::to_string(pid) + '/' + file;
 }
 
-std::string_view HXExecutedPath(const HXProgramName &name) {
-    if (!HXMayBeScript(name)) return name.executable;
-    // The interpreter gets the script as an argument, behind at most one option of the #! line; its loader
-    // may come before it.
-    constexpr size_t reach = 10;
-    const auto arguments = HXSplitArguments(name.arguments);
-    for (size_t i = 1; i < std::min(arguments.size(), reach); i++) {
-        if (name.executedPath ? arguments[i] == *name.executedPath
-                              : i <= 2 && isNamed(arguments[i], name.comm))
-            return arguments[i];
+// By the number of any of its threads, too, /proc shows a process, though it does not list those; through
+// each of them the memory that they share.
+HXDescriptor HXLinuxProcesses::openThread(int32_t pid, const HXDescriptor &leader) {
+    std::vector<int32_t> threads;
+    {
+        const HXDescriptor list = HXOpenAt(leader, "task", O_DIRECTORY);
+        if (!list || !HXForEachEntry(list, [&](const char *name) {
+                const auto thread = pidOf(name);
+                if (thread && *thread != pid) threads.push_back(*thread);
+                return true;
+            }))
+            return {};
     }
-    return name.executable;
+    for (const int32_t thread : threads) {
+        HXDescriptor directory = HXOpenAt(AT_FDCWD, pathOf(thread, "").c_str(), O_PATH | O_DIRECTORY);
+        const auto stat = directory ? HXReadStat(directory) : std::nullopt;
+        if (!stat || stat->isZombie()) continue;
+        // The number may have gone to another process in between.
+        const std::string name = "task/" + std::to_string(thread);
+        if (::faccessat(leader.get(), name.c_str(), F_OK, 0) == 0) return directory;
+    }
+    errno = ESRCH;
+    return {};
 }
 
-HXDirectoryView HXLinuxProcesses::directory() {
-    const std::lock_guard lock(_mutex);
-    if (!_directory) _directory = HXOpenAt(AT_FDCWD, _procPath.c_str(), O_DIRECTORY);
-    return _directory;
-}
-
-HXDescriptor HXLinuxProcesses::open(int32_t pid) {
-    return HXOpenAt(directory(), std::to_string(pid).c_str(), O_PATH | O_DIRECTORY);
+std::optional<HXOpenProcess> HXLinuxProcesses::open(int32_t pid) {
+    const HXShortageWatch watch;
+    HXDescriptor directory = HXOpenAt(AT_FDCWD, pathOf(pid, "").c_str(), O_PATH | O_DIRECTORY);
+    const auto stat = directory ? HXReadStat(directory) : std::nullopt;
+    if (stat && stat->lacksLeader()) directory = openThread(pid, directory);
+    if (stat && directory) return HXOpenProcess{std::move(directory), *stat};
+    errno = watch.seen() ? EMFILE : ESRCH;
+    return std::nullopt;
 }
 
 int32_t HXLinuxProcesses::ownPid() {
     char buffer[32];
-    const auto link = HXReadLink(directory(), "self", buffer);
+    const auto link = HXReadLink(AT_FDCWD, (_procPath + "/self").c_str(), buffer);
     int32_t pid = 0;
     return link && HXIsNumber(*link, &pid) ? pid : -1;
 }
 
 std::optional<HXStatRecord> HXLinuxProcesses::readStat(int32_t pid) {
     char buffer[2048]; // 52 numbers and a short name
-    const auto text = HXReadOnce(directory(), (std::to_string(pid) + "/stat").c_str(), buffer);
+    const auto text = HXReadOnce(AT_FDCWD, pathOf(pid, "stat").c_str(), buffer);
     if (!text) {
         if (errno == ENOENT) errno = ESRCH;
         return std::nullopt;
@@ -191,46 +148,49 @@ std::optional<HXStatRecord> HXLinuxProcesses::statOf(int32_t pid) {
 }
 
 int32_t HXLinuxProcesses::proc_listallpids(int32_t *pids, uint32_t bufferBytes) {
-    // A descriptor of its own: the place in the directory belongs to it.
-    const HXDescriptor list = HXOpenAt(AT_FDCWD, _procPath.c_str(), O_DIRECTORY);
-    if (!list) return -1;
-    const uint32_t room = pids == nullptr ? UINT32_MAX : bufferBytes / sizeof(int32_t);
+    std::vector<int32_t> found = {0};
+    {
+        const HXDescriptor list = HXOpenAt(AT_FDCWD, _procPath.c_str(), O_DIRECTORY);
+        if (!list || !HXForEachEntry(list, [&](const char *name) {
+                const auto pid = pidOf(name);
+                if (pid) found.push_back(*pid);
+                return true;
+            }))
+            return -1;
+    }
+    if (pids == nullptr) return static_cast<int32_t>(found.size());
+    const uint32_t room = bufferBytes / sizeof(int32_t);
     uint32_t count = 0;
     std::unordered_map<int32_t, Listed> listed;
-    if (room > 0) {
-        if (pids != nullptr) pids[0] = 0;
-        count = 1;
-    }
-    const bool done = HXForEachEntry(list, [&](const char *name) {
-        const auto pid = pidOf(name);
-        if (!pid) return true;
-        if (count >= room) return false;
-        if (pids != nullptr) {
-            const auto stat = readStat(*pid);
-            if (!stat || stat->isKernelThread()) return true;
-            pids[count] = *pid;
-            listed.emplace(*pid, Listed{*stat});
+    for (size_t i = 0; i < found.size() && count < room; i++) {
+        const int32_t pid = found[i];
+        if (pid != 0) {
+            const auto stat = readStat(pid);
+            // A list that lacks those for whom there was no descriptor would be no list.
+            if (!stat && HXShortageWatch::isShortage(errno)) return -1;
+            if (!stat || stat->isKernelThread()) continue;
+            listed.emplace(pid, Listed{*stat});
         }
-        count++;
-        return true;
-    });
-    if (!done) return -1;
-    if (pids != nullptr) {
-        const std::lock_guard lock(_mutex);
-        _listed = std::move(listed);
+        pids[count++] = pid;
     }
-    return static_cast<int32_t>(std::min<uint32_t>(count, INT32_MAX));
+    const std::lock_guard lock(_mutex);
+    _listed = std::move(listed);
+    return static_cast<int32_t>(count);
+}
+
+// 64-bit programs have their stack far above what 32-bit ones can reach. Where the kernel does not tell the
+// stack, the program counts as one of the kernel's own width.
+bool HXLinuxProcesses::is64bit(const HXStatRecord &stat) {
+    uint64_t stack = stat.startStack;
+    if (stat.lacksLeader()) {
+        const auto process = open(stat.pid);
+        const auto thread = process ? HXReadStat(process->directory) : std::nullopt;
+        stack = thread ? thread->startStack : 0;
+    }
+    return stack == 0 ? sizeof(void *) == 8 : stack > UINT32_MAX;
 }
 
 namespace {
-
-// 64-bit programs have their stack far above what 32-bit ones can reach. Where the kernel does not tell the
-// stack, the width of the auxiliary vector's words does.
-bool is64bit(const HXStatRecord &stat, HXDirectoryView directory) {
-    if (stat.startStack > UINT32_MAX) return true;
-    const auto vector = readAuxiliaryVector(directory, (std::to_string(stat.pid) + "/auxv").c_str());
-    return vector ? vector->is64bit : sizeof(void *) == 8;
-}
 
 template <typename Record>
 int32_t answer(const Record &record, void *buffer, uint32_t bufferBytes) {
@@ -257,47 +217,46 @@ int32_t HXLinuxProcesses::proc_pidinfo(int32_t pid, int32_t flavor, void *buffer
     // The short record tells whether a process has ended, so it is always read anew.
     const auto stat = pid == 0 ? kernelStat() : isLong ? statOf(pid) : readStat(pid);
     if (!stat) return 0;
-    if (stat->isKernelThread() || (isLong && stat->isZombie())) {
+    if (stat->isKernelThread() || (isLong && stat->hasEnded())) {
         errno = ESRCH;
         return 0;
     }
     // A 64-bit program runs on a 64-bit kernel alone.
     constexpr uint32_t kernelFlags = PROC_FLAG_SYSTEM | (sizeof(void *) == 8 ? PROC_FLAG_LP64 : 0);
-    const bool isWide = pid != 0 && !stat->isZombie() && is64bit(*stat, directory());
+    const bool isWide = pid != 0 && !stat->hasEnded() && is64bit(*stat);
     const uint32_t flags = pid == 0 ? kernelFlags : isWide ? PROC_FLAG_LP64 : 0;
     if (isLong) return answer(bsdInfo(*stat, flags), buffer, bufferBytes);
     return answer(shortInfo(*stat, flags), buffer, bufferBytes);
 }
 
-std::string HXLinuxProcesses::commOf(int32_t pid, const HXDescriptor &process) {
+std::optional<HXStatRecord> HXLinuxProcesses::statForName(int32_t pid) {
     {
         const std::lock_guard lock(_mutex);
         const auto found = _listed.find(pid);
-        if (found != _listed.end()) return std::string(found->second.stat.comm());
+        if (found != _listed.end()) return found->second.stat;
     }
-    char buffer[128];
-    auto comm = HXReadOnce(process, "comm", buffer).value_or(std::string_view());
-    if (comm.ends_with('\n')) comm.remove_suffix(1);
-    return std::string(comm);
+    return readStat(pid);
 }
 
 int32_t HXLinuxProcesses::copyArguments(int32_t pid, void *old, size_t *oldBytes) {
-    const HXDescriptor process = open(pid);
-    if (!process) {
-        if (errno == ENOENT) errno = ESRCH;
+    const auto stat = statForName(pid);
+    if (!stat) return -1;
+    char link[PATH_MAX];
+    std::optional<std::string_view> executable;
+    if (stat->lacksLeader()) {
+        const auto process = open(pid);
+        if (process) executable = HXReadLink(process->directory, "exe", link);
+    } else {
+        executable = HXReadLink(AT_FDCWD, pathOf(pid, "exe").c_str(), link);
+    }
+    if (!executable) return -1;
+    const auto path = programPath(*executable, stat->comm());
+    if (!path) {
+        errno = ENOENT;
         return -1;
     }
-    char link[PATH_MAX];
-    const auto executable = HXReadLink(process, "exe", link);
-    if (!executable) return -1;
-    HXProgramName name{*executable, {}, {}};
-    if (name.executable.ends_with(kDeletedSuffix)) name.executable.remove_suffix(kDeletedSuffix.size());
-    const std::string comm = commOf(pid, process);
-    name.comm = comm;
-    const std::span<char> scratch = HXScratchBuffer();
-    name.arguments = HXReadOnce(process, "cmdline", scratch).value_or(std::string_view());
-    if (HXMayBeScript(name)) name.executedPath = readExecutedPath(process);
-    const std::string area = argumentArea(HXExecutedPath(name), name.arguments);
+    constexpr std::string_view oneArgument("\1\0\0", 4); // in little-endian order
+    const std::string area = std::string(oneArgument) + HXSafeName(*path) + '\0';
     const size_t length = std::min(area.size(), *oldBytes);
     if (old != nullptr) std::memcpy(old, area.data(), length);
     *oldBytes = old == nullptr ? area.size() : length;

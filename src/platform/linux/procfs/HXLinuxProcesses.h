@@ -12,16 +12,23 @@
 #include <string_view>
 #include <unordered_map>
 
+// A process that has been opened.
+struct HXOpenProcess {
+    // Its directory in /proc; of one whose leading thread has ended that of another thread, which shows the
+    // same memory.
+    HXDescriptor directory;
+    HXStatRecord stat; // of its leading thread, whose start time tells the process from others of its pid
+};
+
 class HXLinuxProcesses {
   public:
     // What `pid` of 0, the kernel, is called.
     static constexpr std::string_view kernelName = "kernel";
 
-    // Opens `procPath` on first need.
     explicit HXLinuxProcesses(std::string procPath) : _procPath(std::move(procPath)) {}
 
-    // The directory of a process; not open with errno set.
-    HXDescriptor open(int32_t pid);
+    // None with errno set: ESRCH, or EMFILE when descriptors or memory do not suffice.
+    std::optional<HXOpenProcess> open(int32_t pid);
 
     // The number of the running process here, which need not be the one that getpid(2) tells: /proc may be
     // that of another pid namespace (pid_namespaces(7)). -1 when the process is not in it.
@@ -29,7 +36,11 @@ class HXLinuxProcesses {
     // As HXPlatform says.
     int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes);
     int32_t proc_pidinfo(int32_t pid, int32_t flavor, void *buffer, uint32_t bufferBytes);
-    // The argument area of sysctl(KERN_PROCARGS2): 0 on success.
+    // The argument area of sysctl(KERN_PROCARGS2): 0 on success. It counts one argument and has one path: the
+    // folder of what the process executes, and as the name what ps calls it, the `comm`; where that is cut,
+    // the whole name of the executable. Fails for a name that is empty or has a slash: only the record tells
+    // it right. Nothing is read from the process's memory, as cmdline, environ and auxv partly are: a page of
+    // it can make the reader wait for ever.
     int32_t copyArguments(int32_t pid, void *old, size_t *oldBytes);
 
   private:
@@ -40,26 +51,15 @@ class HXLinuxProcesses {
         bool isUsed = false;
     };
 
-    HXDirectoryView directory();
+    std::string pathOf(int32_t pid, const char *file) const;
+    HXDescriptor openThread(int32_t pid, const HXDescriptor &leader);
+    bool is64bit(const HXStatRecord &stat);
     std::optional<HXStatRecord> readStat(int32_t pid);
     std::optional<HXStatRecord> takeListed(int32_t pid);
     std::optional<HXStatRecord> statOf(int32_t pid);
-    std::string commOf(int32_t pid, const HXDescriptor &process);
+    std::optional<HXStatRecord> statForName(int32_t pid);
 
     const std::string _procPath;
     std::mutex _mutex;
-    HXDescriptor _directory;
     std::unordered_map<int32_t, Listed> _listed;
 };
-
-// What names a running program: the path of its executable, or of the script that it runs.
-struct HXProgramName {
-    std::string_view executable; // /proc/PID/exe
-    std::string_view comm;
-    std::string_view arguments;                   // /proc/PID/cmdline
-    std::optional<std::string> executedPath = {}; // AT_EXECFN; none when it cannot be read
-};
-// The path that was executed: the script's for a script started by its #! line.
-std::string_view HXExecutedPath(const HXProgramName &name);
-// Whether `executedPath` matters at all: it costs reading the process's memory.
-bool HXMayBeScript(const HXProgramName &name);

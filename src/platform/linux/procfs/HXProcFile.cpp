@@ -16,7 +16,9 @@ std::span<char> HXScratchBuffer() {
 
 HXDescriptor HXOpenAt(HXDirectoryView directory, const char *name, int flags) {
     constexpr int always = O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY;
-    return HXDescriptor(::openat(directory.get(), name, always | flags));
+    HXDescriptor file(::openat(directory.get(), name, always | flags));
+    if (!file) HXShortageWatch::note(errno);
+    return file;
 }
 
 std::optional<std::string_view> HXReadOnce(HXDirectoryView directory, const char *name,

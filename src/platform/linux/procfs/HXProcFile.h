@@ -19,7 +19,8 @@
 std::span<char> HXScratchBuffer();
 
 // Opens `name` for reading, closed on execution. Never waits and never becomes a controlling terminal.
-// `flags`: more of open(2), as O_DIRECTORY or O_PATH. Not open with errno set.
+// `flags`: more of open(2), as O_DIRECTORY or O_PATH. Not open with errno set; a shortage is noted
+// (HXShortageWatch).
 HXDescriptor HXOpenAt(HXDirectoryView directory, const char *name, int flags = 0);
 
 // The content of a file that the kernel hands out by one read call if there is room (stat, status, comm).

@@ -78,60 +78,25 @@ std::optional<uint64_t> HXParseLabelled(std::string_view text, std::string_view 
     return std::nullopt;
 }
 
-void HXParseMountInfo(std::string_view text,
-                      const std::function<void(uint32_t device, std::string_view type)> &each) {
+void HXParseMountInfo(std::string_view text, const std::function<void(const HXMount &mount)> &each) {
     for (HXTextCursor cursor{text}; !cursor.rest.empty();) {
         // ID PARENT MAJOR:MINOR ROOT POINT OPTIONS [TAG…] - TYPE SOURCE OPTIONS; blanks in paths are escaped.
         HXTextCursor line{cursor.line()};
-        line.word();
-        line.word();
+        HXMount mount{};
         uint32_t major = 0, minor = 0;
+        if (!line.number(&mount.identifier) || line.word().empty()) continue;
         if (!line.field(&major) || !line.skip(':') || !line.number(&minor)) continue;
+        mount.device = HXDeviceNumber(major, minor);
+        line.word();
+        mount.point = line.word();
         const size_t separator = line.rest.find(" - ");
         if (separator == std::string_view::npos) continue;
         line.rest.remove_prefix(separator + 3);
-        each(HXDeviceNumber(major, minor), line.word());
+        mount.type = line.word();
+        line.word();
+        mount.options = line.word();
+        each(mount);
     }
-}
-
-namespace {
-
-template <typename Word>
-std::optional<HXAuxiliaryVector> parseEntries(std::string_view bytes) {
-    constexpr Word nullType = 0, execFileNameType = 31; // AT_NULL, AT_EXECFN
-    HXAuxiliaryVector vector;
-    vector.is64bit = sizeof(Word) == 8;
-    Word entry[2];
-    bool any = false;
-    for (; bytes.size() >= sizeof entry; bytes.remove_prefix(sizeof entry)) {
-        std::memcpy(entry, bytes.data(), sizeof entry);
-        if (entry[0] == nullType) break;
-        any = true;
-        if (entry[0] == execFileNameType) vector.execFileName = entry[1];
-    }
-    if (!any) return std::nullopt;
-    return vector;
-}
-
-} // namespace
-
-std::optional<HXAuxiliaryVector> HXParseAuxiliaryVector(std::string_view bytes) {
-    uint64_t first = 0;
-    if (bytes.size() < sizeof first) return std::nullopt;
-    std::memcpy(&first, bytes.data(), sizeof first);
-    // A 32-bit process has a small type and its value in what reads as the first 64-bit word.
-    if (first > UINT32_MAX) return parseEntries<uint32_t>(bytes);
-    return parseEntries<uint64_t>(bytes);
-}
-
-std::vector<std::string_view> HXSplitArguments(std::string_view text) {
-    std::vector<std::string_view> arguments;
-    while (!text.empty()) {
-        const size_t end = std::min(text.find('\0'), text.size());
-        arguments.push_back(text.substr(0, end));
-        text.remove_prefix(std::min(end + 1, text.size()));
-    }
-    return arguments;
 }
 
 std::optional<uint64_t> HXParseStackPointer(std::string_view text) {
@@ -142,9 +107,4 @@ std::optional<uint64_t> HXParseStackPointer(std::string_view text) {
     uint64_t address = 0;
     if (!pointer.skip("0x") || !HXIsNumber(pointer.rest, &address, 16)) return std::nullopt;
     return address;
-}
-
-std::string_view HXBaseName(std::string_view path) {
-    const size_t slash = path.rfind('/');
-    return slash == std::string_view::npos ? path : path.substr(slash + 1);
 }

@@ -7,7 +7,6 @@
 #include <optional>
 #include <string>
 #include <string_view>
-#include <vector>
 
 // /proc/PID/stat, as far as it is read.
 struct HXStatRecord {
@@ -26,6 +25,11 @@ struct HXStatRecord {
     std::string_view comm() const { return {commBytes, commLength}; }
     bool isKernelThread() const { return (flags & kernelThreadFlag) != 0; }
     bool isZombie() const { return state == 'Z' || state == 'X' || state == 'x'; }
+    // Of a process: no thread of it runs any more.
+    bool hasEnded() const { return isZombie() && threadCount <= 1; }
+    // Of a process: its leading thread has ended, others (may) run. What /proc/PID tells of memory is then
+    // empty.
+    bool lacksLeader() const { return isZombie() && threadCount > 1; }
 };
 // None when the text is no stat line. The name may hold blanks, parentheses and newlines.
 std::optional<HXStatRecord> HXParseStat(std::string_view text);
@@ -61,23 +65,16 @@ constexpr uint32_t HXDeviceNumber(uint32_t major, uint32_t minor) {
     return major << 20 | (minor & 0xFFFFF);
 }
 
-// /proc/PID/mountinfo: calls `each` with the device and the file system type of every mount.
-void HXParseMountInfo(std::string_view text,
-                      const std::function<void(uint32_t device, std::string_view type)> &each);
-
-// /proc/PID/auxv.
-struct HXAuxiliaryVector {
-    bool is64bit = true;                  // width of its words
-    std::optional<uint64_t> execFileName; // AT_EXECFN: address of the path that was executed
+// A line of /proc/PID/mountinfo. Blanks, tabs, newlines and backslashes in its texts stay escaped (\040).
+struct HXMount {
+    uint64_t identifier;
+    uint32_t device; // HXDeviceNumber
+    std::string_view point;
+    std::string_view type;    // of the file system
+    std::string_view options; // of the file system, with commas between them
 };
-// None when the bytes hold no entry.
-std::optional<HXAuxiliaryVector> HXParseAuxiliaryVector(std::string_view bytes);
-
-// /proc/PID/cmdline: the arguments; the last one needs no zero.
-std::vector<std::string_view> HXSplitArguments(std::string_view text);
+// Calls `each` for every mount, in the order of the text.
+void HXParseMountInfo(std::string_view text, const std::function<void(const HXMount &mount)> &each);
 
 // /proc/PID/task/TID/syscall: the stack pointer; none for a thread that is running or whose line has none.
 std::optional<uint64_t> HXParseStackPointer(std::string_view text);
-
-// What follows the last slash of `path`.
-std::string_view HXBaseName(std::string_view path);
