@@ -147,7 +147,7 @@ def attempt(programs, work):
                 continue
             told = not tells_bystander or f'[{bystander.pid}]' in out
             failures += not told
-            note = [line for line in (out + err).splitlines() if str(subject) in line and ':' in line and 'heft' not in line.lower()]
+            note = [line for line in err.splitlines() if 'not answering' in line or 'timed out' in line]
             if words == previous: continue
             previous = words
             print(f'{work.__name__}: {" ".join(words[:2])}: status {child.returncode}, {time.monotonic() - begun:.1f} s'

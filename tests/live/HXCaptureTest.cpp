@@ -91,13 +91,9 @@ TEST_F(Captures, OfOneProcessGiveItsHeftAndCategories) {
         const std::string filter = ".processes[0] | .heft, .auxiliary, .categories";
         return HXRunProgram({"/usr/bin/env", "jq", "-cS", filter, file("json")}).out;
     };
-    const struct {
-        std::vector<std::string> record;
-        std::vector<std::string> mode;
-    } modes[] = {{{HEFT_RECORD_PROGRAM, "memgraph"}, {}},
-                 {{HEFT_RECORD_PROGRAM, "memgraph", "--vmObjectDirty"}, {"--vmObjectDirty"}}};
-    for (const auto &[record, mode] : modes) {
-        std::vector<std::string> arguments = record;
+    for (const auto &mode : std::vector<std::vector<std::string>>{{}, {"--vmObjectDirty"}}) {
+        std::vector<std::string> arguments = {HEFT_RECORD_PROGRAM, "memgraph"};
+        arguments.insert(arguments.end(), mode.begin(), mode.end());
         arguments.insert(arguments.end(), {pid, file("graph")});
         ASSERT_EQ(HXRunProgram(arguments).status, 0);
         const std::string live = figures(pid, mode);

@@ -72,15 +72,6 @@ class Shell {
     std::optional<HXSubject> subject;
 };
 
-TEST(HXProgram, NamesScriptsAfterTheScript) {
-    const HXTemporaryFolder folder;
-    folder.write("my script", "#!/bin/sh\nkill -STOP $$\n");
-    std::filesystem::permissions(folder / "my script", std::filesystem::perms(0755));
-    const HXSubject subject(folder / "my script", {});
-    const std::string header = "my script [" + std::to_string(subject.pid()) + "]: 64-bit\tHeft: ";
-    EXPECT_TRUE(contains(HXRunHeft({"-p", "my script"}).out, header));
-}
-
 TEST(HXProgram, NamesProgramsAfterTheirFileThoughItIsGone) {
     const Shell shell("my shell");
     shell.folder.remove("my shell");
