@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <fcntl.h>
 #include <filesystem>
 #include <sys/mman.h>
 #include <sys/stat.h>
@@ -17,7 +18,13 @@ namespace {
 
 class Captures : public testing::Test {
   protected:
-    Captures() { EXPECT_EQ(ftruncate(memfd, 1 << 20), 0); }
+    Captures() {
+        EXPECT_EQ(ftruncate(memfd, 1 << 20), 0);
+        // Pages of a program that has just been built await writing, but not for long.
+        const int program = open("/proc/self/exe", O_RDONLY | O_CLOEXEC);
+        EXPECT_EQ(fsync(program), 0);
+        close(program);
+    }
     ~Captures() override { close(memfd); }
     std::string file(const std::string &name) const { return folder / name; }
 

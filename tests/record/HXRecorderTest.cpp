@@ -4,6 +4,7 @@
 #include "support/HXBuilders.h"
 #include "support/HXMadeUpMachine.h"
 
+#include <atomic>
 #include <future>
 #include <gtest/gtest.h>
 
@@ -101,10 +102,10 @@ TEST(HXMachineRecorder, LeavesOutItselfAndWhatVanishes) {
 TEST(HXMachineRecorder, LeavesOutWhatDoesNotAnswer) {
     struct Waiting : HXMadeUpMachine {
         using HXMadeUpMachine::HXMadeUpMachine;
-        std::promise<void> answer;
-        bool isFirst = true;
+        std::atomic<bool> isFirst = true;
         void mach_port_deallocate(mach_port_t, mach_port_t) override {
-            if (std::exchange(isFirst, false)) answer.get_future().wait(); // until the machine is no more
+            static auto &answer = *new std::promise<void>; // which is never given
+            if (isFirst.exchange(false)) answer.get_future().wait();
         }
     } host("host\nprocess  pid=5  name=a\nprocess  pid=6  name=b\n");
     host.realServices.setAnswerTime(std::chrono::milliseconds(100));

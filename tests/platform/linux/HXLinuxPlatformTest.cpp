@@ -374,6 +374,7 @@ TEST_F(HXLinuxPlatformTest, CountsFromPageTablesOnlyWhereTheyTellEnough) {
     HXNamedTags tags;
     proc.write("mountinfo", "1 1 0:53 / /huge rw - hugetlbfs none rw\n");
     proc.link("pagemap", "/proc/self/pagemap");
+    static_cast<volatile char *>(ownPage)[0] = 2; // now it is in memory
     const HXDescriptor directory = HXOpenAt(AT_FDCWD, proc.path().c_str());
     const auto sourceFor = [&](const std::string &question) -> std::string {
         const std::vector<std::string> words = HXWordsOf(question);
