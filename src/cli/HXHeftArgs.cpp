@@ -80,8 +80,8 @@ std::unique_ptr<HXHeftArgs> HXHeftArgs::withArgc(int argc, char *const argv[], H
     for (const Option &option : Option::all) {
         const int position = static_cast<int>(words.size());
         if (option.letter) letters += std::string(1, option.letter) + (option.hasArgument ? ":" : "");
-        words.push_back({option.name, option.hasArgument, nullptr,
-                         option.letter ? option.letter : beyondLetters + position});
+        words.push_back(
+            {option.name, option.hasArgument, option.letter ? option.letter : beyondLetters + position});
     }
     auto args = std::make_unique<HXHeftArgs>();
     HXOptionScan scan;

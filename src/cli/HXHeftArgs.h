@@ -24,7 +24,6 @@ class HXStringSet {
 
 // Codes of HXHeftError.
 enum HXHeftErrorCode {
-    HXErrorNoObject = 0,
     HXErrorHelp = 1,
     HXErrorFormat = 2,
     HXErrorSort = 3,

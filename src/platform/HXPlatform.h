@@ -130,6 +130,10 @@ class HXPlatform {
     // Resource usage, flavor RUSAGE_INFO_V4. 0 on success.
     virtual int32_t proc_pid_rusage(int32_t pid, int32_t flavor, rusage_info_v4 *info) = 0;
 
+    // Whether the process may be called `name` by its argument area, as far as its record tells: only those
+    // that may need be asked for it.
+    virtual bool mayBeNamed(const proc_bsdinfo &, std::string_view) { return true; }
+
     // Idle-exit flags (0x1 tracked, 0x2 allows idle exit, 0x4 dirty). 0 on success.
     virtual int32_t proc_get_dirty(int32_t pid, uint32_t *flags) = 0;
 

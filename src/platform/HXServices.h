@@ -16,13 +16,12 @@
 struct HXLongOption {
     const char *name; // may be empty: such an option has no long form
     bool hasArgument;
-    int *flag; // when not null, set to `value` and `getopt_long` returns 0
-    int value;
+    int value; // what `getopt_long` answers
 };
 
 // The scanner's state after a step of `getopt_long`.
 struct HXOptionScan {
-    int result = 0;                 // the option's value, 0, '?' or ':'; -1 at the end
+    int result = 0;                 // the option's value, '?' or ':'; -1 at the end
     const char *argument = nullptr; // the option's argument, if it has one
     int index = 1;                  // at the end: the index of the first argument that is no option
 };

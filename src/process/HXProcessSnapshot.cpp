@@ -112,15 +112,9 @@ kern_return_t HXProcessSnapshot::takeTask(int32_t pid, HXTaskPort *task) {
 // Adds every process that the description means; whether there was one.
 bool HXProcessSnapshot::matchDescription(const std::string &description, HXPidDescriptions &result) {
     const std::optional<int32_t> number = leadingInteger(description);
-    // To read a name is to ask its process. Where a process has the number, only those whose record says so
-    // are taken to be called by it.
-    const bool isPid = number && description == std::to_string(*number) && _positions.contains(*number);
-    const auto mayBeNamed = [&](const proc_bsdinfo &info) {
-        return !isPid || description == HXProcess::_nameForBsdInfoCommName(info);
-    };
     bool matched = false;
     for (const proc_bsdinfo &info : _records) {
-        if (mayBeNamed(info) && description == nameOf(info)) {
+        if (_host.mayBeNamed(info, description) && description == nameOf(info)) {
             result.set(info.pbi_pid, description);
             matched = true;
         } else if (number == info.pbi_pid) {

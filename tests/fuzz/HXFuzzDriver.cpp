@@ -1,6 +1,8 @@
 // Runs a fuzz target without a fuzzing engine: over the files of its corpus, then over mutations of them, the
 // same in every run, for HEFT_FUZZ_SECONDS (default 2).
+#include <algorithm>
 #include <chrono>
+#include <csignal>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
@@ -22,7 +24,21 @@ size_t below(size_t limit) {
     return limit == 0 ? 0 : randomness() % limit;
 }
 
+std::string current;
+
+// The input that a target could not take, so that it can be tried again and kept in the corpus.
+void tellInput(int) {
+    for (const char character : current)
+        std::fprintf(stderr,
+                     character == '\n'                                         ? "%c"
+                     : character < ' ' || character > '~' || character == '\\' ? "\\x%02x"
+                                                                               : "%c",
+                     static_cast<unsigned char>(character));
+    std::fputc('\n', stderr);
+}
+
 void run(const std::string &input) {
+    current = input;
     LLVMFuzzerTestOneInput(reinterpret_cast<const uint8_t *>(input.data()), input.size());
 }
 
@@ -99,6 +115,7 @@ void mutate(const Corpus &corpus, std::string &input) {
 
 int main(int argc, char *argv[]) {
     if (argc != 2) return 2;
+    std::signal(SIGABRT, tellInput);
     const Corpus corpus(argv[1]);
     if (corpus.inputs.empty()) return 2;
     for (const std::string &input : corpus.inputs)

@@ -25,7 +25,7 @@ HXOptionScan HXLinuxServices::getopt_long(int argc, char *const argv[], const ch
     table.reserve(options.size() + 1);
     for (const HXLongOption &entry : options)
         table.push_back(
-            {entry.name, entry.hasArgument ? required_argument : no_argument, entry.flag, entry.value});
+            {entry.name, entry.hasArgument ? required_argument : no_argument, nullptr, entry.value});
     table.push_back({});
     if (restart) optind = 0; // the C library then begins anew, whatever its last scan left behind
     optarg = nullptr;

@@ -229,6 +229,12 @@ int32_t HXLinuxProcesses::proc_pidinfo(int32_t pid, int32_t flavor, void *buffer
     return answer(shortInfo(*stat, flags), buffer, bufferBytes);
 }
 
+bool HXLinuxProcesses::mayBeNamed(const proc_bsdinfo &info, std::string_view name) {
+    constexpr size_t surelyWhole = kCommLength - 3; // behind them the cut may have split a character
+    const std::string_view recorded(info.pbi_comm, ::strnlen(info.pbi_comm, surelyWhole));
+    return recorded.empty() || name.starts_with(recorded);
+}
+
 std::optional<HXStatRecord> HXLinuxProcesses::statForName(int32_t pid) {
     {
         const std::lock_guard lock(_mutex);

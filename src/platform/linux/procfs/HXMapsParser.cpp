@@ -47,6 +47,15 @@ uint16_t accessOf(std::string_view permissions) {
     return flags;
 }
 
+// Whether a line behind the first may begin a mapping.
+bool holdsHeader(std::string_view text) {
+    unsigned found =
+        isHexDigit(text.front()); // without a branch, so that it is done for many characters at once
+    for (size_t i = 1; i < text.size(); i++)
+        found |= static_cast<unsigned>(text[i - 1] == '\n') & static_cast<unsigned>(isHexDigit(text[i]));
+    return found != 0;
+}
+
 // "START-END PERM OFFSET MAJOR:MINOR INODE   PATH"
 bool parseHeader(std::string_view text, HXMapsEntry *entry) {
     constexpr int hexadecimal = 16;
@@ -134,6 +143,7 @@ bool HXMapsParser::parseColumns(std::string_view *text, HXMapping *mapping) cons
     const std::span columns(_columns, _columnCount);
     for (const Column &column : columns)
         if (!text->substr(column.position).starts_with(kFields[column.field].label)) return false;
+    if (holdsHeader(text->substr(0, _flagsPosition))) return false;
     for (const Column &column : columns) {
         HXTextCursor number{text->substr(column.position + kLabelWidth)};
         uint64_t kilobytes = 0;
