@@ -216,6 +216,18 @@ struct owned_vmobject {
 };
 static_assert(sizeof(owned_vmobject) == 56);
 
+// Pages of a private mapping that other tasks hold, too (`mach_vm_region_shares`).
+struct vm_region_share {
+    // Of the pages that one set of tasks shares: the same for all of them, and below 2^53.
+    uint64_t object_id;
+    uint64_t pages_resident; // of the mapping's, in pages of the task's size
+    uint64_t pages_swapped_out;
+    // Where tasks share an object each in its own part: the pages of this mapping that count for all of them,
+    // so that each page of the object counts once. 0 where all hold the same pages.
+    uint64_t pages_resident_counted;
+    uint64_t pages_swapped_out_counted;
+};
+
 // `mach_memory_info`.
 struct mach_zone_name {
     char mzn_name[80]; // need not end in a zero

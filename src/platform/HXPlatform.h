@@ -98,6 +98,15 @@ class HXPlatform {
     // agree, and on hosts whose memory stands still.
     virtual std::optional<HXWalkShortfall> walkShortfall(mach_port_t) { return std::nullopt; }
 
+    // Tells the host that the tasks open now are examined together: it finds out what they share, which is
+    // told among them. For a task that is opened later, or whose memory was read before, every page is its
+    // own. Takes as long as reading them; ends early once `isCancelled` answers true. Main thread only.
+    virtual void examineTogether(const std::function<bool()> &) {}
+
+    // What of the private memory of the mapping that begins at `address` other tasks share. A page that
+    // several mappings of a task show is told once.
+    virtual std::vector<vm_region_share> mach_vm_region_shares(mach_port_t, uint64_t) { return {}; }
+
     // Bytes in a page of the machine, a power of two.
     virtual uint32_t vm_kernel_page_size() = 0;
 
