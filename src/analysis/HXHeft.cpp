@@ -29,6 +29,10 @@ std::unique_ptr<HXDispatchSource> HXHeft::installCancelHandler(std::function<voi
 
 void HXHeft::gatherProcesses() {
     HXServices &services = HXPlatform::current().services();
+    for (const int32_t pid : HXPlatform::current().examineTogether(
+             [this] { return _isCancelled->load(std::memory_order_relaxed); }))
+        for (const auto &process : _processes)
+            if (process->pid() == pid && process->_isAlive()) setAside(*process);
     const HXDispatchQueue queue = services.dispatch_queue_create(kQueueLabel, QOS_CLASS_UTILITY);
     const std::vector<HXProcess *> ordered = _processesBySortingPidDesc(_processes);
     const auto givenUp =

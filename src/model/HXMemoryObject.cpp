@@ -24,6 +24,7 @@ HXSizes sumOfRegions(std::span<const ProcessRegion> regions) {
 // Each region enters as one whole run: the page runs are gone by now.
 HXSizes sizesOfView(std::span<const ProcessRegion> regions, const HXRegionOwner &process) {
     if (regions.size() == 1) return regions.front().region->sizes();
+    if (regions.front().region->isPart()) return sumOfRegions(regions);
     HXRangeList runs;
     for (const auto &[pid, region] : regions)
         runs.addRegion(*region, process.pageSize());
@@ -77,6 +78,10 @@ void HXMemoryObject::_addRegion(HXMemoryRegion &region, uint32_t pageSize, const
 }
 
 void HXMemoryObject::addRuns(HXMemoryRegion &region, uint32_t pageSize) {
+    if (region.isPart()) {
+        _sizes += region.countedSizes();
+        return;
+    }
     if (!_rangeList && !_onlyRun) {
         _rangeList = region.takeSubrangeList();
         if (_rangeList) return;
@@ -108,7 +113,13 @@ void HXMemoryObject::forEachProcess(Each each) const {
     }
 }
 
+// An object of parts has no other regions.
+bool HXMemoryObject::isMadeOfParts() const {
+    return !memoryRegions().empty() && memoryRegions().front()->isPart();
+}
+
 // With the kernel's charge for each region, an object holds at least what any one process is charged for it.
+// So does one of pages that all its processes share.
 void HXMemoryObject::raiseToLargestProcess() {
     forEachProcess([this](std::span<const ProcessRegion> regions) {
         const HXSizes charged = sumOfRegions(regions);
@@ -129,10 +140,10 @@ bool HXMemoryObject::processRegionsTellMore() const {
 
 void HXMemoryObject::finalize() {
     HXRequire(!_accurateSizes, "HXMemoryObject finalize", "!_accurateSizes");
-    _sizes = sumOfRuns();
+    _sizes += sumOfRuns();
     if (_processMemoryRegions) {
         std::stable_sort(_processMemoryRegions->begin(), _processMemoryRegions->end(), byPid);
-        if (HXHeftSwitches::breakDownPhysHeft()) raiseToLargestProcess();
+        if (isMadeOfParts() || HXHeftSwitches::breakDownPhysHeft()) raiseToLargestProcess();
         if (!processRegionsTellMore()) _processMemoryRegions.reset();
     }
     _rangeList.reset();

@@ -78,6 +78,7 @@ class HXMemoryObject {
     void _addRegion(HXMemoryRegion &region, uint32_t pageSize, const HXRegionOwner *process);
     void addRuns(HXMemoryRegion &region, uint32_t pageSize);
     HXSizes sumOfRuns() const;
+    bool isMadeOfParts() const;
     void raiseToLargestProcess();
     bool processRegionsTellMore() const;
     void nameFakeRegions();

@@ -2,6 +2,7 @@
 
 #include "platform/HXPlatform.h"
 
+#include <algorithm>
 #include <array>
 
 namespace {
@@ -73,6 +74,37 @@ void HXMemoryRegion::addSubrange(HXRange range, const HXSizes &sizes, uint32_t p
     _subrangeList->addRange(range, pageSize, sizes);
 }
 
+HXMemoryRegion HXMemoryRegion::takePart(uint64_t id, const HXSizes &part, const HXSizes &counted) {
+    const auto take = [](uint64_t *own, uint64_t *shared, uint64_t wanted) {
+        const uint64_t taken = std::min(*own, wanted);
+        *own -= taken;
+        *shared += taken;
+        return taken;
+    };
+    HXMemoryRegion taken;
+    taken._isPart = true;
+    taken._segment = HXSegmentNoImage;
+    taken._share_mode = SM_SHARED;
+    taken._user_tag = _user_tag;
+    taken._name = _name;
+    taken._detailedName = _detailedName;
+    taken._start = _start;
+    taken._object_id = id;
+    taken._dirtySize = take(&_dirtySize, &_sharedDirtySize, part.dirty);
+    taken._swappedSize = take(&_swappedSize, &_sharedSwappedSize, part.swapped);
+    taken._size = taken.sizes().heft();
+    taken._sharedDirtySize = std::min(counted.dirty, taken._dirtySize);
+    taken._sharedSwappedSize = std::min(counted.swapped, taken._swappedSize);
+    return taken;
+}
+
+HXSizes HXMemoryRegion::listedSizes() const {
+    HXSizes listed = sizes();
+    listed.dirty += _sharedDirtySize;
+    listed.swapped += _sharedSwappedSize;
+    return listed;
+}
+
 bool HXMemoryRegion::eligibleForProcessView() const {
     if (isFake() || _inSharedCache) return false;
     if (_share_mode == SM_PRIVATE || _share_mode == SM_EMPTY || _share_mode == SM_PRIVATE_ALIASED)
@@ -82,6 +114,7 @@ bool HXMemoryRegion::eligibleForProcessView() const {
 
 bool HXMemoryRegion::eligibleForSubrangesUsingPageSize(uint32_t pageSize) const {
     if (!eligibleForProcessView() || _size <= pageSize || _ownedExclusivelyByParentProcess) return false;
+    if ((_sharedDirtySize | _sharedSwappedSize) != 0) return false; // the runs have what is in parts, too
     bool anyNonZero = false;
     for (const uint64_t part : {_dirtySize, _swappedSize, _cleanNonSpecSize, _reclaimableSize}) {
         if (part == _size) return false; // wholly in one state: nothing to split

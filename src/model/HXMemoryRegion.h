@@ -100,6 +100,17 @@ class HXMemoryRegion {
         return {_dirtySize, _swappedSize, _cleanNonSpecSize, _reclaimableSize, wiredSize()};
     }
 
+    // The region stands for pages of a mapping that one set of processes shares (`takePart`): an entry of
+    // their object, not of the listing, where they stay with the mapping.
+    bool isPart() const { return _isPart; }
+    // Takes dirty and swapped bytes out of what `sizes` tells, at most as much as there is, and makes a part
+    // of them in the object `id`. Of the part `counted` bytes count for all who share the object.
+    HXMemoryRegion takePart(uint64_t id, const HXSizes &part, const HXSizes &counted);
+    // All of a mapping's bytes, its parts included.
+    HXSizes listedSizes() const;
+    // Of a part: see `takePart`.
+    HXSizes countedSizes() const { return {_sharedDirtySize, _sharedSwappedSize}; }
+
     // Identifier of the VM object; 0 when there is none.
     uint64_t object_id() const { return _object_id; }
     void setObject_id(uint64_t id) { _object_id = id; }
@@ -127,6 +138,7 @@ class HXMemoryRegion {
     bool _inSharedCache : 1 = false;
     bool _unusedSharedCacheRegion : 1 = false;
     bool _ownedExclusivelyByParentProcess : 1 = false;
+    bool _isPart : 1 = false;
     HXSegment _segment = HXSegmentUnset;
     uint8_t _share_mode = 0;
     uint32_t _user_tag = 0;
@@ -142,6 +154,9 @@ class HXMemoryRegion {
     uint64_t _swappedSize = 0;
     uint64_t _cleanNonSpecSize = 0;
     uint64_t _object_id = 0;
+    // In parts; of a part, the bytes that count.
+    uint64_t _sharedDirtySize = 0;
+    uint64_t _sharedSwappedSize = 0;
 };
 
 // A process's regions: their addresses stay as the list grows at its end.

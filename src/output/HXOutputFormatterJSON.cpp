@@ -115,8 +115,8 @@ void HXOutputFormatterJSON::region(const HXMemoryRegion &region) {
     if (region.start() != kNoAddress) member("addr", region.start());
     member("vsize", region.size());
     unlessZero("offset", region.offset());
-    unlessZero("dirty", region.dirtySize());
-    unlessZero("swapped", region.swappedSize());
+    unlessZero("dirty", region.listedSizes().dirty);
+    unlessZero("swapped", region.listedSizes().swapped);
     unlessZero("clean", region.cleanNonSpecSize());
     unlessZero("reclaimable", region.reclaimableSize());
     unlessZero("wired", region.wiredSize());
@@ -135,7 +135,7 @@ void HXOutputFormatterJSON::printProcessHeader(const HXProcess &process) {
         key("regions");
         open('[');
         for (const HXMemoryRegion &each : process.memoryRegions())
-            region(each);
+            if (!each.isPart()) region(each);
         close(']');
     }
     if (_pageSize == 0) _pageSize = process.pageSize();

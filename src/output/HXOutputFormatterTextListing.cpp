@@ -16,7 +16,7 @@ void HXOutputFormatterText::printAtlasLikeOutputForProcess(const HXProcess &proc
             "------------\n",
             optional(HXTextSwapped, "   -----"), optional(HXTextWired, "   -----"));
     for (const HXMemoryRegion &region : regions)
-        printRegion(region, process.pageSize());
+        if (!region.isPart()) printRegion(region, process.pageSize());
     fputc('\n', _output);
 }
 
@@ -29,8 +29,8 @@ void HXOutputFormatterText::printRegion(const HXMemoryRegion &region, uint64_t p
     else
         fprintf(_output, "%16" PRIx64 " - %16" PRIx64 " [%10" PRIx64 "]", region.start(),
                 region.start() + region.size(), id);
-    fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.size()), pages(region.sizes().heft()));
-    if (shows(HXTextSwapped)) fprintf(_output, " %7" PRIu64, pages(region.swappedSize()));
+    fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.size()), pages(region.listedSizes().heft()));
+    if (shows(HXTextSwapped)) fprintf(_output, " %7" PRIu64, pages(region.listedSizes().swapped));
     fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.cleanNonSpecSize()),
             pages(region.reclaimableSize()));
     if (shows(HXTextWired)) fprintf(_output, " %7" PRIu64, pages(region.wiredSize()));

@@ -100,8 +100,9 @@ class HXPlatform {
 
     // Tells the host that the tasks open now are examined together: it finds out what they share, which is
     // told among them. For a task that is opened later, or whose memory was read before, every page is its
-    // own. Takes as long as reading them; ends early once `isCancelled` answers true. Main thread only.
-    virtual void examineTogether(const std::function<bool()> &) {}
+    // own. Takes as long as reading them; ends early once `isCancelled` answers true. The pids of tasks that
+    // do not answer: they must not be asked again. Main thread only.
+    virtual std::vector<int32_t> examineTogether(const std::function<bool()> &) { return {}; }
 
     // What of the private memory of the mapping that begins at `address` other tasks share. A page that
     // several mappings of a task show is told once.

@@ -44,6 +44,9 @@ class HXProcess : public HXRegionOwner {
     // the name is the one in the record. False when the record cannot be; it must then be dropped.
     virtual bool initWithBsdInfo(const proc_bsdinfo &info, HXProcessSnapshot *snapshot);
 
+    // Whether this is a process of the host, whose task is asked.
+    virtual bool _isAlive() const { return false; }
+
     // Fills `memoryRegions`, the figures, errors and warnings. Never fails otherwise.
     virtual void gatherData() {}
 
@@ -89,7 +92,6 @@ class HXProcess : public HXRegionOwner {
     // Hooks of construction and gathering.
     virtual uint32_t _gatherPageSize();
     virtual bool _populateTask(HXProcessSnapshot *) { return false; }
-    virtual bool _isAlive() const { return false; }
 
     HXMemoryRegionList _memoryRegions;
     std::string _name;

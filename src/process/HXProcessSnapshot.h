@@ -39,7 +39,7 @@ class HXPidDescriptions {
 // only.
 class HXProcessSnapshot {
   public:
-    HXProcessSnapshot() : _host(HXPlatform::current()) {}
+    explicit HXProcessSnapshot(HXPlatform &host = HXPlatform::current()) : _host(host) {}
 
     // The records of all processes that could be read, in list order; null when there are none.
     const std::vector<proc_bsdinfo> *listAllBsdInfo();

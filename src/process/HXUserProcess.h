@@ -23,6 +23,7 @@ class HXUserProcess : public HXProcess {
   public:
     bool initWithBsdInfo(const proc_bsdinfo &info, HXProcessSnapshot *snapshot) override;
     void gatherData() override;
+    bool _isAlive() const override { return true; }
     // The current and the peak heft, neither aggregating; null when the heft is 0.
     HXAuxTree auxData() const override;
 
@@ -47,7 +48,6 @@ class HXUserProcess : public HXProcess {
 
   protected:
     bool _populateTask(HXProcessSnapshot *snapshot) override;
-    bool _isAlive() const override { return true; }
     // Whether the process's host has a shared region at all.
     virtual bool _hostHasSharedRegion() const;
 
@@ -86,6 +86,7 @@ class HXUserProcess : public HXProcess {
                   const vm_region_submap_info_64 &info) const;
     void nameRegion(HXMemoryRegion &region, Gathering &gathering, const vm_region_submap_info_64 &info,
                     int32_t purgeState, std::optional<std::string_view> path);
+    void takeParts(HXMemoryRegion &region, Gathering &gathering) const;
     void chargeOwnedObject(HXMemoryRegion &region, Gathering &gathering, const vm_region_submap_info_64 &info,
                            int32_t purgeState);
     void warnOfMovedMemory();

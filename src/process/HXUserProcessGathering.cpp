@@ -40,14 +40,17 @@ struct HXUserProcess::Gathering {
         : enumerator(process._images), cutter(process.pageSize(), enumerator, regions, process.pageQuery()),
           hidden(process.hiddenFromDisplay()), breakDown(process.breakDownPhysHeft()),
           cutsRuns(breakDown && !hidden && process._isAlive() &&
-                   !HXHeftSwitches::isSharingAnalysisDisabled()) {}
+                   !HXHeftSwitches::isSharingAnalysisDisabled()),
+          takesParts(process._isAlive() && !HXHeftSwitches::isSharingAnalysisDisabled()) {}
 
     HXMemoryRegionList regions;
+    HXMemoryRegionList parts; // of these
     HXImageEnumerator enumerator;
     HXSharedRegionCutter cutter;
     const bool hidden;
     const bool breakDown;
     const bool cutsRuns;
+    const bool takesParts;
     std::optional<HXMemoryRegion> unmappedRegion; // built from the kernel's fake region
     // Dirty and swapped bytes charged to mapped regions from owned objects: the kernel's fake region counts
     // them, too.
@@ -114,6 +117,7 @@ void HXUserProcess::_gatherMemoryData() {
     addUnmappedOwnedObjects(gathering);
     addUnmappedHeft(gathering);
     addPageTables(gathering);
+    std::move(gathering.parts.begin(), gathering.parts.end(), std::back_inserter(gathering.regions));
     _memoryRegions = std::move(gathering.regions);
 }
 
@@ -158,6 +162,8 @@ bool HXUserProcess::addRegion(Gathering &gathering, uint64_t start, uint64_t siz
         }
     }
     nameRegion(region, gathering, info, purgeState, path);
+    if (gathering.takesParts && (region.share_mode() == SM_PRIVATE || region.share_mode() == SM_COW))
+        takeParts(region, gathering);
     if (gathering.cutsRuns && region.eligibleForSubrangesUsingPageSize(pageSize()))
         _addSubrangesForRegion(region, purgeState);
 
@@ -177,6 +183,16 @@ void HXUserProcess::setSizes(HXMemoryRegion &region, const Gathering &gathering,
     region.setReclaimableSize(uint64_t{info.pages_reusable} * pageSize());
     region.setSwappedSize(uint64_t{info.pages_swapped_out} * pageSize());
     region.setCleanNonSpecSize(left(info.pages_resident, dirtyPages + info.pages_reusable) * pageSize());
+}
+
+// What other processes share becomes parts of the region, each in the object that all of them share.
+void HXUserProcess::takeParts(HXMemoryRegion &region, Gathering &gathering) const {
+    if (region.sizes().heft() == 0) return;
+    for (const vm_region_share &share :
+         HXPlatform::current().mach_vm_region_shares(_task.get(), region.start()))
+        gathering.parts.push_back(region.takePart(
+            share.object_id, {share.pages_resident * pageSize(), share.pages_swapped_out * pageSize()},
+            {share.pages_resident_counted * pageSize(), share.pages_swapped_out_counted * pageSize()}));
 }
 
 void HXUserProcess::nameRegion(HXMemoryRegion &region, Gathering &gathering,

@@ -6,7 +6,6 @@
 #include "record/HXAnswer.h"
 #include "record/HXLedger.h"
 #include "record/HXProcessRecorder.h"
-#include "record/HXRegionHeftSetting.h"
 
 #include <algorithm>
 
@@ -14,6 +13,7 @@ using namespace HXMachineFormat;
 
 namespace {
 
+constexpr int32_t kKernelPid = 0;
 constexpr uint32_t kLastDescribedTag = 239; // from 240 on tags are the program's own
 
 } // namespace
@@ -44,13 +44,25 @@ bool HXMachineRecorder::record(const std::vector<int32_t> &pids) {
     };
     auto process = newRecorder();
     std::set<uint32_t> tags;
-    const int32_t self = _host.getpid();
-    for (const int32_t pid : pids.empty() ? _listed.value_or(std::vector<int32_t>()) : pids) {
-        if (pid == self) continue;
+    std::vector<int32_t> chosen = pids.empty() ? _listed.value_or(std::vector<int32_t>()) : pids;
+    std::erase(chosen, _host.getpid());
+    HXProcessSnapshot tasks(_host);
+    const std::set<int32_t> unanswering = examineTogether(chosen, setting, tasks);
+    for (const int32_t pid : chosen) {
         const bool listed = !_listed || std::binary_search(_sorted.begin(), _sorted.end(), pid);
         const auto isWhole = std::make_shared<bool>(false);
-        const bool isAnswered = HXIsAnswered(
-            _host.services(), [process, isWhole, pid, listed] { *isWhole = process->record(pid, listed); });
+        const auto task = std::make_shared<HXTaskPort>(_host);
+        const kern_return_t error =
+            pid == kKernelPid ? kern_return_t{KERN_FAILURE} : tasks.takeTask(pid, task.get());
+        if (error == KERN_OPERATION_TIMED_OUT || unanswering.contains(pid)) {
+            std::fprintf(stderr, "heft-record: %d is left out: %s\n", pid, kNotAnswering);
+            static std::vector<HXTaskPort> kept; // what somebody may still be using
+            kept.push_back(std::move(*task));
+            continue;
+        }
+        const bool isAnswered = HXIsAnswered(_host.services(), [process, isWhole, pid, listed, task, error] {
+            *isWhole = process->record(pid, listed, std::move(*task), error);
+        });
         if (!isAnswered || !*isWhole) {
             const char *problem = isAnswered ? process->problem().c_str() : kNotAnswering;
             std::fprintf(stderr, "heft-record: %d is left out: %s\n", pid, problem);
@@ -66,6 +78,17 @@ bool HXMachineRecorder::record(const std::vector<int32_t> &pids) {
     _writer.clear();
     recordTags(tags);
     return write(_writer.written()) && std::fflush(_out) == 0;
+}
+
+// Opens the tasks and lets the host find out what they share; the pids of those that do not answer. With
+// what the memory objects see, which a host may have to read in another way.
+std::set<int32_t> HXMachineRecorder::examineTogether(std::vector<int32_t> pids, HXRegionHeftSetting &setting,
+                                                     HXProcessSnapshot &tasks) {
+    std::erase(pids, kKernelPid);
+    tasks.openTasks(pids);
+    if (setting.found()) setting.set(0);
+    const std::vector<int32_t> unanswering = _host.examineTogether([] { return false; });
+    return {unanswering.begin(), unanswering.end()};
 }
 
 // The pids in the host's order; also sorted, in _sorted.

@@ -4,7 +4,9 @@
 #include "platform/HXPlatform.h"
 #include "platform/capture/HXCaptureWriter.h"
 #include "platform/capture/HXMachine.h"
+#include "process/HXProcessSnapshot.h"
 #include "record/HXAnonymizer.h"
+#include "record/HXRegionHeftSetting.h"
 
 #include <cstdio>
 #include <optional>
@@ -32,6 +34,8 @@ class HXMachineRecorder {
     void recordSymbols(const std::set<uint64_t> &addresses);
     void recordTags(const std::set<uint32_t> &tags);
     std::optional<std::vector<int32_t>> listedPids();
+    std::set<int32_t> examineTogether(std::vector<int32_t> pids, HXRegionHeftSetting &setting,
+                                      HXProcessSnapshot &tasks);
     bool write(const std::string &text);
 
     HXPlatform &_host;

@@ -71,9 +71,11 @@ void HXProcessRecorder::setSetting(int32_t value) {
     if (!_isAbandoned) _setting.set(value);
 }
 
-bool HXProcessRecorder::record(int32_t pid, bool listed) {
+bool HXProcessRecorder::record(int32_t pid, bool listed, HXTaskPort task, kern_return_t taskError) {
     _head.clear();
     _body.clear();
+    _task = std::move(task);
+    _taskError = taskError;
     const bool whole = recordProcess(pid, listed);
     _task.close();
     return whole;
@@ -100,16 +102,15 @@ bool HXProcessRecorder::recordProcess(int32_t pid, bool listed) {
     _head.text(Process::name, name(HXTextOfField(info.pbi_name)));
     recordArguments(pid);
     recordFigures(pid);
-    if (!isKernel && !openTask(pid)) return false;
+    if (isKernel)
+        _task.close();
+    else
+        _process.taskError = _taskError;
+    if (_process.taskError != KERN_SUCCESS && !this->exists(pid)) return fail("it exited meanwhile");
     if (_task.get() != 0 && !recordMemory(pid)) return false;
     _head.numbers(&_process);
     _head.end();
     return true;
-}
-
-bool HXProcessRecorder::openTask(int32_t pid) {
-    _process.taskError = _task.open(pid);
-    return _process.taskError == KERN_SUCCESS || exists(pid) || fail("it exited meanwhile");
 }
 
 bool HXProcessRecorder::exists(int32_t pid) {
@@ -201,6 +202,15 @@ void HXProcessRecorder::recordRegion(int32_t pid, uint64_t address, uint64_t siz
         _body.text(Region::path, pathName(std::string_view(path, static_cast<size_t>(pathBytes))));
     if (isPageQueried(size, info)) recordPages(pid, address, size);
     _body.end();
+    recordShares(pid, address);
+}
+
+void HXProcessRecorder::recordShares(int32_t pid, uint64_t address) {
+    for (const vm_region_share &share : _host.mach_vm_region_shares(_task.get(), address)) {
+        _body.begin(shareRecord, pid);
+        _body.numbers(&share);
+        _body.end();
+    }
 }
 
 // Ends the region's record with the dispositions of its pages; records that go on with them come after it.

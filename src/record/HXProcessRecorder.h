@@ -21,9 +21,10 @@ class HXProcessRecorder {
                       HXAnonymizer *anonymizer);
 
     // Asks for all that an analysis of the process would, in both analysis modes. Its records are then in
+    // `task`: the process's, or none with the error of opening it. Its records are then in
     // `head` (the process) and `body` (its memory), to be written in that order. False, with why in
     // `problem`, when the process vanished meanwhile or its memory could not be walked to the end.
-    bool record(int32_t pid, bool listed);
+    bool record(int32_t pid, bool listed, HXTaskPort task, kern_return_t taskError);
 
     // For a `record` that does not return: when it goes on after all, on its thread, it leaves alone what
     // others use. Its answers mean nothing then.
@@ -38,7 +39,6 @@ class HXProcessRecorder {
   private:
     bool fail(const std::string &problem);
     bool recordProcess(int32_t pid, bool listed);
-    bool openTask(int32_t pid);
     bool exists(int32_t pid);
     void recordFigures(int32_t pid);
     void recordArguments(int32_t pid);
@@ -48,6 +48,7 @@ class HXProcessRecorder {
     void recordRegion(int32_t pid, uint64_t address, uint64_t size, const vm_region_submap_info_64 &info,
                       uint32_t words);
     void recordPages(int32_t pid, uint64_t address, uint64_t size);
+    void recordShares(int32_t pid, uint64_t address);
     std::optional<uint32_t> pagesDirtiedOfObject(uint64_t address, uint64_t size,
                                                  HXMachineRegionTraits *traits);
     bool nextTop(uint64_t *address, uint64_t *size, vm_region_basic_info_64 *top);
@@ -65,6 +66,7 @@ class HXProcessRecorder {
     HXPlatform &_host;
     const HXMachineHost _facts;
     HXTaskPort _task; // of the process being recorded
+    kern_return_t _taskError = KERN_SUCCESS;
     HXRegionHeftSetting &_setting;
     const bool _hasSetting;
     HXAnonymizer *const _anonymizer;

@@ -60,7 +60,7 @@ TEST(HXMachineRecorder, MakesUpNamesButKeepsTheStructure) {
     EXPECT_EQ(recorded(host, true), contentOf(kCases + "whole.anonymized"));
 }
 
-// Process 5 exits before its task is opened.
+// Process 5, whose task could not be opened, exits when its arguments are read.
 class Exiting : public HXMadeUpMachine {
   public:
     Exiting() : HXMadeUpMachine("process  pid=5  task_error=5\n") {}
@@ -69,9 +69,9 @@ class Exiting : public HXMadeUpMachine {
         errno = ESRCH;
         return _isGone ? 0 : HXMadeUpMachine::proc_pidinfo(pid, flavor, argument, buffer, bytes);
     }
-    kern_return_t task_for_pid(mach_port_t self, int32_t pid, mach_port_t *task) override {
-        _isGone = true;
-        return HXMadeUpMachine::task_for_pid(self, pid, task);
+    int32_t sysctl(const int32_t *name, uint32_t length, void *old, size_t *oldBytes) override {
+        _isGone = _isGone || length == 3;
+        return HXMadeUpMachine::sysctl(name, length, old, oldBytes);
     }
 
   private:

@@ -39,6 +39,8 @@ struct HXMachineRegionExtra {
     bool hasPageRuns = false;
     uint32_t pageRunCount = 0;
     size_t firstPageRun = 0; // in the machine's page runs
+    size_t firstShare = 0;   // in the machine's shares
+    uint32_t shareCount = 0;
 };
 
 struct HXMachineRegion {
@@ -168,6 +170,7 @@ class HXMachine {
     std::vector<HXMachineRegionTraits> regionTraits;
     std::deque<HXMachineRegionExtra> regionExtras; // the first stands for regions without one
     std::deque<HXMachinePageRun> pageRuns;
+    std::deque<vm_region_share> shares;
     HXStringTable strings;
 
     std::vector<mach_zone_name> zoneNames;

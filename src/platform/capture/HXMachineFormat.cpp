@@ -23,6 +23,15 @@ constexpr auto topFields = HXWithRegionFields<&HXRegionField::topForm>(
     std::array{F::required("pid", K::signed32), F::required("address", K::unsigned64).inHexadecimal(),
                F::required("size", K::unsigned64).inHexadecimal()});
 constexpr F pagesFields[] = {F::required("pid", K::signed32), F::required("pages", K::text)};
+#define SHARE(member) HX_MEMBER(vm_region_share, member)
+constexpr F shareFields[] = {
+    F::required("pid", K::signed32),
+    F::required("object_id", SHARE(object_id)).inHexadecimal(),
+    F::defaulted("resident", SHARE(pages_resident)),
+    F::defaulted("swapped", SHARE(pages_swapped_out)),
+    F::defaulted("resident_counted", SHARE(pages_resident_counted)),
+    F::defaulted("swapped_counted", SHARE(pages_swapped_out_counted)),
+};
 #define PROCESS(member) HX_MEMBER(HXMachineProcess, member)
 constexpr F processFields[] = {
     F::required("pid", K::signed32),
@@ -111,10 +120,10 @@ constexpr F hostFields[] = {
 };
 
 constexpr HXRecordForm records[] = {
-    {"region", regionFields},   {"top", topFields},     {"pages", pagesFields}, {"image", imageFields},
-    {"segment", segmentFields}, {"owned", ownedFields}, {"fault", faultFields}, {"process", processFields},
-    {"zone", zoneFields},       {"site", siteFields},   {"kext", kextFields},   {"symbol", symbolFields},
-    {"tag", tagFields},         {"host", hostFields},
+    {"region", regionFields},   {"top", topFields},         {"pages", pagesFields}, {"share", shareFields},
+    {"image", imageFields},     {"segment", segmentFields}, {"owned", ownedFields}, {"fault", faultFields},
+    {"process", processFields}, {"zone", zoneFields},       {"site", siteFields},   {"kext", kextFields},
+    {"symbol", symbolFields},   {"tag", tagFields},         {"host", hostFields},
 };
 
 static_assert(std::size(regionFields) <= kMaxCaptureFields);

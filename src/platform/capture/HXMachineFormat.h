@@ -11,6 +11,7 @@ enum Record : size_t {
     regionRecord,
     topRecord,
     pagesRecord,
+    shareRecord,
     imageRecord,
     segmentRecord,
     ownedRecord,

@@ -18,11 +18,11 @@ constexpr size_t kNameBytes = sizeof proc_bsdinfo::pbi_name;
 } // namespace
 
 const HXMachineReader::Handler HXMachineReader::handlers[] = {
-    &HXMachineReader::readRegion, &HXMachineReader::readTop,     &HXMachineReader::readPages,
-    &HXMachineReader::readImage,  &HXMachineReader::readSegment, &HXMachineReader::readOwned,
-    &HXMachineReader::readFault,  &HXMachineReader::readProcess, &HXMachineReader::readZone,
-    &HXMachineReader::readSite,   &HXMachineReader::readKext,    &HXMachineReader::readSymbol,
-    &HXMachineReader::readTag,    &HXMachineReader::readHost,
+    &HXMachineReader::readRegion, &HXMachineReader::readTop,   &HXMachineReader::readPages,
+    &HXMachineReader::readShare,  &HXMachineReader::readImage, &HXMachineReader::readSegment,
+    &HXMachineReader::readOwned,  &HXMachineReader::readFault, &HXMachineReader::readProcess,
+    &HXMachineReader::readZone,   &HXMachineReader::readSite,  &HXMachineReader::readKext,
+    &HXMachineReader::readSymbol, &HXMachineReader::readTag,   &HXMachineReader::readHost,
 };
 
 static std::unique_ptr<HXMachine> machineOf(HXCaptureReader &&reader, std::string *reason) {
@@ -173,6 +173,28 @@ bool HXMachineReader::readPages() {
     if (!extra.hasPageRuns || !isLast || _machine.pageRuns.empty())
         return _reader.fail("pages that do not continue those of the last region");
     return addPageRuns(region, _reader.text(Pages::pages));
+}
+
+bool HXMachineReader::readShare() {
+    constexpr uint64_t mostPages = uint64_t{1} << 45; // whose bytes fit a record of sizes many times
+    if (!_process->regions) return _reader.fail("a share before a region of the process");
+    vm_region_share share{};
+    _reader.fill(&share);
+    if (share.object_id == 0 || share.object_id == UINT64_MAX) return _reader.fail("a share of no object");
+    for (const uint64_t pages : {share.pages_resident, share.pages_swapped_out})
+        if (pages > mostPages) return _reader.fail("a share of too many pages");
+    HXMachineRegion &region = _process->regions->back();
+    if (region.extra == 0) {
+        region.extra = static_cast<uint32_t>(_machine.regionExtras.size());
+        _machine.regionExtras.emplace_back();
+    }
+    HXMachineRegionExtra &extra = _machine.regionExtras[region.extra];
+    if (extra.shareCount == 0) extra.firstShare = _machine.shares.size();
+    if (extra.firstShare + extra.shareCount != _machine.shares.size())
+        return _reader.fail("a share that does not continue those of the last region");
+    extra.shareCount++;
+    _machine.shares.push_back(share);
+    return true;
 }
 
 bool HXMachineReader::readTop() {

@@ -24,6 +24,7 @@ class HXMachineReader {
     bool readImage();
     bool readSegment();
     bool readOwned();
+    bool readShare();
     bool readFault();
     bool readZone();
     bool readSite();

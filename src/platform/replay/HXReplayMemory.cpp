@@ -221,6 +221,15 @@ void HXReplayPlatform::addRuns(const HXMachineRegion &region, uint64_t index, ui
     }
 }
 
+std::vector<vm_region_share> HXReplayPlatform::mach_vm_region_shares(mach_port_t task, uint64_t address) {
+    const auto [process, state] = taskOf(task);
+    const HXMachineRegion *const region = process ? regionAt(*process, *state, address) : nullptr;
+    if (region == nullptr) return {};
+    const HXMachineRegionExtra &extra = _machine.extra(*region);
+    const auto first = _machine.shares.begin() + static_cast<std::ptrdiff_t>(extra.firstShare);
+    return {first, first + extra.shareCount};
+}
+
 kern_return_t HXReplayPlatform::mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,
                                                          int32_t *purgeState) {
     const auto [process, state] = taskOf(task);

@@ -25,6 +25,7 @@ class HXReplayPlatform : public HXPlatform {
                                          uint32_t *infoCount) override;
     kern_return_t mach_vm_page_range_query(mach_port_t task, uint64_t address, uint64_t size,
                                            std::vector<vm_page_run> *runs, uint64_t *pages) override;
+    std::vector<vm_region_share> mach_vm_region_shares(mach_port_t task, uint64_t address) override;
     kern_return_t mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,
                                            int32_t *state) override;
     uint32_t vm_kernel_page_size() override { return _machine.host.pageSize; }
