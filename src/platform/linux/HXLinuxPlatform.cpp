@@ -54,7 +54,7 @@ const char *programName = "";
 } // namespace
 
 HXLinuxPlatform::HXLinuxPlatform(const Setting &setting)
-    : _pageSize(static_cast<uint32_t>(::sysconf(_SC_PAGESIZE))),
+    : _pageSize(static_cast<uint32_t>(::sysconf(_SC_PAGESIZE))), _sysPath(setting.sysPath),
       _fileSystems(setting.procPath, setting.sharedMemoryDevice),
       _machine(setting.procPath), _readerSetting{&_fileSystems, &_machine, &namedTags(),
                                                  static_cast<uint32_t>(std::countr_zero(_pageSize)),

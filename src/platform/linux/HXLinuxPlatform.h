@@ -49,6 +49,8 @@ class HXLinuxPlatform final : public HXPlatform {
     kern_return_t mach_vm_purgable_control(mach_port_t, uint64_t, int32_t, int32_t *) override {
         return KERN_INVALID_ARGUMENT; // nothing is purgeable here
     }
+    std::vector<int32_t> examineTogether(const std::function<bool()> &isCancelled) override;
+    std::vector<vm_region_share> mach_vm_region_shares(mach_port_t task, uint64_t address) override;
     std::optional<HXWalkShortfall> walkShortfall(mach_port_t task) override;
     uint32_t vm_kernel_page_size() override { return _pageSize; }
     bool hasSharedRegion() override { return false; }
@@ -123,6 +125,7 @@ class HXLinuxPlatform final : public HXPlatform {
     std::optional<HXStatusRecord> statusOf(int32_t pid, HXLinuxTask::StatusUse use);
 
     const uint32_t _pageSize;
+    const std::string _sysPath;
     HXFileSystems _fileSystems;
     HXMachineFacts _machine;
     const HXReaderSetting _readerSetting;

@@ -5,6 +5,7 @@
 #include "platform/linux/images/HXImageLayout.h"
 #include "platform/linux/memory/HXTaskFiles.h"
 #include "platform/linux/procfs/HXProcFile.h"
+#include "platform/linux/sharing/HXSharing.h"
 
 #include <sys/resource.h>
 
@@ -134,6 +135,22 @@ kern_return_t HXLinuxPlatform::mach_vm_page_range_query(mach_port_t port, uint64
         error = task->pages().query(addressSpace, start, runs, pages);
     });
     return error != KERN_SUCCESS && !suffice ? KERN_RESOURCE_SHORTAGE : error;
+}
+
+std::vector<int32_t> HXLinuxPlatform::examineTogether(const std::function<bool()> &isCancelled) {
+    HXSharing sharing({&_services, &_readerSetting, &_identifiers, _sysPath,
+                       _reportsCharge.load(std::memory_order_relaxed) == 0, isCancelled});
+    const std::set<int32_t> unanswering = sharing.examine(_tasks.all());
+    return {unanswering.begin(), unanswering.end()};
+}
+
+std::vector<vm_region_share> HXLinuxPlatform::mach_vm_region_shares(mach_port_t port, uint64_t address) {
+    HXLinuxTask *task = _tasks.find(port);
+    if (task == nullptr) return {};
+    const HXAddressSpace &addressSpace = addressSpaceOf(task);
+    const size_t index = task->find(address);
+    if (index == addressSpace.count() || addressSpace[index].start != address) return {};
+    return task->sharesOf(index);
 }
 
 std::optional<HXWalkShortfall> HXLinuxPlatform::walkShortfall(mach_port_t port) {

@@ -34,6 +34,8 @@ class HXAddressSpace {
     // not: MACH_SEND_INVALID_DEST for a process that died or executed another program meanwhile.
     kern_return_t endError = KERN_INVALID_ADDRESS;
     bool knowsDirtyPages = false;
+    // Figures of mappings that HXMayShareAfterFork are still to come (HXReadRequest::leavesPrivatePages).
+    bool lacksPrivatePages = false;
     uint64_t ipcNamespace = 0; // read when there is System V memory
     // Where mappings show pages of their object that a mapping at a lower address shows, too; ascending.
     std::vector<HXAddressRange> repeated;

@@ -89,8 +89,10 @@ bool Reader::mapsMaySuffice() {
 bool Reader::readMapsAndScan() {
     const HXDescriptor maps = readFile("maps");
     if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return true;
-    if (!mapsSuffice() || !HXScanFigures(_request.process, _setting.pageShift,
-                                         _request.status->swapSize.value_or(0), _addressSpace.get()))
+    if (!mapsSuffice()) return false;
+    _addressSpace->lacksPrivatePages = _request.leavesPrivatePages;
+    if (!HXScanFigures(_request.process, _setting.pageShift, _request.status->swapSize.value_or(0),
+                       _addressSpace.get()))
         return false;
     // If the process executed another program before its page tables were opened, those are not of this.
     if (!isAlive(maps)) _addressSpace->endError = MACH_SEND_INVALID_DEST;

@@ -27,6 +27,8 @@ struct HXReadRequest {
     std::optional<HXStatusRecord> status;           // where it has been read already
     bool needsDirtyPages = true;                    // HXMapping::dirtyPages
     std::chrono::steady_clock::time_point opened{}; // when the process was
+    // Where page tables are counted, those of mappings that HXMayShareAfterFork are left to the caller.
+    bool leavesPrivatePages = false;
 };
 
 // Reads the mappings of a process and classifies them. A process that vanishes leaves what was read until

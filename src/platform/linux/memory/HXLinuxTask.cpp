@@ -3,6 +3,7 @@
 #include "platform/linux/memory/HXRepeatedPages.h"
 #include "platform/linux/memory/HXTaskFiles.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <mutex>
 #include <utility>
@@ -24,7 +25,8 @@ bool HXDescriptorTurns::run(const std::function<void()> &read) {
 
 HXLinuxTask::HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, bool keepsOpen,
                          HXLinuxProcesses &processes, HXDescriptorTurns &turns)
-    : _pid(pid), _number(number), _startTime(process.stat.startTime), _processes(processes), _turns(turns) {
+    : _pid(pid), _number(number), _startTime(process.stat.startTime), _startStack(process.stat.startStack),
+      _processes(processes), _turns(turns) {
     if (keepsOpen) _directory = std::move(process.directory);
 }
 
@@ -44,16 +46,65 @@ bool HXLinuxTask::withDescriptors(const std::function<void()> &read) {
 }
 
 const HXAddressSpace &HXLinuxTask::addressSpace(const HXReaderSetting &setting, bool needsDirtyPages) {
+    if (_awaitsSettling) settle(setting);
     if (!_addressSpace || (needsDirtyPages && !_addressSpace->knowsDirtyPages)) {
+        _shares.clear(); // by their mappings' places among those of an earlier reading
         withDescriptors([&] { read(setting, needsDirtyPages); });
         if (!_addressSpace) { // nobody gave way
             _addressSpace = std::make_unique<HXAddressSpace>();
             _addressSpace->endError = KERN_RESOURCE_SHORTAGE;
         }
-        _pages.emplace(_directory, setting.pageShift);
-        withDescriptors([&] { HXFindRepeatedPages(setting.pageShift, &*_pages, _addressSpace.get()); });
+        finishReading(setting);
     }
     return *_addressSpace;
+}
+
+void HXLinuxTask::finishReading(const HXReaderSetting &setting) {
+    _pages.emplace(_directory, setting.pageShift);
+    withDescriptors([&] { HXFindRepeatedPages(setting.pageShift, &*_pages, _addressSpace.get()); });
+}
+
+void HXLinuxTask::readForSharing(const HXReaderSetting &setting, bool needsDirtyPages) {
+    if (!_directory) _directory = reopen();
+    _addressSpace = HXReadAddressSpace({_directory, _status, needsDirtyPages, _opened, true}, setting);
+}
+
+void HXLinuxTask::takeShared(HXSharedPages shared) {
+    HXAddressSpace &addressSpace = *_addressSpace;
+    for (const HXSharedPages::Figures &figures : shared.figures) {
+        if (!addressSpace.lacksPrivatePages) break;
+        HXMapping &mapping = addressSpace[figures.mapping];
+        mapping.residentPages += figures.resident;
+        mapping.anonymousPages += figures.anonymous;
+        mapping.swappedPages += figures.swapped;
+    }
+    addressSpace.lacksPrivatePages = false;
+    for (const HXSharedPages::Repeated &repeated : shared.repeated) {
+        addressSpace[repeated.mapping].repeatedPages += repeated.resident;
+        addressSpace[repeated.mapping].repeatedSwappedPages += repeated.swapped;
+    }
+    _shares = std::move(shared.shares);
+    _awaitsSettling = true;
+}
+
+// Whether what was found holds is for the thread that then asks for it to see: another process may keep it
+// waiting. Where it does not, the pages are read once more, as the process's own.
+void HXLinuxTask::settle(const HXReaderSetting &setting) {
+    _awaitsSettling = false;
+    compare(setting, true);
+    if (_difference)
+        forget();
+    else
+        finishReading(setting);
+}
+
+std::vector<vm_region_share> HXLinuxTask::sharesOf(size_t index) const {
+    std::vector<vm_region_share> found;
+    auto share = std::partition_point(_shares.begin(), _shares.end(),
+                                      [&](const auto &each) { return each.mapping < index; });
+    for (; share != _shares.end() && share->mapping == index; ++share)
+        found.push_back(share->share);
+    return found;
 }
 
 void HXLinuxTask::read(const HXReaderSetting &setting, bool needsDirtyPages) {
@@ -119,6 +170,16 @@ void HXTaskTable::remove(uint32_t port) {
 size_t HXTaskTable::count() const {
     const std::shared_lock lock(_mutex);
     return _tasks.size();
+}
+
+std::vector<HXLinuxTask *> HXTaskTable::all() const {
+    const std::shared_lock lock(_mutex);
+    std::vector<HXLinuxTask *> all;
+    for (const auto &[pid, port] : _portsByPid)
+        all.push_back(_tasks.at(port).get());
+    std::sort(all.begin(), all.end(),
+              [](const HXLinuxTask *a, const HXLinuxTask *b) { return a->pid() < b->pid(); });
+    return all;
 }
 
 HXLinuxTask *HXTaskTable::find(uint32_t port) const {

@@ -15,6 +15,27 @@
 #include <optional>
 #include <shared_mutex>
 #include <unordered_map>
+#include <vector>
+
+// What was found out of a task's private pages by looking at those of others, too. By the index of the
+// mapping in its address space, in pages.
+struct HXSharedPages {
+    struct Figures {
+        uint32_t mapping;
+        uint32_t resident, anonymous, swapped; // as HXMapping has them
+    };
+    std::vector<Figures> figures; // some mappings several times: to be added up
+    struct Repeated {
+        uint32_t mapping;
+        uint32_t resident, swapped; // of which a lower mapping shows the same pages
+    };
+    std::vector<Repeated> repeated;
+    struct Share {
+        uint32_t mapping;
+        vm_region_share share;
+    };
+    std::vector<Share> shares; // ascending by mapping
+};
 
 // Lets those who read processes take turns when there are few descriptors. Any thread.
 class HXDescriptorTurns {
@@ -40,6 +61,8 @@ class HXLinuxTask {
     HXLinuxTask &operator=(const HXLinuxTask &) = delete;
 
     int32_t pid() const { return _pid; }
+    // Where the stack began when the process was executed: the same after fork(2). 0 where it is not told.
+    uint64_t startStack() const { return _startStack; }
     uint32_t number() const { return _number; }
     const HXDescriptor &directory() const { return _directory; }
 
@@ -51,6 +74,16 @@ class HXLinuxTask {
     // of one that was read without them, and once more when the first reading disagrees with the process's
     // own counters.
     const HXAddressSpace &addressSpace(const HXReaderSetting &setting, bool needsDirtyPages);
+    // Reads the address space for somebody who looks at several tasks together, and may leave the private
+    // pages to him (HXAddressSpace::lacksPrivatePages). Then `takeShared` or `forget`, before anything else
+    // is asked.
+    void readForSharing(const HXReaderSetting &setting, bool needsDirtyPages);
+    const HXAddressSpace *addressSpaceRead() const { return _addressSpace.get(); } // null: not read
+    void takeShared(HXSharedPages shared);
+    void forget() { _addressSpace.reset(); }
+    // HXPlatform::mach_vm_region_shares for a mapping by its index.
+    std::vector<vm_region_share> sharesOf(size_t index) const;
+
     // The index in the address space, once read, of the first mapping that ends above `address`. A walk in
     // ascending order costs no search.
     size_t find(uint64_t address);
@@ -68,11 +101,14 @@ class HXLinuxTask {
     HXDescriptor reopen();
     void read(const HXReaderSetting &setting, bool needsDirtyPages);
     void readOnce(const HXReaderSetting &setting, bool needsDirtyPages);
+    void settle(const HXReaderSetting &setting);
+    void finishReading(const HXReaderSetting &setting);
     void compare(const HXReaderSetting &setting, bool isFirst);
 
     const int32_t _pid;
     const uint32_t _number;
     const uint64_t _startTime; // clock ticks since boot
+    const uint64_t _startStack;
     HXLinuxProcesses &_processes;
     HXDescriptorTurns &_turns;
     HXDescriptor _directory;
@@ -82,6 +118,8 @@ class HXLinuxTask {
     std::optional<HXPageReader> _pages;
     std::optional<HXStatusRecord> _status;
     std::optional<HXWalkDifference> _difference;
+    bool _awaitsSettling = false; // shared pages have been taken
+    std::vector<HXSharedPages::Share> _shares;
     bool _used[2] = {};
 };
 
@@ -94,6 +132,8 @@ class HXTaskTable {
     // Null for a port that is none.
     HXLinuxTask *find(uint32_t port) const;
     size_t count() const;
+    // Of each process the task that was opened last, ascending by pid.
+    std::vector<HXLinuxTask *> all() const;
     // The task of `pid` that was opened last and is open still; null when there is none.
     HXLinuxTask *findByPid(int32_t pid) const;
 

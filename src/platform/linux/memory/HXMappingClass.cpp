@@ -132,6 +132,12 @@ bool HXHoldsOwnPages(const HXMapping &mapping) {
            mapping.hugePages > 0;
 }
 
+bool HXMayShareAfterFork(const HXMapping &mapping) {
+    constexpr uint64_t kernelHalf = uint64_t{1} << 63; // where the gate page is
+    return !mapping.has(HXMappingShared) && mapping.kind != HXPathKind::vdso &&
+           mapping.kind != HXPathKind::special && mapping.start < kernelHalf;
+}
+
 void HXClassifyMapping(HXPathKind kind, HXFileSystemKind fileSystem, uint32_t sharedMemoryDevice,
                        uint8_t namedTag, HXMapping *mapping) {
     const bool huge = mapping->has(HXMappingHugePages);

@@ -25,6 +25,10 @@ bool HXIsPrivateAnonymous(const HXMapping &mapping);
 // Whether a private mapping holds pages of its own.
 bool HXHoldsOwnPages(const HXMapping &mapping);
 
+// Whether its process may share pages of its own in the mapping with processes that it was forked from or has
+// forked.
+bool HXMayShareAfterFork(const HXMapping &mapping);
+
 // The record of a classified mapping. `objectID`: of what it maps (HXObjectIdentifiers.h), below 2^53.
 // `reportsCharge`: "vm.self_region_heft".
 vm_region_submap_info_64 HXRegionInfo(const HXMapping &mapping, uint64_t objectID, bool reportsCharge);

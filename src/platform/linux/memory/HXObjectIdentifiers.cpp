@@ -87,3 +87,7 @@ uint64_t HXObjectIdentifiers::of(const HXMapping &mapping, const HXMappingOwner 
         return interned({Kind::systemV, mapping.device, owner.ipcNamespace, mapping.inode});
     return interned({Kind::file, mapping.device, 0, mapping.inode});
 }
+
+uint64_t HXObjectIdentifiers::ofShared(int32_t pid, uint64_t start, uint64_t set) {
+    return interned({Kind::shared, static_cast<uint32_t>(pid), set, start});
+}

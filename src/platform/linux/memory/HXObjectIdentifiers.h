@@ -54,9 +54,12 @@ class HXObjectIdentifiers {
     // The identifier of what a classified mapping maps. The same in every run for what is the same on the
     // machine, unless something else has taken its number first.
     uint64_t of(const HXMapping &mapping, const HXMappingOwner &owner);
+    // The identifier of pages that several processes share: those that the lowest of them, `pid`, has in its
+    // mapping at `start`. `set` tells the sets of processes apart whose lowest member that is.
+    uint64_t ofShared(int32_t pid, uint64_t start, uint64_t set);
 
   private:
-    enum class Kind : uint32_t { file = 1, mapping, systemV, vdso };
+    enum class Kind : uint32_t { file = 1, mapping, systemV, vdso, shared };
     struct Key {
         Kind kind;
         uint32_t device;

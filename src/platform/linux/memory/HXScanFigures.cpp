@@ -1,5 +1,6 @@
 #include "platform/linux/memory/HXScanFigures.h"
 
+#include "platform/linux/memory/HXMappingClass.h"
 #include "platform/linux/memory/HXPageScan.h"
 #include "platform/linux/procfs/HXProcFile.h"
 
@@ -25,10 +26,15 @@ class Scanner {
     bool scan();
     // A living process has pages; the page tables of one that has gone are empty.
     bool isGood(uint64_t swappedSize) const {
+        if (_addressSpace.lacksPrivatePages) return true;
         return _foundAny && _swappedPages << _pageShift == swappedSize;
     }
 
   private:
+    bool scanStretch(size_t first, size_t end);
+    bool leaves(const HXMapping &mapping) const {
+        return _addressSpace.lacksPrivatePages && HXMayShareAfterFork(mapping);
+    }
     bool walk(size_t first, size_t end, bool tellsFiles);
     void add(const HXPageRun &run);
     void count(uint8_t facts, uint32_t pages, HXMapping &mapping);
@@ -41,30 +47,40 @@ class Scanner {
     bool _foundAny = false;
 };
 
-// Neighbours that need the same go together. So does what does not need its pages looked at, yet lies between
-// others that do and is so small that a request of its own would cost more than looking.
 bool Scanner::scan() {
-    constexpr uint64_t smallSize = 1 << 20; // 256 pages
     if (!_pagemap) return false;
     size_t count = _addressSpace.count();
     while (count > 0 && _addressSpace[count - 1].end >> 63 != 0)
         count--; // the gate page, which no page table of the process shows
-    size_t begin = 0;
+    for (size_t i = 0, first = 0; i < count; first = i) {
+        while (i < count && !leaves(_addressSpace[i]))
+            i++;
+        if (first < i && !scanStretch(first, i)) return false;
+        while (i < count && leaves(_addressSpace[i]))
+            i++;
+    }
+    return true;
+}
+
+// Neighbours that need the same go together. So does what does not need its pages looked at, yet lies between
+// others that do and is so small that a request of its own would cost more than looking.
+bool Scanner::scanStretch(size_t begin, size_t count) {
+    constexpr uint64_t smallSize = 1 << 20; // 256 pages
     bool tellsFiles = true;
-    for (size_t i = 0; i < count;) {
+    for (size_t i = begin; i < count;) {
         const bool needs = needsPages(_addressSpace[i]);
         const size_t first = i;
         uint64_t size = 0;
         for (; i < count && needsPages(_addressSpace[i]) == needs; i++)
             size += _addressSpace[i].end - _addressSpace[i].start;
         const bool tellsNext = needs || size < smallSize;
-        if (first > 0 && tellsNext != tellsFiles) {
+        if (first > begin && tellsNext != tellsFiles) {
             if (!walk(begin, first, tellsFiles)) return false;
             begin = first;
         }
         tellsFiles = tellsNext;
     }
-    return count == 0 || walk(begin, count, tellsFiles);
+    return walk(begin, count, tellsFiles);
 }
 
 // From the mapping `first` to the one before `end`.

@@ -1,0 +1,33 @@
+#include "platform/linux/sharing/HXFamily.h"
+
+void HXFamilyPages::addRest(HXSharerSets::Bits set, std::span<const uint32_t> layout,
+                            const HXPageCount &pages) {
+    const uint32_t lowest = HXSharerSets::first(set);
+    const HXFamilyMapping object = {lowest, layout[lowest]};
+    HXSharerSets::forEachMember(set, [&](uint32_t member) {
+        Rest &entry = rest[{object, {member, layout[member]}}];
+        entry.pages += pages;
+        if (member == lowest) entry.counted += pages;
+    });
+}
+
+void HXFamilyPages::add(const HXFamilyPages &other) {
+    const auto firstLayout = static_cast<uint32_t>(layouts.size() / members);
+    layouts.insert(layouts.end(), other.layouts.begin(), other.layouts.end());
+    for (const Count &count : other.counts) {
+        const HXSharerSets::Bits set = other.sets.bits(count.set);
+        const uint32_t number = sets.number(set);
+        if (number == HXSharerSets::kNone)
+            addRest(set, other.layout(count.layout), count.pages);
+        else
+            counts.push_back({firstLayout + count.layout, number, count.pages});
+    }
+    for (const auto &[key, entry] : other.rest) {
+        rest[key].pages += entry.pages;
+        rest[key].counted += entry.counted;
+    }
+    for (size_t i = 0; i < members; i++)
+        figures[i].insert(figures[i].end(), other.figures[i].begin(), other.figures[i].end());
+    metAgain.insert(metAgain.end(), other.metAgain.begin(), other.metAgain.end());
+    repeated.insert(repeated.end(), other.repeated.begin(), other.repeated.end());
+}

@@ -1,0 +1,366 @@
+#include "platform/linux/sharing/HXFamilyColumns.h"
+
+#include "platform/linux/memory/HXPageScan.h"
+
+#include <algorithm>
+#include <bit>
+#include <optional>
+
+namespace {
+
+constexpr uint64_t kWindowPages = 2048;
+// So much memory is taken for the entries of a window: those of a large family are shorter.
+constexpr uint64_t kWindowEntries = uint64_t{1} << 19;
+constexpr size_t kSetsOfStretch = size_t{1} << 15;
+
+// Groups the members of a column by what they hold. Used again for each column: entries of earlier ones are
+// told by their stamp.
+class Groups {
+  public:
+    explicit Groups(size_t members) : _slots(std::bit_ceil(members * 2)), _wordCount((members + 63) / 64) {}
+
+    struct Group {
+        HXPageKey key;
+        uint32_t count;
+    };
+
+    void begin() {
+        _stamp++;
+        _groups.clear();
+        _bits.clear();
+    }
+    void add(uint32_t member, HXPageKey key) {
+        const size_t group = groupOf(key);
+        _groups[group].count++;
+        _bits[group * _wordCount + member / 64] |= uint64_t{1} << (member % 64);
+    }
+    const std::vector<Group> &groups() const { return _groups; }
+    HXSharerSets::Bits bits(size_t group) const {
+        return HXSharerSets::Bits(_bits).subspan(group * _wordCount, _wordCount);
+    }
+
+  private:
+    struct Slot {
+        uint64_t stamp = 0;
+        uint32_t group = 0;
+    };
+
+    size_t groupOf(HXPageKey key) {
+        size_t slot = (key * 0x9E3779B97F4A7C15 >> 32) & (_slots.size() - 1);
+        for (; _slots[slot].stamp == _stamp; slot = (slot + 1) & (_slots.size() - 1))
+            if (_groups[_slots[slot].group].key == key) return _slots[slot].group;
+        _slots[slot] = {_stamp, static_cast<uint32_t>(_groups.size())};
+        _groups.push_back({key, 0});
+        _bits.resize(_bits.size() + _wordCount);
+        return _groups.size() - 1;
+    }
+
+    std::vector<Slot> _slots;
+    const size_t _wordCount;
+    uint64_t _stamp = 0;
+    std::vector<Group> _groups;
+    std::vector<uint64_t> _bits;
+};
+
+class ColumnReader {
+  public:
+    ColumnReader(const HXColumnRequest &request, std::atomic<uint32_t> *reading);
+
+    std::unique_ptr<HXFamilyPages> read();
+
+  private:
+    // A member in the stretch that is read.
+    struct Row {
+        size_t range = 0;         // the first of its ranges that ends behind the window's start
+        uint64_t nothingUpTo = 0; // before this page there is none, as far as is known
+        bool isInWindow = false;
+        HXFamilyFigures figures = {}; // of its mapping in the current strip
+    };
+
+    void readWindow(uint64_t first, uint64_t end);
+    void readRow(uint32_t member, uint64_t first, uint64_t end);
+    void skipHole(uint32_t member, uint64_t from);
+    uint64_t nextPage(uint64_t from);
+    void countStrip(uint64_t first, uint64_t end);
+    void takeRow(uint32_t member, const HXFamilyRange &range, uint64_t first, uint64_t end);
+    void compareRows(size_t pages);
+    void countColumn(size_t page);
+    void countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t sharers);
+    void endStrip();
+    uint64_t *row(uint32_t member) { return _entries.data() + member * _stride; }
+    const std::vector<HXFamilyRange> &ranges(uint32_t member) const { return _family.members[member].ranges; }
+
+    const HXColumnRequest &_request;
+    const HXFamily &_family;
+    std::atomic<uint32_t> &_reading;
+    const uint32_t _memberCount;
+    const uint64_t _windowPages, _stride;
+    std::vector<uint64_t> _entries; // of the window, then what they tell: keys
+    std::vector<uint64_t> _differs; // by page of the strip: not 0 where the active rows are not equal
+    std::vector<Row> _rows;
+    std::vector<uint32_t> _active;  // members with a mapping in the strip
+    std::vector<uint64_t> _allBits; // of these
+    std::vector<uint32_t> _layout;  // of the strip, then of the last that was counted
+    uint64_t _windowStart = 0;
+    size_t _stripOffset = 0; // of the strip in the window
+    uint32_t _layoutNumber = HXFamilyPages::kNoMapping;
+    std::unordered_map<uint32_t, HXPageCount> _counts; // of the layout, by set
+    uint32_t _lastSet = HXSharerSets::kNone;
+    HXPageCount *_lastCount = nullptr;
+    Groups _groups;
+    HXSeenKeys::Cursor _seen;
+    std::optional<HXSeenKeys::Cursor> _repeated;
+    std::unique_ptr<HXFamilyPages> _pages;
+};
+
+uint64_t windowPagesFor(uint64_t members) {
+    const uint64_t pages = std::bit_floor(std::max<uint64_t>(kWindowEntries / members, 64));
+    return std::min(kWindowPages, pages);
+}
+
+ColumnReader::ColumnReader(const HXColumnRequest &request, std::atomic<uint32_t> *reading)
+    : _request(request), _family(*request.family), _reading(*reading),
+      _memberCount(static_cast<uint32_t>(_family.members.size())), _windowPages(windowPagesFor(_memberCount)),
+      // Rows that lie a power of two apart would fight for the same lines of the processor's cache.
+      _stride(_windowPages + 8), _entries(_stride * _memberCount), _differs(_windowPages),
+      _rows(_memberCount), _allBits((_memberCount + 63) / 64),
+      _layout(_memberCount, HXFamilyPages::kNoMapping), _groups(_memberCount), _seen(*_family.seen),
+      _pages(std::make_unique<HXFamilyPages>(_memberCount, kSetsOfStretch)) {
+    if (request.repeated) _repeated.emplace(*request.repeated);
+}
+
+std::unique_ptr<HXFamilyPages> ColumnReader::read() {
+    const HXPageStretch &stretch = _request.stretch;
+    for (uint32_t member = 0; member < _memberCount; member++) {
+        const auto &all = ranges(member);
+        const auto found = std::partition_point(
+            all.begin(), all.end(), [&](const HXFamilyRange &range) { return range.end <= stretch.first; });
+        _rows[member].range = static_cast<size_t>(found - all.begin());
+    }
+    for (uint64_t at = nextPage(stretch.first); at < stretch.end; at = nextPage(at)) {
+        const uint64_t end = std::min((at / _windowPages + 1) * _windowPages, stretch.end);
+        readWindow(at, end);
+        at = end;
+    }
+    endStrip();
+    return std::move(_pages);
+}
+
+// The first page from `from` on that may be there in some member; none: the end of the stretch.
+uint64_t ColumnReader::nextPage(uint64_t from) {
+    uint64_t next = _request.stretch.end;
+    for (uint32_t member = 0; member < _memberCount && next > from; member++) {
+        Row &row = _rows[member];
+        const uint64_t least = std::max(from, row.nothingUpTo);
+        const auto &all = ranges(member);
+        while (row.range < all.size() && all[row.range].end <= least)
+            row.range++;
+        if (row.range < all.size()) next = std::min(next, std::max(least, all[row.range].first));
+    }
+    return next;
+}
+
+void ColumnReader::readWindow(uint64_t first, uint64_t end) {
+    _windowStart = first;
+    std::vector<uint64_t> borders = {first, end};
+    for (uint32_t member = 0; member < _memberCount; member++) {
+        Row &row = _rows[member];
+        const auto &all = ranges(member);
+        while (row.range < all.size() && all[row.range].end <= first)
+            row.range++;
+        row.isInWindow = row.range < all.size() && all[row.range].first < end && row.nothingUpTo < end;
+        if (!row.isInWindow) continue;
+        for (size_t i = row.range; i < all.size() && all[i].first < end; i++) {
+            borders.push_back(std::max(all[i].first, first));
+            borders.push_back(std::min(all[i].end, end));
+        }
+        readRow(member, first, end);
+    }
+    std::sort(borders.begin(), borders.end());
+    borders.erase(std::unique(borders.begin(), borders.end()), borders.end());
+    for (size_t i = 0; i + 1 < borders.size(); i++)
+        countStrip(borders[i], borders[i + 1]);
+}
+
+// Reads the entries of a member's ranges in the window, and of what lies between them.
+void ColumnReader::readRow(uint32_t member, uint64_t first, uint64_t end) {
+    const auto &all = ranges(member);
+    Row &row = _rows[member];
+    const uint64_t from = std::max(all[row.range].first, first);
+    size_t last = row.range;
+    while (last + 1 < all.size() && all[last + 1].first < end)
+        last++;
+    const uint64_t to = std::min(all[last].end, end);
+    uint64_t *const entries = this->row(member) + (from - first);
+    const size_t bytes = (to - from) * sizeof *entries;
+    _reading.store(member, std::memory_order_relaxed);
+    const ssize_t got = _family.members[member].pagemap.readAt(from * sizeof *entries, entries, bytes);
+    // One whose address space has gone has nothing left to tell.
+    const size_t count = got < 0 ? 0 : static_cast<size_t>(got) / sizeof *entries;
+    std::fill(entries + count, entries + (to - from), 0);
+    if (std::all_of(entries, entries + count, [](uint64_t entry) { return entry == 0; }))
+        skipHole(member, end);
+}
+
+// Asks where the next page is: mappings can be far larger than what is in them.
+void ColumnReader::skipHole(uint32_t member, uint64_t from) {
+    Row &row = _rows[member];
+    const auto &all = ranges(member);
+    const uint64_t end = std::min(all.back().end, _request.stretch.end);
+    if (from >= end) return;
+    HXPageRun run[1];
+    const uint32_t shift = _request.pageShift;
+    const auto walk =
+        HXPageScan::find(_family.members[member].pagemap, false, from << shift, end << shift, run);
+    if (walk) row.nothingUpTo = walk->count == 0 ? end : run[0].start >> shift;
+}
+
+// Counts [first, end), in which every member has one mapping or none.
+void ColumnReader::countStrip(uint64_t first, uint64_t end) {
+    _active.clear();
+    std::fill(_allBits.begin(), _allBits.end(), 0);
+    std::vector<uint32_t> layout(_memberCount, HXFamilyPages::kNoMapping);
+    _stripOffset = first - _windowStart;
+    for (uint32_t member = 0; member < _memberCount; member++) {
+        if (!_rows[member].isInWindow) continue;
+        const auto &all = ranges(member);
+        size_t i = _rows[member].range;
+        while (i < all.size() && all[i].end <= first)
+            i++;
+        if (i == all.size() || all[i].first > first) continue;
+        layout[member] = all[i].mapping;
+        _active.push_back(member);
+        _allBits[member / 64] |= uint64_t{1} << (member % 64);
+        takeRow(member, all[i], first, end);
+    }
+    if (_active.empty()) return;
+    if (layout != _layout || _layoutNumber == HXFamilyPages::kNoMapping) {
+        endStrip();
+        _layoutNumber = static_cast<uint32_t>(_pages->layouts.size() / _memberCount);
+        _pages->layouts.insert(_pages->layouts.end(), layout.begin(), layout.end());
+        _layout = std::move(layout);
+    }
+    compareRows(end - first);
+    for (size_t page = 0; page < end - first; page++)
+        countColumn(page);
+}
+
+// Turns a row's entries into keys, and counts them.
+void ColumnReader::takeRow(uint32_t member, const HXFamilyRange &range, uint64_t first, uint64_t end) {
+    HXFamilyFigures figures;
+    uint64_t *const keys = row(member) + _stripOffset;
+    for (size_t page = 0; page < end - first; page++) {
+        if (keys[page] == 0) continue;
+        const HXPageEntries::Kind kind = _family.entries->read(keys[page], &keys[page]);
+        figures.resident += kind == HXPageEntries::anonymous || (kind == HXPageEntries::file && range.isFile);
+        figures.anonymous += kind == HXPageEntries::anonymous;
+        figures.swapped += kind == HXPageEntries::swapped;
+    }
+    auto &told = _pages->figures[member];
+    if (told.empty() || told.back().first != range.mapping)
+        told.emplace_back(range.mapping, figures);
+    else {
+        told.back().second.resident += figures.resident;
+        told.back().second.anonymous += figures.anonymous;
+        told.back().second.swapped += figures.swapped;
+    }
+}
+
+// Row by row, which is fast; most columns of a family are alike.
+void ColumnReader::compareRows(size_t pages) {
+    std::fill_n(_differs.begin(), pages, 0);
+    const uint64_t *const lowest = row(_active.front()) + _stripOffset;
+    for (const uint32_t member : _active) {
+        const uint64_t *const keys = row(member) + _stripOffset;
+        for (size_t page = 0; page < pages; page++)
+            _differs[page] |= keys[page] ^ lowest[page];
+    }
+}
+
+void ColumnReader::countColumn(size_t page) {
+    const size_t place = _stripOffset + page;
+    if (_differs[page] == 0) {
+        const HXPageKey key = row(_active.front())[place];
+        if (key != 0) countGroup(key, _allBits, static_cast<uint32_t>(_active.size()));
+        return;
+    }
+    _groups.begin();
+    for (const uint32_t member : _active)
+        if (const HXPageKey key = row(member)[place]) _groups.add(member, key);
+    for (size_t group = 0; group < _groups.groups().size(); group++)
+        countGroup(_groups.groups()[group].key, _groups.bits(group), _groups.groups()[group].count);
+}
+
+void ColumnReader::countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t sharers) {
+    if (!_repeated) {
+        if (_seen.add(key)) _pages->metAgain.push_back(key);
+    } else if (_repeated->contains(key)) {
+        HXSharerSets::forEachMember(bits, [&](uint32_t member) {
+            _pages->repeated.push_back({key, {member, _layout[member]}});
+        });
+        return;
+    }
+    if (sharers < 2) return;
+    if (_lastCount == nullptr || !std::ranges::equal(_pages->sets.bits(_lastSet), bits)) {
+        _lastSet = _pages->sets.number(bits);
+        _lastCount = _lastSet == HXSharerSets::kNone ? nullptr : &_counts[_lastSet];
+    }
+    HXPageCount page;
+    page.add(key);
+    if (_lastCount != nullptr)
+        *_lastCount += page;
+    else
+        _pages->addRest(bits, _layout, page);
+}
+
+void ColumnReader::endStrip() {
+    for (const auto &[set, pages] : _counts)
+        _pages->counts.push_back({_layoutNumber, set, pages});
+    _counts.clear();
+    _lastCount = nullptr;
+}
+
+} // namespace
+
+std::vector<HXPageStretch> HXStretchesOfFamily(const HXFamily &family) {
+    constexpr uint64_t leastPages = 8 * kWindowPages, mostStretches = 4096;
+    std::vector<HXPageStretch> all; // the ranges of all members, then joined
+    for (const HXFamilyMember &member : family.members)
+        for (const HXFamilyRange &range : member.ranges)
+            all.push_back({range.first, range.end});
+    std::sort(all.begin(), all.end(),
+              [](const HXPageStretch &a, const HXPageStretch &b) { return a.first < b.first; });
+    std::vector<HXPageStretch> joined;
+    uint64_t pages = 0;
+    for (const HXPageStretch &range : all) {
+        const uint64_t seenTo = joined.empty() ? 0 : joined.back().end;
+        if (range.end <= seenTo) continue;
+        if (joined.empty() || range.first > seenTo)
+            joined.push_back(range);
+        else
+            joined.back().end = range.end;
+        pages += range.end - std::max(range.first, seenTo);
+    }
+    const uint64_t wanted = std::max(leastPages, pages / mostStretches);
+    std::vector<HXPageStretch> stretches;
+    uint64_t taken = wanted; // by the last stretch, which is full
+    for (const HXPageStretch &range : joined) {
+        for (uint64_t at = range.first; at < range.end;) {
+            if (taken >= wanted) {
+                stretches.push_back({at, at});
+                taken = 0;
+            }
+            // On a border of windows, so that none is read twice.
+            const uint64_t border = (at + (wanted - taken) + kWindowPages - 1) / kWindowPages * kWindowPages;
+            const uint64_t end = std::min(range.end, border);
+            stretches.back().end = end;
+            taken += end - at;
+            at = end;
+        }
+    }
+    return stretches;
+}
+
+std::unique_ptr<HXFamilyPages> HXReadColumns(const HXColumnRequest &request, std::atomic<uint32_t> *reading) {
+    return ColumnReader(request, reading).read();
+}

@@ -1,0 +1,52 @@
+// Finds out which private pages processes share: after fork(2), by same-page merging, and in one address
+// space.
+#pragma once
+
+#include "platform/HXServices.h"
+#include "platform/linux/memory/HXAddressSpaceReader.h"
+#include "platform/linux/memory/HXLinuxTask.h"
+#include "platform/linux/memory/HXObjectIdentifiers.h"
+#include "platform/linux/sharing/HXFamily.h"
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <set>
+#include <string>
+#include <vector>
+
+// What HXSharing works with; outlives it.
+struct HXSharingSetting {
+    HXServices *services;
+    const HXReaderSetting *reader;
+    HXObjectIdentifiers *identifiers;
+    std::string sysPath;
+    bool needsDirtyPages; // HXReadRequest::needsDirtyPages
+    std::function<bool()> isCancelled;
+};
+
+class HXSharing {
+  public:
+    explicit HXSharing(HXSharingSetting setting) : _setting(std::move(setting)) {}
+
+    // Reads those of the tasks that may share with others and tells each what it shares. The pids of those
+    // that do not answer.
+    std::set<int32_t> examine(const std::vector<HXLinuxTask *> &tasks);
+
+  private:
+    using Tasks = std::vector<HXLinuxTask *>;
+    struct Work;
+
+    std::vector<Tasks> findFamilies(const Tasks &tasks);
+    Tasks findMerged(const Tasks &tasks);
+    std::vector<size_t> forAll(size_t count, std::function<void(size_t)> work);
+    void readAddressSpaces(std::vector<Tasks> &families);
+    std::shared_ptr<Work> open(const Tasks &tasks);
+    void readPages(std::vector<std::shared_ptr<Work>> &families, bool isSecond);
+    void readFamilies(std::vector<Tasks> families);
+    void give(Work &family);
+
+    const HXSharingSetting _setting;
+    std::shared_ptr<const HXPageEntries> _entries;
+    std::set<int32_t> _unanswering;
+};
