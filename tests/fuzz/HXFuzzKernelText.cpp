@@ -32,8 +32,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
                                    HXParseSlabinfo(text),
                                    HXParseVmallocinfo(text),
                                    HXParseModules(text),
-                                   HXParseZoneinfoPresentPages(text),
-                                   0};
+                                   HXParseZoneinfo(text),
+                                   0,
+                                   {}};
     uint64_t cachesSize = 0;
     for (const HXSlabCache &cache : *readings.caches) {
         if (!isSane(cache.slabs) || !isSane(cache.pagesPerSlab * cache.slabs)) return 0;

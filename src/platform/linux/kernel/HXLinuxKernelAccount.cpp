@@ -1,6 +1,7 @@
 #include "platform/linux/kernel/HXLinuxKernelAccount.h"
 
 #include "platform/HXSafeText.h"
+#include "platform/linux/kernel/HXLinuxMachineFigures.h"
 #include "platform/linux/procfs/HXTextNumber.h"
 
 #include <algorithm>
@@ -304,23 +305,28 @@ void SiteBuilder::addAreas() {
 void SiteBuilder::addCounters(uint64_t kmallocSize) {
     const uint64_t totalSize = *_meminfo.totalSize;
     const uint64_t slabSize = *_meminfo.slabReclaimableSize + *_meminfo.slabUnreclaimableSize;
-    const uint64_t stackSize = _areas.stackSize > 0 ? 0 : *_meminfo.kernelStackSize;
+    const bool inVmalloc = _areas.stackSize > 0;
+    const uint64_t stackSize = inVmalloc ? 0 : *_meminfo.kernelStackSize;
+    const uint64_t vmallocSize = std::max(_meminfo.vmallocUsedSize.value_or(0), _areas.size);
     const struct {
         uint64_t counter;
         uint64_t size;
     } counters[] = {
         {kCounterManaged, totalSize},
-        {kCounterReserved, difference(_readings.presentPages.value_or(0) * _readings.pageSize, totalSize)},
+        {kCounterReserved, difference(_readings.zonePages.present * _readings.pageSize, totalSize)},
         {kCounterWired,
          sum({_meminfo.slabUnreclaimableSize, _areas.size, stackSize, _meminfo.perCpuSize, _compressedSize,
               _meminfo.pageTableSize, _meminfo.secondaryPageTableSize, _meminfo.mlockedSize})},
         {kCounterStolen, sum({_meminfo.hardwareCorruptedSize, _meminfo.balloonSize})},
-        {kCounterMapKernel, std::max(_meminfo.vmallocUsedSize.value_or(0), _areas.size)},
+        {kCounterMapKernel, vmallocSize},
         {kCounterMapZone, slabSize},
         {kCounterMapKalloc, kmallocSize},
     };
     for (const auto &entry : counters)
         add(VM_KERN_SITE_COUNTER, entry.counter, entry.size);
+    const uint64_t otherVmallocSize = difference(vmallocSize, inVmalloc ? *_meminfo.kernelStackSize : 0);
+    for (const HXMachineFigure &figure : HXMachineFigures(_readings, otherVmallocSize))
+        add(VM_KERN_SITE_COUNTER, HXKernelSiteForFunction(figure.name, {}), figure.size, figure.name);
 }
 
 void SiteBuilder::build(uint64_t kmallocSize) {

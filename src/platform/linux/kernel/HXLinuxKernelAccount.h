@@ -10,6 +10,12 @@
 #include <string_view>
 #include <vector>
 
+// The pools of huge pages of all sizes together, in bytes (the kernel's document on hugetlbpage).
+struct HXHugePagePools {
+    uint64_t freeSize = 0;
+    uint64_t reservedSize = 0; // of the free ones: promised to mappings that have not touched them yet
+};
+
 // What was read. The text that the views point into belongs to the caller.
 struct HXLinuxKernelReadings {
     uint64_t pageSize = 4096;
@@ -18,8 +24,9 @@ struct HXLinuxKernelReadings {
     std::optional<std::vector<HXSlabCache>> caches;
     std::vector<HXVmallocArea> areas;
     std::vector<HXKernelModule> modules;
-    std::optional<uint64_t> presentPages; // of RAM, managed or not
-    uint64_t zramSize = 0;                // bytes that zram devices hold
+    HXZonePages zonePages;
+    uint64_t zramSize = 0; // bytes that zram devices hold
+    HXHugePagePools hugePages;
 };
 
 struct HXLinuxKernelAccount {
@@ -36,6 +43,9 @@ struct HXLinuxKernelAccount {
 // that asked for them, wired; page tables hidden, since the processes are charged for them; locked user
 // memory. The wired sites that are neither hidden nor locked user memory add up to the pages of all vmalloc
 // areas, kernel stacks that are not among these, Percpu and the compressed pool.
+//
+// Counters: those with published numbers, and by name what the machine counts (HXMachineFigures). They are
+// no part of the sums above.
 HXLinuxKernelAccount HXAccountForKernelMemory(const HXLinuxKernelReadings &readings);
 
 // The site of a kernel function that is known by its name alone: an address in no mapping, the same in every

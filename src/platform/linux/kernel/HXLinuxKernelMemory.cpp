@@ -4,6 +4,7 @@
 #include "platform/linux/kernel/HXLinuxKernelAccount.h"
 #include "platform/linux/kernel/HXLinuxKernelSymbols.h"
 #include "platform/linux/procfs/HXProcFile.h"
+#include "platform/linux/procfs/HXTextNumber.h"
 
 #include <fcntl.h>
 
@@ -61,6 +62,28 @@ uint64_t HXLinuxKernelMemory::readZramSize() const {
     return size;
 }
 
+// A directory "hugepages-SIZEkB" for each size of huge pages, with numbers of pages in its files.
+HXHugePagePools HXLinuxKernelMemory::readHugePages() const {
+    const HXDescriptor directory =
+        HXOpenAt(AT_FDCWD, (_sysPath + "/kernel/mm/hugepages").c_str(), O_DIRECTORY);
+    HXHugePagePools pools;
+    HXForEachEntry(directory, [&](const char *name) {
+        HXTextCursor text{name};
+        uint64_t kibibytes = 0;
+        if (!text.skip("hugepages-") || !text.number(&kibibytes)) return true;
+        const auto sizeIn = [&](const char *file) {
+            char buffer[32]; // one number
+            const auto figure = HXReadOnce(directory, (std::string(name) + file).c_str(), buffer);
+            uint64_t pages = 0;
+            return figure && HXTextCursor{*figure}.number(&pages) ? pages * kibibytes * 1024 : 0;
+        };
+        pools.freeSize += sizeIn("/free_hugepages");
+        pools.reservedSize += sizeIn("/resv_hugepages");
+        return true;
+    });
+    return pools;
+}
+
 template <typename Record>
 void HXLinuxKernelMemory::handOut(const std::vector<Record> &from, Record **records, uint32_t *count) {
     *count = static_cast<uint32_t>(from.size());
@@ -92,8 +115,9 @@ kern_return_t HXLinuxKernelMemory::mach_memory_info(mach_port_t, mach_zone_name 
     }
     if (texts.vmallocinfo) readings.areas = HXParseVmallocinfo(*texts.vmallocinfo);
     if (texts.modules) readings.modules = HXParseModules(*texts.modules);
-    if (texts.zoneinfo) readings.presentPages = HXParseZoneinfoPresentPages(*texts.zoneinfo);
+    if (texts.zoneinfo) readings.zonePages = HXParseZoneinfo(*texts.zoneinfo);
     readings.zramSize = readZramSize();
+    readings.hugePages = readHugePages();
 
     const HXLinuxKernelAccount account = HXAccountForKernelMemory(readings);
     handOut(account.zoneNames, names, nameCount);

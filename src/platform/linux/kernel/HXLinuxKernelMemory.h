@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+struct HXHugePagePools;
 struct HXSlabCache;
 
 // Reads /proc and /sys anew for every call. May be called from any thread.
@@ -50,6 +51,7 @@ class HXLinuxKernelMemory {
     kern_return_t readTexts(Texts *texts) const;
     void readCacheKinds(std::vector<HXSlabCache> &caches) const;
     uint64_t readZramSize() const;
+    HXHugePagePools readHugePages() const;
     template <typename Record>
     void handOut(const std::vector<Record> &from, Record **records, uint32_t *count);
 

@@ -162,6 +162,20 @@ std::optional<HXKernelMeminfo> HXParseKernelMeminfo(std::string_view text) {
         {"Zswap:", &Meminfo::zswapSize},
         {"HardwareCorrupted:", &Meminfo::hardwareCorruptedSize},
         {"Balloon:", &Meminfo::balloonSize},
+        {"MemFree:", &Meminfo::freeSize},
+        {"MemAvailable:", &Meminfo::availableSize},
+        {"Buffers:", &Meminfo::buffersSize},
+        {"Cached:", &Meminfo::cachedSize},
+        {"Shmem:", &Meminfo::sharedSize},
+        {"AnonPages:", &Meminfo::anonymousSize},
+        {"KReclaimable:", &Meminfo::reclaimableSize},
+        {"Active:", &Meminfo::activeSize},
+        {"Inactive:", &Meminfo::inactiveSize},
+        {"Unevictable:", &Meminfo::unevictableSize},
+        {"Hugetlb:", &Meminfo::hugePageSize},
+        {"SwapTotal:", &Meminfo::swapTotalSize},
+        {"SwapFree:", &Meminfo::swapFreeSize},
+        {"SwapCached:", &Meminfo::swapCachedSize},
     };
     const Meminfo meminfo = HXParseLabelledFigures(text, figures);
     const bool isWhole = meminfo.totalSize && meminfo.slabReclaimableSize && meminfo.slabUnreclaimableSize &&
@@ -169,15 +183,16 @@ std::optional<HXKernelMeminfo> HXParseKernelMeminfo(std::string_view text) {
     return isWhole ? std::optional(meminfo) : std::nullopt;
 }
 
-std::optional<uint64_t> HXParseZoneinfoPresentPages(std::string_view text) {
-    std::optional<uint64_t> presentPages;
+HXZonePages HXParseZoneinfo(std::string_view text) {
+    HXZonePages sums;
     for (HXTextCursor cursor{text}; !cursor.rest.empty();) {
         HXTextCursor line{cursor.line()};
+        const std::string_view label = line.word();
         uint64_t pages = 0;
-        if (line.word() == "present" && takeNumber(line, &pages))
-            presentPages = presentPages.value_or(0) + pages;
+        if (label == "present" && takeNumber(line, &pages)) sums.present += pages;
+        if (label == "count:" && takeNumber(line, &pages)) sums.listed += pages;
     }
-    return presentPages;
+    return sums;
 }
 
 std::optional<uint64_t> HXParseZramUsedSize(std::string_view text) {

@@ -41,7 +41,7 @@ struct HXKernelModule {
 };
 std::vector<HXKernelModule> HXParseModules(std::string_view text);
 
-// The figures of /proc/meminfo that describe the kernel's memory, in bytes (proc(5)).
+// The figures of /proc/meminfo that describe the machine's memory and the kernel's, in bytes (proc(5)).
 struct HXKernelMeminfo {
     // Needed: every kernel since 2.6.32 has them.
     std::optional<uint64_t> totalSize, slabReclaimableSize, slabUnreclaimableSize, kernelStackSize;
@@ -54,13 +54,27 @@ struct HXKernelMeminfo {
     std::optional<uint64_t> zswapSize; // the pool's pages (since 5.19)
     std::optional<uint64_t> hardwareCorruptedSize;
     std::optional<uint64_t> balloonSize; // since 6.15
+    std::optional<uint64_t> freeSize, buffersSize;
+    std::optional<uint64_t>
+        availableSize;                  // the kernel's estimate of what programs could still get (since 3.14)
+    std::optional<uint64_t> cachedSize; // page cache, shared memory with it; without buffers and swap cache
+    std::optional<uint64_t> sharedSize; // shared memory and tmpfs, resident
+    std::optional<uint64_t> anonymousSize;   // mapped anonymous pages
+    std::optional<uint64_t> reclaimableSize; // SReclaimable and what else the kernel gives back (since 4.20)
+    // What the lists of reclaim hold: all anonymous, shared and file pages, whether or not they are mapped.
+    std::optional<uint64_t> activeSize, inactiveSize, unevictableSize;
+    std::optional<uint64_t> hugePageSize; // the pools of huge pages of all sizes (since 4.19)
+    std::optional<uint64_t> swapTotalSize, swapFreeSize, swapCachedSize;
 };
 // None when the text lacks a needed figure.
 std::optional<HXKernelMeminfo> HXParseKernelMeminfo(std::string_view text);
 
-// Pages of RAM that the kernel found, whether or not it manages them: the `present` figures of /proc/zoneinfo
-// added up; none when the text has no such figure.
-std::optional<uint64_t> HXParseZoneinfoPresentPages(std::string_view text);
+// The figures of /proc/zoneinfo, added up over all zones.
+struct HXZonePages {
+    uint64_t present = 0; // pages of RAM that the kernel found, whether or not it manages them
+    uint64_t listed = 0;  // free pages on the lists of single CPUs, which MemFree leaves out
+};
+HXZonePages HXParseZoneinfo(std::string_view text);
 
 // Bytes that a zram device holds (`mem_used_total` of its mm_stat); none when there is no such figure.
 std::optional<uint64_t> HXParseZramUsedSize(std::string_view text);

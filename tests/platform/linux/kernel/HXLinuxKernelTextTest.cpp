@@ -29,6 +29,9 @@ std::string show(const HXKernelModule &m) {
 std::string show(const HXAllocationSite &s) {
     return row(s.size, s.path, s.line, s.module, s.function);
 }
+std::string show(const HXZonePages &z) {
+    return row(z.present, z.listed);
+}
 std::string show(const HXKernelSymbol &s) {
     return row(s.address, s.name, s.module, s.isCode);
 }
@@ -38,6 +41,10 @@ std::string rows(std::string_view text) {
     for (const auto &record : parse(text))
         all += show(record);
     return all;
+}
+template <auto parse>
+std::string whole(std::string_view text) {
+    return show(parse(text));
 }
 template <auto parse>
 std::string figure(std::string_view text) {
@@ -50,7 +57,7 @@ TEST(HXLinuxKernelText, ReadsLinesOfManyKernels) {
     static const std::map<std::string, std::string (*)(std::string_view)> parsers = {
         {"slabinfo", rows<HXParseSlabinfo>},     {"vmallocinfo", rows<HXParseVmallocinfo>},
         {"modules", rows<HXParseModules>},       {"allocinfo", rows<HXParseAllocinfo>},
-        {"kallsyms", rows<HXParseKallsyms>},     {"zoneinfo", figure<HXParseZoneinfoPresentPages>},
+        {"kallsyms", rows<HXParseKallsyms>},     {"zoneinfo", whole<HXParseZoneinfo>},
         {"mm_stat", figure<HXParseZramUsedSize>}};
     for (const HXCase &each : HXReadCases("linux-kernel-text.txt")) {
         const auto parse = parsers.at(each.title.substr(0, each.title.find(':')));
