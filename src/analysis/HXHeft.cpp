@@ -27,12 +27,24 @@ std::unique_ptr<HXDispatchSource> HXHeft::installCancelHandler(std::function<voi
     return source;
 }
 
-void HXHeft::gatherProcesses() {
-    HXServices &services = HXPlatform::current().services();
-    for (const int32_t pid : HXPlatform::current().examineTogether(
-             [this] { return _isCancelled->load(std::memory_order_relaxed); }))
+// Has the host find out what the processes share.
+void HXHeft::examineTogether() {
+    constexpr uint64_t least = 1 << 20; // bytes worth a warning
+    HXPlatform &platform = HXPlatform::current();
+    const auto unanswering = platform.examineTogether(
+        [isCancelled = _isCancelled] { return isCancelled->load(std::memory_order_relaxed); });
+    for (const int32_t pid : unanswering)
         for (const auto &process : _processes)
             if (process->pid() == pid && process->_isAlive()) setAside(*process);
+    const uint64_t notTold = platform.sharedSizeNotTold().value_or(0);
+    if (notTold > least)
+        _warnings.push_back("Memory shared since fork(2) is counted for each process that has it, "
+                            "which adds at most " +
+                            std::to_string(notTold) + " bytes (try as root?)");
+}
+
+void HXHeft::gatherProcesses() {
+    HXServices &services = HXPlatform::current().services();
     const HXDispatchQueue queue = services.dispatch_queue_create(kQueueLabel, QOS_CLASS_UTILITY);
     const std::vector<HXProcess *> ordered = _processesBySortingPidDesc(_processes);
     const auto givenUp =
@@ -55,6 +67,7 @@ void HXHeft::setAside(const HXProcess &unanswering) {
 }
 
 void HXHeft::gatherData() {
+    examineTogether();
     gatherProcesses();
     if (*_isCancelled)
         HXProcess::_addGlobalError("Heft exited early due to SIGINT and did not finish gathering all data");

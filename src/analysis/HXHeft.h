@@ -80,6 +80,7 @@ class HXHeft : public HXHeftSwitches {
     using ObjectMap = std::pmr::unordered_map<uint64_t, HXMemoryObject *, KeyHash>;
     struct Report;
 
+    void examineTogether();
     void gatherProcesses();
     void setAside(const HXProcess &unanswering);
     void reserveMaps();
@@ -104,5 +105,6 @@ class HXHeft : public HXHeftSwitches {
     };
     std::unique_ptr<ObjectMaps> _maps;
     std::vector<HXOutputFormatter *> _outputFormatters;
+    std::vector<std::string> _warnings; // of the analysis as a whole
     std::shared_ptr<std::atomic<bool>> _isCancelled = std::make_shared<std::atomic<bool>>(false);
 };

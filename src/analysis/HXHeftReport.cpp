@@ -65,12 +65,12 @@ void HXHeft::printOutputVerbose(bool verbose, bool summarize) {
     for (const HXProcess *process : inOrder)
         reportProcess(*process, report, sharing, summarize);
 
-    const std::vector<std::string> globalErrors = HXProcess::globalErrors();
+    const HXGlobalMessages messages = {HXProcess::globalErrors(), _warnings};
     for (HXOutputFormatter *formatter : _outputFormatters)
-        formatter->printProcessesWithWarnings(report.withWarnings, report.withErrors, globalErrors);
+        formatter->printProcessesWithWarnings(report.withWarnings, report.withErrors, messages);
     const HXCategoryMap summary = _categoriesForAllProcessesShouldSummarize(summarize);
     const HXMemoryTotal total = _totalForCategories(summary);
-    const bool hadErrors = !globalErrors.empty() || !report.withErrors.empty();
+    const bool hadErrors = !messages.errors.empty() || !report.withErrors.empty();
     for (HXOutputFormatter *formatter : _outputFormatters) {
         formatter->printSummaryCategories(summary, total, hadErrors);
         formatter->printGlobalAuxData(report.globalAuxData.get());

@@ -15,6 +15,12 @@
 #include <string>
 #include <vector>
 
+// What is to be said of the whole analysis, not of one process.
+struct HXGlobalMessages {
+    std::vector<std::string> errors;
+    std::vector<std::string> warnings;
+};
+
 class HXOutputFormatter {
   public:
     using Processes = std::vector<const HXProcess *>;
@@ -32,7 +38,7 @@ class HXOutputFormatter {
                                        bool hasProcessView, const HXMemoryTotal &total) = 0;
     virtual void printProcessAuxData(const HXAuxDictionary *data) = 0;
     virtual void printProcessesWithWarnings(const Processes &withWarnings, const Processes &withErrors,
-                                            const std::vector<std::string> &globalErrors) = 0;
+                                            const HXGlobalMessages &messages) = 0;
     virtual void printSummaryCategories(const HXCategoryMap &categories, const HXMemoryTotal &total,
                                         bool hadErrors) = 0;
     virtual void printGlobalAuxData(const HXAuxDictionary *data) = 0;

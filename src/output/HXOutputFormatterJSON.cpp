@@ -174,13 +174,13 @@ void HXOutputFormatterJSON::printProcessAuxData(const HXAuxDictionary *data) {
 
 void HXOutputFormatterJSON::printProcessesWithWarnings(const Processes &withWarnings,
                                                        const Processes &withErrors,
-                                                       const std::vector<std::string> &globalErrors) {
+                                                       const HXGlobalMessages &messages) {
     close(']');
-    std::vector<std::string> errors = globalErrors;
+    std::vector<std::string> errors = messages.errors;
     for (const HXProcess *process : withErrors)
         for (const std::string &error : process->errors())
             errors.push_back(error);
-    std::vector<std::string> warnings;
+    std::vector<std::string> warnings = messages.warnings;
     for (const HXProcess *process : withWarnings)
         warnings.insert(warnings.end(), process->warnings().begin(), process->warnings().end());
     texts("errors", errors);

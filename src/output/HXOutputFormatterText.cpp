@@ -206,11 +206,12 @@ void HXOutputFormatterText::printProcessAuxData(const HXAuxDictionary *data) {
 
 void HXOutputFormatterText::printProcessesWithWarnings(const Processes &withWarnings,
                                                        const Processes &withErrors,
-                                                       const std::vector<std::string> &globalErrors) {
+                                                       const HXGlobalMessages &messages) {
     printList("Warnings were encountered while examining the following processes:", namesOf(withWarnings));
     printList("Errors were encountered while examining the following processes:", namesOf(withErrors));
-    printList("Errors were encountered:", globalErrors);
-    if (!withErrors.empty() || !globalErrors.empty())
+    printList("Warnings were encountered:", messages.warnings);
+    printList("Errors were encountered:", messages.errors);
+    if (!withErrors.empty() || !messages.errors.empty())
         fputs("\nDue to errors, summary results may be invalid\n", _output);
 }
 

@@ -24,7 +24,7 @@ class HXOutputFormatterText : public HXOutputFormatter {
                                const HXMemoryTotal &total) override;
     void printProcessAuxData(const HXAuxDictionary *data) override;
     void printProcessesWithWarnings(const Processes &withWarnings, const Processes &withErrors,
-                                    const std::vector<std::string> &globalErrors) override;
+                                    const HXGlobalMessages &messages) override;
     void printSummaryCategories(const HXCategoryMap &categories, const HXMemoryTotal &total,
                                 bool hadErrors) override;
     void printGlobalAuxData(const HXAuxDictionary *data) override;

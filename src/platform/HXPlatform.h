@@ -104,6 +104,10 @@ class HXPlatform {
     // do not answer: they must not be asked again. Main thread only.
     virtual std::vector<int32_t> examineTogether(const std::function<bool()> &) { return {}; }
 
+    // After `examineTogether` by somebody who may not know which pages tasks share: how many bytes at most
+    // are told of several of them. None where it is known.
+    virtual std::optional<uint64_t> sharedSizeNotTold() { return std::nullopt; }
+
     // What of the private memory of the mapping that begins at `address` other tasks share. A page that
     // several mappings of a task show is told once.
     virtual std::vector<vm_region_share> mach_vm_region_shares(mach_port_t, uint64_t) { return {}; }

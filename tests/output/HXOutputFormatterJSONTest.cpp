@@ -14,7 +14,7 @@ TEST(HXOutputFormatterJSONTest, SaysWhenNothingCanBeWritten) {
     for (const size_t length : {1, 100000}) { // what is written at the end, and what is written before
         const auto formatter = HXOutputFormatterJSON::withPath("/dev/full");
         ASSERT_TRUE(formatter);
-        formatter->printProcessesWithWarnings({}, {}, std::vector<std::string>(length, "a report"));
+        formatter->printProcessesWithWarnings({}, {}, {std::vector<std::string>(length, "a report"), {}});
         formatter->printSummaryCategories(HXCategoryMap(), {}, false);
         formatter->printGlobalAuxData(nullptr);
         formatter->end();

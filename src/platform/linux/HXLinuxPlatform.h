@@ -50,6 +50,7 @@ class HXLinuxPlatform final : public HXPlatform {
         return KERN_INVALID_ARGUMENT; // nothing is purgeable here
     }
     std::vector<int32_t> examineTogether(const std::function<bool()> &isCancelled) override;
+    std::optional<uint64_t> sharedSizeNotTold() override { return _sharedSizeNotTold; }
     std::vector<vm_region_share> mach_vm_region_shares(mach_port_t task, uint64_t address) override;
     std::optional<HXWalkShortfall> walkShortfall(mach_port_t task) override;
     uint32_t vm_kernel_page_size() override { return _pageSize; }
@@ -135,6 +136,7 @@ class HXLinuxPlatform final : public HXPlatform {
     HXDescriptorTurns _turns;
     HXObjectIdentifiers _identifiers;
     HXTaskTable _tasks;
-    std::atomic<uint32_t> _reportsCharge = 0; // "vm.self_region_heft"
+    std::optional<uint64_t> _sharedSizeNotTold; // of the last `examineTogether`
+    std::atomic<uint32_t> _reportsCharge = 0;   // "vm.self_region_heft"
     HXLinuxServices _services;
 };

@@ -141,6 +141,7 @@ std::vector<int32_t> HXLinuxPlatform::examineTogether(const std::function<bool()
     HXSharing sharing({&_services, &_readerSetting, &_identifiers, _sysPath,
                        _reportsCharge.load(std::memory_order_relaxed) == 0, isCancelled});
     const std::set<int32_t> unanswering = sharing.examine(_tasks.all());
+    _sharedSizeNotTold = sharing.sizeNotTold();
     return {unanswering.begin(), unanswering.end()};
 }
 

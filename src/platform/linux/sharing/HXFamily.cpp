@@ -3,9 +3,8 @@
 void HXFamilyPages::addRest(HXSharerSets::Bits set, std::span<const uint32_t> layout,
                             const HXPageCount &pages) {
     const uint32_t lowest = HXSharerSets::first(set);
-    const HXFamilyMapping object = {lowest, layout[lowest]};
     HXSharerSets::forEachMember(set, [&](uint32_t member) {
-        Rest &entry = rest[{object, {member, layout[member]}}];
+        Rest &entry = rest[{member, layout[member]}];
         entry.pages += pages;
         if (member == lowest) entry.counted += pages;
     });
@@ -22,9 +21,9 @@ void HXFamilyPages::add(const HXFamilyPages &other) {
         else
             counts.push_back({firstLayout + count.layout, number, count.pages});
     }
-    for (const auto &[key, entry] : other.rest) {
-        rest[key].pages += entry.pages;
-        rest[key].counted += entry.counted;
+    for (const auto &[place, entry] : other.rest) {
+        rest[place].pages += entry.pages;
+        rest[place].counted += entry.counted;
     }
     for (size_t i = 0; i < members; i++)
         figures[i].insert(figures[i].end(), other.figures[i].begin(), other.figures[i].end());

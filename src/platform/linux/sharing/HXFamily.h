@@ -81,19 +81,16 @@ struct HXFamilyPages {
         uint32_t set;
         HXPageCount pages;
     };
-    // What is not told by sets: pages of sets that found no room. `object`: where their lowest member has
-    // them.
+    // What a mapping has of pages whose sets are not told, and how many of these no lower member has.
     struct Rest {
-        HXPageCount pages;
-        HXPageCount counted; // of which `object` is the member's own place
+        HXPageCount pages, counted;
     };
-    using RestKey = std::pair<HXFamilyMapping, HXFamilyMapping>; // object and place
 
     size_t members;
     HXSharerSets sets;
     std::vector<uint32_t> layouts; // the mapping of each member, or kNoMapping, layout by layout
     std::vector<Count> counts;
-    std::map<RestKey, Rest> rest;
+    std::map<HXFamilyMapping, Rest> rest;
     std::vector<std::vector<std::pair<uint32_t, HXFamilyFigures>>> figures; // of mappings, by member
     std::vector<HXPageKey> metAgain;
     std::vector<HXRepeatedPage> repeated;
@@ -101,7 +98,7 @@ struct HXFamilyPages {
     std::span<const uint32_t> layout(uint32_t number) const {
         return std::span(layouts).subspan(number * members, members);
     }
-    // Counts pages of a set whose members have them where `layout` says.
+    // Counts pages, without their set, whose members have them where `layout` says.
     void addRest(HXSharerSets::Bits set, std::span<const uint32_t> layout, const HXPageCount &pages);
     // Adds what was read elsewhere.
     void add(const HXFamilyPages &other);

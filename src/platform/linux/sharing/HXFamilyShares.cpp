@@ -30,7 +30,6 @@ class Shares {
     void add(HXSharerSets::Bits bits, uint32_t set, std::span<const uint32_t> layout,
              const HXPageCount &pages);
     uint64_t tokenOf(uint32_t set);
-    uint64_t identifierOf(HXFamilyMapping lowest, uint64_t token);
     void tellExact();
     void tellRest();
     void share(HXFamilyMapping place, const vm_region_share &share);
@@ -151,11 +150,6 @@ uint64_t Shares::tokenOf(uint32_t set) {
     return token;
 }
 
-uint64_t Shares::identifierOf(HXFamilyMapping lowest, uint64_t token) {
-    const HXFamilyTask &task = _tasks[lowest.member];
-    return _identifiers.ofShared(task.task->pid(), (*task.addressSpace)[lowest.mapping].start, token);
-}
-
 void Shares::share(HXFamilyMapping place, const vm_region_share &share) {
     _told[place.member].shares.push_back({place.mapping, share});
 }
@@ -167,16 +161,19 @@ void Shares::tellExact() {
         const auto &[set, lowest] = object;
         if (set != lastSet) token = tokenOf(set);
         lastSet = set;
-        const uint64_t id = identifierOf(lowest, token);
+        const HXFamilyTask &task = _tasks[lowest.member];
+        const uint64_t start = (*task.addressSpace)[lowest.mapping].start;
+        const uint64_t id = _identifiers.ofShared(task.task->pid(), start, token);
         for (const auto &[place, pages] : places)
             share(place, {id, pages.resident, pages.swapped, 0, 0});
     }
 }
 
 void Shares::tellRest() {
-    for (const auto &[key, rest] : _pages.rest)
-        share(key.second, {identifierOf(key.first, 0), rest.pages.resident, rest.pages.swapped,
-                           rest.counted.resident, rest.counted.swapped});
+    const uint64_t id = _identifiers.ofShared(_tasks.front().task->pid(), 0, 0);
+    for (const auto &[place, rest] : _pages.rest)
+        share(place,
+              {id, rest.pages.resident, rest.pages.swapped, rest.counted.resident, rest.counted.swapped});
 }
 
 } // namespace

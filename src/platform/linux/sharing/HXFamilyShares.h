@@ -15,7 +15,7 @@ struct HXFamilyTask {
 };
 
 // Works out what each member is told. The largest sets are told exactly: kExactSets of them, and all of at
-// least kExactSize bytes. What smaller ones share is one object for each mapping of their lowest members.
+// least kExactSize bytes. What all smaller ones share is one object.
 // `pages`: all that was read of the family.
 inline constexpr size_t kExactSets = 64;
 inline constexpr uint64_t kExactSize = 1 << 20;

@@ -61,7 +61,10 @@ std::set<int32_t> HXSharing::examine(const std::vector<HXLinuxTask *> &tasks) {
     std::vector<Tasks> families = findFamilies(tasks);
     if (families.empty()) return {};
     _entries = std::make_shared<HXPageEntries>(_setting.reader->pageShift);
-    if (!_entries->tellFrames()) return {};
+    if (!_entries->tellFrames()) {
+        measureNotTold(families);
+        return _unanswering;
+    }
     // As many families at once as there are descriptors for.
     const size_t most = mostOpenMembers();
     for (size_t first = 0; first < families.size();) {
@@ -72,9 +75,31 @@ std::set<int32_t> HXSharing::examine(const std::vector<HXLinuxTask *> &tasks) {
             members += families[first].size();
             batch.push_back(std::move(families[first]));
         }
-        if (members <= most) readFamilies(std::move(batch));
+        if (members <= most)
+            readFamilies(std::move(batch));
+        else
+            measureNotTold(batch);
     }
     return _unanswering;
+}
+
+// What the kernel counts for each process beyond its share of it.
+void HXSharing::measureNotTold(const std::vector<Tasks> &families) {
+    Tasks all;
+    for (const Tasks &family : families)
+        all.insert(all.end(), family.begin(), family.end());
+    const auto size = std::make_shared<std::atomic<uint64_t>>(0);
+    const auto givenUp = forAll(all.size(), [all, size](size_t i) {
+        char text[4096]; // of some 25 lines
+        const auto rollup = HXReadOnce(all[i]->directory(), "smaps_rollup", text);
+        if (!rollup) return;
+        const auto whole = HXParseLabelled(*rollup, "Anonymous:"),
+                   share = HXParseLabelled(*rollup, "Pss_Anon:");
+        if (whole && share && *whole > *share) *size += (*whole - *share) * 1024;
+    });
+    for (const size_t i : givenUp)
+        _unanswering.insert(all[i]->pid());
+    _sizeNotTold = _sizeNotTold.value_or(0) + *size;
 }
 
 // Iterations that did not answer.

@@ -11,6 +11,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <set>
 #include <string>
 #include <vector>
@@ -33,6 +34,9 @@ class HXSharing {
     // that do not answer.
     std::set<int32_t> examine(const std::vector<HXLinuxTask *> &tasks);
 
+    // Bytes of pages that tasks may share and `examine` told as each one's own; none when it told all.
+    std::optional<uint64_t> sizeNotTold() const { return _sizeNotTold; }
+
   private:
     using Tasks = std::vector<HXLinuxTask *>;
     struct Work;
@@ -45,8 +49,10 @@ class HXSharing {
     void readPages(std::vector<std::shared_ptr<Work>> &families, bool isSecond);
     void readFamilies(std::vector<Tasks> families);
     void give(Work &family);
+    void measureNotTold(const std::vector<Tasks> &families);
 
     const HXSharingSetting _setting;
     std::shared_ptr<const HXPageEntries> _entries;
     std::set<int32_t> _unanswering;
+    std::optional<uint64_t> _sizeNotTold;
 };
