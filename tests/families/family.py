@@ -14,42 +14,37 @@ import socket
 import sys
 import tempfile
 import time
-import traceback
 
 PAGE, MIB = mmap.PAGESIZE, 1 << 20
 PAYLOAD = "anonymous code"
 HUGE_POOL, MOVE_TO = 0x40000, 1 | 2  # MAP_HUGETLB, MREMAP_MAYMOVE | MREMAP_FIXED
 DONTNEED, DONTFORK, MERGEABLE, HUGEPAGE, PAGEOUT = 4, 10, 12, 14, 21
 IPC_CREAT, IPC_RMID, IPC_PRIVATE = 0o1000, 0, 0
+PRIVATE = mmap.MAP_PRIVATE | mmap.MAP_ANONYMOUS
 
 libc = ctypes.CDLL(None, use_errno=True)
-long, word = ctypes.c_long, ctypes.c_size_t
-libc.mmap.argtypes, libc.mmap.restype = [word, word, ctypes.c_int, ctypes.c_int, ctypes.c_int, long], long
-libc.mremap.argtypes, libc.mremap.restype = [word, word, word, ctypes.c_int, word], long
-libc.munmap.argtypes = [word, word]
-libc.madvise.argtypes = [word, word, ctypes.c_int]
-libc.shmget.argtypes = [ctypes.c_int, word, ctypes.c_int]
-libc.shmat.argtypes, libc.shmat.restype = [ctypes.c_int, word, ctypes.c_int], long
-libc.shmdt.argtypes = [word]
 
 
 class Skip(Exception):
     pass
 
 
-def checked(result):
-    if result == -1:
-        error = ctypes.get_errno()
-        raise OSError(error, os.strerror(error))
+def call(name, *arguments):
+    """A function of the C library whose arguments are numbers."""
+    function = getattr(libc, name)
+    function.restype = ctypes.c_long
+    result = function(*map(ctypes.c_long, arguments))
+    if result & 0xFFFFFFFF == 0xFFFFFFFF:  # -1, also as an int
+        raise OSError(ctypes.get_errno(), name)
     return result
 
 
 class Memory:
     """A mapping; offsets and sizes are in bytes."""
 
-    def __init__(self, size, flags=mmap.MAP_PRIVATE | mmap.MAP_ANONYMOUS, file=-1, code=True, align=PAGE):
+    def __init__(self, size, flags=PRIVATE, file=-1, code=True, align=PAGE):
         rights = mmap.PROT_READ | mmap.PROT_WRITE | (mmap.PROT_EXEC if code else 0)
-        start = checked(libc.mmap(0, size + (align if align > PAGE else 0), rights, flags, file, 0))
+        start = call("mmap", 0, size + (align if align > PAGE else 0), rights, flags, file, 0)
         self.start, self.size = -(-start // align) * align, size
 
     @classmethod
@@ -60,22 +55,23 @@ class Memory:
 
     def write(self, start=0, end=None, value=1):
         ctypes.memset(self.start + start, value, (self.size if end is None else end) - start)
+        return self
 
     def read(self, start, end):
         for offset in range(start, end, PAGE):
             ctypes.c_char.from_address(self.start + offset).value
 
     def advise(self, advice, start=0, end=None):
-        checked(libc.madvise(self.start + start, (self.size if end is None else end) - start, advice))
+        call("madvise", self.start + start, (self.size if end is None else end) - start, advice)
 
     def move(self, start, end):
         """Moves a range to a new place; its own stays empty."""
-        target = checked(libc.mmap(0, end - start, 0, mmap.MAP_PRIVATE | mmap.MAP_ANONYMOUS, -1, 0))
-        checked(libc.mremap(self.start + start, end - start, end - start, MOVE_TO, target))
+        target = call("mmap", 0, end - start, 0, PRIVATE, -1, 0)
+        call("mremap", self.start + start, end - start, end - start, MOVE_TO, target)
         return Memory.at(target, end - start)
 
     def unmap(self):
-        checked(libc.munmap(self.start, self.size))
+        call("munmap", self.start, self.size)
 
 
 at_end = []  # of the first process
@@ -94,16 +90,11 @@ def fork(name, body=lambda: None):
     """A child that does `body` and waits; returns when it has done so."""
     done, tell = os.pipe()
     if os.fork() == 0:
+        os.close(done)
         at_end.clear()
-        try:
-            body()
-            os.write(names_out, f"{name} {os.getpid()}\n".encode())
-            os.write(tell, b".")
-            os.close(tell)
-            os.close(done)
-        except BaseException:
-            traceback.print_exc()
-            os._exit(1)
+        body()
+        os.write(names_out, f"{name} {os.getpid()}\n".encode())
+        os.write(tell, b".")
         until_the_end()
     os.close(tell)
     if not os.read(done, 1):
@@ -117,8 +108,7 @@ def in_mib(**sets):
 
 def prefork(size, children):
     """The k-th child rewrote the first k MiB."""
-    payload = Memory(size * MIB)
-    payload.write()
+    payload = Memory(size * MIB).write()
     names = [f"c{k}" for k in range(1, children + 1)]
     for k, name in enumerate(names, 1):
         fork(name, lambda: payload.write(0, k * MIB, 2))
@@ -128,8 +118,7 @@ def prefork(size, children):
 
 
 def grandchildren():
-    payload = Memory(8 * MIB)
-    payload.write()
+    payload = Memory(8 * MIB).write()
 
     def child():
         payload.write(0, 2 * MIB, 2)
@@ -141,8 +130,7 @@ def grandchildren():
 
 
 def moved():
-    payload = Memory(8 * MIB)
-    payload.write()
+    payload = Memory(8 * MIB).write()
     fork("mover", lambda: payload.move(2 * MIB, 5 * MIB).write(0, MIB, 2))
     fork("other", lambda: payload.move(7 * MIB, 8 * MIB))
     payload.move(4 * MIB, 6 * MIB)
@@ -150,8 +138,7 @@ def moved():
 
 
 def dontfork():
-    payload = Memory(8 * MIB)
-    payload.write()
+    payload = Memory(8 * MIB).write()
     payload.advise(DONTFORK, 0, 3 * MIB)
     fork("child")
     return {PAYLOAD: in_mib(parent=3, parent_child=5)}
@@ -176,8 +163,7 @@ def transparent():
 
 def pool():
     """Needs five free pages of 2 MiB in the huge-page pool."""
-    payload = Memory(8 * MIB, mmap.MAP_PRIVATE | mmap.MAP_ANONYMOUS | HUGE_POOL, code=False)
-    payload.write()
+    payload = Memory(8 * MIB, PRIVATE | HUGE_POOL, code=False).write()
     fork("child", lambda: payload.write(2 * MIB, 4 * MIB, 2))
     return {"huge pages": in_mib(parent=2, child=2, parent_child=6)}
 
@@ -217,8 +203,7 @@ def merged(name, pages, twice, *children):
 
 
 def swapped():
-    payload = Memory(16 * MIB)
-    payload.write()
+    payload = Memory(16 * MIB).write()
     payload.advise(PAGEOUT, 0, 8 * MIB)
 
     def child():
@@ -229,8 +214,7 @@ def swapped():
     fork("child", child)
     file = os.memfd_create("swapped")
     os.ftruncate(file, 4 * MIB)
-    memory = Memory(4 * MIB, mmap.MAP_SHARED, file, code=False)
-    memory.write()
+    memory = Memory(4 * MIB, mmap.MAP_SHARED, file, code=False).write()
     memory.advise(PAGEOUT)
     memory.unmap()
     # The child's frames of the first 2 MiB are other pages than the parent's slots.
@@ -242,44 +226,37 @@ def memfd():
 
     def create(size):
         file = os.memfd_create("some")
-        os.ftruncate(file, size * MIB)
-        return file, lambda: Memory(size * MIB, mmap.MAP_SHARED, file, code=False)
-
-    def fill(file, size):
         os.write(file, b"x" * size * MIB)
+        return file
 
-    fill(create(3)[0], 3)
-    both, map_both = create(4)
-    fill(both, 4)
-    fork("child", lambda: map_both().write(0, 3 * MIB))
-    mapped, map_it = create(2)
-    map_it().write()
+    def shared(file):
+        return Memory(os.fstat(file).st_size, mmap.MAP_SHARED, file, code=False)
+
+    create(3)
+    both = create(4)
+    fork("child", lambda: shared(both).write(0, 3 * MIB))
+    mapped = create(2)
+    shared(mapped).write()
     os.close(mapped)
-    used = create(5)[1]()
-    used.write()
-    used.unmap()
-    part, map_part = create(4)
-    fill(part, 4)
-    map_part().write(0, MIB)
+    shared(create(5)).write().unmap()
+    shared(create(4)).write(0, MIB)
     return {"memfd": in_mib(child=3, parent=3), "memfd (unmapped)": in_mib(parent=8, parent_child=4)}
 
 
 def system_v():
     def attach(segment):
-        return Memory.at(checked(libc.shmat(segment, 0, 0)), sizes[segment])
+        return Memory.at(call("shmat", segment, 0, 0), sizes[segment])
 
     sizes = {}
     for size in (3, 2, 4):
-        segment = checked(libc.shmget(IPC_PRIVATE, size * MIB, IPC_CREAT | 0o600))
-        at_end.append(lambda segment=segment: libc.shmctl(segment, IPC_RMID, None))
+        segment = call("shmget", IPC_PRIVATE, size * MIB, IPC_CREAT | 0o600)
+        at_end.append(lambda segment=segment: call("shmctl", segment, IPC_RMID, 0))
         sizes[segment] = size * MIB
     fork("child")
     mapped, untouched, left = sizes
     attach(mapped).write()
     for segment in (untouched, left):
-        memory = attach(segment)
-        memory.write()
-        checked(libc.shmdt(memory.start))
+        call("shmdt", attach(segment).write().start)
     attach(untouched)
     known = {"System V shared memory": in_mib(parent=3), "System V shared memory (unmapped)": in_mib(parent=2)}
     return known, {"System V shared memory (unattached)": 4 * MIB}
@@ -366,8 +343,7 @@ def tree(seed):
 
 def same(size, children):
     """Children that share all of their parent's memory."""
-    payload = Memory(size * MIB)
-    payload.write()
+    payload = Memory(size * MIB).write()
     for k in range(children):
         fork(f"c{k}")
     return {}
@@ -375,8 +351,7 @@ def same(size, children):
 
 def many(children, pages):
     """Each page was rewritten by two children drawn at random."""
-    payload = Memory(pages * PAGE)
-    payload.write()
+    payload = Memory(pages * PAGE).write()
     dice = random.Random(1)
     rewritten = [[] for _ in range(children)]
     for page in range(pages):
@@ -394,8 +369,7 @@ def many(children, pages):
 
 def writers(count):
     """Processes that drop and write pages of memory that they share in part, about 20,000 a second in all."""
-    payload = Memory(64 * MIB)
-    payload.write()
+    payload = Memory(64 * MIB).write()
 
     def walk():
         page, half, window = 0, payload.size // PAGE // 2, 2048

@@ -16,7 +16,7 @@ PRESENT, SWAPPED, FILE, GUARD = 1 << 63, 1 << 62, 1 << 61, 1 << 58
 FRAME = (1 << 55) - 1
 MARKER_TYPE, MIGRATION_TYPES = 31, range(24, 31)  # in place of a swap file's number
 
-Mapping = collections.namedtuple("Mapping", "start end rights is_private device name figures")
+Mapping = collections.namedtuple("Mapping", "start end rights device name figures")
 
 
 def read(path):
@@ -36,7 +36,7 @@ def mappings(pid):
         if header := HEADER.fullmatch(line):
             start, end, rights, major, minor, name = header.groups()
             device = os.makedev(int(major, 16), int(minor, 16))
-            result.append(Mapping(int(start, 16), int(end, 16), rights, rights[3] == "p", device, name, collections.Counter()))
+            result.append(Mapping(int(start, 16), int(end, 16), rights, device, name, collections.Counter()))
         elif figure := FIGURE.match(line):
             result[-1].figures[figure[1]] = int(figure[2]) * 1024
     return result
@@ -65,7 +65,7 @@ def own_bytes(mapping):
 
 
 def private_bytes(pid):
-    return sum(own_bytes(mapping) for mapping in mappings(pid) if mapping.is_private)
+    return sum(own_bytes(mapping) for mapping in mappings(pid) if mapping.rights.endswith("p"))
 
 
 def charge(pid):
@@ -80,37 +80,31 @@ def charge(pid):
 
 def pagemap(pid, start, end):
     with open(f"/proc/{pid}/pagemap", "rb", buffering=0) as file:
-        entries = array.array("Q")
-        while len(entries) < (end - start) // PAGE:
-            file.seek((start // PAGE + len(entries)) * 8)
-            entries.frombytes(file.read(((end - start) // PAGE - len(entries)) * 8))
-        return entries
+        return array.array("Q", os.pread(file.fileno(), (end - start) // PAGE * 8, start // PAGE * 8))
 
 
 def zero_frames():
-    """The frames of the zero page and of the huge one, with what keeps the latter in place."""
-    size = 2 * figures("/proc/meminfo", "Hugepagesize")
-    area = mmap.mmap(-1, size, flags=mmap.MAP_PRIVATE | mmap.MAP_ANONYMOUS)
-    small = mmap.mmap(-1, 16 * PAGE, flags=mmap.MAP_PRIVATE | mmap.MAP_ANONYMOUS)
-    frames = set()
-    if size:
-        area.madvise(mmap.MADV_HUGEPAGE)
-    for memory in (area, small):
-        for offset in range(0, len(memory), PAGE):
-            memory[offset]
-        start = ctypes.addressof(ctypes.c_char.from_buffer(memory))
-        frames |= {entry & FRAME for entry in pagemap("self", start, start + len(memory)) if entry & PRESENT}
-    return frames, (area, small)
+    """The frames of the zero page and of the huge one, with the mappings that keep the latter in place."""
+    frames, areas = set(), []
+    for size in (2 * figures("/proc/meminfo", "Hugepagesize"), 16 * PAGE):
+        areas.append(mmap.mmap(-1, size or PAGE, flags=mmap.MAP_PRIVATE | mmap.MAP_ANONYMOUS))
+        if size > 16 * PAGE:
+            areas[-1].madvise(mmap.MADV_HUGEPAGE)
+        for offset in range(0, size, PAGE):
+            areas[-1][offset]
+        start = ctypes.addressof(ctypes.c_char.from_buffer(areas[-1]))
+        frames |= {entry & FRAME for entry in pagemap("self", start, start + size) if entry & PRESENT}
+    return frames, areas
 
 
-ZERO_FRAMES, ZERO_MAPPINGS = zero_frames()
+ZERO_FRAMES, ZERO_AREAS = zero_frames()
 
 
 def page_keys(pid, wanted=lambda mapping: True):
     """The frame or swap slot behind each page that a process's private mappings hold."""
     keys = []
     for mapping in mappings(pid):
-        if not mapping.is_private or mapping.name in ("[vvar]", "[vvar_vclock]", "[vsyscall]") or not wanted(mapping):
+        if mapping.rights.endswith("s") or mapping.name.startswith(("[vvar", "[vsyscall")) or not wanted(mapping):
             continue
         for entry in pagemap(pid, mapping.start, mapping.end):
             if not entry & (PRESENT | SWAPPED) or entry & (FILE | GUARD):
@@ -142,5 +136,4 @@ def page_sets(pids, wanted=lambda mapping: True):
 def user_memory():
     """Anonymous and shared memory, resident or swapped, of the whole machine."""
     read("/proc/sys/vm/stat_refresh")  # has the counts of all CPUs added up
-    found = {name: int(value) * 1024 for name, value in FIGURE.findall(read("/proc/meminfo"))}
-    return found["AnonPages"] + found["Shmem"] + found["SwapTotal"] - found["SwapFree"]
+    return figures("/proc/meminfo", "AnonPages", "Shmem", "SwapTotal") - figures("/proc/meminfo", "SwapFree")
