@@ -5,6 +5,7 @@ category the bytes of every exact set of processes, named with blanks between; "
 their standard input. The private memory with known answers is executable: that is a category of its own, in which an
 interpreter has nothing.
 """
+import contextlib
 import ctypes
 import json
 import mmap
@@ -83,6 +84,9 @@ def until_the_end():
         pass
     for action in at_end:
         action()
+    with contextlib.suppress(ChildProcessError):
+        while True:
+            os.wait()
     os._exit(0)
 
 

@@ -7,6 +7,7 @@
 #include <stdlib.h>
 #include <string.h>
 #include <sys/mman.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 enum { kMiB = 1 << 20 };
@@ -16,6 +17,8 @@ static int untilTheEnd(void *unused) {
     char byte;
     (void)unused;
     while (read(STDIN_FILENO, &byte, 1) > 0) {
+    }
+    while (wait(NULL) > 0) {
     }
     _exit(0);
 }
