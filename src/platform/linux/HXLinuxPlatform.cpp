@@ -4,7 +4,7 @@
 #include "platform/HXRegionTags.h"
 #include "platform/HXSafeText.h"
 #include "platform/linux/HXTemporaryFiles.h"
-#include "platform/linux/memory/HXTaskFiles.h"
+#include "platform/linux/procfs/HXTaskFiles.h"
 
 #include <fcntl.h>
 #include <malloc.h>

@@ -6,8 +6,8 @@
 #include "platform/linux/images/HXImageHeaders.h"
 #include "platform/linux/kernel/HXLinuxKernelMemory.h"
 #include "platform/linux/memory/HXFileSystems.h"
-#include "platform/linux/memory/HXLinuxTask.h"
 #include "platform/linux/memory/HXObjectIdentifiers.h"
+#include "platform/linux/pages/HXLinuxTask.h"
 #include "platform/linux/procfs/HXLinuxProcesses.h"
 
 #include <unistd.h>

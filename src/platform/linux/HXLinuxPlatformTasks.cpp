@@ -3,8 +3,8 @@
 
 #include "platform/HXSafeText.h"
 #include "platform/linux/images/HXImageLayout.h"
-#include "platform/linux/memory/HXTaskFiles.h"
 #include "platform/linux/procfs/HXProcFile.h"
+#include "platform/linux/procfs/HXTaskFiles.h"
 #include "platform/linux/sharing/HXSharing.h"
 
 #include <sys/resource.h>

@@ -1,7 +1,7 @@
 // The live host over a made-up /proc.
 #include "platform/linux/HXLinuxPlatform.h"
 
-#include "platform/linux/memory/HXPageScan.h"
+#include "platform/linux/pages/HXPageScan.h"
 #include "platform/linux/procfs/HXProcFile.h"
 #include "support/HXCaseFile.h"
 #include "support/HXHostCalls.h"

@@ -2,8 +2,8 @@
 #pragma once
 
 #include "platform/HXRegionTags.h"
-#include "platform/linux/memory/HXMapping.h"
 #include "platform/linux/memory/HXMappingClass.h"
+#include "platform/linux/procfs/HXMapping.h"
 
 #include <cstddef>
 #include <cstdint>

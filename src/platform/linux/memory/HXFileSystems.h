@@ -3,8 +3,8 @@
 #pragma once
 
 #include "platform/linux/memory/HXFileSystemKind.h"
-#include "platform/linux/memory/HXMapping.h"
 #include "platform/linux/procfs/HXDescriptor.h"
+#include "platform/linux/procfs/HXMapping.h"
 
 #include <atomic>
 #include <cstdint>

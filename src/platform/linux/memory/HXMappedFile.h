@@ -2,8 +2,8 @@
 // directory in /proc.
 #pragma once
 
-#include "platform/linux/memory/HXMapping.h"
 #include "platform/linux/procfs/HXDescriptor.h"
+#include "platform/linux/procfs/HXMapping.h"
 
 #include <optional>
 #include <string>

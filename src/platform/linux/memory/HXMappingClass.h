@@ -3,7 +3,7 @@
 
 #include "platform/HXHostRecords.h"
 #include "platform/linux/memory/HXFileSystemKind.h"
-#include "platform/linux/memory/HXMapping.h"
+#include "platform/linux/procfs/HXMapping.h"
 
 #include <cstdint>
 #include <string_view>

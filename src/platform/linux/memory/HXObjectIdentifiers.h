@@ -14,7 +14,7 @@
 // which happens to the second kind alone; so its lower bits decide.
 #pragma once
 
-#include "platform/linux/memory/HXMapping.h"
+#include "platform/linux/procfs/HXMapping.h"
 
 #include <cstdint>
 #include <deque>

@@ -1,8 +1,8 @@
 #include "platform/linux/procfs/HXLinuxProcesses.h"
 
 #include "platform/HXSafeText.h"
-#include "platform/linux/memory/HXTaskFiles.h"
 #include "platform/linux/procfs/HXProcFile.h"
+#include "platform/linux/procfs/HXTaskFiles.h"
 #include "platform/linux/procfs/HXTextNumber.h"
 
 #include <fcntl.h>

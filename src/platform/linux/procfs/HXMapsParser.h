@@ -1,7 +1,7 @@
 // Parser of /proc/PID/maps and /proc/PID/smaps, given in pieces as they are read. It touches no system.
 #pragma once
 
-#include "platform/linux/memory/HXMapping.h"
+#include "platform/linux/procfs/HXMapping.h"
 
 #include <cstdint>
 #include <string_view>

@@ -1,6 +1,6 @@
 #include "platform/linux/sharing/HXFamilyColumns.h"
 
-#include "platform/linux/memory/HXPageScan.h"
+#include "platform/linux/pages/HXPageScan.h"
 
 #include <algorithm>
 #include <bit>

@@ -1,8 +1,8 @@
 // What the members of a family are told of the pages that they share.
 #pragma once
 
-#include "platform/linux/memory/HXLinuxTask.h"
 #include "platform/linux/memory/HXObjectIdentifiers.h"
+#include "platform/linux/pages/HXLinuxTask.h"
 #include "platform/linux/sharing/HXFamily.h"
 
 #include <cstdint>

@@ -3,9 +3,9 @@
 #pragma once
 
 #include "platform/HXServices.h"
-#include "platform/linux/memory/HXAddressSpaceReader.h"
-#include "platform/linux/memory/HXLinuxTask.h"
 #include "platform/linux/memory/HXObjectIdentifiers.h"
+#include "platform/linux/pages/HXAddressSpaceReader.h"
+#include "platform/linux/pages/HXLinuxTask.h"
 #include "platform/linux/sharing/HXFamily.h"
 
 #include <cstdint>

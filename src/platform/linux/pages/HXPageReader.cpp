@@ -1,9 +1,9 @@
-#include "platform/linux/memory/HXPageReader.h"
+#include "platform/linux/pages/HXPageReader.h"
 
 #include "platform/HXPlatform.h"
 #include "platform/linux/memory/HXMappedFile.h"
-#include "platform/linux/memory/HXTaskFiles.h"
 #include "platform/linux/procfs/HXProcFile.h"
+#include "platform/linux/procfs/HXTaskFiles.h"
 
 #include <algorithm>
 #include <array>

@@ -1,11 +1,11 @@
-#include "platform/linux/memory/HXAddressSpaceReader.h"
+#include "platform/linux/pages/HXAddressSpaceReader.h"
 
 #include "platform/linux/memory/HXMappedFile.h"
-#include "platform/linux/memory/HXPageScan.h"
-#include "platform/linux/memory/HXScanFigures.h"
-#include "platform/linux/memory/HXTaskFiles.h"
+#include "platform/linux/pages/HXPageScan.h"
+#include "platform/linux/pages/HXScanFigures.h"
 #include "platform/linux/procfs/HXMapsParser.h"
 #include "platform/linux/procfs/HXProcFile.h"
+#include "platform/linux/procfs/HXTaskFiles.h"
 #include "platform/linux/procfs/HXTextNumber.h"
 
 #include <algorithm>

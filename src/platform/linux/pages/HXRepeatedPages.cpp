@@ -1,4 +1,4 @@
-#include "platform/linux/memory/HXRepeatedPages.h"
+#include "platform/linux/pages/HXRepeatedPages.h"
 
 #include <algorithm>
 #include <map>

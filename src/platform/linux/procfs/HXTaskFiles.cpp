@@ -1,4 +1,4 @@
-#include "platform/linux/memory/HXTaskFiles.h"
+#include "platform/linux/procfs/HXTaskFiles.h"
 
 #include "platform/linux/procfs/HXProcFile.h"
 

@@ -1,5 +1,5 @@
 #include "platform/HXRegionTags.h"
-#include "platform/linux/memory/HXAddressSpaceReader.h"
+#include "platform/linux/pages/HXAddressSpaceReader.h"
 #include "platform/linux/procfs/HXProcFile.h"
 #include "platform/linux/procfs/HXProcText.h"
 

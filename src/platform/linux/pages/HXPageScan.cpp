@@ -1,4 +1,4 @@
-#include "platform/linux/memory/HXPageScan.h"
+#include "platform/linux/pages/HXPageScan.h"
 
 #include "platform/linux/procfs/HXProcFile.h"
 

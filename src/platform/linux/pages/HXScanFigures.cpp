@@ -1,7 +1,7 @@
-#include "platform/linux/memory/HXScanFigures.h"
+#include "platform/linux/pages/HXScanFigures.h"
 
 #include "platform/linux/memory/HXMappingClass.h"
-#include "platform/linux/memory/HXPageScan.h"
+#include "platform/linux/pages/HXPageScan.h"
 #include "platform/linux/procfs/HXProcFile.h"
 
 #include <algorithm>

@@ -1,4 +1,4 @@
-#include "platform/linux/memory/HXSharedSwap.h"
+#include "platform/linux/pages/HXSharedSwap.h"
 
 #include <sys/syscall.h>
 #include <unistd.h>

@@ -2,7 +2,7 @@
 #pragma once
 
 #include "platform/linux/memory/HXAddressSpace.h"
-#include "platform/linux/memory/HXPageReader.h"
+#include "platform/linux/pages/HXPageReader.h"
 
 #include <cstdint>
 

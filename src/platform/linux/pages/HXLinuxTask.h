@@ -1,9 +1,9 @@
 // One process that has been opened for examination.
 #pragma once
 
-#include "platform/linux/memory/HXAddressSpaceReader.h"
-#include "platform/linux/memory/HXPageReader.h"
-#include "platform/linux/memory/HXWalkDifference.h"
+#include "platform/linux/pages/HXAddressSpaceReader.h"
+#include "platform/linux/pages/HXPageReader.h"
+#include "platform/linux/pages/HXWalkDifference.h"
 #include "platform/linux/procfs/HXDescriptor.h"
 #include "platform/linux/procfs/HXLinuxProcesses.h"
 #include "platform/linux/procfs/HXProcText.h"

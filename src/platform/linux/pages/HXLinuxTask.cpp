@@ -1,7 +1,7 @@
-#include "platform/linux/memory/HXLinuxTask.h"
+#include "platform/linux/pages/HXLinuxTask.h"
 
-#include "platform/linux/memory/HXRepeatedPages.h"
-#include "platform/linux/memory/HXTaskFiles.h"
+#include "platform/linux/pages/HXRepeatedPages.h"
+#include "platform/linux/procfs/HXTaskFiles.h"
 
 #include <algorithm>
 #include <cerrno>

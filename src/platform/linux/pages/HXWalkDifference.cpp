@@ -1,4 +1,4 @@
-#include "platform/linux/memory/HXWalkDifference.h"
+#include "platform/linux/pages/HXWalkDifference.h"
 
 #include <algorithm>
 

@@ -3,8 +3,8 @@
 #pragma once
 
 #include "platform/linux/memory/HXAddressSpace.h"
-#include "platform/linux/memory/HXPageScan.h"
-#include "platform/linux/memory/HXSharedSwap.h"
+#include "platform/linux/pages/HXPageScan.h"
+#include "platform/linux/pages/HXSharedSwap.h"
 #include "platform/linux/procfs/HXDescriptor.h"
 
 #include <cstddef>
