@@ -14,6 +14,7 @@ enum Record : size_t {
     imageRecord,
     segmentRecord,
     ownedRecord,
+    heldRecord,
     faultRecord,
     processRecord,
     zoneRecord,
@@ -55,6 +56,9 @@ enum Field : size_t { pid, path, base };
 }
 namespace Segment {
 enum Field : size_t { pid, name, start, size };
+}
+namespace Held {
+enum Field : size_t { pid, name, detail };
 }
 namespace Fault {
 enum Field : size_t { pid, call, from, error, becomes };

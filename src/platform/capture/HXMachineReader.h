@@ -24,6 +24,7 @@ class HXMachineReader {
     bool readImage();
     bool readSegment();
     bool readOwned();
+    bool readHeld();
     bool readFault();
     bool readZone();
     bool readSite();
