@@ -6,6 +6,7 @@
 #include "platform/linux/images/HXImageHeaders.h"
 #include "platform/linux/kernel/HXLinuxKernelMemory.h"
 #include "platform/linux/memory/HXFileSystems.h"
+#include "platform/linux/memory/HXHeldObjects.h"
 #include "platform/linux/memory/HXLinuxTask.h"
 #include "platform/linux/memory/HXObjectIdentifiers.h"
 #include "platform/linux/procfs/HXLinuxProcesses.h"
@@ -50,6 +51,8 @@ class HXLinuxPlatform final : public HXPlatform {
         return KERN_INVALID_ARGUMENT; // nothing is purgeable here
     }
     std::optional<HXWalkShortfall> walkShortfall(mach_port_t task) override;
+    std::vector<task_held_object> task_held_objects(mach_port_t task, HeldBy by) override;
+    std::vector<task_held_object> host_held_objects(mach_port_t) override { return _held.ofKernel(); }
     uint32_t vm_kernel_page_size() override { return _pageSize; }
     bool hasSharedRegion() override { return false; }
 
@@ -131,6 +134,7 @@ class HXLinuxPlatform final : public HXPlatform {
     HXLinuxKernelMemory _kernelMemory;
     HXDescriptorTurns _turns;
     HXObjectIdentifiers _identifiers;
+    HXHeldObjects _held;
     HXTaskTable _tasks;
     std::atomic<uint32_t> _reportsCharge = 0; // "vm.self_region_heft"
     HXLinuxServices _services;

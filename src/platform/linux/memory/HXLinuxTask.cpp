@@ -37,6 +37,11 @@ HXDescriptor HXLinuxTask::reopen() {
     return {};
 }
 
+const HXDescriptor &HXLinuxTask::openDirectory() {
+    if (!_directory) _directory = reopen();
+    return _directory;
+}
+
 bool HXLinuxTask::withDescriptors(const std::function<void()> &read) {
     const bool suffice = _turns.run(read);
     if (!suffice && _addressSpace) _addressSpace->endError = KERN_RESOURCE_SHORTAGE;
@@ -57,7 +62,7 @@ const HXAddressSpace &HXLinuxTask::addressSpace(const HXReaderSetting &setting, 
 }
 
 void HXLinuxTask::read(const HXReaderSetting &setting, bool needsDirtyPages) {
-    if (!_directory) _directory = reopen();
+    openDirectory();
     readOnce(setting, needsDirtyPages);
     compare(setting, true);
     if (!_difference) return;

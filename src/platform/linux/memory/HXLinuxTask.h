@@ -42,6 +42,8 @@ class HXLinuxTask {
     int32_t pid() const { return _pid; }
     uint32_t number() const { return _number; }
     const HXDescriptor &directory() const { return _directory; }
+    // The same, opened where it is not; not open when the process is gone.
+    const HXDescriptor &openDirectory();
 
     // Runs `read` by turns; if descriptors do not suffice, the address space, once read, ends with that
     // error. Whether they do.

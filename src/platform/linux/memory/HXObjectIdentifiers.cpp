@@ -81,9 +81,17 @@ uint64_t HXObjectIdentifiers::of(const HXMapping &mapping, const HXMappingOwner 
             return uint64_t{owner.processNumber} << (kPageBits + 1) | page << 1 | 1;
         return interned({Kind::mapping, 0, static_cast<uint32_t>(owner.pid), mapping.start});
     }
+    return ofObject(mapping, owner.ipcNamespace);
+}
+
+uint64_t HXObjectIdentifiers::ofObject(const HXMapping &mapping, uint64_t ipcNamespace) {
     // System V memory's inode number is its identifier, which says nothing outside its namespace and which
     // other shared memory may have, too.
     if (mapping.kind == HXPathKind::systemV)
-        return interned({Kind::systemV, mapping.device, owner.ipcNamespace, mapping.inode});
+        return interned({Kind::systemV, mapping.device, ipcNamespace, mapping.inode});
     return interned({Kind::file, mapping.device, 0, mapping.inode});
+}
+
+uint64_t HXObjectIdentifiers::ofFileSystem(uint32_t device) {
+    return interned({Kind::fileSystem, device, 0, 0});
 }

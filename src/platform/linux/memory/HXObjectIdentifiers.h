@@ -54,9 +54,14 @@ class HXObjectIdentifiers {
     // The identifier of what a classified mapping maps. The same in every run for what is the same on the
     // machine, unless something else has taken its number first.
     uint64_t of(const HXMapping &mapping, const HXMappingOwner &owner);
+    // That of the file or shared object, whatever pages of its own the mapping holds: by its kind, device and
+    // inode.
+    uint64_t ofObject(const HXMapping &mapping, uint64_t ipcNamespace);
+    // That of all files on a device.
+    uint64_t ofFileSystem(uint32_t device);
 
   private:
-    enum class Kind : uint32_t { file = 1, mapping, systemV, vdso };
+    enum class Kind : uint32_t { file = 1, mapping, systemV, vdso, fileSystem };
     struct Key {
         Kind kind;
         uint32_t device;
