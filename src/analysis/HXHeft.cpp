@@ -76,6 +76,8 @@ void HXHeft::gatherData() {
         _addProcess(*process);
     _maps.reset();
     finalizeObjects();
+    // Without all regions what nobody maps is not known.
+    if (!*_isCancelled) _addHeldObjects();
     _buildProcessToHeftMap();
 }
 
@@ -113,16 +115,19 @@ HXMemoryObject &HXHeft::objectForRegion(const HXMemoryRegion &region, const HXPr
 
 void HXHeft::_addProcess(HXProcess &process) {
     const bool breakDown = breakDownPhysHeft();
-    const bool sharingDisabled = isSharingAnalysisDisabled();
     for (HXMemoryRegion &region : process.memoryRegions()) {
         HXMemoryObject &object = objectForRegion(region, process);
-        if (sharingDisabled)
-            object.addRegion(region, process.pageSize());
-        else
-            object.addRegion(region, process);
+        merge(region, process, object);
         if (breakDown && region.ownedExclusivelyByParentProcess()) object.setOwnerPid(process.pid());
-        region.setMemoryObject(&object);
     }
+}
+
+void HXHeft::merge(HXMemoryRegion &region, const HXProcess &process, HXMemoryObject &object) {
+    if (isSharingAnalysisDisabled())
+        object.addRegion(region, process.pageSize());
+    else
+        object.addRegion(region, process);
+    region.setMemoryObject(&object);
 }
 
 // Every object lives in exactly one of the maps or shares with nothing; together they are all objects.

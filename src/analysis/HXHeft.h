@@ -48,6 +48,9 @@ class HXHeft : public HXHeftSwitches {
     // ---- Steps of the above ----
     void _addProcess(HXProcess &process);
     void finalizeObjects();
+    // Adds what the targets hold of finalised objects without mapping it, as regions without an address in
+    // objects of their own.
+    void _addHeldObjects();
     void _buildProcessToHeftMap();
     uint64_t _calculateHeftForProcess(const HXProcess &process) const;
     // The shown processes, in target order.
@@ -86,6 +89,7 @@ class HXHeft : public HXHeftSwitches {
     void reserveMaps();
     ObjectMap &mapForRegion(const HXMemoryRegion &region, const HXProcess &process);
     HXMemoryObject &objectForRegion(const HXMemoryRegion &region, const HXProcess &process);
+    void merge(HXMemoryRegion &region, const HXProcess &process, HXMemoryObject &object);
     void reportProcess(const HXProcess &process, Report &report, const HXHeftSharingData &sharing,
                        bool summarize);
     void reportGroups(const HXProcess &process, const HXHeftSharingData::Groups &groups,

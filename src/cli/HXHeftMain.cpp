@@ -81,6 +81,8 @@ int HXHeftMain(int argc, char *const argv[]) {
         fputs("Must run as root.\n", stderr);
         return 1;
     }
+    HXHeft::setExaminesWholeMachine(args->targetAll() && !args->skipIdleExitClean() &&
+                                    args->excludedPidsOrProcesses().empty());
     auto targets = args->targetProcessesAndError(&error);
     if (!targets) {
         fprintf(stderr, "%s\n", error.localizedDescription.value_or("").c_str());

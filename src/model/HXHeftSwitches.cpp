@@ -10,6 +10,7 @@ namespace {
 
 constexpr char kSetting[] = "vm.self_region_heft";
 std::atomic<bool> isDisabled{false};
+std::atomic<bool> isWholeMachine{false};
 
 } // namespace
 
@@ -41,4 +42,12 @@ bool HXHeftSwitches::isSharingAnalysisDisabled() {
 
 void HXHeftSwitches::setSharingAnalysisDisabled(bool disabled) {
     isDisabled = disabled;
+}
+
+bool HXHeftSwitches::examinesWholeMachine() {
+    return isWholeMachine;
+}
+
+void HXHeftSwitches::setExaminesWholeMachine(bool whole) {
+    isWholeMachine = whole;
 }

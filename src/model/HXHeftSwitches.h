@@ -12,4 +12,8 @@ class HXHeftSwitches {
     // Whether regions are merged without recording which process contributed them: no per-process views then.
     static bool isSharingAnalysisDisabled();
     static void setSharingAnalysisDisabled(bool disabled);
+
+    // Whether all processes of the machine are examined, so that what none of them holds nobody does.
+    static bool examinesWholeMachine();
+    static void setExaminesWholeMachine(bool whole);
 };

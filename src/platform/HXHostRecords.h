@@ -228,6 +228,25 @@ struct vm_region_share {
     uint64_t pages_swapped_out_counted;
 };
 
+// Shared memory that a task or the kernel holds, mapped or not (`task_held_objects`, `host_held_objects`).
+struct task_held_object {
+    uint64_t object_id = 0; // the full object id of regions that map it
+    uint64_t container_id =
+        0; // of the kernel's held object that it is a part of, as of a file system; 0: none
+    // Bytes of all of it, whoever maps how much. Both 0 where only its container is known.
+    uint64_t resident_size = 0;
+    uint64_t swapped_size = 0;
+    uint64_t flags = 0; // TASK_HELD_…
+    // What is called so is what of it no region shows. Empty: that is its container's.
+    std::string name;
+    std::string detail; // more of the name; may be empty
+};
+// Known by an open descriptor alone.
+inline constexpr uint64_t TASK_HELD_OPEN = 0x1;
+// The container of all that the machine has of the kind: what is left of it means something only to those who
+// know all holders.
+inline constexpr uint64_t TASK_HELD_WHOLE = 0x2;
+
 // `mach_memory_info`.
 struct mach_zone_name {
     char mzn_name[80]; // need not end in a zero

@@ -112,6 +112,14 @@ class HXPlatform {
     // several mappings of a task show is told once.
     virtual std::vector<vm_region_share> mach_vm_region_shares(mach_port_t, uint64_t) { return {}; }
 
+    // The shared memory that a task holds, each object once: what it maps, or what it has descriptors of.
+    enum class HeldBy { mapping, descriptor };
+    virtual std::vector<task_held_object> task_held_objects(mach_port_t, HeldBy) { return {}; }
+
+    // What the kernel holds itself: shared memory with a name, and what nobody has attached, as far as it is
+    // in reach of the tasks that were asked before. No task holds any of these objects.
+    virtual std::vector<task_held_object> host_held_objects(mach_port_t) { return {}; }
+
     // Bytes in a page of the machine, a power of two.
     virtual uint32_t vm_kernel_page_size() = 0;
 

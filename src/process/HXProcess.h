@@ -63,6 +63,10 @@ class HXProcess : public HXRegionOwner {
     HXMemoryRegionList &memoryRegions() { return _memoryRegions; }
     void setMemoryRegions(HXMemoryRegionList regions) { _memoryRegions = std::move(regions); }
 
+    // The shared memory that it holds; empty until gathered. Where the whole machine is examined, without
+    // what it has descriptors of alone.
+    const std::vector<task_held_object> &heldObjects() const { return _heldObjects; }
+
     // A copy, as of now.
     std::vector<std::string> errors() const { return _errors; }
     // The list itself, which may still grow.
@@ -94,6 +98,7 @@ class HXProcess : public HXRegionOwner {
     virtual bool _populateTask(HXProcessSnapshot *) { return false; }
 
     HXMemoryRegionList _memoryRegions;
+    std::vector<task_held_object> _heldObjects;
     std::string _name;
     std::vector<std::string> _errors;
     std::vector<std::string> _warnings;

@@ -57,6 +57,7 @@ class HXUserProcess : public HXProcess {
     void _gatherIdleExitStatus();
     std::optional<HXOwnedVmObjects> _gatherOwnedVmObjects();
     void _gatherMemoryData();
+    void _gatherHeldObjects();
 
     // Cuts a region into runs of pages of one kind.
     void _addSubrangesForRegion(HXMemoryRegion &region, int32_t purgeState);

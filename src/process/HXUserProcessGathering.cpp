@@ -64,8 +64,19 @@ void HXUserProcess::gatherData() {
         if (_isAlive()) _ownedVmObjects = _gatherOwnedVmObjects();
     }
     _gatherMemoryData();
+    if (!hiddenFromDisplay() && _isAlive()) _gatherHeldObjects();
     _images = {};
     _task.close();
+}
+
+// Descriptors are many: where the whole machine is examined they are asked for only if the rest leaves much
+// open (HXHeft).
+void HXUserProcess::_gatherHeldObjects() {
+    HXPlatform &platform = HXPlatform::current();
+    _heldObjects = platform.task_held_objects(_task.get(), HXPlatform::HeldBy::mapping);
+    if (HXHeftSwitches::examinesWholeMachine()) return;
+    const auto open = platform.task_held_objects(_task.get(), HXPlatform::HeldBy::descriptor);
+    _heldObjects.insert(_heldObjects.end(), open.begin(), open.end());
 }
 
 std::optional<HXOwnedVmObjects> HXUserProcess::_gatherOwnedVmObjects() {

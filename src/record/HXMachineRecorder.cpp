@@ -44,6 +44,7 @@ bool HXMachineRecorder::record(const std::vector<int32_t> &pids) {
     };
     auto process = newRecorder();
     std::set<uint32_t> tags;
+    bool hasKernel = false;
     std::vector<int32_t> chosen = pids.empty() ? _listed.value_or(std::vector<int32_t>()) : pids;
     std::erase(chosen, _host.getpid());
     HXProcessSnapshot tasks(_host);
@@ -73,9 +74,11 @@ bool HXMachineRecorder::record(const std::vector<int32_t> &pids) {
         }
         if (!write(process->head()) || !write(process->body())) return false;
         tags.insert(process->tags().begin(), process->tags().end());
+        hasKernel |= pid == 0;
         _processCount++;
     }
     _writer.clear();
+    if (hasKernel) recordHeldByKernel(pids.empty());
     recordTags(tags);
     return write(_writer.written()) && std::fflush(_out) == 0;
 }
@@ -181,6 +184,22 @@ void HXMachineRecorder::recordSymbols(const std::set<uint64_t> &addresses) {
             _writer.number(Symbol::line, static_cast<uint32_t>(source.lineNumber));
         }
         _writer.end();
+    }
+}
+
+// After all processes, whose places it is found in. What is left of the whole means nothing where processes
+// are left out.
+void HXMachineRecorder::recordHeldByKernel(bool isWholeMachine) {
+    const auto held = std::make_shared<std::vector<task_held_object>>();
+    if (!HXIsAnswered(_host.services(),
+                      [held, &host = _host] { *held = host.host_held_objects(host.mach_host_self()); }))
+        return;
+    for (task_held_object &object : *held) {
+        if (object.flags & TASK_HELD_WHOLE && !isWholeMachine) continue;
+        const size_t path = object.name.find('/');
+        if (_anonymize && path != std::string::npos)
+            object.name = object.name.substr(0, path) + _anonymizer.path(object.name.substr(path));
+        HXRecordHeld(object, 0, &_writer);
     }
 }
 

@@ -32,6 +32,7 @@ class HXMachineRecorder {
     void recordHost(const std::optional<int32_t> &selfRegionHeft);
     void recordKernel();
     void recordSymbols(const std::set<uint64_t> &addresses);
+    void recordHeldByKernel(bool isWholeMachine);
     void recordTags(const std::set<uint32_t> &tags);
     std::optional<std::vector<int32_t>> listedPids();
     std::set<int32_t> examineTogether(std::vector<int32_t> pids, HXRegionHeftSetting &setting,

@@ -47,6 +47,14 @@ class RunsText {
 
 } // namespace
 
+void HXRecordHeld(const task_held_object &object, int32_t pid, HXCaptureWriter *writer) {
+    writer->begin(heldRecord, pid);
+    writer->numbers(&object);
+    writer->text(Held::name, object.name);
+    writer->text(Held::detail, object.detail);
+    writer->end();
+}
+
 HXProcessRecorder::HXProcessRecorder(HXPlatform &host, const HXMachineHost &facts,
                                      HXRegionHeftSetting &setting, HXAnonymizer *anonymizer)
     : _host(host), _facts(facts), _task(host), _setting(setting), _hasSetting(setting.found()),
@@ -158,7 +166,11 @@ bool HXProcessRecorder::recordMemory(int32_t pid) {
     recordOwned(pid);
     recordImages(pid);
     if (_facts.sharedRegion) recordTops(pid);
-    return recordRegions(pid);
+    if (!recordRegions(pid)) return false;
+    for (const auto by : {HXPlatform::HeldBy::mapping, HXPlatform::HeldBy::descriptor})
+        for (const task_held_object &object : _host.task_held_objects(_task.get(), by))
+            HXRecordHeld(object, pid, &_body);
+    return true;
 }
 
 bool HXProcessRecorder::recordRegions(int32_t pid) {

@@ -13,6 +13,9 @@
 #include <string>
 #include <vector>
 
+// A record of what the process of that pid, 0 for the kernel, holds.
+void HXRecordHeld(const task_held_object &object, int32_t pid, HXCaptureWriter *writer);
+
 class HXProcessRecorder {
   public:
     // `facts` are those of the host. `anonymizer` may be null: names are then kept. Neither it nor `setting`

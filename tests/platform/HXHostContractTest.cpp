@@ -9,6 +9,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
@@ -55,7 +56,9 @@ class HXHostContract : public testing::TestWithParam<const char *> {
                 "host  self_region_heft=0  ledger=page_table  page_size=" + std::to_string(kPage) +
                 "\nprocess  args_path=/heft-tests  pid=" + std::to_string(self) + "\n" +
                 region(self, kPlace, 4 * kPage, "pages=2*9") +
-                region(self, kPlace + 4 * kPage, kPage, "pager=1  pages=1*0x81  path=" + path) + "process" +
+                region(self, kPlace + 4 * kPage, kPage, "pager=1  pages=1*0x81  path=" + path) +
+                "held  name=memfd (unmapped)  object_id=2  resident=0x3000  flags=1  pid=" +
+                std::to_string(self) + "\nheld  object_id=3  pid=" + std::to_string(self) + "\nprocess" +
                 other + "fault  call=mach_vm_region_recurse  error=0x10000003  becomes=gone" + other);
         task = HXTaskOf(*host, self);
     }
@@ -163,6 +166,23 @@ TEST_P(HXHostContract, PathsAreCutToWholeCharacters) {
         EXPECT_TRUE(path.starts_with(cut) && HXSafeText(cut) == cut) << cut;
     }
     EXPECT_EQ(host->proc_regionfilename(self, kPlace, buffer, sizeof buffer), 0) << "of no file";
+}
+
+TEST_P(HXHostContract, WhatDescriptorsHold) {
+    const int file = ::memfd_create("three pages", MFD_CLOEXEC);
+    ASSERT_EQ(::write(file, std::string(3 * kPage, 'x').data(), 3 * kPage), ssize_t{3 * kPage});
+    const auto open = host->task_held_objects(task, HXPlatform::HeldBy::descriptor);
+    EXPECT_EQ(std::count_if(open.begin(), open.end(),
+                            [](const task_held_object &object) {
+                                return object.name == "memfd (unmapped)" && object.resident_size == 3 * kPage;
+                            }),
+              1);
+    for (const task_held_object &object : open)
+        EXPECT_EQ(object.flags, TASK_HELD_OPEN);
+    for (const task_held_object &object : host->task_held_objects(task, HXPlatform::HeldBy::mapping))
+        EXPECT_EQ(object.flags, 0U);
+    EXPECT_TRUE(host->task_held_objects(kNoPort, HXPlatform::HeldBy::mapping).empty());
+    ::close(file);
 }
 
 INSTANTIATE_TEST_SUITE_P(Hosts, HXHostContract, testing::Values("Live", "Replayed"),

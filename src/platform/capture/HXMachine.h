@@ -121,6 +121,7 @@ struct HXMachineProcess {
     std::vector<HXMachineImage> images;
     std::vector<HXMachineSegment> segments;
     std::vector<owned_vmobject> owned;
+    std::vector<task_held_object> held;
     std::unique_ptr<HXMachineFaults> faults;
 };
 

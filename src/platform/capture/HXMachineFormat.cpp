@@ -74,6 +74,17 @@ constexpr F ownedFields[] = {
     F::defaulted("compressed", OWNED(compressed_size)),
     F::defaulted("flags", OWNED(flags)).inHexadecimal(),
 };
+#define HELD(member) HX_MEMBER(task_held_object, member)
+constexpr F heldFields[] = {
+    F::required("pid", K::signed32),
+    F::defaulted("name", K::text),
+    F::defaulted("detail", K::text),
+    F::required("object_id", HELD(object_id)).inHexadecimal(),
+    F::defaulted("container_id", HELD(container_id)).inHexadecimal(),
+    F::defaulted("resident", HELD(resident_size)),
+    F::defaulted("swapped", HELD(swapped_size)),
+    F::defaulted("flags", HELD(flags)).inHexadecimal(),
+};
 constexpr F faultFields[] = {
     F::required("pid", K::signed32),        F::required("call", K::text),
     F::defaulted("from", K::unsigned32, 1), F::required("error", K::signed32),
@@ -120,10 +131,10 @@ constexpr F hostFields[] = {
 };
 
 constexpr HXRecordForm records[] = {
-    {"region", regionFields},   {"top", topFields},         {"pages", pagesFields}, {"share", shareFields},
-    {"image", imageFields},     {"segment", segmentFields}, {"owned", ownedFields}, {"fault", faultFields},
-    {"process", processFields}, {"zone", zoneFields},       {"site", siteFields},   {"kext", kextFields},
-    {"symbol", symbolFields},   {"tag", tagFields},         {"host", hostFields},
+    {"region", regionFields}, {"top", topFields},         {"pages", pagesFields}, {"share", shareFields},
+    {"image", imageFields},   {"segment", segmentFields}, {"owned", ownedFields}, {"held", heldFields},
+    {"fault", faultFields},   {"process", processFields}, {"zone", zoneFields},   {"site", siteFields},
+    {"kext", kextFields},     {"symbol", symbolFields},   {"tag", tagFields},     {"host", hostFields},
 };
 
 static_assert(std::size(regionFields) <= kMaxCaptureFields);

@@ -15,6 +15,7 @@ enum Record : size_t {
     imageRecord,
     segmentRecord,
     ownedRecord,
+    heldRecord,
     faultRecord,
     processRecord,
     zoneRecord,
@@ -56,6 +57,9 @@ enum Field : size_t { pid, path, base };
 }
 namespace Segment {
 enum Field : size_t { pid, name, start, size };
+}
+namespace Held {
+enum Field : size_t { pid, name, detail };
 }
 namespace Fault {
 enum Field : size_t { pid, call, from, error, becomes };

@@ -18,11 +18,12 @@ constexpr size_t kNameBytes = sizeof proc_bsdinfo::pbi_name;
 } // namespace
 
 const HXMachineReader::Handler HXMachineReader::handlers[] = {
-    &HXMachineReader::readRegion, &HXMachineReader::readTop,   &HXMachineReader::readPages,
-    &HXMachineReader::readShare,  &HXMachineReader::readImage, &HXMachineReader::readSegment,
-    &HXMachineReader::readOwned,  &HXMachineReader::readFault, &HXMachineReader::readProcess,
-    &HXMachineReader::readZone,   &HXMachineReader::readSite,  &HXMachineReader::readKext,
-    &HXMachineReader::readSymbol, &HXMachineReader::readTag,   &HXMachineReader::readHost,
+    &HXMachineReader::readRegion,  &HXMachineReader::readTop,    &HXMachineReader::readPages,
+    &HXMachineReader::readShare,   &HXMachineReader::readImage,  &HXMachineReader::readSegment,
+    &HXMachineReader::readOwned,   &HXMachineReader::readHeld,   &HXMachineReader::readFault,
+    &HXMachineReader::readProcess, &HXMachineReader::readZone,   &HXMachineReader::readSite,
+    &HXMachineReader::readKext,    &HXMachineReader::readSymbol, &HXMachineReader::readTag,
+    &HXMachineReader::readHost,
 };
 
 static std::unique_ptr<HXMachine> machineOf(HXCaptureReader &&reader, std::string *reason) {
@@ -242,6 +243,14 @@ bool HXMachineReader::readSegment() {
 bool HXMachineReader::readOwned() {
     if (_process->ownedNone) return _reader.fail("an owned object of a process with owned_none=1");
     _reader.fill(&_process->owned.emplace_back());
+    return true;
+}
+
+bool HXMachineReader::readHeld() {
+    task_held_object &object = _process->held.emplace_back();
+    _reader.fill(&object);
+    object.name = safeText(Held::name);
+    object.detail = safeText(Held::detail);
     return true;
 }
 

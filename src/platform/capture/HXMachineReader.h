@@ -25,6 +25,7 @@ class HXMachineReader {
     bool readSegment();
     bool readOwned();
     bool readShare();
+    bool readHeld();
     bool readFault();
     bool readZone();
     bool readSite();

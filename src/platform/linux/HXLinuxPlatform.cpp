@@ -60,7 +60,8 @@ HXLinuxPlatform::HXLinuxPlatform(const Setting &setting)
                                                  static_cast<uint32_t>(std::countr_zero(_pageSize)),
                                                  setting.mayScanPageTables},
       _imageHeaders(_fileSystems), _processes(setting.procPath),
-      _kernelMemory(setting.procPath, setting.sysPath, _pageSize) {}
+      _kernelMemory(setting.procPath, setting.sysPath, _pageSize),
+      _held(setting.procPath, _fileSystems, _machine, _identifiers) {}
 
 void HXLinuxPlatform::prepareProcess(const char *program) {
     programName = program;

@@ -9,6 +9,7 @@
 #include "platform/linux/memory/HXObjectIdentifiers.h"
 #include "platform/linux/pages/HXLinuxTask.h"
 #include "platform/linux/procfs/HXLinuxProcesses.h"
+#include "platform/linux/sharing/HXHeldObjects.h"
 
 #include <unistd.h>
 
@@ -53,6 +54,8 @@ class HXLinuxPlatform final : public HXPlatform {
     std::optional<uint64_t> sharedSizeNotTold() override { return _sharedSizeNotTold; }
     std::vector<vm_region_share> mach_vm_region_shares(mach_port_t task, uint64_t address) override;
     std::optional<HXWalkShortfall> walkShortfall(mach_port_t task) override;
+    std::vector<task_held_object> task_held_objects(mach_port_t task, HeldBy by) override;
+    std::vector<task_held_object> host_held_objects(mach_port_t) override { return _held.ofKernel(); }
     uint32_t vm_kernel_page_size() override { return _pageSize; }
     bool hasSharedRegion() override { return false; }
 
@@ -135,6 +138,7 @@ class HXLinuxPlatform final : public HXPlatform {
     HXLinuxKernelMemory _kernelMemory;
     HXDescriptorTurns _turns;
     HXObjectIdentifiers _identifiers;
+    HXHeldObjects _held;
     HXTaskTable _tasks;
     std::optional<uint64_t> _sharedSizeNotTold; // of the last `examineTogether`
     std::atomic<uint32_t> _reportsCharge = 0;   // "vm.self_region_heft"

@@ -163,6 +163,17 @@ std::optional<HXWalkShortfall> HXLinuxPlatform::walkShortfall(mach_port_t port) 
     return HXWalkShortfall{difference->regionsSize, difference->countersSize};
 }
 
+std::vector<task_held_object> HXLinuxPlatform::task_held_objects(mach_port_t port, HeldBy by) {
+    std::vector<task_held_object> held;
+    HXLinuxTask *task = _tasks.find(port);
+    if (task == nullptr) return held;
+    const HXAddressSpace *mapped = by == HeldBy::mapping ? &addressSpaceOf(task) : nullptr;
+    task->withDescriptors([&] {
+        held = mapped ? _held.mapped(task->directory(), *mapped) : _held.open(task->openDirectory());
+    });
+    return held;
+}
+
 int32_t HXLinuxPlatform::proc_regionfilename(int32_t pid, uint64_t address, char *buffer,
                                              uint32_t bufferBytes) {
     HXLinuxTask *task = _tasks.findByPid(pid);

@@ -7,6 +7,7 @@
 
 #include <algorithm>
 #include <cstring>
+#include <iterator>
 
 namespace {
 
@@ -99,6 +100,22 @@ const HXMachineRegion *HXReplayPlatform::regionAt(const HXMachineProcess &proces
                                                   uint64_t address) const {
     const HXMachineRegion *const region = firstRegion(process, state, address);
     return region != nullptr && region->address <= address ? region : nullptr;
+}
+
+std::vector<task_held_object> HXReplayPlatform::task_held_objects(mach_port_t task, HeldBy by) {
+    const HXMachineProcess *const process = taskOf(task).process;
+    std::vector<task_held_object> held;
+    if (process == nullptr) return held;
+    std::copy_if(process->held.begin(), process->held.end(), std::back_inserter(held),
+                 [by](const task_held_object &object) {
+                     return ((object.flags & TASK_HELD_OPEN) != 0) == (by == HeldBy::descriptor);
+                 });
+    return held;
+}
+
+std::vector<task_held_object> HXReplayPlatform::host_held_objects(mach_port_t) {
+    const HXMachineProcess *const kernel = _machine.process(0);
+    return kernel == nullptr ? std::vector<task_held_object>() : kernel->held;
 }
 
 kern_return_t HXReplayPlatform::mach_vm_region(mach_port_t task, uint64_t *address, uint64_t *size,

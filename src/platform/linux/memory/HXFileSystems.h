@@ -41,11 +41,12 @@ class HXFileSystems {
     // Opens for reading the plain file that a mapping maps, which `locate` finds. Not open unless it is known
     // to lie on this machine, whatever the process does meanwhile. Any thread.
     HXDescriptor openLocal(const HXDescriptor &process, const HXMapping &mapping, const HXLocateFile &locate);
+    // Whether a file on that device, or mount of it, lies on this machine, by the mount tables as they are
+    // now; see HXIsLocalMount. Any thread.
+    bool isLocalNow(const HXDescriptor &process, uint32_t device, std::optional<uint64_t> mount) const;
 
   private:
     void readMounts(HXDirectoryView directory, const char *name);
-    // By the mount tables as they are now; see HXIsLocalMount.
-    bool isLocalNow(const HXDescriptor &process, uint32_t device, std::optional<uint64_t> mount) const;
     HXFileSystemKind known(uint32_t device) const;
 
     const std::string _procPath;

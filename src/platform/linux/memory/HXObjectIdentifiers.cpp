@@ -81,13 +81,21 @@ uint64_t HXObjectIdentifiers::of(const HXMapping &mapping, const HXMappingOwner 
             return uint64_t{owner.processNumber} << (kPageBits + 1) | page << 1 | 1;
         return interned({Kind::mapping, 0, static_cast<uint32_t>(owner.pid), mapping.start});
     }
+    return ofObject(mapping, owner.ipcNamespace);
+}
+
+uint64_t HXObjectIdentifiers::ofObject(const HXMapping &mapping, uint64_t ipcNamespace) {
     // System V memory's inode number is its identifier, which says nothing outside its namespace and which
     // other shared memory may have, too.
     if (mapping.kind == HXPathKind::systemV)
-        return interned({Kind::systemV, mapping.device, owner.ipcNamespace, mapping.inode});
+        return interned({Kind::systemV, mapping.device, ipcNamespace, mapping.inode});
     return interned({Kind::file, mapping.device, 0, mapping.inode});
 }
 
 uint64_t HXObjectIdentifiers::ofShared(int32_t pid, uint64_t start, uint64_t set) {
     return interned({Kind::shared, static_cast<uint32_t>(pid), set, start});
+}
+
+uint64_t HXObjectIdentifiers::ofFileSystem(uint32_t device) {
+    return interned({Kind::fileSystem, device, 0, 0});
 }

@@ -58,8 +58,14 @@ class HXObjectIdentifiers {
     // mapping at `start`. `set` tells the sets of processes apart whose lowest member that is.
     uint64_t ofShared(int32_t pid, uint64_t start, uint64_t set);
 
+    // That of the file or shared object, whatever pages of its own the mapping holds: by its kind, device and
+    // inode.
+    uint64_t ofObject(const HXMapping &mapping, uint64_t ipcNamespace);
+    // That of all files on a device.
+    uint64_t ofFileSystem(uint32_t device);
+
   private:
-    enum class Kind : uint32_t { file = 1, mapping, systemV, vdso, shared };
+    enum class Kind : uint32_t { file = 1, mapping, systemV, vdso, shared, fileSystem };
     struct Key {
         Kind kind;
         uint32_t device;

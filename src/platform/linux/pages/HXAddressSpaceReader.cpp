@@ -51,16 +51,6 @@ kern_return_t errorOfOpening(int error) {
     return HXShortageWatch::isShortage(error) ? KERN_RESOURCE_SHORTAGE : MACH_SEND_INVALID_DEST;
 }
 
-uint64_t readIpcNamespace(const HXDescriptor &process) {
-    char buffer[64];
-    const auto link = HXReadLink(process, "ns/ipc", buffer);
-    if (!link) return 0;
-    HXTextCursor cursor{link->substr(std::min(link->find('[') + 1, link->size()))};
-    uint64_t number = 0;
-    cursor.number(&number);
-    return number;
-}
-
 // A file of an address space that is gone reads as empty; one that lives still has its first line.
 bool isAlive(const HXDescriptor &file) {
     char byte;
@@ -165,7 +155,7 @@ void Reader::take(const HXMapsEntry &entry) {
     if (path.kind == HXPathKind::stack) _sawStack = true;
     if (path.kind == HXPathKind::special && path.text == "[vsyscall]") _sawGate = true;
     if (path.kind == HXPathKind::systemV && _addressSpace->ipcNamespace == 0)
-        _addressSpace->ipcNamespace = readIpcNamespace(_request.process);
+        _addressSpace->ipcNamespace = HXReadNamespace(_request.process, "ns/ipc");
     _addressSpace->append(mapping);
 }
 

@@ -65,6 +65,8 @@ class HXLinuxTask {
     uint64_t startStack() const { return _startStack; }
     uint32_t number() const { return _number; }
     const HXDescriptor &directory() const { return _directory; }
+    // The same, opened where it is not; not open when the process is gone.
+    const HXDescriptor &openDirectory();
 
     // Runs `read` by turns; if descriptors do not suffice, the address space, once read, ends with that
     // error. Whether they do.

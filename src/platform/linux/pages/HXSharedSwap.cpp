@@ -63,13 +63,23 @@ std::vector<HXPageSpan> HXFindSwapped(const HXCountSwapped &countSwapped, const 
     return std::move(finder.found);
 }
 
+// Pages of a range of bytes; of length 0 for all that follow.
+static std::optional<uint64_t> countSwappedIn(const HXDescriptor &file, CacheRange range) {
+    CacheFigures figures{};
+    if (!file || ::syscall(kCacheStatCall, file.get(), &range, &figures, 0) != 0) return std::nullopt;
+    return figures.evicted;
+}
+
+std::optional<uint64_t> HXSwappedSize(const HXDescriptor &file) {
+    const auto pages = countSwappedIn(file, {0, 0});
+    if (!pages) return std::nullopt;
+    return *pages * static_cast<uint64_t>(::sysconf(_SC_PAGESIZE));
+}
+
 std::vector<HXPageSpan> HXFindSwapped(const HXDescriptor &file, uint32_t pageShift, const HXPageSpan &span,
                                       HXSwapSearch *search) {
-    const HXCountSwapped countSwapped = [&](const HXPageSpan &part) -> std::optional<uint64_t> {
-        CacheRange range{part.first << pageShift, part.count << pageShift};
-        CacheFigures figures{};
-        if (!file || ::syscall(kCacheStatCall, file.get(), &range, &figures, 0) != 0) return std::nullopt;
-        return figures.evicted;
+    const HXCountSwapped countSwapped = [&](const HXPageSpan &part) {
+        return countSwappedIn(file, {part.first << pageShift, part.count << pageShift});
     };
     return HXFindSwapped(countSwapped, span, search);
 }

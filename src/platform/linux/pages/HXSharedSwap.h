@@ -19,6 +19,9 @@ struct HXPageSpan {
 // How many pages of `span` are swapped out; none when the kernel does not tell.
 using HXCountSwapped = std::function<std::optional<uint64_t>(const HXPageSpan &span)>;
 
+// Bytes of a whole file in memory that are swapped out; none when the kernel does not tell.
+std::optional<uint64_t> HXSwappedSize(const HXDescriptor &file);
+
 // How far a search goes on.
 struct HXSwapSearch {
     uint64_t pagesLeft = 0; // to be found

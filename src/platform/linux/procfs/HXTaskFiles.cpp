@@ -1,7 +1,9 @@
 #include "platform/linux/procfs/HXTaskFiles.h"
 
 #include "platform/linux/procfs/HXProcFile.h"
+#include "platform/linux/procfs/HXTextNumber.h"
 
+#include <algorithm>
 #include <cerrno>
 
 namespace {
@@ -18,6 +20,16 @@ std::optional<HXStatRecord> HXReadStat(const HXDescriptor &process) {
     char buffer[2048]; // some 50 numbers of at most 20 digits
     const auto text = HXReadOnce(process, "stat", buffer);
     return text ? HXParseStat(*text) : std::nullopt;
+}
+
+uint64_t HXReadNamespace(const HXDescriptor &process, const char *link) {
+    char buffer[64];
+    const auto text = HXReadLink(process, link, buffer);
+    if (!text) return 0;
+    HXTextCursor cursor{text->substr(std::min(text->find('[') + 1, text->size()))};
+    uint64_t number = 0;
+    cursor.number(&number);
+    return number;
 }
 
 std::optional<HXStatusRecord> HXReadStatus(const HXDescriptor &process) {
