@@ -35,7 +35,7 @@ class HXHeft : public HXHeftSwitches {
     // Ends gathering early: processes not yet started are left out. Any thread.
     void cancel() { _isCancelled->store(true, std::memory_order_relaxed); }
     // Installs a handler of SIGINT that runs `callback` on a thread of its own; null when standard output is
-    // a terminal (the signal then ends the program).
+    // a terminal (the signal then ends the program) and when there can be no source.
     static std::unique_ptr<HXDispatchSource> installCancelHandler(std::function<void()> callback);
 
     // Formatters are not owned and must outlive the report.

@@ -5,6 +5,7 @@
 #include "record/HXMachineRecorder.h"
 #include "record/HXMemgraphRecorder.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <charconv>
 #include <cstdio>
@@ -76,7 +77,7 @@ int recordMachine(HXPlatform &host, const Words &words, bool anonymize) {
     for (size_t i = 1; i < words.size(); i++) {
         const auto pid = parsePid(host, words[i]);
         if (!pid) return 1;
-        pids.push_back(*pid);
+        if (std::find(pids.begin(), pids.end(), *pid) == pids.end()) pids.push_back(*pid); // recorded once
     }
     return writeFile(host.services(), path, [&](std::FILE *out) {
         HXMachineRecorder recorder(host, out, anonymize);

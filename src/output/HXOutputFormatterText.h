@@ -34,7 +34,7 @@ class HXOutputFormatterText : public HXOutputFormatter {
 
     // A size in the chosen format; pages are those of the process whose header came last.
     std::string formattedStringForSize(uint64_t size) const;
-    // "…/" and the last path component unless the output is wide; none stays none.
+    // ".../" and the last path component unless the output is wide; none stays none.
     HXString _truncatedNameForString(HXString text) const;
     // The categories in print order.
     std::vector<const HXMemoryCategory *> _sortedKeysForCategories(const HXCategoryMap &categories) const;

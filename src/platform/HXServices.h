@@ -45,7 +45,7 @@ inline constexpr int HX_SIGPIPE = 13;
 
 // A file to write; made by `createPendingFile`.
 struct HXPendingFile {
-    std::FILE *stream = nullptr; // owned by the platform until commit or discard
+    std::FILE *stream = nullptr; // owned by the services until commit or discard
     std::string path;            // its place, links followed
     std::string temporaryPath;   // where it is written until commit; empty: at its place
 };

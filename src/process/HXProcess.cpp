@@ -7,6 +7,7 @@
 #include "process/HXUserProcess.h"
 
 #include <algorithm>
+#include <cstdlib>
 #include <cstring>
 
 namespace {
@@ -118,7 +119,9 @@ std::string HXProcess::_nameForBsdInfo(const proc_bsdinfo &info) {
     if (platform.sysctl(maximumName, 2, &maximum, &length) != 0 || maximum <= 0)
         return _nameForBsdInfoCommName(info);
 
-    const std::unique_ptr<char[]> area(new (std::nothrow) char[static_cast<size_t>(maximum)]);
+    // Not by new, for whose failures the programs end.
+    const std::unique_ptr<char, decltype(&std::free)> area(
+        static_cast<char *>(std::malloc(static_cast<size_t>(maximum))), std::free);
     if (!area) return _nameForBsdInfoCommName(info);
     const int32_t areaName[] = {CTL_KERN, KERN_PROCARGS2, info.pbi_pid};
     length = static_cast<size_t>(maximum);

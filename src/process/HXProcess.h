@@ -29,8 +29,8 @@ class HXProcess : public HXRegionOwner {
   public:
     using Map = std::map<int32_t, std::unique_ptr<HXProcess>>;
 
-    // A new record of the right kind, or null when the process cannot be examined (a global error then says
-    // why), named by the snapshot that `info` comes from. Main thread only.
+    // A new record of the right kind, named by the snapshot that `info` comes from; null when the process
+    // cannot be examined: a global error then says why, unless it has ended meanwhile. Main thread only.
     static std::unique_ptr<HXProcess> processWithBsdInfo(const proc_bsdinfo &info,
                                                          HXProcessSnapshot &snapshot);
     // The same by pid; null also when there is no such process.
@@ -61,7 +61,6 @@ class HXProcess : public HXRegionOwner {
     // The regions in the order in which the source found them; empty until gathered.
     const HXMemoryRegionList &memoryRegions() const { return _memoryRegions; }
     HXMemoryRegionList &memoryRegions() { return _memoryRegions; }
-    void setMemoryRegions(HXMemoryRegionList regions) { _memoryRegions = std::move(regions); }
 
     // The shared memory that it holds; empty until gathered. Where the whole machine is examined, without
     // what it has descriptors of alone.

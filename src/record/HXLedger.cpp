@@ -8,8 +8,8 @@ std::optional<std::vector<std::string>> HXLedgerNames(HXPlatform &host) {
     constexpr int64_t firstRoom = 80, mostRoom = 1 << 16;
     std::vector<ledger_template_info> entries;
     int64_t count = firstRoom;
-    for (int64_t room = firstRoom; count == room && room <= mostRoom;
-         room *= 2) { // all of them fill: there may be more
+    // A buffer that they fill may not hold all.
+    for (int64_t room = firstRoom; count == room && room <= mostRoom; room *= 2) {
         entries.resize(static_cast<size_t>(room));
         count = room;
         if (host.ledger(LEDGER_TEMPLATE_INFO, 0, entries.data(), &count) < 0) return std::nullopt;

@@ -75,7 +75,8 @@ const HXMapping *HXLinuxPlatform::mappingAt(HXLinuxTask *task, uint64_t *address
 }
 
 vm_region_submap_info_64 HXLinuxPlatform::infoOf(HXLinuxTask *task, const HXMapping &mapping) {
-    const HXMappingOwner owner{task->pid(), task->number(), addressSpaceOf(task).ipcNamespace};
+    // Not read anew, whatever the setting is by now: the mapping lies in it.
+    const HXMappingOwner owner{task->pid(), task->number(), task->addressSpace().ipcNamespace};
     return HXRegionInfo(mapping, _identifiers.of(mapping, owner),
                         _reportsCharge.load(std::memory_order_relaxed) != 0);
 }

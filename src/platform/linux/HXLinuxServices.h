@@ -3,6 +3,7 @@
 
 #include "platform/HXServices.h"
 
+#include <atomic>
 #include <chrono>
 #include <cstddef>
 
@@ -36,5 +37,5 @@ class HXLinuxServices : public HXServices {
   private:
     size_t _workerCount = 0;
     std::chrono::milliseconds _answerTime{10000};
-    bool _hasGivenUp = false;
+    std::atomic<bool> _hasGivenUp = false;
 };

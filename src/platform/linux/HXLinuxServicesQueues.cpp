@@ -37,7 +37,7 @@ std::vector<size_t> HXLinuxServices::dispatch_apply(size_t iterations, const HXD
                                                     std::function<void(size_t)> work) {
     const size_t workers = _workerCount == 0 ? usableProcessorCount() : _workerCount;
     auto givenUp = HXWorkLoop::run(iterations, workers, _answerTime, std::move(work));
-    _hasGivenUp |= !givenUp.empty();
+    if (!givenUp.empty()) _hasGivenUp = true;
     return givenUp;
 }
 

@@ -17,7 +17,8 @@ namespace {
 
 using Handler = void (*)(int);
 
-constexpr int kEndingSignals[] = {SIGHUP, SIGINT, SIGQUIT, SIGABRT, SIGTERM, SIGXFSZ};
+constexpr int kEndingSignals[] = {SIGHUP,  SIGINT,  SIGQUIT, SIGABRT, SIGTERM,   SIGXFSZ,
+                                  SIGXCPU, SIGALRM, SIGUSR1, SIGUSR2, SIGVTALRM, SIGPROF};
 
 // The handler may come at any moment: it takes no lock and reads a path only while that is marked as used.
 struct Slot {

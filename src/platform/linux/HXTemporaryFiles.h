@@ -6,7 +6,7 @@
 #include <string>
 
 // Makes a file for writing, readable by its owner alone, by a template that ends in "XXXXXX", and stores its
-// path there. -1 with errno set, and the path emptied.
+// path there. Not open with errno set, and the path emptied.
 HXDescriptor HXCreateTemporaryFile(std::string *path);
 // rename(2): false with errno set, the file then stays.
 bool HXRenameTemporaryFile(const std::string &temporaryPath, const std::string &path);

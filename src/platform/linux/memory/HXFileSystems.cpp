@@ -25,6 +25,7 @@ bool isMountedByRoot(const HXDescriptor &process) {
     constexpr ino_t initialUserNamespace = 0xEFFFFFFD; // the same on every machine
     const HXDescriptor mounts = HXOpenAt(process, "ns/mnt");
     const HXDescriptor owner(mounts ? ::ioctl(mounts.get(), NS_GET_USERNS) : -1);
+    if (mounts && !owner) HXShortageWatch::note(errno);
     struct stat status;
     return owner && ::fstat(owner.get(), &status) == 0 && status.st_ino == initialUserNamespace;
 }

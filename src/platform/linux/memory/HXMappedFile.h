@@ -8,7 +8,8 @@
 #include <optional>
 #include <string>
 
-// Whether a descriptor (of any kind) is of the plain file that the mapping maps.
+// Whether a descriptor (of any kind) is of a plain file with the inode number of what the mapping maps; the
+// device is the caller's to check.
 bool HXIsMappedFile(const HXMapping &mapping, const HXDescriptor &place);
 // The device (HXDeviceNumber) of the file that a descriptor is of. File systems with subvolumes tell another
 // one here than in maps. UINT32_MAX when it cannot be told.

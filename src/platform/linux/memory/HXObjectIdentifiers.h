@@ -3,12 +3,9 @@
 //
 // All are below 2^53. Their lowest bit tells two kinds apart:
 //
-//   1  A private mapping without a file: the number of its process, from bit 36 on, and the number of its
-//   page,
-//      from bit 1 on. Distinct by construction, which no table is needed for.
-//   0  Everything else, by a table. The number's lower 32 bits are its own; the higher ones are the same for
-//   all
-//      of these.
+//   1  A private mapping without a file: its process's number from bit 36 on, its page's from bit 1 on.
+//      Distinct by construction, which no table is needed for.
+//   0  Everything else, by a table. The lower 32 bits are its own; the higher ones are the same for all.
 //
 // What a process has copied on write is told apart from others' by its pid in the bits from 32 on (HXHeft),
 // which happens to the second kind alone; so its lower bits decide.

@@ -55,10 +55,6 @@ const HXAddressSpace &HXLinuxTask::addressSpace(const HXReaderSetting &setting, 
     if (!_addressSpace || (needsDirtyPages && !_addressSpace->knowsDirtyPages)) {
         _shares.clear(); // by their mappings' places among those of an earlier reading
         withDescriptors([&] { read(setting, needsDirtyPages); });
-        if (!_addressSpace) { // nobody gave way
-            _addressSpace = std::make_unique<HXAddressSpace>();
-            _addressSpace->endError = KERN_RESOURCE_SHORTAGE;
-        }
         finishReading(setting);
     }
     return *_addressSpace;

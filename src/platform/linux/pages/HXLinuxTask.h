@@ -86,6 +86,8 @@ class HXLinuxTask {
     // HXPlatform::mach_vm_region_shares for a mapping by its index.
     std::vector<vm_region_share> sharesOf(size_t index) const;
 
+    // The address space, once read, as it is.
+    const HXAddressSpace &addressSpace() const { return *_addressSpace; }
     // The index in the address space, once read, of the first mapping that ends above `address`. A walk in
     // ascending order costs no search.
     size_t find(uint64_t address);

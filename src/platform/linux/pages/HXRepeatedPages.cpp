@@ -50,6 +50,7 @@ class Finder {
   private:
     using Indexes = std::vector<size_t>;
 
+    void forget();
     bool findAmong(Indexes group);
     void add(HXMapping &mapping, const HXFoundPages &found, Offsets &known);
 
@@ -58,8 +59,18 @@ class Finder {
     HXAddressSpace &_addressSpace;
 };
 
+// What has been found so far.
+void Finder::forget() {
+    if (_addressSpace.repeated.empty()) return;
+    for (size_t i = 0; i < _addressSpace.count(); i++)
+        if (mayRepeat(_addressSpace[i]))
+            _addressSpace[i].repeatedPages = _addressSpace[i].repeatedSwappedPages = 0;
+    _addressSpace.repeated.clear();
+}
+
 // Goes through the mappings by object and offset, in groups that overlap.
 void Finder::find() {
+    forget(); // of a run that had too few descriptors
     Indexes all;
     for (size_t i = 0; i < _addressSpace.count(); i++)
         if (mayRepeat(_addressSpace[i])) all.push_back(i);
@@ -92,9 +103,7 @@ bool Finder::findAmong(Indexes group) {
         const kern_return_t error = _pages.findAll(
             _addressSpace, mapping, [&](const HXFoundPages &found) { add(mapping, found, known); });
         if (error == KERN_SUCCESS) continue;
-        for (size_t i = 0; i < _addressSpace.count(); i++)
-            _addressSpace[i].repeatedPages = _addressSpace[i].repeatedSwappedPages = 0;
-        _addressSpace.repeated.clear();
+        forget();
         return false;
     }
     return true;

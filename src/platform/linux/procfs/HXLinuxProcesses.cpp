@@ -231,7 +231,9 @@ int32_t HXLinuxProcesses::proc_pidinfo(int32_t pid, int32_t flavor, void *buffer
 
 bool HXLinuxProcesses::mayBeNamed(const proc_bsdinfo &info, std::string_view name) {
     constexpr size_t surelyWhole = kCommLength - 3; // behind them the cut may have split a character
-    const std::string_view recorded(info.pbi_comm, ::strnlen(info.pbi_comm, surelyWhole));
+    std::string_view recorded(info.pbi_comm, ::strnlen(info.pbi_comm, surelyWhole));
+    while (recorded.ends_with('?')) // may stand for parts of a character that the cut has split
+        recorded.remove_suffix(1);
     return recorded.empty() || name.starts_with(recorded);
 }
 
