@@ -368,6 +368,13 @@ TEST_F(HXLinuxPlatformTest, TellsWhenMemoryMovedWhileItWasRead) {
 // A page of the test's own, in a made-up process that has the test's page tables.
 alignas(4096) char ownPage[4096] = {1};
 
+TEST_F(HXLinuxPlatformTest, OpensWithoutWaitingAndClosesOnExecution) {
+    const std::string fifo = proc.path().native() + "/fifo";
+    ASSERT_EQ(::mkfifo(fifo.c_str(), 0600), 0);
+    const HXDescriptor file = HXOpenAt(AT_FDCWD, fifo.c_str()); // nobody writes to it
+    EXPECT_EQ(::fcntl(file.get(), F_GETFD), FD_CLOEXEC);
+}
+
 TEST_F(HXLinuxPlatformTest, CountsFromPageTablesOnlyWhereTheyTellEnough) {
     if (!HXPageScan::isComplete()) GTEST_SKIP() << "the kernel's answers are not complete";
     HXFileSystems fileSystems(proc.path(), HXDeviceNumber(0, 1));
