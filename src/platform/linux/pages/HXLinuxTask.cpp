@@ -92,8 +92,10 @@ void HXLinuxTask::takeShared(HXSharedPages shared) {
 // waiting. Where it does not, the pages are read once more, as the process's own.
 void HXLinuxTask::settle(const HXReaderSetting &setting) {
     _awaitsSettling = false;
+    // Page tables that were opened after the process had executed another program are not of these mappings.
+    const auto stat = HXReadStat(_directory);
     compare(setting, true);
-    if (_difference)
+    if (!stat || stat->startStack != _startStack || _difference)
         forget();
     else
         finishReading(setting);
