@@ -94,6 +94,7 @@ bool Reader::mapsSuffice() const {
     if (_mayHoldHugePages) return false;
     // Page tables do not show which pages of shared memory are swapped out.
     if (_sawSwapBacked && _setting.machine->usesSwap()) return false;
+    if (_request.leavesLazyFree) return true;
     return !_setting.machine->hasFreedLazily(_request.opened) || !hasFreedLazily();
 }
 

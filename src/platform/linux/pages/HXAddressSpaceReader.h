@@ -29,6 +29,8 @@ struct HXReadRequest {
     std::chrono::steady_clock::time_point opened{}; // when the process was
     // Where page tables are counted, those of mappings that HXMayShareAfterFork are left to the caller.
     bool leavesPrivatePages = false;
+    // He also finds out whether any of them are lazily freed.
+    bool leavesLazyFree = false;
 };
 
 // Reads the mappings of a process and classifies them. A process that vanishes leaves what was read until

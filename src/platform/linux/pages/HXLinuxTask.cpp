@@ -65,9 +65,10 @@ void HXLinuxTask::finishReading(const HXReaderSetting &setting) {
     withDescriptors([&] { HXFindRepeatedPages(setting.pageShift, &*_pages, _addressSpace.get()); });
 }
 
-void HXLinuxTask::readForSharing(const HXReaderSetting &setting, bool needsDirtyPages) {
+void HXLinuxTask::readForSharing(const HXReaderSetting &setting, bool needsDirtyPages, bool leavesLazyFree) {
     if (!_directory) _directory = reopen();
-    _addressSpace = HXReadAddressSpace({_directory, _status, needsDirtyPages, _opened, true}, setting);
+    _addressSpace =
+        HXReadAddressSpace({_directory, _status, needsDirtyPages, _opened, true, leavesLazyFree}, setting);
 }
 
 void HXLinuxTask::takeShared(HXSharedPages shared) {
@@ -85,6 +86,7 @@ void HXLinuxTask::takeShared(HXSharedPages shared) {
         addressSpace[repeated.mapping].repeatedSwappedPages += repeated.swapped;
     }
     _shares = std::move(shared.shares);
+    _mayBeLazilyFreed = shared.mayBeLazilyFreed;
     _awaitsSettling = true;
 }
 
@@ -95,10 +97,26 @@ void HXLinuxTask::settle(const HXReaderSetting &setting) {
     // Page tables that were opened after the process had executed another program are not of these mappings.
     const auto stat = HXReadStat(_directory);
     compare(setting, true);
-    if (!stat || stat->startStack != _startStack || _difference)
+    const bool isSame = stat && stat->startStack == _startStack && !_difference;
+    if (!isSame || (_mayBeLazilyFreed && !readLazilyFreed(setting)))
         forget();
     else
         finishReading(setting);
+}
+
+// Takes the figures of smaps instead, if they are still of the same mappings.
+bool HXLinuxTask::readLazilyFreed(const HXReaderSetting &setting) {
+    auto read = HXReadAddressSpace({_directory, _status, true, _opened}, setting);
+    if (read->endError != KERN_INVALID_ADDRESS || read->count() != _addressSpace->count()) return false;
+    for (size_t i = 0; i < read->count(); i++) {
+        const HXMapping &before = (*_addressSpace)[i];
+        HXMapping &mapping = (*read)[i];
+        if (mapping.start != before.start || mapping.end != before.end) return false;
+        mapping.repeatedPages = before.repeatedPages;
+        mapping.repeatedSwappedPages = before.repeatedSwappedPages;
+    }
+    _addressSpace = std::move(read);
+    return true;
 }
 
 std::vector<vm_region_share> HXLinuxTask::sharesOf(size_t index) const {

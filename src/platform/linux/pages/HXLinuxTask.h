@@ -34,7 +34,8 @@ struct HXSharedPages {
         uint32_t mapping;
         vm_region_share share;
     };
-    std::vector<Share> shares; // ascending by mapping
+    std::vector<Share> shares;     // ascending by mapping
+    bool mayBeLazilyFreed = false; // some of the pages, which smaps tells
 };
 
 // Lets those who read processes take turns when there are few descriptors. Any thread.
@@ -79,7 +80,8 @@ class HXLinuxTask {
     // Reads the address space for somebody who looks at several tasks together, and may leave the private
     // pages to him (HXAddressSpace::lacksPrivatePages). Then `takeShared` or `forget`, before anything else
     // is asked.
-    void readForSharing(const HXReaderSetting &setting, bool needsDirtyPages);
+    // `leavesLazyFree`: HXReadRequest's.
+    void readForSharing(const HXReaderSetting &setting, bool needsDirtyPages, bool leavesLazyFree);
     const HXAddressSpace *addressSpaceRead() const { return _addressSpace.get(); } // null: not read
     void takeShared(HXSharedPages shared);
     void forget() { _addressSpace.reset(); }
@@ -106,6 +108,7 @@ class HXLinuxTask {
     void read(const HXReaderSetting &setting, bool needsDirtyPages);
     void readOnce(const HXReaderSetting &setting, bool needsDirtyPages);
     void settle(const HXReaderSetting &setting);
+    bool readLazilyFreed(const HXReaderSetting &setting);
     void finishReading(const HXReaderSetting &setting);
     void compare(const HXReaderSetting &setting, bool isFirst);
 
@@ -123,6 +126,7 @@ class HXLinuxTask {
     std::optional<HXStatusRecord> _status;
     std::optional<HXWalkDifference> _difference;
     bool _awaitsSettling = false; // shared pages have been taken
+    bool _mayBeLazilyFreed = false;
     std::vector<HXSharedPages::Share> _shares;
     bool _used[2] = {};
 };

@@ -26,6 +26,8 @@ void HXFamilyPages::add(const HXFamilyPages &other) {
         rest[place].counted += entry.counted;
     }
     for (size_t i = 0; i < members; i++)
+        mayBeLazilyFreed[i] |= other.mayBeLazilyFreed[i];
+    for (size_t i = 0; i < members; i++)
         figures[i].insert(figures[i].end(), other.figures[i].begin(), other.figures[i].end());
     metAgain.insert(metAgain.end(), other.metAgain.begin(), other.metAgain.end());
     repeated.insert(repeated.end(), other.repeated.begin(), other.repeated.end());

@@ -72,7 +72,8 @@ struct HXRepeatedPage {
 // What was read of a family, or of a stretch of its addresses.
 struct HXFamilyPages {
     explicit HXFamilyPages(size_t memberCount, size_t setLimit)
-        : members(memberCount), sets(memberCount, setLimit), figures(memberCount) {}
+        : members(memberCount), sets(memberCount, setLimit), figures(memberCount),
+          mayBeLazilyFreed(memberCount) {}
 
     static constexpr uint32_t kNoMapping = UINT32_MAX;
     // How many of the shared pages lie in one mapping of each member: a set's pages in one layout.
@@ -92,6 +93,7 @@ struct HXFamilyPages {
     std::vector<Count> counts;
     std::map<HXFamilyMapping, Rest> rest;
     std::vector<std::vector<std::pair<uint32_t, HXFamilyFigures>>> figures; // of mappings, by member
+    std::vector<uint8_t> mayBeLazilyFreed; // by member: whether some of its pages may be
     std::vector<HXPageKey> metAgain;
     std::vector<HXRepeatedPage> repeated;
 

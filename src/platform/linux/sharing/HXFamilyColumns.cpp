@@ -87,6 +87,7 @@ class ColumnReader {
     void countColumn(size_t page);
     void countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t sharers);
     void endStrip();
+    void findLazilyFreed();
     uint64_t *row(uint32_t member) { return _entries.data() + member * _stride; }
     const std::vector<HXFamilyRange> &ranges(uint32_t member) const { return _family.members[member].ranges; }
 
@@ -108,6 +109,8 @@ class ColumnReader {
     uint32_t _lastSet = HXSharerSets::kNone;
     HXPageCount *_lastCount = nullptr;
     Groups _groups;
+    std::optional<HXFrameFlags> _flags;          // where lazily freed pages are wanted
+    std::vector<uint64_t> _frames, _lazilyFreed; // of the window
     HXSeenKeys::Cursor _seen;
     std::optional<HXSeenKeys::Cursor> _repeated;
     std::unique_ptr<HXFamilyPages> _pages;
@@ -126,6 +129,7 @@ ColumnReader::ColumnReader(const HXColumnRequest &request, std::atomic<uint32_t>
       _rows(_memberCount), _allBits((_memberCount + 63) / 64),
       _layout(_memberCount, HXFamilyPages::kNoMapping), _groups(_memberCount), _seen(*_family.seen),
       _pages(std::make_unique<HXFamilyPages>(_memberCount, kSetsOfStretch)) {
+    if (request.findsLazilyFreed) _flags.emplace();
     if (request.repeated) _repeated.emplace(*request.repeated);
 }
 
@@ -180,6 +184,7 @@ void ColumnReader::readWindow(uint64_t first, uint64_t end) {
     borders.erase(std::unique(borders.begin(), borders.end()), borders.end());
     for (size_t i = 0; i + 1 < borders.size(); i++)
         countStrip(borders[i], borders[i + 1]);
+    if (_flags) findLazilyFreed();
 }
 
 // Reads the entries of a member's ranges in the window, and of what lies between them.
@@ -292,6 +297,7 @@ void ColumnReader::countColumn(size_t page) {
 }
 
 void ColumnReader::countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t sharers) {
+    if (_flags && (key & kSwappedKey) == 0) _frames.push_back(key);
     if (!_repeated) {
         if (_seen.add(key)) _pages->metAgain.push_back(key);
     } else if (_repeated->contains(key)) {
@@ -311,6 +317,21 @@ void ColumnReader::countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t s
         *_lastCount += page;
     else
         _pages->addRest(bits, _layout, page);
+}
+
+// Of the window, whose rows are keys by now; those of members that are not in it are old.
+void ColumnReader::findLazilyFreed() {
+    _lazilyFreed.clear();
+    _flags->findLazilyFreed(&_frames, &_lazilyFreed);
+    _frames.clear();
+    if (_lazilyFreed.empty()) return;
+    std::sort(_lazilyFreed.begin(), _lazilyFreed.end());
+    for (uint32_t member = 0; member < _memberCount; member++)
+        if (_rows[member].isInWindow)
+            _pages->mayBeLazilyFreed[member] |=
+                std::any_of(row(member), row(member) + _windowPages, [this](uint64_t key) {
+                    return std::binary_search(_lazilyFreed.begin(), _lazilyFreed.end(), key);
+                });
 }
 
 void ColumnReader::endStrip() {

@@ -24,6 +24,7 @@ struct HXColumnRequest {
     // Pages that lie at several places, which are told one by one (HXFamilyPages::repeated) instead of being
     // counted by sets; null in the first reading, which finds them.
     std::shared_ptr<HXSeenKeys> repeated;
+    bool findsLazilyFreed; // HXFamilyPages::mayBeLazilyFreed
 };
 
 // *reading: the member that is being read, for whoever waits. A member that has gone shows nothing.

@@ -50,6 +50,8 @@ std::vector<HXSharedPages> Shares::tell() {
     for (uint32_t member = 0; member < _tasks.size(); member++)
         for (const auto &[mapping, figures] : _pages.figures[member])
             _told[member].figures.push_back({mapping, figures.resident, figures.anonymous, figures.swapped});
+    for (uint32_t member = 0; member < _tasks.size(); member++)
+        _told[member].mayBeLazilyFreed = _pages.mayBeLazilyFreed[member] != 0;
     std::sort(_pages.repeated.begin(), _pages.repeated.end());
     chooseExactSets();
     for (const HXFamilyPages::Count &count : _pages.counts)

@@ -5,6 +5,8 @@
 #include <fcntl.h>
 #include <sys/mman.h>
 
+#include <algorithm>
+
 namespace {
 
 constexpr size_t kHugeSize = 2 << 20, kZerosSize = 2 * kHugeSize;
@@ -60,6 +62,34 @@ HXPageEntries::Kind HXPageEntries::readSwapped(uint64_t entry, HXPageKey *key) {
     if ((entry & kFile) != 0) return file;
     *key = (entry & kFrame) >> typeBits;
     return *key == 0 ? nothing : anonymous;
+}
+
+namespace {
+constexpr const char *kFlagsPath = "/proc/kpageflags";
+}
+
+bool HXFrameFlags::areTold() {
+    uint64_t flags = 0;
+    return HXOpenAt(AT_FDCWD, kFlagsPath).readAt(0, &flags, sizeof flags) == sizeof flags;
+}
+
+HXFrameFlags::HXFrameFlags() : _file(HXOpenAt(AT_FDCWD, kFlagsPath)) {}
+
+void HXFrameFlags::findLazilyFreed(std::vector<uint64_t> *frames, std::vector<uint64_t> *found) {
+    constexpr uint64_t anonymous = 1 << 12, swapBacked = 1 << 14; // KPF_ANON, KPF_SWAPBACKED
+    constexpr uint64_t smallGap = 16, mostFrames = 4096;          // that are asked for at once
+    std::sort(frames->begin(), frames->end());
+    for (size_t first = 0, next = 0; first < frames->size(); first = next) {
+        const uint64_t start = (*frames)[first];
+        for (next = first + 1; next < frames->size(); next++)
+            if ((*frames)[next] - (*frames)[next - 1] > smallGap || (*frames)[next] - start >= mostFrames)
+                break;
+        _flags.assign((*frames)[next - 1] - start + 1, 0); // which a file that ends tells nothing of
+        (void)_file.readAt(start * sizeof _flags[0], _flags.data(), _flags.size() * sizeof _flags[0]);
+        for (size_t i = first; i < next; i++)
+            if ((_flags[(*frames)[i] - start] & (anonymous | swapBacked)) == anonymous)
+                found->push_back((*frames)[i]);
+    }
 }
 
 std::atomic<uint64_t> &HXSeenKeys::Cursor::wordOf(HXPageKey key) {

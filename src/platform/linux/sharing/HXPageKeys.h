@@ -2,12 +2,15 @@
 // entries of pagemap have them (Documentation/admin-guide/mm/pagemap.rst).
 #pragma once
 
+#include "platform/linux/procfs/HXDescriptor.h"
+
 #include <array>
 #include <atomic>
 #include <cstdint>
 #include <memory>
 #include <mutex>
 #include <unordered_map>
+#include <vector>
 
 // A frame's number, or with the top bit set the type and offset of swapped memory. 0: no page of its own.
 using HXPageKey = uint64_t;
@@ -52,6 +55,22 @@ class HXPageEntries {
     uint64_t _hugeZeroFrame = 0;
     uint64_t _hugeZeroFrames = 0; // 0: there is no huge one
     void *_zeros = nullptr;       // where they are mapped
+};
+
+// Tells of frames by /proc/kpageflags (Documentation/admin-guide/mm/pagemap.rst). One thread at a time.
+class HXFrameFlags {
+  public:
+    // Whether this machine tells of frames.
+    static bool areTold();
+
+    HXFrameFlags();
+    // Adds to `found` those of the frames that hold private memory which needs no swapping to be dropped:
+    // lazily freed, if it was not written to since. Sorts `frames`.
+    void findLazilyFreed(std::vector<uint64_t> *frames, std::vector<uint64_t> *found);
+
+  private:
+    HXDescriptor _file;
+    std::vector<uint64_t> _flags;
 };
 
 // Which keys have been met: a bit for each, of memory that is there where keys are. Any thread.

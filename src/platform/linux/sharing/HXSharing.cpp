@@ -65,6 +65,8 @@ std::set<int32_t> HXSharing::examine(const std::vector<HXLinuxTask *> &tasks) {
         measureNotTold(families);
         return _unanswering;
     }
+    _findsLazilyFreed =
+        _setting.reader->machine->hasFreedLazily(std::chrono::steady_clock::now()) && HXFrameFlags::areTold();
     // As many families at once as there are descriptors for.
     const size_t most = mostOpenMembers();
     for (size_t first = 0; first < families.size();) {
@@ -180,10 +182,11 @@ void HXSharing::readAddressSpaces(std::vector<Tasks> &families) {
     for (const Tasks &family : families)
         all.insert(all.end(), family.begin(), family.end());
     const auto isCancelled = _setting.isCancelled;
-    const auto givenUp = forAll(
-        all.size(), [all, reader = _setting.reader, needsDirtyPages = _setting.needsDirtyPages](size_t i) {
-            all[i]->withDescriptors([&] { all[i]->readForSharing(*reader, needsDirtyPages); });
-        });
+    const auto givenUp = forAll(all.size(), [all, reader = _setting.reader,
+                                             needsDirtyPages = _setting.needsDirtyPages,
+                                             findsLazilyFreed = _findsLazilyFreed](size_t i) {
+        all[i]->withDescriptors([&] { all[i]->readForSharing(*reader, needsDirtyPages, findsLazilyFreed); });
+    });
     for (const size_t i : givenUp) {
         _unanswering.insert(all[i]->pid());
         for (Tasks &family : families)
@@ -224,15 +227,16 @@ void HXSharing::readPages(std::vector<std::shared_ptr<Work>> &families, bool isS
             items.emplace_back(work, i);
     }
     const auto isCancelled = _setting.isCancelled;
-    const auto givenUp = forAll(
-        items.size(), [items, isSecond, isCancelled, pageShift = _setting.reader->pageShift](size_t i) {
+    const auto givenUp =
+        forAll(items.size(), [items, isSecond, isCancelled, findsLazilyFreed = _findsLazilyFreed,
+                              pageShift = _setting.reader->pageShift](size_t i) {
             const auto &[work, stretch] = items[i];
             const auto slots = work->slots;
             if (isCancelled()) return;
             Work::Slot &slot = (*slots)[stretch];
-            slot.pages = HXReadColumns(
-                {work->family, work->stretches[stretch], pageShift, isSecond ? work->repeated : nullptr},
-                &slot.reading);
+            slot.pages = HXReadColumns({work->family, work->stretches[stretch], pageShift,
+                                        isSecond ? work->repeated : nullptr, findsLazilyFreed},
+                                       &slot.reading);
         });
     for (const size_t i : givenUp) {
         const auto &[work, stretch] = items[i];

@@ -53,6 +53,7 @@ class HXSharing {
 
     const HXSharingSetting _setting;
     std::shared_ptr<const HXPageEntries> _entries;
+    bool _findsLazilyFreed = false; // from the frames, which takes the place of smaps
     std::set<int32_t> _unanswering;
     std::optional<uint64_t> _sizeNotTold;
 };
