@@ -52,7 +52,9 @@ struct HXPageCount {
 struct HXFamilyMapping {
     uint32_t member;
     uint32_t mapping;
-    auto operator<=>(const HXFamilyMapping &) const = default;
+    bool operator<(const HXFamilyMapping &other) const {
+        return std::tie(member, mapping) < std::tie(other.member, other.mapping);
+    }
 };
 
 // What the page tables show of a private mapping, in pages: figures of HXMapping.
@@ -66,7 +68,9 @@ struct HXFamilyFigures {
 struct HXRepeatedPage {
     HXPageKey key;
     HXFamilyMapping place;
-    auto operator<=>(const HXRepeatedPage &) const = default;
+    bool operator<(const HXRepeatedPage &other) const {
+        return std::tie(key, place) < std::tie(other.key, other.place);
+    }
 };
 
 // What was read of a family, or of a stretch of its addresses.

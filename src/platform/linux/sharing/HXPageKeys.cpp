@@ -35,15 +35,15 @@ HXPageEntries::~HXPageEntries() {
 void HXPageEntries::learnZeros(uint32_t pageShift) {
     const HXDescriptor pagemap = HXOpenAt(AT_FDCWD, "/proc/self/pagemap");
     if (!pagemap) return;
-    const auto start = reinterpret_cast<uint64_t>(_zeros), mask = uint64_t{kHugeSize} - 1;
-    const uint64_t huge = (start + mask) & ~mask;
-    const uint64_t small = huge == start ? huge + kHugeSize : start; // outside of the huge one
-    ::madvise(reinterpret_cast<void *>(huge), kHugeSize, MADV_HUGEPAGE);
-    ::madvise(reinterpret_cast<void *>(small), size_t{1} << pageShift, MADV_NOHUGEPAGE);
-    [[maybe_unused]] const char zeros[] = {*reinterpret_cast<const volatile char *>(huge),
-                                           *reinterpret_cast<const volatile char *>(small)};
-    _zeroFrame = entryOf(pagemap, small, pageShift) & kFrame;
-    const uint64_t hugeFrame = entryOf(pagemap, huge, pageShift) & kFrame;
+    char *const start = static_cast<char *>(_zeros);
+    char *const huge = start + (kHugeSize - reinterpret_cast<uint64_t>(start) % kHugeSize) % kHugeSize;
+    char *const small = huge == start ? huge + kHugeSize : start; // outside of the huge one
+    ::madvise(huge, kHugeSize, MADV_HUGEPAGE);
+    ::madvise(small, size_t{1} << pageShift, MADV_NOHUGEPAGE);
+    [[maybe_unused]] const char zeros[] = {*static_cast<const volatile char *>(huge),
+                                           *static_cast<const volatile char *>(small)};
+    _zeroFrame = entryOf(pagemap, reinterpret_cast<uint64_t>(small), pageShift) & kFrame;
+    const uint64_t hugeFrame = entryOf(pagemap, reinterpret_cast<uint64_t>(huge), pageShift) & kFrame;
     if (hugeFrame == 0 || hugeFrame == _zeroFrame) return;
     _hugeZeroFrame = hugeFrame;
     _hugeZeroFrames = kHugeSize >> pageShift;
