@@ -47,12 +47,16 @@ bool HXHeldPlaces::isNew(const std::string &place) const {
 
 // Two threads may learn the same at a time; none waits for the other, who may be stuck.
 void HXHeldPlaces::learn(const HXDescriptor &process) {
-    char root[PATH_MAX];
-    const std::string mounts = std::to_string(HXReadNamespace(process, "ns/mnt")) + " " +
-                               std::string(HXReadLink(process, "root", root).value_or(""));
-    if (isNew(mounts) && learnMounts(process)) {
-        const std::lock_guard lock(_mutex);
-        _known.insert(mounts);
+    const std::string mounts = "mnt " + std::to_string(HXReadNamespace(process, "ns/mnt"));
+    if (isNew(mounts)) {
+        char buffer[PATH_MAX];
+        const auto root = HXReadLink(process, "root", buffer);
+        // Another root of the same namespace may show less.
+        const std::string place = root == "/" ? mounts : mounts + " " + std::string(root.value_or(""));
+        if (isNew(place) && learnMounts(process)) {
+            const std::lock_guard lock(_mutex);
+            _known.insert(place);
+        }
     }
     const uint64_t space = HXReadNamespace(process, "ns/ipc");
     const std::string segments = "ipc " + std::to_string(space);
