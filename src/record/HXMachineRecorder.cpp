@@ -37,16 +37,21 @@ bool HXMachineRecorder::record(const std::vector<int32_t> &pids) {
     _writer.header();
     recordHost(setting.found());
     if (!write(_writer.written()) || !write(kernel)) return false;
+    std::vector<int32_t> chosen = pids.empty() ? _listed.value_or(std::vector<int32_t>()) : pids;
+    std::erase(chosen, _host.getpid());
+    if (!recordProcesses(chosen, setting)) return false;
+    _writer.clear();
+    if (_hasKernel) recordHeldByKernel(pids.empty());
+    recordTags(_tags);
+    return write(_writer.written()) && std::fflush(_out) == 0;
+}
 
+bool HXMachineRecorder::recordProcesses(const std::vector<int32_t> &chosen, HXRegionHeftSetting &setting) {
     const auto newRecorder = [&] {
         return std::make_shared<HXProcessRecorder>(_host, _facts, setting,
                                                    _anonymize ? &_anonymizer : nullptr);
     };
     auto process = newRecorder();
-    std::set<uint32_t> tags;
-    bool hasKernel = false;
-    std::vector<int32_t> chosen = pids.empty() ? _listed.value_or(std::vector<int32_t>()) : pids;
-    std::erase(chosen, _host.getpid());
     HXProcessSnapshot tasks(_host);
     const std::set<int32_t> unanswering = examineTogether(chosen, setting, tasks);
     for (const int32_t pid : chosen) {
@@ -73,14 +78,11 @@ bool HXMachineRecorder::record(const std::vector<int32_t> &pids) {
             continue;
         }
         if (!write(process->head()) || !write(process->body())) return false;
-        tags.insert(process->tags().begin(), process->tags().end());
-        hasKernel |= pid == 0;
+        _tags.insert(process->tags().begin(), process->tags().end());
+        _hasKernel |= pid == kKernelPid;
         _processCount++;
     }
-    _writer.clear();
-    if (hasKernel) recordHeldByKernel(pids.empty());
-    recordTags(tags);
-    return write(_writer.written()) && std::fflush(_out) == 0;
+    return true;
 }
 
 // Opens the tasks and lets the host find out what they share; the pids of those that do not answer. With

@@ -37,6 +37,7 @@ class HXMachineRecorder {
     std::optional<std::vector<int32_t>> listedPids();
     std::set<int32_t> examineTogether(std::vector<int32_t> pids, HXRegionHeftSetting &setting,
                                       HXProcessSnapshot &tasks);
+    bool recordProcesses(const std::vector<int32_t> &chosen, HXRegionHeftSetting &setting);
     bool write(const std::string &text);
 
     HXPlatform &_host;
@@ -47,5 +48,7 @@ class HXMachineRecorder {
     HXMachineHost _facts;
     std::optional<std::vector<int32_t>> _listed; // none when the host cannot list its processes
     std::vector<int32_t> _sorted;
+    std::set<uint32_t> _tags; // of all that was recorded
+    bool _hasKernel = false;
     size_t _processCount = 0;
 };

@@ -263,7 +263,7 @@ int32_t HXLinuxProcesses::copyArguments(int32_t pid, void *old, size_t *oldBytes
         errno = ENOENT;
         return -1;
     }
-    constexpr std::string_view oneArgument("\1\0\0", 4); // in little-endian order
+    constexpr std::string_view oneArgument("\1\0\0\0", 4); // in little-endian order
     const std::string area = std::string(oneArgument) + HXSafeName(*path) + '\0';
     const size_t length = std::min(area.size(), *oldBytes);
     if (old != nullptr) std::memcpy(old, area.data(), length);
