@@ -394,9 +394,11 @@ def writers(count):
 
     parent = os.getpid()
     for k in range(count):
-        if os.fork() == 0:
+        pid = os.fork()
+        if pid == 0:
             os.write(names_out, f"w{k} {os.getpid()}\n".encode())
             walk()
+        at_end.append(lambda pid=pid: os.kill(pid, 9))
     time.sleep(2)
     return {}
 
