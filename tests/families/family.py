@@ -374,21 +374,26 @@ def many(children, pages):
     return {}
 
 
-def writers(count):
-    """Processes that drop and write pages of memory that they share in part, about 20,000 a second in all."""
+def writers(count, is_shuffled):
+    """Processes that drop and write pages of memory that they share in part, about 20,000 a second in all.
+
+    The memory that each has written goes round: upwards in its addresses, or without any order."""
     payload = Memory(64 * MIB).write()
 
     def walk():
-        page, half, window = 0, payload.size // PAGE // 2, 2048
-        payload.write(0, window * PAGE, 2)
-        for position in range(window, half):
-            payload.advise(DONTNEED, position * PAGE, (position + 1) * PAGE)
+        places, position, window = list(range(payload.size // PAGE // 2)), 0, 2048
+        if is_shuffled:
+            random.shuffle(places)
+        for place in places[:window]:
+            payload.write(place * PAGE, (place + 1) * PAGE, 2)
+        for place in places[window:]:
+            payload.advise(DONTNEED, place * PAGE, (place + 1) * PAGE)
         while os.getppid() == parent:
             for _ in range(20000 // count // 50):
-                payload.advise(DONTNEED, page * PAGE, (page + 1) * PAGE)
-                ahead = (page + window) % half
-                payload.write(ahead * PAGE, (ahead + 1) * PAGE, 3)
-                page = (page + 1) % half
+                last, next_ = places[position], places[(position + window) % len(places)]
+                payload.advise(DONTNEED, last * PAGE, (last + 1) * PAGE)
+                payload.write(next_ * PAGE, (next_ + 1) * PAGE, 3)
+                position = (position + 1) % len(places)
             time.sleep(0.02)
         os._exit(0)
 

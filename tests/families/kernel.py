@@ -2,6 +2,7 @@
 import array
 import collections
 import ctypes
+import glob
 import mmap
 import os
 import re
@@ -133,7 +134,20 @@ def page_sets(pids, wanted=lambda mapping: True):
     return named, counts
 
 
+def out_of_reach():
+    """The anonymous memory of processes that root may not examine either, which no report can count."""
+    total = 0
+    for path in glob.glob("/proc/[0-9]*"):
+        try:
+            open(path + "/smaps").close()
+        except PermissionError:
+            total += figures(path + "/status", "RssAnon", "VmSwap")
+        except FileNotFoundError:
+            pass  # has ended
+    return total
+
+
 def user_memory():
-    """Anonymous and shared memory, resident or swapped, of the whole machine."""
+    """Anonymous and shared memory, resident or swapped, of all that root may examine."""
     read("/proc/sys/vm/stat_refresh")  # has the counts of all CPUs added up
-    return figures("/proc/meminfo", "AnonPages", "Shmem", "SwapTotal") - figures("/proc/meminfo", "SwapFree")
+    return figures("/proc/meminfo", "AnonPages", "Shmem", "SwapTotal") - figures("/proc/meminfo", "SwapFree") - out_of_reach()
