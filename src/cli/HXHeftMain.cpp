@@ -32,16 +32,12 @@ constexpr char kUsage[] =
     "\t--vmObjectDirty\t\t\tinterpret dirty memory as viewed by VM objects in the kernel\n"
     "\t--unmapped\t\t\t\tsearch all processes for unmapped memory owned by the target processes\n";
 
-} // namespace
-
 void printUsage() {
     std::string defaultSort = HXHeftArgs::sortColumnNames().front();
     for (char &c : defaultSort)
         c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
     printf(kUsage, defaultSort.c_str());
 }
-
-namespace {
 
 int optionsFailed(const HXError &error) {
     if (error.localizedDescription) fprintf(stderr, "%s\n", error.localizedDescription->c_str());

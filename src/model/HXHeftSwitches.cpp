@@ -8,7 +8,6 @@
 
 namespace {
 
-constexpr char kSetting[] = "vm.self_region_heft";
 std::atomic<bool> isDisabled{false};
 std::atomic<bool> isWholeMachine{false};
 
@@ -20,7 +19,7 @@ bool HXHeftSwitches::breakDownPhysHeft() {
     if (cached >= 0) return cached != 0;
     int32_t value = 0;
     size_t size = sizeof value;
-    if (platform.sysctlbyname(kSetting, &value, &size, nullptr, 0) != 0) {
+    if (platform.sysctlbyname(kSelfRegionHeftSetting, &value, &size, nullptr, 0) != 0) {
         if (errno != ENOENT) std::perror("Unable to retrieve status of physical heft data collection");
         value = 0;
     }
@@ -31,7 +30,8 @@ bool HXHeftSwitches::breakDownPhysHeft() {
 void HXHeftSwitches::setBreakDownPhysHeft(bool breakDown) {
     HXPlatform &platform = HXPlatform::current();
     const int32_t value = breakDown ? 1 : 0;
-    if (platform.sysctlbyname(kSetting, nullptr, nullptr, &value, sizeof value) != 0 && errno != ENOENT)
+    if (platform.sysctlbyname(kSelfRegionHeftSetting, nullptr, nullptr, &value, sizeof value) != 0 &&
+        errno != ENOENT)
         std::perror("Unable to configure physical heft data collection");
     platform.cache().selfRegionHeft = -1;
 }

@@ -48,7 +48,7 @@ constexpr TagName kTagNames[] = {
     {91, "video bitstream"},
 };
 
-constexpr uint32_t kFirstAppTag = 240;
+constexpr uint32_t kFirstAppTag = HXHostTagLastNamed + 1;
 constexpr uint32_t kLastAppTag = 255;
 
 using NameTable = std::array<HXString, 256>;

@@ -168,6 +168,10 @@ inline constexpr int32_t CTL_KERN = 1;
 inline constexpr int32_t KERN_ARGMAX = 8;
 inline constexpr int32_t KERN_PROCARGS2 = 49;
 
+// Names for `sysctlbyname`.
+inline constexpr char kSelfRegionHeftSetting[] = "vm.self_region_heft";
+inline constexpr char kOwnedObjectsSetting[] = "vm.get_owned_vmobjects";
+
 inline constexpr int32_t RUSAGE_INFO_V4 = 4;
 
 // `proc_pid_rusage` flavor 4; only the heft figures (bytes) are read.

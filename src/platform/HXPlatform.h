@@ -17,6 +17,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 // Answers of a host that hold for the whole run, kept by those who asked.
@@ -29,8 +30,8 @@ struct HXHostCache {
     int64_t ledgerEntryCount = 0;
 };
 
-// Bytes, as HXPlatform::walkShortfall tells them.
-struct HXWalkShortfall {
+// Bytes of anonymous, shared and huge pages and of private swapped ones, the lazily freed included.
+struct HXWalkDifference {
     uint64_t regionsSize;
     uint64_t countersSize;
 };
@@ -96,7 +97,7 @@ class HXPlatform {
     // After the walk of a task whose memory moved while it was read: what its regions and what its own
     // counters add up to, which differ by more than 1 % and 1 MiB even on a second reading. None where they
     // agree, and on hosts whose memory stands still.
-    virtual std::optional<HXWalkShortfall> walkShortfall(mach_port_t) { return std::nullopt; }
+    virtual std::optional<HXWalkDifference> walkDifference(mach_port_t) { return std::nullopt; }
 
     // Tells the host that the tasks open now are examined together: it finds out what they share, which is
     // told among them. For a task that is opened later, or whose memory was read before, every page is its

@@ -64,9 +64,9 @@ class HXServices {
     // Whether a file system object exists at `path`; links are followed.
     virtual bool stat(const std::string &path) = 0;
 
-    // fopen(3): a stream, which the caller closes with std::fclose, or null with errno set. Reading waits for
-    // a fifo's writer, but for one that does not come within ten seconds no longer (ETIMEDOUT).
-    virtual std::FILE *fopen(const std::string &path, const char *mode) = 0;
+    // A stream to read, which the caller closes with std::fclose, or null with errno set. Waits for a fifo's
+    // writer, but for one that does not come within ten seconds no longer (ETIMEDOUT).
+    virtual std::FILE *openForReading(const std::string &path) = 0;
 
     // The same for reading a regular file. Never waits: a folder (EISDIR) and a fifo or device (EINVAL) are
     // not even opened.

@@ -1,6 +1,7 @@
 #include "process/HXKernelProcess.h"
 
 #include "platform/HXPlatform.h"
+#include "platform/capture/HXFixedText.h"
 
 #include <array>
 #include <cinttypes>
@@ -44,11 +45,6 @@ constexpr uint64_t kSourceCode = 1, kSourceZone = 2, kSourceTag = 3, kSourceCoun
 
 uint64_t siteType(const mach_memory_info_record &info) {
     return info.flags & VM_KERN_SITE_TYPE;
-}
-
-template <size_t Width>
-std::string textOfField(const char (&field)[Width]) {
-    return std::string(field, strnlen(field, Width));
 }
 
 std::string hexadecimal(uint64_t number) {
@@ -108,7 +104,7 @@ uint64_t objectIdForSite(const mach_memory_info_record &info) {
 }
 
 std::string nameForSite(const mach_memory_info_record &info, const HXKernelProcess::SiteNames &names) {
-    if (info.flags & VM_KERN_SITE_NAMED) return textOfField(info.name);
+    if (info.flags & VM_KERN_SITE_NAMED) return std::string(HXTextOfField(info.name));
     if (const SiteKind *const kind = kindOfSite(info)) return kind->name(info.site, names);
     return "unknown site (" + hexadecimal(siteType(info)) + ", " + hexadecimal(info.site) + ")";
 }
@@ -190,7 +186,7 @@ void HXKernelProcess::gatherData() {
 void HXKernelProcess::_addZones(std::span<const mach_zone_info> zones, ZoneNames names) {
     for (size_t i = 0; i < zones.size(); i++) {
         HXMemoryRegion &region = _memoryRegions.emplace_back();
-        region.setName(i < names.size() ? textOfField(names[i].mzn_name) : "unknown");
+        region.setName(i < names.size() ? HXTextOfField(names[i].mzn_name) : "unknown");
         setZoneSizes(region, zones[i]);
         region.setDetailedName("zone");
         region.setObject_id((kSourceZone << 32) + i);
@@ -239,7 +235,7 @@ HXSymbolicatorGuard HXKernelProcess::_createSymbolicator() {
 std::string HXKernelProcess::_nameForWiredInfo(const mach_memory_info_record &info, const SiteNames &names) {
     std::string name = nameForSite(info, names);
     if ((info.flags & VM_KERN_SITE_ZONE) && info.zone < names.zones.size())
-        name += "[" + textOfField(names.zones[info.zone].mzn_name) + "]";
+        name += "[" + std::string(HXTextOfField(names.zones[info.zone].mzn_name)) + "]";
     return name;
 }
 

@@ -2,6 +2,7 @@
 
 #include "model/HXHeftSwitches.h"
 #include "platform/HXPlatform.h"
+#include "platform/capture/HXFixedText.h"
 #include "process/HXKernelProcess.h"
 #include "process/HXProcessSnapshot.h"
 #include "process/HXUserProcess.h"
@@ -15,10 +16,6 @@ namespace {
 std::vector<std::string> &globalErrorList() {
     static std::vector<std::string> list;
     return list;
-}
-
-std::string textOfField(const char *field, size_t width) {
-    return std::string(field, strnlen(field, width));
 }
 
 // The path in an argument area: after the count's first zero byte and the zeros that follow it. None when the
@@ -106,8 +103,8 @@ std::vector<std::string> HXProcess::globalErrors() {
 }
 
 std::string HXProcess::_nameForBsdInfoCommName(const proc_bsdinfo &info) {
-    if (info.pbi_name[0] != '\0') return textOfField(info.pbi_name, sizeof info.pbi_name);
-    if (info.pbi_comm[0] != '\0') return textOfField(info.pbi_comm, sizeof info.pbi_comm);
+    if (info.pbi_name[0] != '\0') return std::string(HXTextOfField(info.pbi_name));
+    if (info.pbi_comm[0] != '\0') return std::string(HXTextOfField(info.pbi_comm));
     return "Unknown";
 }
 

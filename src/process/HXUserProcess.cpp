@@ -129,7 +129,7 @@ bool HXUserProcess::handOverRegion(uint64_t address, uint64_t size, const vm_reg
     if (platform.mach_vm_purgable_control(_task.get(), address, VM_PURGABLE_GET_STATE, &purgeState) !=
         KERN_SUCCESS)
         purgeState = VM_PURGABLE_DENY;
-    char buffer[1024];
+    char buffer[kMaxPathBytes];
     std::optional<std::string_view> path;
     if (info.external_pager) {
         const int32_t length = platform.proc_regionfilename(pid(), address, buffer, sizeof buffer);

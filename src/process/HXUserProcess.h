@@ -67,8 +67,8 @@ class HXUserProcess : public HXProcess {
     // Adds a warning with the text of the current errno and prints it.
     void _addErrnoWarningWithDescription(const std::string &description);
 
-    uint64_t _phys_heft = 0;
-    uint64_t _phys_heft_peak = 0;
+    uint64_t _phys_heft{};
+    uint64_t _phys_heft_peak{};
     std::vector<HXImage> _images; // sorted by start
 
   private:

@@ -12,8 +12,6 @@ namespace {
 // The user tag of memory that several processes have a hand in: never taken as owned by the one that maps it.
 constexpr uint32_t kNeverOwnedTag = 87;
 
-constexpr char kOwnedObjectsSetting[] = "vm.get_owned_vmobjects";
-
 // What of `all` is left after `taken`; a kernel whose counts disagree leaves none.
 uint64_t left(uint64_t all, uint64_t taken) {
     return all > taken ? all - taken : 0;
@@ -134,11 +132,11 @@ void HXUserProcess::_gatherMemoryData() {
 
 void HXUserProcess::warnOfMovedMemory() {
     if (!_isAlive()) return;
-    const auto shortfall = HXPlatform::current().walkShortfall(_task.get());
-    if (!shortfall) return;
+    const auto difference = HXPlatform::current().walkDifference(_task.get());
+    if (!difference) return;
     _warnings.push_back(displayString() + ": memory changed while it was read: regions " +
-                        std::to_string(shortfall->regionsSize) + " bytes, counters " +
-                        std::to_string(shortfall->countersSize) + " bytes");
+                        std::to_string(difference->regionsSize) + " bytes, counters " +
+                        std::to_string(difference->countersSize) + " bytes");
 }
 
 // Returns true to stop the walk.

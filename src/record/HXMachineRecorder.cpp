@@ -14,7 +14,6 @@ using namespace HXMachineFormat;
 namespace {
 
 constexpr int32_t kKernelPid = 0;
-constexpr uint32_t kLastDescribedTag = 239; // from 240 on tags are the program's own
 
 } // namespace
 
@@ -207,7 +206,7 @@ void HXMachineRecorder::recordHeldByKernel(bool isWholeMachine) {
 
 void HXMachineRecorder::recordTags(const std::set<uint32_t> &tags) {
     for (const uint32_t tag : tags) {
-        if (tag > kLastDescribedTag) break;
+        if (tag > HXHostTagLastNamed) break; // the rest are the program's own
         const auto name = _host.GXRegionTypeDescriptionForTagShareProtAndPager(tag, 0, 0, 0);
         if (!name) continue;
         const bool fromProgram = tag >= HXHostTagFirstNamed && tag <= HXHostTagLastNamed;

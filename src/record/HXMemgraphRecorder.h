@@ -25,9 +25,10 @@ class HXMemgraphRecorder {
         std::string name;
         bool breakDownPhysHeft;
     };
-    // Writes the graph to `out`, which stays the caller's. The setting "vm.self_region_heft" is changed
-    // meanwhile. False with the reason when the process cannot be examined, vanishes meanwhile or does not
-    // answer, or when writing fails.
+    // Writes the graph to `out`, which stays the caller's, of a process of the current platform. The setting
+    // "vm.self_region_heft" is changed meanwhile and then put back, unless the process does not answer. False
+    // with the reason when the process cannot be examined, vanishes meanwhile or does not answer, or when
+    // writing fails.
     static bool record(HXPlatform &host, std::FILE *out, CategoryName categoryName, const Subject &subject,
                        std::string *reason);
 

@@ -351,18 +351,19 @@ void HXProcessRecorder::recordImages(int32_t pid) {
     });
 }
 
-// Whatever the host answers to "vm.get_owned_vmobjects"; none with errno set when it fails.
+// Whatever the host answers to kOwnedObjectsSetting; none with errno set when it fails.
 std::optional<std::vector<char>> HXProcessRecorder::ownedReply() {
-    constexpr char setting[] = "vm.get_owned_vmobjects";
     constexpr size_t spare = 16 * sizeof(owned_vmobject);
     const mach_port_t task = _task.get();
     std::vector<char> reply;
     size_t bytes = 0;
-    if (_host.sysctlbyname(setting, nullptr, &bytes, &task, sizeof task) != 0) return std::nullopt;
+    if (_host.sysctlbyname(kOwnedObjectsSetting, nullptr, &bytes, &task, sizeof task) != 0)
+        return std::nullopt;
     do { // until it was not cut
         reply.resize(bytes + spare);
         bytes = reply.size();
-        if (_host.sysctlbyname(setting, reply.data(), &bytes, &task, sizeof task) != 0) return std::nullopt;
+        if (_host.sysctlbyname(kOwnedObjectsSetting, reply.data(), &bytes, &task, sizeof task) != 0)
+            return std::nullopt;
     } while (bytes >= reply.size());
     reply.resize(bytes);
     return reply;

@@ -1,12 +1,9 @@
 #include "record/HXRegionHeftSetting.h"
 
-namespace {
-constexpr char kName[] = "vm.self_region_heft";
-}
-
 HXRegionHeftSetting::HXRegionHeftSetting(HXPlatform &host) : _host(host) {
     size_t bytes = sizeof _current;
-    if (_host.sysctlbyname(kName, &_current, &bytes, nullptr, 0) == 0 && bytes == sizeof _current)
+    if (_host.sysctlbyname(kSelfRegionHeftSetting, &_current, &bytes, nullptr, 0) == 0 &&
+        bytes == sizeof _current)
         _found = _current;
 }
 
@@ -16,5 +13,6 @@ HXRegionHeftSetting::~HXRegionHeftSetting() {
 
 void HXRegionHeftSetting::set(int32_t value) {
     if (!_found || value == _current) return;
-    if (_host.sysctlbyname(kName, nullptr, nullptr, &value, sizeof value) == 0) _current = value;
+    if (_host.sysctlbyname(kSelfRegionHeftSetting, nullptr, nullptr, &value, sizeof value) == 0)
+        _current = value;
 }

@@ -5,6 +5,7 @@ document or a temporary file.
 usage: tests/attack/documents.py FOLDER-OF-THE-PROGRAMS"""
 import atexit, os, shutil, signal, subprocess, sys, tempfile, time
 
+if len(sys.argv) < 2: sys.exit(__doc__)
 programs = os.path.abspath(sys.argv[1])
 folder = tempfile.mkdtemp(prefix='heft-documents-')
 atexit.register(shutil.rmtree, folder)

@@ -1,7 +1,7 @@
 #!/usr/bin/env python3
 """Few pages in very large shared mappings: heft, heft-record and heft-replay end within LIMIT seconds each.
 
-usage: sparse_mappings.py [FOLDER_OF_THE_PROGRAMS]
+usage: tests/attack/sparse_mappings.py [FOLDER_OF_THE_PROGRAMS]
 """
 import mmap
 import os

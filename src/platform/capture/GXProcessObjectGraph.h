@@ -51,9 +51,6 @@ struct GXProcessFacts {
 
 class GXProcessObjectGraph {
   public:
-    // How every memory-graph file begins.
-    static constexpr std::string_view header = "heft-memgraph 1";
-
     // The graph that a memory-graph file describes; null with the reason when it breaks the form, is too long
     // for any graph or cannot be read. The stream is read on from where it is, in pieces, and stays open.
     // Tags that programs name become those that `tags` has for the names.

@@ -36,6 +36,7 @@ struct HXMember {
         constexpr HXFieldKind unsignedKinds[] = {HXFieldKind::unsigned8, HXFieldKind::unsigned16,
                                                  HXFieldKind::unsigned32, HXFieldKind::unsigned64};
         HXMember member(unsignedKinds[std::bit_width(sizeof(Number)) - 1]);
+        static_assert(!std::signed_integral<Number> || sizeof(Number) == sizeof(int32_t));
         if (std::signed_integral<Number>) member.kind = HXFieldKind::signed32;
         if (std::same_as<Number, bool>) member.kind = HXFieldKind::boolean;
         member.bytes = sizeof(Number);

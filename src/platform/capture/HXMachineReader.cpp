@@ -34,7 +34,7 @@ static std::unique_ptr<HXMachine> machineOf(HXCaptureReader &&reader, std::strin
 }
 
 std::unique_ptr<HXMachine> HXMachine::load(HXServices &files, const std::string &path, std::string *reason) {
-    const std::unique_ptr<std::FILE, int (*)(std::FILE *)> stream(files.fopen(path, "r"), std::fclose);
+    const std::unique_ptr<std::FILE, int (*)(std::FILE *)> stream(files.openForReading(path), std::fclose);
     if (stream) return machineOf(HXCaptureReader(format, stream.get()), reason);
     *reason = std::strerror(errno);
     return nullptr;

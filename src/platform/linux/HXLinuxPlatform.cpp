@@ -22,7 +22,6 @@ namespace {
 
 // As long as the arguments of most systems may be together; more is cut (HXPlatform::sysctl).
 constexpr uint32_t kArgumentAreaSize = 131072;
-constexpr const char *kChargeSwitch = "vm.self_region_heft";
 
 int32_t failed(int error) {
     errno = error;
@@ -115,7 +114,7 @@ int32_t HXLinuxPlatform::ledger(int32_t command, int32_t pid, void *buffer, int6
     }
     if (command == LEDGER_TEMPLATE_INFO) {
         ledger_template_info entry{};
-        std::strcpy(entry.lti_name, "page_table");
+        kPageTableEntry.copy(entry.lti_name, sizeof entry.lti_name);
         std::strcpy(entry.lti_group, "physmem");
         std::strcpy(entry.lti_units, "bytes");
         std::memcpy(buffer, &entry, sizeof entry);
@@ -148,7 +147,7 @@ int32_t HXLinuxPlatform::sysctl(const int32_t *name, uint32_t nameLength, void *
 
 int32_t HXLinuxPlatform::sysctlbyname(const char *name, void *old, size_t *oldBytes, const void *newValue,
                                       size_t newBytes) {
-    if (std::strcmp(name, kChargeSwitch) != 0) return failed(ENOENT);
+    if (std::strcmp(name, kSelfRegionHeftSetting) != 0) return failed(ENOENT);
     uint32_t value = 0;
     if (newValue != nullptr && newBytes != sizeof value) return failed(EINVAL);
     if (copyOut(_reportsCharge.load(), old, oldBytes) != 0) return -1;

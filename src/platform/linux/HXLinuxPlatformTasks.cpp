@@ -155,13 +155,11 @@ std::vector<vm_region_share> HXLinuxPlatform::mach_vm_region_shares(mach_port_t 
     return task->sharesOf(index);
 }
 
-std::optional<HXWalkShortfall> HXLinuxPlatform::walkShortfall(mach_port_t port) {
+std::optional<HXWalkDifference> HXLinuxPlatform::walkDifference(mach_port_t port) {
     HXLinuxTask *task = _tasks.find(port);
     if (task == nullptr) return std::nullopt;
     addressSpaceOf(task);
-    const auto &difference = task->difference();
-    if (!difference) return std::nullopt;
-    return HXWalkShortfall{difference->regionsSize, difference->countersSize};
+    return task->difference();
 }
 
 std::vector<task_held_object> HXLinuxPlatform::task_held_objects(mach_port_t port, HeldBy by) {

@@ -107,12 +107,10 @@ HXDescriptor openAsItStands(const fs::path &path) {
 
 } // namespace
 
-std::FILE *HXLinuxServices::fopen(const std::string &path, const char *mode) {
+std::FILE *HXLinuxServices::openForReading(const std::string &path) {
     struct ::stat status;
-    if (mode[0] == 'r' && ::stat(path.c_str(), &status) == 0 && S_ISFIFO(status.st_mode))
-        return openFifo(path);
-    const std::string closedOnExecution = std::string(mode) + "e";
-    return std::fopen(path.c_str(), closedOnExecution.c_str());
+    if (::stat(path.c_str(), &status) == 0 && S_ISFIFO(status.st_mode)) return openFifo(path);
+    return std::fopen(path.c_str(), "re");
 }
 
 std::FILE *HXLinuxServices::openRegularFile(const std::string &path) {

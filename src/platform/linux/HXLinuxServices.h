@@ -18,7 +18,7 @@ class HXLinuxServices : public HXServices {
     HXOptionScan getopt_long(int argc, char *const argv[], const char *shortOptions,
                              const std::vector<HXLongOption> &options, bool restart) override;
     bool stat(const std::string &path) override;
-    std::FILE *fopen(const std::string &path, const char *mode) override;
+    std::FILE *openForReading(const std::string &path) override;
     std::FILE *openRegularFile(const std::string &path) override;
     std::optional<HXPendingFile> createPendingFile(const std::string &path) override;
     bool commitPendingFile(HXPendingFile &file) override;

@@ -19,10 +19,11 @@ size_t usableProcessorCount() {
         if (set == nullptr) break;
         const size_t bytes = CPU_ALLOC_SIZE(processors);
         const bool known = ::sched_getaffinity(0, bytes, set) == 0;
+        const int error = errno;
         const int count = known ? CPU_COUNT_S(bytes, set) : 0;
         CPU_FREE(set);
         if (known) return static_cast<size_t>(std::max(count, 1));
-        if (errno != EINVAL) break;
+        if (error != EINVAL) break;
     }
     return 1;
 }

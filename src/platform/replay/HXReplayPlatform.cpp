@@ -143,8 +143,8 @@ int32_t HXReplayPlatform::argumentArea(int32_t pid, void *old, size_t *oldBytes)
 int32_t HXReplayPlatform::sysctlbyname(const char *name, void *old, size_t *oldBytes, const void *newValue,
                                        size_t newBytes) {
     const std::string_view setting = name;
-    if (setting == "vm.self_region_heft") return selfRegionHeft(old, oldBytes, newValue, newBytes);
-    if (setting == "vm.get_owned_vmobjects") return ownedObjects(old, oldBytes, newValue, newBytes);
+    if (setting == kSelfRegionHeftSetting) return selfRegionHeft(old, oldBytes, newValue, newBytes);
+    if (setting == kOwnedObjectsSetting) return ownedObjects(old, oldBytes, newValue, newBytes);
     return failWith(ENOENT);
 }
 

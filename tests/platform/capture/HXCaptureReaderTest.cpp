@@ -1,6 +1,7 @@
 // What breaks the form of captures, and how files are read.
 #include "platform/capture/GXProcessObjectGraph.h"
 #include "platform/capture/HXMachine.h"
+#include "platform/capture/HXMemgraphFormat.h"
 #include "platform/linux/HXLinuxServices.h"
 #include "support/HXBuilders.h"
 
@@ -19,7 +20,7 @@ TEST(HXCaptureForms, NameTheLineThatBreaksThem) {
     const auto check = [&] {
         std::string reason;
         HXNamedTags tags;
-        const bool isGraph = file.starts_with(GXProcessObjectGraph::header);
+        const bool isGraph = file.starts_with(HXMemgraphFormat::format.header);
         const bool loaded = isGraph
                                 ? GXProcessObjectGraph::directedGraphWithData(file, tags, &reason) != nullptr
                                 : HXMachine::loadText(file, &reason) != nullptr;
@@ -72,8 +73,10 @@ TEST(HXMachineReader, ReadsFilesInPiecesAsItReadsText) {
         EXPECT_EQ(machine->strings.text(read[i - 1].path), pathOf(i));
     }
     const std::string large(40 << 20, 'x');
-    const std::pair<std::string, const char *> broken[] = {
+    const std::pair<std::string, std::string> broken[] = {
         {text + "x\n", "line 10003: unknown record \"x\""},
+        {text + std::string(60, 'x') + "\n", "line 10003: unknown record \"" + std::string(60, 'x') + "\""},
+        {text + std::string(61, 'x') + "\n", "line 10003: unknown record \"" + std::string(60, 'x') + "…\""},
         {text + "zone\tname=" + large, "line 10003: the record is longer than 1 MiB"},
         {text + "#" + large + "\nx", "line 10004: unknown record \"x\""},
         {large, "not a machine file"},

@@ -357,11 +357,11 @@ TEST_F(HXLinuxPlatformTest, TellsWhenMemoryMovedWhileItWasRead) {
                                                         " kB\nRssShmem: " + std::to_string(item.rssShmem) +
                                                         " kB\nVmSwap: " + std::to_string(item.swap) +
                                                         " kB\nVmPTE: 4 kB\nVmRSS: 1 kB\nThreads: 1\n");
-        const auto shortfall = platform.walkShortfall(open(pid));
-        ASSERT_EQ(shortfall.has_value(), item.expected.has_value()) << pid;
-        if (!shortfall) continue;
-        EXPECT_EQ(shortfall->regionsSize, item.expected->first * 1024) << pid;
-        EXPECT_EQ(shortfall->countersSize, item.expected->second * 1024) << pid;
+        const auto difference = platform.walkDifference(open(pid));
+        ASSERT_EQ(difference.has_value(), item.expected.has_value()) << pid;
+        if (!difference) continue;
+        EXPECT_EQ(difference->regionsSize, item.expected->first * 1024) << pid;
+        EXPECT_EQ(difference->countersSize, item.expected->second * 1024) << pid;
     }
 }
 

@@ -9,8 +9,8 @@
 // Where the program headers lie, by the file's first bytes.
 struct HXElfHeaderPlace {
     bool is64bit = true;
-    uint64_t offset = 0;
-    uint32_t count = 0;
+    uint64_t offset{};
+    uint32_t count{};
 
     uint64_t size() const; // bytes
 };
@@ -21,18 +21,18 @@ std::optional<HXElfHeaderPlace> HXParseElfFileHeader(std::string_view bytes);
 
 // A part of the file that is loaded; all in bytes, addresses before relocation.
 struct HXElfLoad {
-    uint64_t offset = 0;
-    uint64_t fileSize = 0;
-    uint64_t address = 0;
-    uint64_t memorySize = 0; // at least `fileSize`; the rest is zero-filled
-    bool writable = false;
-    bool executable = false;
+    uint64_t offset{};
+    uint64_t fileSize{};
+    uint64_t address{};
+    uint64_t memorySize{}; // at least `fileSize`; the rest is zero-filled
+    bool writable{};
+    bool executable{};
 };
 struct HXElfHeaders {
     std::vector<HXElfLoad> loads; // ascending, not overlapping; at least one is executable
     // What is read-only once relocated; empty: nothing.
-    uint64_t relocatedStart = 0;
-    uint64_t relocatedEnd = 0;
+    uint64_t relocatedStart{};
+    uint64_t relocatedEnd{};
 };
 // None when the headers make no sense. `bytes`: place.size() bytes from place.offset.
 std::optional<HXElfHeaders> HXParseElfProgramHeaders(std::string_view bytes, const HXElfHeaderPlace &place);

@@ -26,8 +26,8 @@ class HXLinuxKernelSymbolicator : public RVSymbolicator {
   private:
     struct Source {
         std::string path;
-        int32_t line = 0;
-        uint64_t size = 0;
+        int32_t line{};
+        uint64_t size{};
     };
     void loadSymbols();
     void loadSources();

@@ -13,10 +13,10 @@
 // One cache of /proc/slabinfo, version 2.x (slabinfo(5)).
 struct HXSlabCache {
     std::string_view name;
-    uint64_t activeObjects = 0;
-    uint64_t objectSize = 0; // bytes
-    uint64_t slabs = 0;
-    uint64_t pagesPerSlab = 0;
+    uint64_t activeObjects{};
+    uint64_t objectSize{}; // bytes
+    uint64_t slabs{};
+    uint64_t pagesPerSlab{};
     // Whether the kernel accounts its slabs as SReclaimable; none where sysfs does not tell. Not in slabinfo.
     std::optional<bool> reclaimable;
 };
@@ -27,10 +27,10 @@ std::vector<HXSlabCache> HXParseSlabinfo(std::string_view text);
 // per-CPU space (`pcpu_get_vm_areas`, counted as Percpu), and freed areas that are not yet unmapped
 // (`unpurged`).
 struct HXVmallocArea {
-    std::string_view function;  // the caller's symbol without its offset; empty when it is not named
-    std::string_view module;    // the module the caller lies in; empty for the kernel proper
-    uint64_t callerAddress = 0; // when the caller is no symbol: its address
-    uint64_t pages = 0;
+    std::string_view function; // the caller's symbol without its offset; empty when it is not named
+    std::string_view module;   // the module the caller lies in; empty for the kernel proper
+    uint64_t callerAddress{};  // when the caller is no symbol: its address
+    uint64_t pages{};
 };
 std::vector<HXVmallocArea> HXParseVmallocinfo(std::string_view text);
 
@@ -81,9 +81,9 @@ std::optional<uint64_t> HXParseZramUsedSize(std::string_view text);
 
 // One allocation site of /proc/allocinfo (kernels with memory allocation profiling, since 6.10).
 struct HXAllocationSite {
-    uint64_t size = 0; // bytes
+    uint64_t size{}; // bytes
     std::string_view path;
-    int32_t line = 0;
+    int32_t line{};
     std::string_view module; // empty for the kernel proper
     std::string_view function;
 };
@@ -91,10 +91,10 @@ std::vector<HXAllocationSite> HXParseAllocinfo(std::string_view text);
 
 // One symbol of /proc/kallsyms.
 struct HXKernelSymbol {
-    uint64_t address = 0;
+    uint64_t address{};
     std::string_view name;
     std::string_view module; // empty for the kernel proper
-    bool isCode = false;
+    bool isCode{};
 };
 // All symbols, by ascending address; several at one address in the order of the file, whose first is the one
 // that the kernel itself names the address by. Empty when the kernel hides its addresses by showing zeros.

@@ -39,7 +39,7 @@ uint8_t tagOf(const HXMapping &mapping, uint8_t namedTag) {
     if (!isAccessible(mapping)) return HXHostTagGuard;
     if (namedTag != 0) return namedTag;
     const bool huge = mapping.has(HXMappingHugePages);
-    const bool anonymous = mapping.has(HXMappingShared) || mapping.isFile();
+    const bool isShared = mapping.has(HXMappingShared) || mapping.isFile();
     switch (mapping.kind) {
     case HXPathKind::heap:
         return HXHostTagHeap;
@@ -58,7 +58,7 @@ uint8_t tagOf(const HXMapping &mapping, uint8_t namedTag) {
         break;
     }
     if (huge) return HXHostTagHugePages;
-    if (anonymous) return HXHostTagSharedAnonymous;
+    if (isShared) return HXHostTagSharedAnonymous;
     return mapping.has(HXMappingExecutable) ? HXHostTagAnonymousCode : HXHostTagAnonymous;
 }
 

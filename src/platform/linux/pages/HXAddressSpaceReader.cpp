@@ -138,7 +138,7 @@ void Reader::readMappings(const HXDescriptor &file) {
         std::string_view text(buffer.data(), length);
         while (parser.next(&text, complete, &entry))
             take(entry);
-        if (text.size() == buffer.size()) text = {}; // no mapping's text is that long
+        if (text.size() == buffer.size()) text.remove_prefix(text.size()); // no mapping's text is that long
         std::memmove(buffer.data(), text.data(), text.size());
         length = text.size();
     }

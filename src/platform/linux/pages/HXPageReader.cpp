@@ -219,7 +219,7 @@ void HXPageReader::takeRun(const HXMapping &mapping, uint64_t start, uint64_t en
 // Pages of shared memory that are swapped out have no entries in page tables.
 void HXPageReader::takeHole(const HXMapping &mapping, uint64_t start, uint64_t end) {
     if (start == end || !mapping.has(HXMappingSwapBacked) || _left.swapped.pagesLeft == 0) return;
-    if (!_swapFile) _swapFile = HXOpenMappedFile(_process, mapping);
+    if (!_swapFile && _left.swapped.callsLeft > 0) _swapFile = HXOpenMappedFile(_process, mapping);
     const uint64_t first = (mapping.offset + (start - mapping.start)) >> _pageShift;
     for (const HXPageSpan &span :
          HXFindSwapped(_swapFile, _pageShift, {first, (end - start) >> _pageShift}, &_left.swapped)) {

@@ -3,17 +3,12 @@
 // to one that had been, so that it is in no mapping, or the other way round, so that it is in two.
 #pragma once
 
+#include "platform/HXPlatform.h"
 #include "platform/linux/memory/HXAddressSpace.h"
 #include "platform/linux/procfs/HXProcText.h"
 
 #include <cstdint>
 #include <optional>
-
-// Bytes of anonymous, shared and huge pages and of private swapped ones, the lazily freed included.
-struct HXWalkDifference {
-    uint64_t regionsSize;
-    uint64_t countersSize;
-};
 
 struct HXWalkTolerance {
     uint32_t pageShift;

@@ -11,16 +11,16 @@
 // /proc/PID/stat, as far as it is read.
 struct HXStatRecord {
     static constexpr uint32_t kernelThreadFlag = 0x00200000; // PF_KTHREAD
-    int32_t pid = 0;
-    uint8_t commLength = 0;
+    int32_t pid{};
+    uint8_t commLength{};
     char commBytes[64]; // as the kernel has it, not safe text
     char state = '?';
-    int32_t ppid = 0;
-    uint32_t pgid = 0;
-    uint32_t flags = 0;
-    uint32_t threadCount = 0;
-    uint64_t startTime = 0;  // clock ticks since boot
-    uint64_t startStack = 0; // an address; 0 when the reader may not know it
+    int32_t ppid{};
+    uint32_t pgid{};
+    uint32_t flags{};
+    uint32_t threadCount{};
+    uint64_t startTime{};  // clock ticks since boot
+    uint64_t startStack{}; // an address; 0 when the reader may not know it
 
     std::string_view comm() const { return {commBytes, commLength}; }
     bool isKernelThread() const { return (flags & kernelThreadFlag) != 0; }

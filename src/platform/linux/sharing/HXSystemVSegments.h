@@ -9,12 +9,12 @@
 #include <vector>
 
 struct HXSystemVSegment {
-    uint64_t identifier = 0; // the inode number of mappings of it
-    int64_t creatorPid = 0;  // as the reader's namespaces number it, like the user
-    uint64_t creatorUser = 0;
-    uint64_t attachedCount = 0;
-    uint64_t residentSize = 0; // bytes
-    uint64_t swappedSize = 0;
+    uint64_t identifier{}; // the inode number of mappings of it
+    int64_t creatorPid{};  // as the reader's namespaces number it, like the user
+    uint64_t creatorUser{};
+    uint64_t attachedCount{};
+    uint64_t residentSize{}; // bytes
+    uint64_t swappedSize{};
 };
 
 // The segments that the text of /proc/sysvipc/shm tells, whose columns its first line names.
