@@ -8,7 +8,11 @@
 
 namespace {
 
-constexpr uint64_t kWindowPages = 2048;
+// A member's entries of a window are read at once, so that memory which the member exchanges for other memory
+// meanwhile is seldom counted twice or not at all.
+constexpr uint64_t kWindowPages = 16384;
+// Of memory that is mostly holes.
+constexpr uint64_t kSparseWindowPages = 2048, kEntriesOfSparsePage = 64;
 // So much memory is taken for the entries of a window: those of a large family are shorter.
 constexpr uint64_t kWindowEntries = uint64_t{1} << 19;
 constexpr size_t kSetsOfStretch = size_t{1} << 15;
@@ -103,7 +107,9 @@ class ColumnReader {
     std::vector<uint64_t> _allBits; // of these
     std::vector<uint32_t> _layout;  // of the strip, then of the last that was counted
     uint64_t _windowStart = 0;
-    size_t _stripOffset = 0; // of the strip in the window
+    uint64_t _windowEntries = 0, _windowFound = 0; // read, and of these such as tell a page
+    bool _isSparse = false;                        // the last window
+    size_t _stripOffset = 0;                       // of the strip in the window
     uint32_t _layoutNumber = HXFamilyPages::kNoMapping;
     std::unordered_map<uint32_t, HXPageCount> _counts; // of the layout, by set
     uint32_t _lastSet = HXSharerSets::kNone;
@@ -142,7 +148,8 @@ std::unique_ptr<HXFamilyPages> ColumnReader::read() {
         _rows[member].range = static_cast<size_t>(found - all.begin());
     }
     for (uint64_t at = nextPage(stretch.first); at < stretch.end; at = nextPage(at)) {
-        const uint64_t end = std::min((at / _windowPages + 1) * _windowPages, stretch.end);
+        const uint64_t pages = _isSparse ? std::min(kSparseWindowPages, _windowPages) : _windowPages;
+        const uint64_t end = std::min(at + pages, stretch.end);
         readWindow(at, end);
         at = end;
     }
@@ -166,6 +173,7 @@ uint64_t ColumnReader::nextPage(uint64_t from) {
 
 void ColumnReader::readWindow(uint64_t first, uint64_t end) {
     _windowStart = first;
+    _windowEntries = _windowFound = 0;
     std::vector<uint64_t> borders = {first, end};
     for (uint32_t member = 0; member < _memberCount; member++) {
         Row &row = _rows[member];
@@ -184,6 +192,7 @@ void ColumnReader::readWindow(uint64_t first, uint64_t end) {
     borders.erase(std::unique(borders.begin(), borders.end()), borders.end());
     for (size_t i = 0; i + 1 < borders.size(); i++)
         countStrip(borders[i], borders[i + 1]);
+    _isSparse = _windowFound * kEntriesOfSparsePage < _windowEntries;
     if (_flags) findLazilyFreed();
 }
 
@@ -198,6 +207,7 @@ void ColumnReader::readRow(uint32_t member, uint64_t first, uint64_t end) {
     const uint64_t to = std::min(all[last].end, end);
     uint64_t *const entries = this->row(member) + (from - first);
     const size_t bytes = (to - from) * sizeof *entries;
+    _windowEntries += to - from;
     _reading.store(member, std::memory_order_relaxed);
     const ssize_t got = _family.members[member].pagemap.readAt(from * sizeof *entries, entries, bytes);
     // One whose address space has gone has nothing left to tell.
@@ -261,6 +271,7 @@ void ColumnReader::takeRow(uint32_t member, const HXFamilyRange &range, uint64_t
         figures.anonymous += kind == HXPageEntries::anonymous;
         figures.swapped += kind == HXPageEntries::swapped;
     }
+    _windowFound += figures.resident + figures.swapped;
     auto &told = _pages->figures[member];
     if (told.empty() || told.back().first != range.mapping)
         told.emplace_back(range.mapping, figures);
@@ -344,7 +355,7 @@ void ColumnReader::endStrip() {
 } // namespace
 
 std::vector<HXPageStretch> HXStretchesOfFamily(const HXFamily &family) {
-    constexpr uint64_t leastPages = 8 * kWindowPages, mostStretches = 4096;
+    constexpr uint64_t leastPages = kWindowPages, mostStretches = 4096;
     std::vector<HXPageStretch> all; // the ranges of all members, then joined
     for (const HXFamilyMember &member : family.members)
         for (const HXFamilyRange &range : member.ranges)
@@ -371,9 +382,7 @@ std::vector<HXPageStretch> HXStretchesOfFamily(const HXFamily &family) {
                 stretches.push_back({at, at});
                 taken = 0;
             }
-            // On a border of windows, so that none is read twice.
-            const uint64_t border = (at + (wanted - taken) + kWindowPages - 1) / kWindowPages * kWindowPages;
-            const uint64_t end = std::min(range.end, border);
+            const uint64_t end = std::min(range.end, at + (wanted - taken));
             stretches.back().end = end;
             taken += end - at;
             at = end;
