@@ -1,7 +1,7 @@
-// Times whole programs on a fixed population of processes: heft, reading the kernel's own files, and peers
-// that are installed. Commands take turns, so that a noisy machine disturbs all alike; medians are printed.
+// Times whole programs on populations of processes: heft, reading the kernel's own files, and peers that are
+// installed. Commands take turns, so that a noisy machine disturbs all alike; medians are printed.
 //
-//   heft-compare DIRECTORY-OF-PROGRAMS [ROUNDS]
+//   heft-compare DIRECTORY-OF-PROGRAMS [ROUNDS [POPULATION...]]
 
 #include <algorithm>
 #include <chrono>
@@ -9,6 +9,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -24,7 +25,8 @@ namespace {
 
 constexpr size_t kPage = 4096;
 constexpr size_t kMiB = 1 << 20;
-constexpr size_t kGiB = 1 << 30;
+
+// What a member of a population does before it rests.
 
 char *mapPrivate(size_t size) {
     void *all =
@@ -34,22 +36,29 @@ char *mapPrivate(size_t size) {
     return static_cast<char *>(all);
 }
 
-// `count` mappings of a page each, which the kernel cannot merge.
+// `count` mappings, of which every other holds a page: the kernel cannot merge them.
 void manyMappings(size_t count) {
-    char *all = mapPrivate(2 * count * kPage);
-    for (size_t i = 0; i < count; i++) {
-        all[2 * i * kPage] = 1;
-        mprotect(all + (2 * i + 1) * kPage, kPage, PROT_NONE);
+    char *all = mapPrivate(count * kPage);
+    for (size_t i = 0; i + 1 < count; i += 2) {
+        all[i * kPage] = 1;
+        mprotect(all + (i + 1) * kPage, kPage, PROT_NONE);
     }
 }
 
-void fourGigabytes() {
-    memset(mapPrivate(4 * kGiB), 1, 4 * kGiB);
+void smallPages(size_t mebibytes) {
+    memset(mapPrivate(mebibytes * kMiB), 1, mebibytes * kMiB);
 }
 
-void forkingParent() {
-    memset(mapPrivate(256 * kMiB), 1, 256 * kMiB);
-    for (int i = 0; i < 32; i++) {
+// Some mebibytes in a handful of mappings, as ordinary programs have them.
+void ordinary(size_t number) {
+    manyMappings(2 + number % 20);
+    for (size_t i = 0; i < 3; i++)
+        smallPages(1 + (number + i) % 3);
+}
+
+void forks(size_t mebibytes, size_t children) {
+    smallPages(mebibytes);
+    for (size_t i = 0; i < children; i++) {
         if (fork() == 0) {
             prctl(PR_SET_PDEATHSIG, SIGKILL);
             for (;;)
@@ -58,53 +67,135 @@ void forkingParent() {
     }
 }
 
+void sharers(size_t mebibytes, size_t children) {
+    const int file = memfd_create("bench", 0);
+    if (file < 0 || ftruncate(file, static_cast<off_t>(mebibytes * kMiB)) != 0) _exit(1);
+    void *all = mmap(nullptr, mebibytes * kMiB, PROT_READ | PROT_WRITE, MAP_SHARED, file, 0);
+    if (all == MAP_FAILED) _exit(1);
+    memset(all, 1, mebibytes * kMiB);
+    for (size_t i = 0; i < children; i++) {
+        if (fork() != 0) continue;
+        prctl(PR_SET_PDEATHSIG, SIGKILL);
+        volatile char sum = 0;
+        for (size_t at = 0; at < mebibytes * kMiB; at += kPage)
+            sum = static_cast<char>(sum + static_cast<char *>(all)[at]);
+        for (;;)
+            pause();
+    }
+    sleep(1); // until the children have touched it
+}
+
+struct Kind {
+    const char *name;
+    void (*work)(size_t first, size_t second);
+};
+const Kind kKinds[] = {
+    {"mappings", [](size_t count, size_t) { manyMappings(count); }},
+    {"pages", [](size_t mebibytes, size_t) { smallPages(mebibytes); }},
+    {"ordinary", [](size_t number, size_t) { ordinary(number); }},
+    {"forks", forks},
+    {"sharers", sharers},
+};
+
+// Runs in a program of its own, so that only those are a family that are meant to be.
+int beMember(char *argv[]) {
+    prctl(PR_SET_PDEATHSIG, SIGKILL);
+    for (const Kind &kind : kKinds)
+        if (strcmp(argv[0], kind.name) == 0)
+            kind.work(strtoul(argv[1], nullptr, 10), strtoul(argv[2], nullptr, 10));
+    if (write(1, "", 1) != 1) return 1;
+    for (;;)
+        pause();
+}
+
+struct Members {
+    size_t count;
+    const char *kind;
+    size_t first, second; // of `ordinary` the first is the member's number
+};
+struct PopulationPlan {
+    const char *name;
+    std::vector<Members> members;
+};
+const PopulationPlan kPlans[] = {
+    {"large",
+     {{300, "mappings", 80, 0}, {1, "mappings", 20000, 0}, {1, "pages", 4096, 0}, {1, "forks", 256, 32}}},
+    {"mix",
+     {{250, "mappings", 10, 0},
+      {10, "mappings", 2000, 0},
+      {1, "mappings", 20000, 0},
+      {4, "pages", 1024, 0},
+      {1, "forks", 256, 32},
+      {1, "sharers", 128, 24}}},
+    {"ordinary", {{300, "ordinary", 0, 0}}},
+    {"families", {{3, "forks", 256, 32}, {30, "forks", 32, 5}}},
+};
+
 // Processes that were started, each in its own group so that its children end with it.
 class Population {
   public:
+    explicit Population(const PopulationPlan &plan) {
+        for (const Members &members : plan.members)
+            for (size_t i = 0; i < members.count; i++)
+                start(members, strcmp(members.kind, "ordinary") == 0 ? i : members.first);
+    }
     ~Population() {
         for (const pid_t pid : _pids)
             kill(-pid, SIGKILL);
         for (const pid_t pid : _pids)
             waitpid(pid, nullptr, 0);
     }
-    template <typename Work>
-    void start(Work work) {
+    const std::vector<pid_t> &pids() const { return _pids; }
+
+  private:
+    void start(const Members &members, size_t first) {
         int ready[2];
-        if (pipe(ready) != 0) exit(1);
+        if (pipe2(ready, O_CLOEXEC) != 0) exit(1);
         const pid_t pid = fork();
         if (pid == 0) {
             setpgid(0, 0);
-            prctl(PR_SET_PDEATHSIG, SIGKILL);
-            work();
-            if (write(ready[1], "", 1) != 1) _exit(1);
-            for (;;)
-                pause();
+            dup2(ready[1], 1);
+            execl("/proc/self/exe", "heft-compare", "--member", members.kind, std::to_string(first).c_str(),
+                  std::to_string(members.second).c_str(), nullptr);
+            _exit(127);
         }
+        close(ready[1]);
         char byte;
         if (read(ready[0], &byte, 1) != 1) exit(1);
         close(ready[0]);
-        close(ready[1]);
         _pids.push_back(pid);
     }
 
-  private:
     std::vector<pid_t> _pids;
 };
 
 struct Command {
     std::string name;
     std::string shell;
-    std::vector<double> seconds;
+    std::vector<double> seconds = {}, processorSeconds = {}, serialSeconds = {};
     long peakKilobytes = 0;
 };
 
+double secondsOf(const timeval &time) {
+    return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_usec) / 1e6;
+}
+
+// What heft-variant says at its end: the processor time of its main thread.
+std::optional<double> readSerialSeconds(int file) {
+    char text[64] = {};
+    if (pread(file, text, sizeof text - 1, 0) <= 0) return std::nullopt;
+    return strtod(text, nullptr);
+}
+
 void run(Command &command) {
+    const int serial = memfd_create("serial", 0);
     const auto before = std::chrono::steady_clock::now();
     const pid_t pid = fork();
     if (pid == 0) {
         const int null = open("/dev/null", O_WRONLY);
         dup2(null, 1);
         dup2(null, 2);
+        dup2(serial, 9);
         execl("/bin/sh", "sh", "-c", ("exec " + command.shell).c_str(), nullptr);
         _exit(127);
     }
@@ -113,14 +204,17 @@ void run(Command &command) {
     wait4(pid, &status, 0, &usage);
     const std::chrono::duration<double> took = std::chrono::steady_clock::now() - before;
     command.seconds.push_back(took.count());
+    command.processorSeconds.push_back(secondsOf(usage.ru_utime) + secondsOf(usage.ru_stime));
     command.peakKilobytes = std::max(command.peakKilobytes, usage.ru_maxrss);
+    if (const auto seconds = readSerialSeconds(serial)) command.serialSeconds.push_back(*seconds);
+    close(serial);
     if (!WIFEXITED(status) || WEXITSTATUS(status) > 1)
         fprintf(stderr, "%s ended badly\n", command.name.c_str());
 }
 
 double median(std::vector<double> values) {
     std::sort(values.begin(), values.end());
-    return values[values.size() / 2];
+    return values.empty() ? 0 : values[values.size() / 2];
 }
 
 size_t countMappings() {
@@ -131,55 +225,70 @@ size_t countMappings() {
     return count;
 }
 
-void addPeers(std::vector<Command> &commands) {
+std::vector<Command> commandsFor(const std::string &programs, const std::vector<pid_t> &pids) {
+    const std::string heft = programs + "/heft";
+    const std::string variant = programs + "/bench/heft-variant ";
+    std::string named;
+    for (const pid_t pid : pids)
+        named += " " + std::to_string(pid);
+    std::vector<Command> commands = {
+        {"cat smaps", "cat /proc/[0-9]*/smaps"},
+        {"cat smaps_rollup", "cat /proc/[0-9]*/smaps_rollup"},
+        {"heft -a", heft + " -a"},
+        {"heft -a --json", heft + " -a --json /dev/null"},
+        {"heft -a, one worker", "taskset -c 0 " + heft + " -a"},
+        {"heft -a, from smaps alone", variant + "smaps -a"},
+        {"heft -a, from maps and scans", variant + "maps -a"},
+        {"heft PID...", heft + named},
+    };
     for (const char *peer : {"smem", "smemstat", "ps_mem"})
         if (system((std::string("command -v ") + peer + " >/dev/null 2>&1").c_str()) == 0)
-            commands.push_back({peer, peer, {}, 0});
+            commands.push_back({peer, peer});
+    return commands;
 }
 
-} // namespace
-
-int main(int argc, char *argv[]) {
-    if (argc < 2) {
-        fprintf(stderr, "usage: heft-compare DIRECTORY-OF-PROGRAMS [ROUNDS]\n");
-        return 1;
-    }
-    const std::string programs = argv[1];
-    const int rounds = argc > 2 ? std::max(1, atoi(argv[2])) : 7;
-    const std::string heft = programs + "/heft -a";
-    const std::string variant = programs + "/bench/heft-variant ";
-    std::vector<Command> commands = {
-        {"cat smaps", "cat /proc/[0-9]*/smaps", {}, 0},
-        {"cat smaps_rollup", "cat /proc/[0-9]*/smaps_rollup", {}, 0},
-        {"heft -a", heft, {}, 0},
-        {"heft -a --json", heft + " --json /dev/null", {}, 0},
-        {"heft -a, one worker", "taskset -c 0 " + heft, {}, 0},
-        {"heft -a --json, one worker", "taskset -c 0 " + heft + " --json /dev/null", {}, 0},
-        {"heft -a, from smaps alone", variant + "smaps -a", {}, 0},
-        {"heft -a, from maps and scans", variant + "maps -a", {}, 0},
-    };
-    addPeers(commands);
-
-    Population population;
-    for (int i = 0; i < 300; i++)
-        population.start([] { manyMappings(40); }); // and about 20 of the program itself
-    population.start([] { manyMappings(10000); });
-    population.start(fourGigabytes);
-    population.start(forkingParent);
+void compare(const PopulationPlan &plan, const std::string &programs, int rounds) {
+    const Population population(plan);
+    std::vector<Command> commands = commandsFor(programs, population.pids());
     const size_t mappings = countMappings();
     for (int round = 0; round < rounds; round++)
         for (Command &command : commands)
             run(command);
 
-    const double reference = median(commands.front().seconds);
-    const long budget = 40 * 1024 + static_cast<long>(mappings * 250 / 1024);
-    printf("%zu mappings, %d rounds; peak memory of 40 MiB + 250 bytes per mapping would be %ld KiB\n",
-           mappings, rounds, budget);
-    printf("%-30s %12s %12s %14s\n", "", "median ms", "x cat smaps", "peak KiB");
+    const Command &reference = commands.front();
+    const auto memory =
+        static_cast<uint64_t>(sysconf(_SC_PHYS_PAGES)) * static_cast<uint64_t>(sysconf(_SC_PAGESIZE));
+    printf("%s: %zu mappings, %d rounds; peak memory of 40 MiB, 250 bytes a mapping and 64 KiB a GiB would "
+           "be %zu KiB\n",
+           plan.name, mappings, rounds, 40 * 1024 + mappings * 250 / 1024 + (memory >> 24));
+    printf("%-30s %10s %12s %10s %12s %10s %9s\n", "", "wall ms", "x cat smaps", "CPU ms", "x cat smaps",
+           "peak KiB", "serial");
     for (const Command &command : commands) {
-        const double seconds = median(command.seconds);
-        printf("%-30s %12.1f %12.2f %14ld\n", command.name.c_str(), seconds * 1e3, seconds / reference,
-               command.peakKilobytes);
+        const double wall = median(command.seconds), processor = median(command.processorSeconds);
+        printf("%-30s %10.1f %12.2f %10.1f %12.2f %10ld", command.name.c_str(), wall * 1e3,
+               wall / median(reference.seconds), processor * 1e3,
+               processor / median(reference.processorSeconds), command.peakKilobytes);
+        if (!command.serialSeconds.empty())
+            printf(" %7.1f %%", median(command.serialSeconds) / processor * 100);
+        printf("\n");
+    }
+    printf("\n");
+}
+
+} // namespace
+
+int main(int argc, char *argv[]) {
+    if (argc == 5 && strcmp(argv[1], "--member") == 0) return beMember(argv + 2);
+    if (argc < 2) {
+        fprintf(stderr, "usage: heft-compare DIRECTORY-OF-PROGRAMS [ROUNDS [POPULATION...]]\n");
+        return 1;
+    }
+    const int rounds = argc > 2 ? std::max(1, atoi(argv[2])) : 7;
+    for (const PopulationPlan &plan : kPlans) {
+        const bool isWanted = argc <= 3 || std::any_of(argv + 3, argv + argc, [&](const char *name) {
+                                  return strcmp(name, plan.name) == 0;
+                              });
+        if (isWanted) compare(plan, argv[1], rounds);
     }
     return 0;
 }
