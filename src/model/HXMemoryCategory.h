@@ -5,6 +5,7 @@
 
 #include <string>
 #include <unordered_map>
+#include <utility>
 #include <vector>
 
 // It keeps the name of the object that it was made for: views of objects can be made of regions that other
@@ -53,9 +54,14 @@ class HXCategoryMap {
         }
     };
 
+    size_t addCategory(HXString name, HXString detail, const HXMemoryRegion &naming);
+
     bool _summarize;
     std::vector<HXMemoryCategory> _categories;
-    std::unordered_map<std::string, size_t> _byFullName;
     // Spares making the full name for every object: strings are interned, so equal names are the same name.
+    // Other names can make the same text. Where there are few, as in most maps, they are looked through.
+    std::vector<std::pair<NamePair, size_t>> _names;
+    // Made for larger maps only.
     std::unordered_map<NamePair, size_t, NamePairHash> _byName;
+    std::unordered_map<std::string, size_t> _byFullName;
 };

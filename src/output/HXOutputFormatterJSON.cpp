@@ -4,6 +4,8 @@
 #include "platform/HXPlatform.h"
 
 #include <cerrno>
+#include <charconv>
+#include <iterator>
 
 namespace {
 
@@ -46,35 +48,50 @@ void HXOutputFormatterJSON::noteFailure() {
     if (_writeError == 0) _writeError = errno != 0 ? errno : EIO;
 }
 
+// Hands over what has been made so far.
+void HXOutputFormatterJSON::flush() {
+    errno = 0;
+    if (fwrite(_text.data(), 1, _text.size(), _stream) != _text.size() || fflush(_stream) != 0)
+        noteFailure(); // while the reason is known
+    _text.clear();
+}
+
 void HXOutputFormatterJSON::separate() {
-    if (_needsComma) fputc(',', _stream);
+    if (_needsComma) _text += ',';
 }
 
 void HXOutputFormatterJSON::key(std::string_view name) {
-    fputs(_needsComma ? ",\"" : "\"", _stream);
-    fwrite(name.data(), 1, name.size(), _stream);
-    fputs("\":", _stream);
+    (_text += _needsComma ? ",\"" : "\"").append(name).append("\":");
     _needsComma = false;
 }
 
 void HXOutputFormatterJSON::open(char bracket) {
+    constexpr size_t piece = 1 << 16; // bytes
     separate();
-    fputc(bracket, _stream);
+    _text += bracket;
     _needsComma = false;
+    if (_text.size() > piece) flush();
 }
 
 void HXOutputFormatterJSON::close(char bracket) {
-    fputc(bracket, _stream);
+    _text += bracket;
     _needsComma = true;
 }
 
 void HXOutputFormatterJSON::raw(std::string_view json) {
-    fwrite(json.data(), 1, json.size(), _stream);
+    _text += json;
     _needsComma = true;
 }
 
-void HXOutputFormatterJSON::text(const std::string &value) {
-    raw('"' + value + '"');
+void HXOutputFormatterJSON::number(uint64_t value) {
+    char digits[20];
+    raw({digits, std::to_chars(digits, std::end(digits), value).ptr});
+}
+
+void HXOutputFormatterJSON::text(std::string_view value) {
+    _text += '"';
+    raw(value);
+    _text += '"';
 }
 
 void HXOutputFormatterJSON::texts(std::string_view name, const std::vector<std::string> &values) {
@@ -89,7 +106,7 @@ void HXOutputFormatterJSON::texts(std::string_view name, const std::vector<std::
 
 void HXOutputFormatterJSON::member(std::string_view name, uint64_t value) {
     key(name);
-    raw(std::to_string(value));
+    number(value);
 }
 
 // A total's dirty bytes include the swapped ones.
@@ -166,10 +183,9 @@ void HXOutputFormatterJSON::printSharedCategories(const std::shared_ptr<const HX
 
 void HXOutputFormatterJSON::printProcessAuxData(const HXAuxDictionary *data) {
     key("auxiliary");
-    errno = 0;
     JSONForAuxData(data);
     close('}');
-    if (fflush(_stream) != 0) noteFailure(); // while the reason is known
+    flush();
 }
 
 void HXOutputFormatterJSON::printProcessesWithWarnings(const Processes &withWarnings,
@@ -232,6 +248,7 @@ void HXOutputFormatterJSON::end() {
     if (_pageSize == 0) _pageSize = HXPlatform::current().vm_kernel_page_size();
     member("page size", _pageSize);
     close('}');
+    flush();
     if (!HXPlatform::current().services().commitPendingFile(_file)) noteFailure();
 }
 

@@ -55,12 +55,14 @@ class HXOutputFormatterJSON : public HXOutputFormatter {
     void open(char bracket);
     void close(char bracket);
     void raw(std::string_view json); // a value as it stands
-    void text(const std::string &value);
+    void number(uint64_t value);
+    void text(std::string_view value);
     void texts(std::string_view name, const std::vector<std::string> &values);
     void member(std::string_view name, uint64_t value);
     void sizes(const HXMemoryTotal &total);
     void region(const HXMemoryRegion &region);
     void sharedEntry(const SharedEntry &entry);
+    void flush();
     void noteFailure();
 
     bool _verbose = false; // region lists are written
@@ -69,6 +71,7 @@ class HXOutputFormatterJSON : public HXOutputFormatter {
     uint32_t _pageSize = 0;                                         // that of the first process
     HXPendingFile _file;
     std::FILE *const _stream; // the file's, until `end`
+    std::string _text;        // that is not handed over yet
     bool _needsComma = false;
     int _writeError = 0;
 };

@@ -28,6 +28,12 @@ std::string humanized(int64_t size) {
     return buffer;
 }
 
+void appendPadded(std::string &line, std::string_view text, int width) {
+    const auto columns = static_cast<size_t>(width);
+    if (text.size() < columns) line.append(columns - text.size(), ' ');
+    line += text;
+}
+
 std::vector<std::string> namesOf(const HXOutputFormatter::Processes &processes) {
     std::vector<std::string> names;
     for (const HXProcess *process : processes)
@@ -63,7 +69,12 @@ HXOutputFormatterText::HXOutputFormatterText(int32_t summaryFormat, int32_t opti
 std::string HXOutputFormatterText::formattedStringForSize(uint64_t size) const {
     const auto asSigned = static_cast<int64_t>(size);
     if (_summaryFormat == HXFormatBytes) return std::to_string(asSigned) + " B";
-    if (_summaryFormat == HXFormatFormatted) return humanized(asSigned);
+    if (_summaryFormat == HXFormatFormatted) {
+        // Most sizes are those of a few pages, and few are met once.
+        HumanizedSize &known = _humanized[(size ^ size >> 12) % _humanized.size()];
+        if (known.text.empty() || known.size != size) known = {size, humanized(asSigned)};
+        return known.text;
+    }
     const uint64_t pageSize = _pageSize != 0 ? _pageSize : HXPlatform::current().vm_kernel_page_size();
     return std::to_string((size + pageSize - 1) / pageSize) + " pages";
 }
@@ -80,26 +91,30 @@ void HXOutputFormatterText::printRule(const char *lineEnd) {
 }
 
 template <typename Text>
-void HXOutputFormatterText::printLine(Text text, const std::string &category) {
+void HXOutputFormatterText::printLine(Text text, std::string_view category, std::string_view detail) {
+    _line.clear();
     for (const Column &column : kColumns)
         if (shows(column.option))
-            fprintf(_output, "%*s",
-                    _summaryFormat == HXFormatFormatted ? column.formattedWidth : column.otherWidth,
-                    std::string(text(column)).c_str());
-    fprintf(_output, "    %s\n", category.c_str());
+            appendPadded(_line, text(column),
+                         _summaryFormat == HXFormatFormatted ? column.formattedWidth : column.otherWidth);
+    _line.append("    ").append(category);
+    if (!detail.empty()) _line.append(" ").append(detail);
+    _line += '\n';
+    fwrite(_line.data(), 1, _line.size(), _output);
 }
 
 void HXOutputFormatterText::printDashes() {
     printLine([](const Column &) { return "---"; }, "---");
 }
 
-void HXOutputFormatterText::printRow(const HXMemoryTotal &total, const std::string &category) {
+void HXOutputFormatterText::printRow(const HXMemoryTotal &total, std::string_view category,
+                                     std::string_view detail) {
     printLine(
         [&](const Column &column) {
             const uint64_t figure = column.figure(total);
             return column.figure == regions ? std::to_string(figure) : formattedStringForSize(figure);
         },
-        category);
+        category, detail);
 }
 
 void HXOutputFormatterText::printTable(const HXCategoryMap &categories, const HXMemoryTotal &total) {
@@ -137,7 +152,7 @@ HXOutputFormatterText::_sortedKeysForCategories(const HXCategoryMap &categories)
 void HXOutputFormatterText::_printCategories(const HXCategoryMap &categories) {
     for (const HXMemoryCategory *category : _sortedKeysForCategories(categories)) {
         const HXString detail = _truncatedNameForString(category->detailedName());
-        printRow(category->total(), category->name().str() + (detail ? " " + detail.str() : ""));
+        printRow(category->total(), category->name().str(), detail ? detail.str() : std::string_view());
     }
 }
 

@@ -3,7 +3,10 @@
 
 #include "analysis/HXOutputFormatter.h"
 
+#include <array>
 #include <cstdio>
+#include <string>
+#include <string_view>
 
 enum HXSummaryFormat : int32_t { HXFormatBytes = 0, HXFormatFormatted = 1, HXFormatPages = 2 };
 
@@ -52,11 +55,11 @@ class HXOutputFormatterText : public HXOutputFormatter {
     static const Column kColumns[];
 
     void printTable(const HXCategoryMap &categories, const HXMemoryTotal &total);
-    // A line of a table: `text(column)` in each column, then the category.
+    // A line of a table: `text(column)` in each column, then the category and its detail, if any.
     template <typename Text>
-    void printLine(Text text, const std::string &category);
+    void printLine(Text text, std::string_view category, std::string_view detail = {});
     void printDashes();
-    void printRow(const HXMemoryTotal &total, const std::string &category);
+    void printRow(const HXMemoryTotal &total, std::string_view category, std::string_view detail = {});
     void printRule(const char *lineEnd);
     // A heading and a line for each text; nothing without texts.
     void printList(const char *heading, const std::vector<std::string> &texts);
@@ -70,4 +73,10 @@ class HXOutputFormatterText : public HXOutputFormatter {
     int32_t _options;
     std::string _sort;
     std::FILE *_output;
+    std::string _line; // that is being made
+    struct HumanizedSize {
+        uint64_t size = 0;
+        std::string text; // empty: none yet
+    };
+    mutable std::array<HumanizedSize, 1024> _humanized;
 };

@@ -1,7 +1,8 @@
 // The region-by-region listing.
 #include "output/HXOutputFormatterText.h"
 
-#include <cinttypes>
+#include <charconv>
+#include <iterator>
 
 void HXOutputFormatterText::printAtlasLikeOutputForProcess(const HXProcess &process,
                                                            const HXMemoryRegionList &regions) {
@@ -22,20 +23,38 @@ void HXOutputFormatterText::printAtlasLikeOutputForProcess(const HXProcess &proc
 
 void HXOutputFormatterText::printRegion(const HXMemoryRegion &region, uint64_t pageSize) {
     constexpr uint64_t objectIdBits = 0xFFFFFFFFFF; // the low 40
-    const auto pages = [pageSize](uint64_t size) { return (size + pageSize - 1) / pageSize; };
-    const uint64_t id = region.object_id() & objectIdBits;
-    if (region.start() == kNoAddress)
-        fprintf(_output, "        unmapped -         unmapped [%10" PRIx64 "]", id);
-    else
-        fprintf(_output, "%16" PRIx64 " - %16" PRIx64 " [%10" PRIx64 "]", region.start(),
-                region.start() + region.size(), id);
-    fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.size()), pages(region.listedSizes().heft()));
-    if (shows(HXTextSwapped)) fprintf(_output, " %7" PRIu64, pages(region.listedSizes().swapped));
-    fprintf(_output, " %7" PRIu64 " %7" PRIu64, pages(region.cleanNonSpecSize()),
-            pages(region.reclaimableSize()));
-    if (shows(HXTextWired)) fprintf(_output, " %7" PRIu64, pages(region.wiredSize()));
-    fprintf(_output, "   %s", region.name().c_str());
+    constexpr size_t addressWidth = 16, idWidth = 10, pagesWidth = 7;
+    _line.clear();
+    const auto number = [this](uint64_t value, size_t width, int base) {
+        char digits[64];
+        const auto end = std::to_chars(digits, std::end(digits), value, base).ptr;
+        const auto length = static_cast<size_t>(end - digits);
+        if (length < width) _line.append(width - length, ' ');
+        _line.append(digits, length);
+    };
+    const auto pages = [&](uint64_t size) {
+        _line += ' ';
+        number((size + pageSize - 1) / pageSize, pagesWidth, 10);
+    };
+    if (region.start() == kNoAddress) {
+        _line += "        unmapped -         unmapped";
+    } else {
+        number(region.start(), addressWidth, 16);
+        _line += " - ";
+        number(region.start() + region.size(), addressWidth, 16);
+    }
+    _line += " [";
+    number(region.object_id() & objectIdBits, idWidth, 16);
+    _line += ']';
+    pages(region.size());
+    pages(region.listedSizes().heft());
+    if (shows(HXTextSwapped)) pages(region.listedSizes().swapped);
+    pages(region.cleanNonSpecSize());
+    pages(region.reclaimableSize());
+    if (shows(HXTextWired)) pages(region.wiredSize());
+    _line.append("   ").append(region.name().str());
     if (const HXString detail = _truncatedNameForString(region.detailedName()))
-        fprintf(_output, " %s", detail.c_str());
-    fputc('\n', _output);
+        _line.append(" ").append(detail.str());
+    _line += '\n';
+    fwrite(_line.data(), 1, _line.size(), _output);
 }

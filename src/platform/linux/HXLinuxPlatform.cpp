@@ -58,7 +58,13 @@ HXLinuxPlatform::HXLinuxPlatform(const Setting &setting)
       _machine(setting.procPath), _readerSetting{&_fileSystems, &_machine, &namedTags(),
                                                  static_cast<uint32_t>(std::countr_zero(_pageSize)),
                                                  setting.mayScanPageTables},
-      _imageHeaders(_fileSystems), _processes(setting.procPath),
+      _imageHeaders(_fileSystems),
+      _processes(setting.procPath,
+                 [this](size_t count, std::function<void(size_t)> work) {
+                     return _services.dispatch_apply(
+                         count, _services.dispatch_queue_create("org.heft.list", QOS_CLASS_UTILITY),
+                         std::move(work));
+                 }),
       _kernelMemory(setting.procPath, setting.sysPath, _pageSize),
       _held(setting.procPath, _fileSystems, _machine, _identifiers) {}
 

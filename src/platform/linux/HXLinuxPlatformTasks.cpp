@@ -20,8 +20,8 @@ class TaskSymbolicator final : public RVSymbolicator {
     std::vector<HXLoadedImage> images;
 };
 
-// Whether one more task may keep a descriptor: three quarters of them are for reading.
-bool maySpareDescriptor(size_t taskCount) {
+// Whether one more task may keep two descriptors: half of them are for reading.
+bool maySpareDescriptors(size_t taskCount) {
     constexpr rlim_t share = 4;
     rlimit limit;
     return ::getrlimit(RLIMIT_NOFILE, &limit) == 0 && taskCount < limit.rlim_cur / share;
@@ -40,10 +40,11 @@ kern_return_t HXLinuxPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_
     auto process = _processes.open(pid);
     if (!process) return errorOfOpening(errno);
     if (process->stat.hasEnded() || process->stat.isKernelThread()) return KERN_FAILURE;
-    if (!HXOpenAt(process->directory, "maps")) return errorOfOpening(errno);
-    *task =
-        _tasks.add(std::make_unique<HXLinuxTask>(pid, _identifiers.numberOfProcess(pid), std::move(*process),
-                                                 maySpareDescriptor(_tasks.count()), _processes, _turns));
+    HXDescriptor maps = HXOpenAt(process->directory, "maps");
+    if (!maps) return errorOfOpening(errno);
+    *task = _tasks.add(std::make_unique<HXLinuxTask>(
+        pid, _identifiers.numberOfProcess(pid), std::move(*process), std::move(maps),
+        maySpareDescriptors(_tasks.count()), _processes, _turns));
     return KERN_SUCCESS;
 }
 

@@ -25,7 +25,7 @@ uint64_t HXMachineFacts::counterErrorPages(uint64_t threads) const {
         return std::sscanf(names.release, "%u.%u", &major, &minor) == 2 &&
                (major < 6 || (major == 6 && minor < 2));
     }();
-    const auto processors = static_cast<uint64_t>(::get_nprocs());
+    static const auto processors = static_cast<uint64_t>(::get_nprocs()); // which reads a file
     return counters *
            (countsByThread ? threads * threadBatch : processors * std::max(leastBatch, 2 * processors));
 }

@@ -27,6 +27,7 @@ class Reader {
     bool hasFreedLazily() const;
     bool readMapsAndScan();
     HXDescriptor readFile(const char *name);
+    HXDescriptor readOpen(HXDescriptor file);
     void readMappings(const HXDescriptor &file);
     void take(const HXMapsEntry &entry);
     HXFileSystemKind fileSystemOf(const HXMapping &mapping, const HXMappedPath &path);
@@ -77,7 +78,10 @@ bool Reader::mapsMaySuffice() {
 }
 
 bool Reader::readMapsAndScan() {
-    const HXDescriptor maps = readFile("maps");
+    const bool isOpen = _request.maps != nullptr && *_request.maps;
+    HXDescriptor maps = isOpen ? readOpen(std::move(*_request.maps)) : readFile("maps");
+    // Since it was opened the process may have executed another program.
+    if (isOpen && _addressSpace->count() == 0) maps = readFile("maps");
     if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return true;
     if (!mapsSuffice()) return false;
     _addressSpace->lacksPrivatePages = _request.leavesPrivatePages;
@@ -112,9 +116,12 @@ bool Reader::hasFreedLazily() const {
 
 // Answers the open file.
 HXDescriptor Reader::readFile(const char *name) {
+    return readOpen(HXOpenAt(_request.process.get(), name));
+}
+
+HXDescriptor Reader::readOpen(HXDescriptor file) {
     _addressSpace = std::make_unique<HXAddressSpace>();
     _readFailed = _sawStack = _sawGate = _sawSwapBacked = _mayHoldHugePages = false;
-    HXDescriptor file = HXOpenAt(_request.process.get(), name);
     if (!file) {
         _addressSpace->endError = errorOfOpening(errno);
         return file;

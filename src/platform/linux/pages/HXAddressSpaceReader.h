@@ -31,6 +31,8 @@ struct HXReadRequest {
     bool leavesPrivatePages = false;
     // He also finds out whether any of them are lazily freed.
     bool leavesLazyFree = false;
+    // The process's open "maps" of which nothing has been read, if there is one; whoever reads it takes it.
+    HXDescriptor *maps = nullptr;
 };
 
 // Reads the mappings of a process and classifies them. A process that vanishes leaves what was read until

@@ -23,11 +23,13 @@ bool HXDescriptorTurns::run(const std::function<void()> &read) {
     return !watch.seen();
 }
 
-HXLinuxTask::HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, bool keepsOpen,
-                         HXLinuxProcesses &processes, HXDescriptorTurns &turns)
+HXLinuxTask::HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, HXDescriptor maps,
+                         bool keepsOpen, HXLinuxProcesses &processes, HXDescriptorTurns &turns)
     : _pid(pid), _number(number), _startTime(process.stat.startTime), _startStack(process.stat.startStack),
-      _processes(processes), _turns(turns) {
-    if (keepsOpen) _directory = std::move(process.directory);
+      _processes(processes), _turns(turns), _status(HXReadStatus(process.directory)) {
+    if (!keepsOpen) return;
+    _directory = std::move(process.directory);
+    _maps = std::move(maps);
 }
 
 // Not open with errno set.
@@ -67,8 +69,9 @@ void HXLinuxTask::finishReading(const HXReaderSetting &setting) {
 
 void HXLinuxTask::readForSharing(const HXReaderSetting &setting, bool needsDirtyPages, bool leavesLazyFree) {
     if (!_directory) _directory = reopen();
-    _addressSpace =
-        HXReadAddressSpace({_directory, _status, needsDirtyPages, _opened, true, leavesLazyFree}, setting);
+    _addressSpace = HXReadAddressSpace(
+        {_directory, _status, needsDirtyPages, _opened, true, leavesLazyFree, &_maps}, setting);
+    _maps.reset();
 }
 
 void HXLinuxTask::takeShared(HXSharedPages shared) {
@@ -138,7 +141,9 @@ void HXLinuxTask::read(const HXReaderSetting &setting, bool needsDirtyPages) {
 }
 
 void HXLinuxTask::readOnce(const HXReaderSetting &setting, bool needsDirtyPages) {
-    _addressSpace = HXReadAddressSpace({_directory, _status, needsDirtyPages, _opened}, setting);
+    _addressSpace =
+        HXReadAddressSpace({_directory, _status, needsDirtyPages, _opened, false, false, &_maps}, setting);
+    _maps.reset();
 }
 
 // The first reading is compared with the counters behind it alone, so that most processes cost one more small

@@ -54,9 +54,10 @@ class HXDescriptorTurns {
 // then. When it is opened again, the process's start time must be the same. Used by one thread at a time.
 class HXLinuxTask {
   public:
-    // `number`: HXObjectIdentifiers::numberOfProcess. `keepsOpen`: hold the directory open until the task
-    // ends. What else is given outlives this.
-    HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, bool keepsOpen,
+    // `number`: HXObjectIdentifiers::numberOfProcess. `maps`: the process's file of that name, open. Both it
+    // and the directory are held open until they are needed, with `keepsOpen`. What else is given outlives
+    // this.
+    HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, HXDescriptor maps, bool keepsOpen,
                 HXLinuxProcesses &processes, HXDescriptorTurns &turns);
     HXLinuxTask(const HXLinuxTask &) = delete;
     HXLinuxTask &operator=(const HXLinuxTask &) = delete;
@@ -119,6 +120,7 @@ class HXLinuxTask {
     HXLinuxProcesses &_processes;
     HXDescriptorTurns &_turns;
     HXDescriptor _directory;
+    HXDescriptor _maps; // until the first reading
     const std::chrono::steady_clock::time_point _opened = std::chrono::steady_clock::now();
     std::unique_ptr<HXAddressSpace> _addressSpace;
     size_t _cursor = 0;

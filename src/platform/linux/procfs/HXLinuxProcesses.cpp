@@ -9,9 +9,11 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <climits>
 #include <cstring>
+#include <memory>
 #include <vector>
 
 namespace {
@@ -122,7 +124,7 @@ int32_t HXLinuxProcesses::ownPid() {
     return link && HXIsNumber(*link, &pid) ? pid : -1;
 }
 
-std::optional<HXStatRecord> HXLinuxProcesses::readStat(int32_t pid) {
+std::optional<HXStatRecord> HXLinuxProcesses::readStat(int32_t pid) const {
     char buffer[2048]; // 52 numbers and a short name
     const auto text = HXReadOnce(AT_FDCWD, pathOf(pid, "stat").c_str(), buffer);
     if (!text) {
@@ -147,6 +149,33 @@ std::optional<HXStatRecord> HXLinuxProcesses::statOf(int32_t pid) {
     return listed ? listed : readStat(pid);
 }
 
+// Those of the processes that are there, in the same order; none when there was no descriptor for one: a list
+// that lacks it would be no list.
+std::optional<std::vector<HXStatRecord>> HXLinuxProcesses::readStats(std::vector<int32_t> pids) {
+    constexpr size_t piece = 32; // of the list, by one thread
+    struct Reading {
+        std::vector<int32_t> pids;
+        std::vector<std::optional<HXStatRecord>> stats;
+        std::atomic<bool> fellShort = false;
+    };
+    const auto reading = std::make_shared<Reading>();
+    reading->stats.resize(pids.size());
+    reading->pids = std::move(pids);
+    const size_t pieces = (reading->pids.size() + piece - 1) / piece;
+    const auto givenUp = _forAll(pieces, [this, reading](size_t number) {
+        const size_t end = std::min((number + 1) * piece, reading->pids.size());
+        for (size_t i = number * piece; i < end; i++) {
+            reading->stats[i] = readStat(reading->pids[i]);
+            if (!reading->stats[i] && HXShortageWatch::isShortage(errno)) reading->fellShort = true;
+        }
+    });
+    if (reading->fellShort || !givenUp.empty()) return std::nullopt;
+    std::vector<HXStatRecord> found;
+    for (const auto &stat : reading->stats)
+        if (stat) found.push_back(*stat);
+    return found;
+}
+
 int32_t HXLinuxProcesses::proc_listallpids(int32_t *pids, uint32_t bufferBytes) {
     std::vector<int32_t> found = {0};
     {
@@ -160,18 +189,17 @@ int32_t HXLinuxProcesses::proc_listallpids(int32_t *pids, uint32_t bufferBytes) 
     }
     if (pids == nullptr) return static_cast<int32_t>(found.size());
     const uint32_t room = bufferBytes / sizeof(int32_t);
+    if (room == 0) return 0;
+    const auto stats = readStats({found.begin() + 1, found.end()});
+    if (!stats) return -1;
     uint32_t count = 0;
+    pids[count++] = 0;
     std::unordered_map<int32_t, Listed> listed;
-    for (size_t i = 0; i < found.size() && count < room; i++) {
-        const int32_t pid = found[i];
-        if (pid != 0) {
-            const auto stat = readStat(pid);
-            // A list that lacks those for whom there was no descriptor would be no list.
-            if (!stat && HXShortageWatch::isShortage(errno)) return -1;
-            if (!stat || stat->isKernelThread()) continue;
-            listed.emplace(pid, Listed{*stat});
-        }
-        pids[count++] = pid;
+    for (const HXStatRecord &stat : *stats) {
+        if (count == room) break;
+        if (stat.isKernelThread()) continue;
+        listed.emplace(stat.pid, Listed{stat});
+        pids[count++] = stat.pid;
     }
     const std::lock_guard lock(_mutex);
     _listed = std::move(listed);

@@ -6,11 +6,13 @@
 #include "platform/linux/procfs/HXProcText.h"
 
 #include <cstdint>
+#include <functional>
 #include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <unordered_map>
+#include <vector>
 
 // A process that has been opened.
 struct HXOpenProcess {
@@ -25,7 +27,12 @@ class HXLinuxProcesses {
     // What `pid` of 0, the kernel, is called.
     static constexpr std::string_view kernelName = "kernel";
 
-    explicit HXLinuxProcesses(std::string procPath) : _procPath(std::move(procPath)) {}
+    // Calls `work` for all numbers below `count`, on several threads at once, and returns when all have
+    // returned. Numbers that it left out are answered.
+    using ForAll = std::function<std::vector<size_t>(size_t count, std::function<void(size_t)> work)>;
+
+    HXLinuxProcesses(std::string procPath, ForAll forAll)
+        : _procPath(std::move(procPath)), _forAll(std::move(forAll)) {}
 
     // None with errno set: ESRCH, or EMFILE when descriptors or memory do not suffice.
     std::optional<HXOpenProcess> open(int32_t pid);
@@ -56,12 +63,14 @@ class HXLinuxProcesses {
     std::string pathOf(int32_t pid, const char *file) const;
     HXDescriptor openThread(int32_t pid, const HXDescriptor &leader);
     bool is64bit(const HXStatRecord &stat);
-    std::optional<HXStatRecord> readStat(int32_t pid);
+    std::optional<HXStatRecord> readStat(int32_t pid) const;
+    std::optional<std::vector<HXStatRecord>> readStats(std::vector<int32_t> pids);
     std::optional<HXStatRecord> takeListed(int32_t pid);
     std::optional<HXStatRecord> statOf(int32_t pid);
     std::optional<HXStatRecord> statForName(int32_t pid);
 
     const std::string _procPath;
+    const ForAll _forAll;
     std::mutex _mutex;
     std::unordered_map<int32_t, Listed> _listed;
 };
