@@ -143,6 +143,10 @@ class HXPlatform {
     // itself is pid 0.
     virtual int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes) = 0;
 
+    // Why the host does not tell of processes, for a message; none when it does. `ofAll`: also why it does
+    // not tell of all of them.
+    virtual std::optional<std::string> processesNotTold(bool) { return std::nullopt; }
+
     // Fills `buffer` with the record of `flavor` (PROC_PIDTBSDINFO, PROC_PIDT_SHORTBSDINFO) and answers its
     // length in bytes; 0 with errno set when it cannot (ENOMEM: too little room). A zombie has no record of
     // flavor 3.

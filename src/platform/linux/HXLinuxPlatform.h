@@ -62,6 +62,7 @@ class HXLinuxPlatform final : public HXPlatform {
     int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes) override {
         return _processes.proc_listallpids(pids, bufferBytes);
     }
+    std::optional<std::string> processesNotTold(bool ofAll) override { return _processes.notTold(ofAll); }
     int32_t proc_pidinfo(int32_t pid, int32_t flavor, uint64_t, void *buffer, uint32_t bufferBytes) override {
         return _processes.proc_pidinfo(pid, flavor, buffer, bufferBytes);
     }
