@@ -112,6 +112,9 @@ class HXPlatform {
     // several mappings of a task show is told once.
     virtual std::vector<vm_region_share> mach_vm_region_shares(mach_port_t, uint64_t) { return {}; }
 
+    // Which object a task's page tables are, as a full object id. All bits set where the host does not tell.
+    virtual uint64_t pageTableObject(mach_port_t) { return UINT64_MAX; }
+
     // The shared memory that a task holds, each object once: what it maps, or what it has descriptors of.
     enum class HeldBy { mapping, descriptor };
     virtual std::vector<task_held_object> task_held_objects(mach_port_t, HeldBy) { return {}; }

@@ -54,6 +54,7 @@ class HXLinuxPlatform final : public HXPlatform {
     std::optional<uint64_t> sharedSizeNotTold() override { return _sharedSizeNotTold; }
     std::vector<vm_region_share> mach_vm_region_shares(mach_port_t task, uint64_t address) override;
     std::optional<HXWalkShortfall> walkShortfall(mach_port_t task) override;
+    uint64_t pageTableObject(mach_port_t task) override;
     std::vector<task_held_object> task_held_objects(mach_port_t task, HeldBy by) override;
     std::vector<task_held_object> host_held_objects(mach_port_t) override { return _held.ofKernel(); }
     uint32_t vm_kernel_page_size() override { return _pageSize; }

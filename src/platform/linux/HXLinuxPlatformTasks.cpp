@@ -164,6 +164,11 @@ std::optional<HXWalkShortfall> HXLinuxPlatform::walkShortfall(mach_port_t port) 
     return HXWalkShortfall{difference->regionsSize, difference->countersSize};
 }
 
+uint64_t HXLinuxPlatform::pageTableObject(mach_port_t port) {
+    const HXLinuxTask *task = _tasks.find(port);
+    return task == nullptr ? UINT64_MAX : _identifiers.ofPageTables(task->pid());
+}
+
 std::vector<task_held_object> HXLinuxPlatform::task_held_objects(mach_port_t port, HeldBy by) {
     std::vector<task_held_object> held;
     HXLinuxTask *task = _tasks.find(port);
