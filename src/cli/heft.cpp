@@ -7,5 +7,5 @@ int main(int argc, char *argv[]) {
     static HXLinuxPlatform platform;
     platform.prepareProcess("heft");
     HXPlatform::setCurrent(&platform);
-    return platform.services().finish(HXHeftMain(argc, argv));
+    return platform.services().finish("heft", HXHeftMain(argc, argv));
 }

@@ -65,7 +65,8 @@ class HXServices {
     virtual bool stat(const std::string &path) = 0;
 
     // fopen(3): a stream, which the caller closes with std::fclose, or null with errno set. Reading waits for
-    // a fifo's writer, but for one that does not come within ten seconds no longer (ETIMEDOUT).
+    // a fifo's writer, but for one that does not come within ten seconds no longer (ETIMEDOUT). An open file
+    // of the process, such as /dev/stdin, goes on where it stands.
     virtual std::FILE *fopen(const std::string &path, const char *mode) = 0;
 
     // The same for reading a regular file. Never waits: a folder (EISDIR) and a fifo or device (EINVAL) are
@@ -96,9 +97,11 @@ class HXServices {
     virtual std::vector<size_t> dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
                                                std::function<void(size_t)> work) = 0;
 
-    // What main returns: `status`. Does not return when an iteration was given up: the program then ends
-    // here, standard output written, before the objects that it may still use are destroyed.
-    virtual int finish(int status) = 0;
+    // What main returns, once all of standard output is written: `status`; 1 when some of that is lost, which
+    // is then told as `program`'s message. That nobody reads any more is no loss. Does not return when an
+    // iteration was given up: the program then ends here, before the objects that it may still use are
+    // destroyed.
+    virtual int finish(const char *program, int status) = 0;
 
     // A source of events for a signal, not yet running; null when there can be none. From here until `signal`
     // sets the disposition anew the signal reaches no other thread.

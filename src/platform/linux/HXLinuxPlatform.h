@@ -33,8 +33,9 @@ class HXLinuxPlatform final : public HXPlatform {
     explicit HXLinuxPlatform(const Setting &setting);
 
     // Readies the running process for examining thousands of others: as many open files as it may have, no
-    // file of its own on the descriptors of the standard streams, should one be closed, and a message of
-    // `program` and status 1 as the end when memory runs out. For main; `program` lives for ever.
+    // file of its own on the descriptors of the standard streams, should one be closed, a standard output
+    // that remembers what is lost of it, and a message of `program` and status 1 as the end when memory runs
+    // out. For main; `program` lives for ever.
     static void prepareProcess(const char *program);
 
     mach_port_t mach_task_self() override { return kSelfPort; }

@@ -27,7 +27,7 @@ class HXLinuxServices : public HXServices {
     HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) override;
     std::vector<size_t> dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
                                        std::function<void(size_t)> work) override;
-    int finish(int status) override;
+    int finish(const char *program, int status) override;
     std::unique_ptr<HXDispatchSource> dispatch_source_create(int signal) override;
     void dispatch_source_set_event_handler(HXDispatchSource &source, std::function<void()> handler) override;
     void dispatch_resume(HXDispatchSource &source) override;

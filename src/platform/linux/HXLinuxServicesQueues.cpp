@@ -1,5 +1,6 @@
 // Work queues.
 #include "platform/linux/HXLinuxServices.h"
+#include "platform/linux/HXStandardOutput.h"
 #include "platform/linux/HXWorkLoop.h"
 
 #include <sched.h>
@@ -8,6 +9,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <cstring>
 
 namespace {
 
@@ -41,8 +43,12 @@ std::vector<size_t> HXLinuxServices::dispatch_apply(size_t iterations, const HXD
     return givenUp;
 }
 
-int HXLinuxServices::finish(int status) {
+int HXLinuxServices::finish(const char *program, int status) {
+    const int failure = HXFlushStandardOutput();
+    if (failure != 0 && failure != EPIPE) {
+        std::fprintf(stderr, "%s: standard output: %s\n", program, std::strerror(failure));
+        status = 1;
+    }
     if (!_hasGivenUp) return status;
-    std::fflush(stdout);
     ::_exit(status);
 }
