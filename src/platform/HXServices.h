@@ -30,6 +30,11 @@ struct HXOptionScan {
 struct HXDispatchQueue {
     std::string label;
     uint32_t qualityOfService = 0;
+    // For whoever watches the work: what is done ("reading memory"), empty where nobody needs to know; and
+    // what the process that an iteration works on is called, asked on the thread of `dispatch_apply`, may be
+    // null.
+    std::string activity = {};
+    std::function<std::string(size_t)> processOf = {};
 };
 inline constexpr uint32_t QOS_CLASS_UTILITY = 0x11;
 

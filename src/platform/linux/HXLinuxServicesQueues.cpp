@@ -35,10 +35,16 @@ HXDispatchQueue HXLinuxServices::dispatch_queue_create(const std::string &label,
     return {label, qualityOfService};
 }
 
-std::vector<size_t> HXLinuxServices::dispatch_apply(size_t iterations, const HXDispatchQueue &,
+std::vector<size_t> HXLinuxServices::dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
                                                     std::function<void(size_t)> work) {
     const size_t workers = _workerCount == 0 ? usableProcessorCount() : _workerCount;
-    auto givenUp = HXWorkLoop::run(iterations, workers, _answerTime, std::move(work));
+    HXWorkLoop::Look look;
+    if (_observer != nullptr && !queue.activity.empty())
+        look = [&](size_t done, std::optional<size_t> waitingFor) {
+            _observer->looked(queue, done, iterations, waitingFor);
+        };
+    auto givenUp = HXWorkLoop::run(iterations, workers, _answerTime, std::move(work), look);
+    if (look) _observer->ended();
     if (!givenUp.empty()) _hasGivenUp = true;
     return givenUp;
 }
