@@ -59,26 +59,23 @@ std::optional<int32_t> parsePid(HXPlatform &host, std::string_view word) {
     return std::nullopt;
 }
 
-// By errno. That nobody reads standard output any more is no failure, as that of a fifo is.
-int failWriting(const std::string &path) {
-    return path == "-" && errno == EPIPE ? 0 : fail(path, std::strerror(errno));
-}
+constexpr int kNothingRead = 3, kUnwritten = -1;
 
-constexpr int kNothingRead = 3;
-
-// Writes `path` with `write`, which tells itself what fails and answers the exit status; the file appears
-// only when that is 0 or kNothingRead.
+// Writes `path`, or standard output for "-", with `write`: it answers the exit status, having told itself
+// what fails, or kUnwritten with errno set. The file appears only when the status is 0 or kNothingRead.
 int writeFile(HXServices &services, const std::string &path, const std::function<int(std::FILE *)> &write) {
     const bool isOutput = path == "-";
+    const std::string name = isOutput ? "standard output" : path;
     std::optional<HXPendingFile> file = services.createPendingFile(isOutput ? "/dev/stdout" : path);
-    if (!file) return fail(path, std::strerror(errno));
+    if (!file) return fail(name, std::strerror(errno));
+    // A reader that goes away is a failed write; only that of standard output may.
     if (!isOutput) services.signal(HX_SIGPIPE, HXSignalDisposition::ignored);
-    const int status = write(file->stream);
-    if (status != 0 && status != kNothingRead) {
-        services.discardPendingFile(*file);
-        return status;
-    }
-    return services.commitPendingFile(*file) ? status : failWriting(path);
+    int status = write(file->stream);
+    const bool isWhole = status == 0 || status == kNothingRead;
+    if (isWhole && !services.commitPendingFile(*file)) status = kUnwritten;
+    if (!isWhole) services.discardPendingFile(*file);
+    if (status != kUnwritten) return status;
+    return isOutput && errno == EPIPE ? 0 : fail(name, std::strerror(errno));
 }
 
 int recordMachine(HXPlatform &host, const Words &words, bool anonymize) {
@@ -89,9 +86,11 @@ int recordMachine(HXPlatform &host, const Words &words, bool anonymize) {
         if (!pid) return 1;
         if (std::find(pids.begin(), pids.end(), *pid) == pids.end()) pids.push_back(*pid); // recorded once
     }
+    const auto notTold = host.processesNotTold(pids.empty());
+    if (notTold) std::fprintf(stderr, "heft-record: %s\n", notTold->c_str());
     return writeFile(host.services(), path, [&](std::FILE *out) {
         HXMachineRecorder recorder(host, out, anonymize);
-        if (!recorder.record(pids)) return failWriting(path);
+        if (!recorder.record(pids)) return kUnwritten;
         if (!recorder.hasRecords()) return fail(path, "no process was recorded");
         const size_t unreadable = recorder.unreadableCount(), all = recorder.readCount() + unreadable;
         if (unreadable > 0)

@@ -12,9 +12,8 @@ namespace {
 constexpr char kUsage[] =
     "Usage: heft-replay FILE [heft's arguments]\n"
     "\n"
-    "Prints heft's report on the machine that the machine file FILE describes (-: standard\n"
-    "input).\n"
-    "heft-record writes such files; heft --help tells heft's arguments.\n";
+    "Prints heft's report on the machine that the machine file FILE describes; - is\n"
+    "standard input. heft-record writes such files; heft --help tells heft's arguments.\n";
 
 int run(HXLinuxPlatform &live, int argc, char *argv[]) {
     if (argc < 2) {

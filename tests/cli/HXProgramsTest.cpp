@@ -135,7 +135,8 @@ TEST(HXProgramsTest, ALostReportIsAFailure) {
         {HEFT_PROGRAM " -h", "heft"},
         {HEFT_REPLAY_PROGRAM " " + machine + " -a", "heft-replay"},
         {HEFT_REPLAY_PROGRAM " -h", "heft-replay"},
-        {HEFT_RECORD_PROGRAM " -h", "heft-record"}};
+        {HEFT_RECORD_PROGRAM " -h", "heft-record"},
+        {HEFT_RECORD_PROGRAM " machine - " + self, "heft-record"}};
     for (const auto &[line, program] : lines) {
         const HXProgramRun run = HXRunProgram({"/bin/sh", "-c", line + " >/dev/full"});
         EXPECT_EQ(run.status, 1) << line;

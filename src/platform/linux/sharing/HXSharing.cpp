@@ -185,14 +185,12 @@ void HXSharing::readAddressSpaces(std::vector<Tasks> &families) {
     for (const Tasks &family : families)
         all.insert(all.end(), family.begin(), family.end());
     const auto isCancelled = _setting.isCancelled;
-    const auto givenUp =
-        forAll(all.size(),
-               [all, reader = _setting.reader, needsDirtyPages = _setting.needsDirtyPages,
-                findsLazilyFreed = _findsLazilyFreed](size_t i) {
-                   all[i]->withDescriptors(
-                       [&] { all[i]->readForSharing(*reader, needsDirtyPages, findsLazilyFreed); });
-               },
-               {"reading processes", [&all](size_t i) { return std::to_string(all[i]->pid()); }});
+    const auto read = [all, reader = _setting.reader, needsDirtyPages = _setting.needsDirtyPages,
+                       findsLazilyFreed = _findsLazilyFreed](size_t i) {
+        all[i]->withDescriptors([&] { all[i]->readForSharing(*reader, needsDirtyPages, findsLazilyFreed); });
+    };
+    const auto givenUp = forAll(
+        all.size(), read, {"reading processes", [&all](size_t i) { return std::to_string(all[i]->pid()); }});
     for (const size_t i : givenUp) {
         _unanswering.insert(all[i]->pid());
         for (Tasks &family : families)
@@ -237,19 +235,18 @@ void HXSharing::readPages(std::vector<std::shared_ptr<Work>> &families, bool isS
         const auto &[work, stretch] = items[i];
         return work->tasks[(*work->slots)[stretch].reading].task->pid();
     };
-    const auto givenUp = forAll(items.size(),
-                                [items, isSecond, isCancelled, findsLazilyFreed = _findsLazilyFreed,
-                                 pageShift = _setting.reader->pageShift](size_t i) {
-                                    const auto &[work, stretch] = items[i];
-                                    const auto slots = work->slots;
-                                    if (isCancelled()) return;
-                                    Work::Slot &slot = (*slots)[stretch];
-                                    slot.pages =
-                                        HXReadColumns({work->family, work->stretches[stretch], pageShift,
-                                                       isSecond ? work->repeated : nullptr, findsLazilyFreed},
-                                                      &slot.reading);
-                                },
-                                {"comparing pages", [&](size_t i) { return std::to_string(pidOf(i)); }});
+    const auto read = [items, isSecond, isCancelled, findsLazilyFreed = _findsLazilyFreed,
+                       pageShift = _setting.reader->pageShift](size_t i) {
+        const auto &[work, stretch] = items[i];
+        const auto slots = work->slots;
+        if (isCancelled()) return;
+        Work::Slot &slot = (*slots)[stretch];
+        slot.pages = HXReadColumns({work->family, work->stretches[stretch], pageShift,
+                                    isSecond ? work->repeated : nullptr, findsLazilyFreed},
+                                   &slot.reading);
+    };
+    const auto givenUp =
+        forAll(items.size(), read, {"comparing pages", [&](size_t i) { return std::to_string(pidOf(i)); }});
     for (const size_t i : givenUp) {
         items[i].first->hasFailed = true;
         _unanswering.insert(pidOf(i));
