@@ -45,8 +45,10 @@ void HXHeft::examineTogether() {
 
 void HXHeft::gatherProcesses() {
     HXServices &services = HXPlatform::current().services();
-    const HXDispatchQueue queue = services.dispatch_queue_create(kQueueLabel, QOS_CLASS_UTILITY);
     const std::vector<HXProcess *> ordered = _processesBySortingPidDesc(_processes);
+    HXDispatchQueue queue = services.dispatch_queue_create(kQueueLabel, QOS_CLASS_UTILITY);
+    queue.activity = "examining processes";
+    queue.processOf = [&ordered](size_t i) { return ordered[i]->displayString(); };
     const auto givenUp =
         services.dispatch_apply(ordered.size(), queue, [ordered, isCancelled = _isCancelled](size_t i) {
             if (!isCancelled->load(std::memory_order_relaxed)) ordered[i]->gatherData();

@@ -83,6 +83,7 @@ class HXHeftArgs {
 
     bool loadMemgraphs(Choice &choice, HXError *error);
     bool takeMemgraph(const std::string &path, Choice &choice, HXError *error);
+    void sayWhatIsNotTold() const;
     HXProcess::Map liveTargets(HXProcessSnapshot &snapshot);
     std::set<int32_t> exclusions(HXProcessSnapshot &snapshot) const;
     void resolveDescriptions(HXProcessSnapshot &snapshot);

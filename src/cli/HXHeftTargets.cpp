@@ -81,6 +81,14 @@ void HXHeftArgs::addTargets(HXProcessSnapshot &snapshot, HXProcess::Map &process
     }
 }
 
+// Before anything is missed.
+void HXHeftArgs::sayWhatIsNotTold() const {
+    const bool areAllWanted = _targetAll || _searchForUnmapped;
+    if (!areAllWanted && _targetPids.empty() && _potentialTargetProcesses.empty()) return;
+    if (const auto reason = HXPlatform::current().processesNotTold(areAllWanted))
+        fprintf(stderr, "heft: %s\n", reason->c_str());
+}
+
 // The processes that options and descriptions mean, without the memory graphs.
 HXProcess::Map HXHeftArgs::liveTargets(HXProcessSnapshot &snapshot) {
     std::set<int32_t> excluded = exclusions(snapshot);
@@ -109,6 +117,7 @@ std::optional<HXHeftArgs::ProcessList> HXHeftArgs::targetProcessesAndError(HXErr
         fail(error, HXErrorNoTarget, "Must specify at least one process or memgraph");
         return std::nullopt;
     }
+    sayWhatIsNotTold();
     HXProcess::Map live = liveTargets(choice.snapshot);
     if (_skipIdleExitClean) live = HXProcess::removeIdleExitCleanProcessesFrom(std::move(live));
 

@@ -29,7 +29,7 @@ constexpr char kUsage[] =
     "--vmObjectDirty  write what the memory objects see, not the breakdown of the heft\n"
     "\n"
     "FILE appears when it is complete, readable by its owner alone; a pipe or device is written as it "
-    "stands.\n";
+    "stands, and - is standard output. Ends 3 when nobody's memory could be read.\n";
 
 using Words = std::vector<std::string_view>;
 
@@ -59,16 +59,23 @@ std::optional<int32_t> parsePid(HXPlatform &host, std::string_view word) {
     return std::nullopt;
 }
 
-// Writes `path` with `write`, which tells itself what fails; the file appears only when all succeeds.
-int writeFile(HXServices &services, const std::string &path, const std::function<bool(std::FILE *)> &write) {
-    std::optional<HXPendingFile> file = services.createPendingFile(path);
-    if (!file) return fail(path, std::strerror(errno));
-    services.signal(HX_SIGPIPE, HXSignalDisposition::ignored); // a reader that goes away is a failed write
-    if (!write(file->stream)) {
-        services.discardPendingFile(*file);
-        return 1;
-    }
-    return services.commitPendingFile(*file) ? 0 : fail(path, std::strerror(errno));
+constexpr int kNothingRead = 3, kUnwritten = -1;
+
+// Writes `path`, or standard output for "-", with `write`: it answers the exit status, having told itself
+// what fails, or kUnwritten with errno set. The file appears only when the status is 0 or kNothingRead.
+int writeFile(HXServices &services, const std::string &path, const std::function<int(std::FILE *)> &write) {
+    const bool isOutput = path == "-";
+    const std::string name = isOutput ? "standard output" : path;
+    std::optional<HXPendingFile> file = services.createPendingFile(isOutput ? "/dev/stdout" : path);
+    if (!file) return fail(name, std::strerror(errno));
+    // A reader that goes away is a failed write; only that of standard output may.
+    if (!isOutput) services.signal(HX_SIGPIPE, HXSignalDisposition::ignored);
+    int status = write(file->stream);
+    const bool isWhole = status == 0 || status == kNothingRead;
+    if (isWhole && !services.commitPendingFile(*file)) status = kUnwritten;
+    if (!isWhole) services.discardPendingFile(*file);
+    if (status != kUnwritten) return status;
+    return isOutput && errno == EPIPE ? 0 : fail(name, std::strerror(errno));
 }
 
 int recordMachine(HXPlatform &host, const Words &words, bool anonymize) {
@@ -79,15 +86,17 @@ int recordMachine(HXPlatform &host, const Words &words, bool anonymize) {
         if (!pid) return 1;
         if (std::find(pids.begin(), pids.end(), *pid) == pids.end()) pids.push_back(*pid); // recorded once
     }
+    const auto notTold = host.processesNotTold(pids.empty());
+    if (notTold) std::fprintf(stderr, "heft-record: %s\n", notTold->c_str());
     return writeFile(host.services(), path, [&](std::FILE *out) {
         HXMachineRecorder recorder(host, out, anonymize);
-        if (!recorder.record(pids)) {
-            fail(path, std::strerror(errno));
-            return false;
-        }
-        if (recorder.processCount() > 0) return true;
-        fail(path, "no process was recorded");
-        return false;
+        if (!recorder.record(pids)) return kUnwritten;
+        if (!recorder.hasRecords()) return fail(path, "no process was recorded");
+        const size_t unreadable = recorder.unreadableCount(), all = recorder.readCount() + unreadable;
+        if (unreadable > 0)
+            std::fprintf(stderr, "heft-record: %zu of %zu processes could not be read%s\n", unreadable, all,
+                         host.geteuid() == 0 ? "" : " (try as root?)");
+        return recorder.readCount() > 0 || recorder.hasKernelMemory() ? 0 : kNothingRead;
     });
 }
 
@@ -102,9 +111,8 @@ int recordMemgraph(HXPlatform &host, const Words &words, bool vmObjectDirty) {
         const auto categoryName = [](uint32_t tag) { return HXMemoryRegion::categoryNameForTag(tag).str(); };
         if (HXMemgraphRecorder::record(host, out, categoryName,
                                        {*pid, snapshot.nameOf(*info), !vmObjectDirty}, &reason))
-            return true;
-        fail(words[0], reason);
-        return false;
+            return 0;
+        return fail(words[0], reason);
     });
 }
 
@@ -122,26 +130,29 @@ constexpr Capture kCaptures[] = {
     {"memgraph", "--vmObjectDirty", 2, 2, recordMemgraph},
 };
 
-} // namespace
-
-int main(int argc, char *argv[]) {
-    Words words(argv + 1, argv + argc);
+int run(HXPlatform &live, Words words) {
     if (words.empty()) return failUsage();
     if (words[0] == "--help" || words[0] == "-h") {
         std::fputs(kUsage, stdout);
         return 0;
     }
-    static HXLinuxPlatform live;
-    live.prepareProcess("heft-record");
-    HXPlatform::setCurrent(&live);
     for (const Capture &capture : kCaptures) {
         if (words[0] != capture.name) continue;
         const bool hasOption = words.size() > 1 && words[1] == capture.option;
         words.erase(words.begin(), words.begin() + (hasOption ? 2 : 1));
         if (words.size() < capture.fewestWords || words.size() > capture.mostWords ||
-            words[0].starts_with('-'))
+            (words[0].starts_with('-') && words[0] != "-"))
             return failUsage();
-        return live.services().finish(capture.record(live, words, hasOption));
+        return capture.record(live, words, hasOption);
     }
     return failUsage();
+}
+
+} // namespace
+
+int main(int argc, char *argv[]) {
+    static HXLinuxPlatform live;
+    live.prepareProcess("heft-record");
+    HXPlatform::setCurrent(&live);
+    return live.services().finish("heft-record", run(live, Words(argv + 1, argv + argc)));
 }

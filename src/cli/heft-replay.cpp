@@ -9,13 +9,13 @@
 #include <vector>
 
 namespace {
-constexpr char kUsage[] = "Usage: heft-replay FILE [heft's arguments]\n"
-                          "\n"
-                          "Prints heft's report on the machine that the machine file FILE describes.\n"
-                          "heft-record writes such files; heft --help tells heft's arguments.\n";
-}
+constexpr char kUsage[] =
+    "Usage: heft-replay FILE [heft's arguments]\n"
+    "\n"
+    "Prints heft's report on the machine that the machine file FILE describes; - is\n"
+    "standard input. heft-record writes such files; heft --help tells heft's arguments.\n";
 
-int main(int argc, char *argv[]) {
+int run(HXLinuxPlatform &live, int argc, char *argv[]) {
     if (argc < 2) {
         std::fputs(kUsage, stderr);
         return 1;
@@ -24,11 +24,10 @@ int main(int argc, char *argv[]) {
         std::fputs(kUsage, stdout);
         return 0;
     }
-    static HXLinuxPlatform live;
-    live.prepareProcess("heft-replay");
     std::string reason;
     static std::unique_ptr<HXMachine> machine;
-    machine = HXMachine::load(live.services(), argv[1], &reason);
+    const std::string_view path = argv[1];
+    machine = HXMachine::load(live.services(), std::string(path == "-" ? "/dev/stdin" : path), &reason);
     if (!machine) {
         std::fprintf(stderr, "%s: %s\n", argv[1], reason.c_str());
         return 1;
@@ -39,5 +38,12 @@ int main(int argc, char *argv[]) {
     std::vector<char *> arguments = {argv[0]};
     arguments.insert(arguments.end(), argv + 2, argv + argc);
     arguments.push_back(nullptr);
-    return live.services().finish(HXHeftMain(argc - 1, arguments.data()));
+    return HXHeftMain(argc - 1, arguments.data());
+}
+} // namespace
+
+int main(int argc, char *argv[]) {
+    static HXLinuxPlatform live;
+    live.prepareProcess("heft-replay");
+    return live.services().finish("heft-replay", run(live, argc, argv));
 }

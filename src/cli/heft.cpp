@@ -2,10 +2,12 @@
 #include "cli/HXHeftMain.h"
 #include "platform/HXPlatform.h"
 #include "platform/linux/HXLinuxPlatform.h"
+#include "platform/linux/HXProgressLine.h"
 
 int main(int argc, char *argv[]) {
     static HXLinuxPlatform platform;
     platform.prepareProcess("heft");
     HXPlatform::setCurrent(&platform);
-    return platform.services().finish(HXHeftMain(argc, argv));
+    static HXProgressLine progress(platform.services());
+    return platform.services().finish("heft", HXHeftMain(argc, argv));
 }

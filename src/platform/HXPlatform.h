@@ -113,6 +113,9 @@ class HXPlatform {
     // several mappings of a task show is told once.
     virtual std::vector<vm_region_share> mach_vm_region_shares(mach_port_t, uint64_t) { return {}; }
 
+    // Which object a task's page tables are, as a full object id. All bits set where the host does not tell.
+    virtual uint64_t pageTableObject(mach_port_t) { return UINT64_MAX; }
+
     // The shared memory that a task holds, each object once: what it maps, or what it has descriptors of.
     enum class HeldBy { mapping, descriptor };
     virtual std::vector<task_held_object> task_held_objects(mach_port_t, HeldBy) { return {}; }
@@ -143,6 +146,10 @@ class HXPlatform {
     // filled. With a null buffer: how many there are about. Kernel threads are no processes; the kernel
     // itself is pid 0.
     virtual int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes) = 0;
+
+    // Why the host does not tell of processes, for a message; none when it does. `ofAll`: also why it does
+    // not tell of all of them.
+    virtual std::optional<std::string> processesNotTold(bool) { return std::nullopt; }
 
     // Fills `buffer` with the record of `flavor` (PROC_PIDTBSDINFO, PROC_PIDT_SHORTBSDINFO) and answers its
     // length in bytes; 0 with errno set when it cannot (ENOMEM: too little room). A zombie has no record of

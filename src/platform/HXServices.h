@@ -30,6 +30,11 @@ struct HXOptionScan {
 struct HXDispatchQueue {
     std::string label;
     uint32_t qualityOfService = 0;
+    // For whoever watches the work: what is done ("reading memory"), empty where nobody needs to know; and
+    // what the process that an iteration works on is called, asked on the thread of `dispatch_apply`, may be
+    // null.
+    std::string activity = {};
+    std::function<std::string(size_t)> processOf = {};
 };
 inline constexpr uint32_t QOS_CLASS_UTILITY = 0x11;
 
@@ -65,7 +70,8 @@ class HXServices {
     virtual bool stat(const std::string &path) = 0;
 
     // A stream to read, which the caller closes with std::fclose, or null with errno set. Waits for a fifo's
-    // writer, but for one that does not come within ten seconds no longer (ETIMEDOUT).
+    // writer, but for one that does not come within ten seconds no longer (ETIMEDOUT). An open file
+    // of the process, such as /dev/stdin, goes on where it stands.
     virtual std::FILE *openForReading(const std::string &path) = 0;
 
     // The same for reading a regular file. Never waits: a folder (EISDIR) and a fifo or device (EINVAL) are
@@ -96,9 +102,11 @@ class HXServices {
     virtual std::vector<size_t> dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
                                                std::function<void(size_t)> work) = 0;
 
-    // What main returns: `status`. Does not return when an iteration was given up: the program then ends
-    // here, standard output written, before the objects that it may still use are destroyed.
-    virtual int finish(int status) = 0;
+    // What main returns, once all of standard output is written: `status`; 1 when some of that is lost, which
+    // is then told as `program`'s message. That nobody reads any more is no loss. Does not return when an
+    // iteration was given up: the program then ends here, before the objects that it may still use are
+    // destroyed.
+    virtual int finish(const char *program, int status) = 0;
 
     // A source of events for a signal, not yet running; null when there can be none. From here until `signal`
     // sets the disposition anew the signal reaches no other thread.

@@ -90,7 +90,9 @@ void HXProcessSnapshot::openTasks(const std::vector<int32_t> &pids) {
     for (size_t i = 0; i < pids.size(); i++)
         openings->push_back({HXTaskPort(_host), KERN_FAILURE});
     HXServices &services = _host.services();
-    const HXDispatchQueue queue = services.dispatch_queue_create("org.heft.opentasks", QOS_CLASS_UTILITY);
+    HXDispatchQueue queue = services.dispatch_queue_create("org.heft.opentasks", QOS_CLASS_UTILITY);
+    queue.activity = "opening processes";
+    queue.processOf = [&pids](size_t i) { return std::to_string(pids[i]); };
     const auto givenUp = services.dispatch_apply(pids.size(), queue, [pids, openings](size_t i) {
         Opening &opening = (*openings)[i];
         opening.error = opening.task.open(pids[i]);

@@ -284,6 +284,6 @@ void HXUserProcess::addPageTables(Gathering &gathering) {
     region.setDirtySize(_ledgers[0]);
     region.setStart(kNoAddress);
     region.setName("page table");
-    region.setObject_id(UINT64_MAX);
+    region.setObject_id(HXPlatform::current().pageTableObject(_task.get()));
     region.setShare_mode(SM_PRIVATE);
 }

@@ -78,8 +78,11 @@ bool HXMachineRecorder::recordProcesses(const std::vector<int32_t> &chosen, HXRe
         }
         if (!write(process->head()) || !write(process->body())) return false;
         _tags.insert(process->tags().begin(), process->tags().end());
+        _hasRecords = true;
         _hasKernel |= pid == kKernelPid;
-        _processCount++;
+        if (pid == kKernelPid) continue;
+        _readCount += error == KERN_SUCCESS;
+        _unreadableCount += error != KERN_SUCCESS && error != KERN_FAILURE; // which is that of a zombie
     }
     return true;
 }

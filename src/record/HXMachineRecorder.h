@@ -26,7 +26,13 @@ class HXMachineRecorder {
     // kernel's own memory is recorded with pid 0. False with errno set when writing failed.
     bool record(const std::vector<int32_t> &pids);
 
-    size_t processCount() const { return _processCount; }
+    // Whether anything was recorded, were it without memory.
+    bool hasRecords() const { return _hasRecords; }
+    // The processes recorded with their memory, and those that could not be opened for it; none that has
+    // ended.
+    size_t readCount() const { return _readCount; }
+    size_t unreadableCount() const { return _unreadableCount; }
+    bool hasKernelMemory() const { return _hasKernel && _facts.memoryInfoError == KERN_SUCCESS; }
 
   private:
     void recordHost(const std::optional<int32_t> &selfRegionHeft);
@@ -50,5 +56,7 @@ class HXMachineRecorder {
     std::vector<int32_t> _sorted;
     std::set<uint32_t> _tags; // of all that was recorded
     bool _hasKernel = false;
-    size_t _processCount = 0;
+    bool _hasRecords = false;
+    size_t _readCount = 0;
+    size_t _unreadableCount = 0;
 };

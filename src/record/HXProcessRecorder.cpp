@@ -147,6 +147,8 @@ void HXProcessRecorder::recordFigures(int32_t pid) {
         _process.heftPeak = usage.ri_lifetime_max_phys_heft;
     }
     if (_facts.ledger) _head.number(Process::pageTable, HXPageTableBalance(_host, *_facts.ledger, pid));
+    const uint64_t pageTables = _host.pageTableObject(_task.get());
+    if (pageTables != UINT64_MAX) _head.number(Process::pageTableObject, pageTables);
 }
 
 // Lets the host read what both values of the setting need before the first region is recorded: it may read a

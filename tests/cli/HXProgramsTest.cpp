@@ -3,6 +3,7 @@
 #include "support/HXCaseFile.h"
 #include "support/HXCheckReport.h"
 #include "support/HXProgramRun.h"
+#include "support/HXSubject.h"
 #include "support/HXTemporaryFolder.h"
 
 #include <gtest/gtest.h>
@@ -121,6 +122,54 @@ TEST(HXProgramsTest, ClosedStandardStreamsStayOutOfTheDocument) {
             if (hasText) checkReport(run.out, document);
             EXPECT_TRUE(document.starts_with("{") && document.ends_with("}")) << line << document;
         }
+}
+
+TEST(HXProgramsTest, ALostReportIsAFailure) {
+    if (!fs::exists("/dev/full")) GTEST_SKIP() << "no /dev/full";
+    const HXTemporaryFolder folder;
+    folder.write("machine", failingMachine(3));
+    const std::string self = std::to_string(getpid()), machine = folder / "machine";
+    const std::pair<std::string, std::string> lines[] = {
+        {HEFT_PROGRAM " " + self, "heft"},
+        {HEFT_PROGRAM " -v " + self, "heft"},
+        {HEFT_PROGRAM " -h", "heft"},
+        {HEFT_REPLAY_PROGRAM " " + machine + " -a", "heft-replay"},
+        {HEFT_REPLAY_PROGRAM " -h", "heft-replay"},
+        {HEFT_RECORD_PROGRAM " -h", "heft-record"},
+        {HEFT_RECORD_PROGRAM " machine - " + self, "heft-record"}};
+    for (const auto &[line, program] : lines) {
+        const HXProgramRun run = HXRunProgram({"/bin/sh", "-c", line + " >/dev/full"});
+        EXPECT_EQ(run.status, 1) << line;
+        EXPECT_TRUE(run.err.ends_with(program + ": standard output: No space left on device\n")) << run.err;
+        // A reader that has gone is none, whether or not its signal is ignored.
+        for (const char *const before : {"", "trap '' PIPE; "}) {
+            const HXProgramRun left =
+                HXRunProgram({"/bin/bash", "-c", before + line + " 2>&1 | true; exit ${PIPESTATUS[0]}"});
+            EXPECT_TRUE(left.status == 0 || left.status == 128 + SIGPIPE) << line;
+        }
+    }
+}
+
+// Through pipes, which is how they leave a machine without a place for them.
+TEST(HXProgramsTest, CapturesAndDocumentsGoThroughOpenFiles) {
+    const HXTemporaryFolder folder;
+    const HXSubject subject([] {});
+    const std::string pid = std::to_string(subject.pid()), json = folder / "json";
+    const std::string record = HEFT_RECORD_PROGRAM " machine ", replay = HEFT_REPLAY_PROGRAM " ";
+    const auto lines = {record + "- " + pid + " | " + replay + "- " + pid,
+                        record + "/dev/stdout " + pid + " | " + replay + "/dev/stdin " + pid,
+                        record + folder.path().native() + "/m " + pid + " && " + replay + "- " + pid + " <" +
+                            folder.path().native() + "/m",
+                        HEFT_RECORD_PROGRAM " memgraph " + pid + " - >" + json + " && " HEFT_PROGRAM " " +
+                            json,
+                        HEFT_PROGRAM " " + pid + " --json /dev/fd/3 3>" + json};
+    for (const std::string &line : lines) {
+        const HXProgramRun run = HXRunProgram({"/bin/sh", "-c", line});
+        EXPECT_EQ(run.status, 0) << line;
+        EXPECT_EQ(run.err, "") << line;
+        EXPECT_TRUE(contains(run.out, " [" + pid + "]")) << line << run.out;
+    }
+    EXPECT_TRUE(contentOf(json).ends_with("}"));
 }
 
 // The reader leaves after a byte of a document that no pipe holds whole.

@@ -109,6 +109,10 @@ bool isSwapBacked(const HXSmapsEntry &entry) {
     return false;
 }
 
+bool isTmpfs(const HXMemoryMapping &mapping) {
+    return mapping.file && mapping.file == std::string("/dev/shm");
+}
+
 const HXMemoryRegion *regionAt(const HXProcess &process, uint64_t start) {
     for (const HXMemoryRegion &region : process.memoryRegions())
         if (region.start() == start) return &region;
@@ -124,6 +128,8 @@ Sizes sizesOf(const HXMemoryRegion &region) {
 class HXLiveRegions : public testing::TestWithParam<HXMemoryRecipe> {
   protected:
     void SetUp() override {
+        for (const HXMemoryMapping &mapping : GetParam().mappings)
+            if (isTmpfs(mapping) && !HXHasTmpfs()) GTEST_SKIP() << "/dev/shm is no tmpfs";
         ASSERT_TRUE(subject.stopped()) << "this machine cannot do it";
         HXPlatform::setCurrent(&platform);
     }
@@ -140,8 +146,8 @@ class HXLiveRegions : public testing::TestWithParam<HXMemoryRecipe> {
     uint64_t repeatedAt(uint64_t start) const {
         for (size_t i = 0; i < GetParam().mappings.size(); i++) {
             const HXMemoryMapping &mapping = GetParam().mappings[i];
-            const bool isSwapBacked = mapping.file && (mapping.file == std::string("memfd") ||
-                                                       mapping.file == std::string("/dev/shm"));
+            const bool isSwapBacked =
+                isTmpfs(mapping) || (mapping.file && mapping.file == std::string("memfd"));
             if (HXPlaceOf(GetParam(), i) == start && isSwapBacked) return mapping.clean * kPage;
         }
         return 0;

@@ -65,6 +65,53 @@ TEST_F(HXProgramAsRoot, RefusesWhatOnlyRootMay) {
     EXPECT_NE(kernel.out.find("kernel [0]: (os/kern) no access"), std::string::npos) << kernel.out;
 }
 
+TEST_F(HXProgramAsRoot, SaysHowMuchOfARecordingIsMissing) {
+    const HXSubject subject([] {});
+    const HXProgramRun run =
+        HXRunProgram({HEFT_RECORD_PROGRAM, "machine", "-", std::to_string(subject.pid())}, kNobody);
+    EXPECT_EQ(run.status, 3);
+    EXPECT_EQ(run.err, "heft-record: 1 of 1 processes could not be read (try as root?)\n");
+    EXPECT_NE(run.out.find("\ttask_error=8"), std::string::npos);
+}
+
+// As JavaScript has them, numbers are whole below 2^53.
+TEST_F(HXProgramAsRoot, GivesIdentifiersThatEveryReaderKeeps) {
+    const HXProgramRun run = HXRunHeft({"-a", "-v", "-j", "/dev/stdout"});
+    const std::string document = run.out.substr(run.out.find("{\"unit\""));
+    const std::regex region(R"("id":(\d+),"name":"([^"]*)\")");
+    std::set<uint64_t> pageTables;
+    size_t count = 0;
+    for (std::sregex_iterator at(document.begin(), document.end(), region), end; at != end; ++at) {
+        const uint64_t id = std::stoull((*at)[1]);
+        EXPECT_LT(id, uint64_t{1} << 53) << (*at)[2];
+        if ((*at)[2] != "page table") continue;
+        count++;
+        pageTables.insert(id);
+    }
+    EXPECT_GT(count, 1U);
+    EXPECT_EQ(pageTables.size(), count) << "two objects have one identifier";
+}
+
+TEST_F(HXProgramAsRoot, SaysWhenProcTellsNothingOrNotAll) {
+    const auto answer = [](const std::string &line) {
+        return HXRunProgram({"/usr/bin/env", "unshare", "-m", "sh", "-c", line});
+    };
+    if (answer("mount -t proc -o hidepid=2 proc /proc").status != 0) GTEST_SKIP() << "no mount namespace";
+    const std::string heft = HEFT_PROGRAM;
+    for (const std::string &target : {std::string("-a"), std::string("1")}) {
+        const HXProgramRun run = answer("umount -l /proc && exec " + heft + " " + target);
+        EXPECT_EQ(run.status, 1);
+        EXPECT_TRUE(run.err.starts_with("heft: /proc is not mounted\n")) << run.err;
+    }
+    const std::string hidden =
+        "mount -t proc -o hidepid=2,gid=12345 proc /proc && exec setpriv --bounding-set=-all "
+        "--inh-caps=-all " +
+        heft;
+    EXPECT_TRUE(answer(hidden + " -a").err.starts_with("heft: /proc hides processes (it is mounted with "));
+    EXPECT_EQ(answer("mount -t proc -o hidepid=2 proc /proc && exec " + heft + " -a").err.find("hides"),
+              std::string::npos);
+}
+
 // Two hundred shells whose children start, map, unmap and die while everything is examined again and again.
 TEST_F(HXProgramAsRoot, SurvivesAMachineInMotion) {
     const HXSubject parent("/bin/sh",

@@ -1,5 +1,6 @@
 // The built program on processes of the user's own.
 #include "support/HXBuilders.h"
+#include "support/HXMemoryRecipe.h"
 #include "support/HXProgramRun.h"
 #include "support/HXSubject.h"
 #include "support/HXTemporaryFolder.h"
@@ -140,6 +141,7 @@ TEST(HXProgram, TellsThirtyTwoBitProgramsApart) {
 
 // Two processes share a memfd and a tmpfs file, and each has memory of its own.
 TEST(HXProgram, CountsSharedMemoryOnce) {
+    if (!HXHasTmpfs()) GTEST_SKIP() << "/dev/shm is no tmpfs";
     constexpr size_t mib = 1 << 20;
     const HXTemporaryFolder folder;
     std::string path = "/dev/shm/heft-XXXXXX";

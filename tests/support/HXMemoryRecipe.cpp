@@ -1,10 +1,12 @@
 #include "support/HXMemoryRecipe.h"
 
 #include <fcntl.h>
+#include <linux/magic.h>
 #include <sys/ipc.h>
 #include <sys/mman.h>
 #include <sys/shm.h>
 #include <sys/syscall.h>
+#include <sys/vfs.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -99,4 +101,9 @@ void HXFollow(const HXMemoryRecipe &recipe) {
                 require(act(step.act, start + (step.first + page) * kPage, length * kPage));
         }
     }
+}
+
+bool HXHasTmpfs() {
+    struct ::statfs system;
+    return ::statfs("/dev/shm", &system) == 0 && system.f_type == TMPFS_MAGIC;
 }

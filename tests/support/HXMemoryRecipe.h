@@ -37,6 +37,9 @@ struct HXMemoryRecipe {
     friend void PrintTo(const HXMemoryRecipe &recipe, std::ostream *out) { *out << recipe.name; }
 };
 
+// Whether /dev/shm is a tmpfs, as it is on most machines but not in every container.
+bool HXHasTmpfs();
+
 // Does all that the calling process needs for it; ends it when the machine cannot.
 void HXFollow(const HXMemoryRecipe &recipe);
 // Where the mapping of that index begins.

@@ -114,6 +114,7 @@ struct HXMachineProcess {
     std::optional<uint64_t> heft; // bytes
     uint64_t heftPeak = 0;
     std::optional<int64_t> pageTable; // bytes
+    uint64_t pageTableObject = UINT64_MAX;
 
     // Both ascending and without overlap. Made with the first region.
     std::unique_ptr<std::deque<HXMachineRegion>> regions;

@@ -41,6 +41,7 @@ constexpr F processFields[] = {
     F::optional("dirty_flags", K::unsigned32),
     F::optional("heft", K::unsigned64),
     F::optional("page_table", K::signed64),
+    F::optional("page_table_object", K::unsigned64).inHexadecimal(),
     F::defaulted("ppid", PROCESS(ppid), 1),
     F::defaulted("flags", PROCESS(flags), PROC_FLAG_LP64),
     F::defaulted("status", PROCESS(status), 2),
@@ -140,7 +141,7 @@ constexpr HXRecordForm records[] = {
 static_assert(std::size(regionFields) <= kMaxCaptureFields);
 static_assert(regionFields[HXMachineFormat::Region::fullObjectID].name == "full_object_id");
 static_assert(regionFields[HXMachineFormat::Region::heftOnly].name == "heft_only");
-static_assert(processFields[HXMachineFormat::Process::pageTable].name == "page_table");
+static_assert(processFields[HXMachineFormat::Process::pageTableObject].name == "page_table_object");
 static_assert(offsetof(HXMachineRegionTraits, info) == 0, "both are filled by the places in one form");
 static_assert(std::size(records) == HXMachineFormat::hostRecord + 1);
 

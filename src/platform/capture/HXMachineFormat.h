@@ -50,7 +50,7 @@ namespace Pages {
 enum Field : size_t { pid, pages };
 }
 namespace Process {
-enum Field : size_t { pid, comm, name, argsPath, dirtyFlags, heft, pageTable };
+enum Field : size_t { pid, comm, name, argsPath, dirtyFlags, heft, pageTable, pageTableObject };
 }
 namespace Image {
 enum Field : size_t { pid, path, base };

@@ -223,6 +223,9 @@ bool HXMachineReader::readProcess() {
     _process->dirtyFlags = _reader.optionalNumber<uint32_t>(Process::dirtyFlags);
     _process->heft = _reader.optionalNumber<uint64_t>(Process::heft);
     _process->pageTable = _reader.optionalNumber<int64_t>(Process::pageTable);
+    _process->pageTableObject =
+        _reader.optionalNumber<uint64_t>(Process::pageTableObject).value_or(UINT64_MAX);
+    if (_process->pageTableObject == 0) return _reader.fail("page tables of no object");
     return true;
 }
 

@@ -3,6 +3,7 @@
 
 #include "platform/HXRegionTags.h"
 #include "platform/HXSafeText.h"
+#include "platform/linux/HXStandardOutput.h"
 #include "platform/linux/HXTemporaryFiles.h"
 #include "platform/linux/procfs/HXTaskFiles.h"
 
@@ -76,6 +77,7 @@ void HXLinuxPlatform::prepareProcess(const char *program) {
         // The lowest free descriptor is this one.
         [[maybe_unused]] const int opened = ::open("/dev/null", O_RDWR);
     }
+    HXWatchStandardOutput();
     // Heaps of worker threads then grow in few steps, each of which is a system call that stops the others:
     // by a mebibyte instead of 128 KiB.
     constexpr int heapStep = 1 << 20;

@@ -33,8 +33,9 @@ class HXLinuxPlatform final : public HXPlatform {
     explicit HXLinuxPlatform(const Setting &setting);
 
     // Readies the running process for examining thousands of others: as many open files as it may have, no
-    // file of its own on the descriptors of the standard streams, should one be closed, and a message of
-    // `program` and status 1 as the end when memory runs out. For main; `program` lives for ever.
+    // file of its own on the descriptors of the standard streams, should one be closed, a standard output
+    // that remembers what is lost of it, and a message of `program` and status 1 as the end when memory runs
+    // out. For main; `program` lives for ever.
     static void prepareProcess(const char *program);
 
     mach_port_t mach_task_self() override { return kSelfPort; }
@@ -54,6 +55,7 @@ class HXLinuxPlatform final : public HXPlatform {
     std::optional<uint64_t> sharedSizeNotTold() override { return _sharedSizeNotTold; }
     std::vector<vm_region_share> mach_vm_region_shares(mach_port_t task, uint64_t address) override;
     std::optional<HXWalkDifference> walkDifference(mach_port_t task) override;
+    uint64_t pageTableObject(mach_port_t task) override;
     std::vector<task_held_object> task_held_objects(mach_port_t task, HeldBy by) override;
     std::vector<task_held_object> host_held_objects(mach_port_t) override { return _held.ofKernel(); }
     uint32_t vm_kernel_page_size() override { return _pageSize; }
@@ -62,6 +64,7 @@ class HXLinuxPlatform final : public HXPlatform {
     int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes) override {
         return _processes.proc_listallpids(pids, bufferBytes);
     }
+    std::optional<std::string> processesNotTold(bool ofAll) override { return _processes.notTold(ofAll); }
     int32_t proc_pidinfo(int32_t pid, int32_t flavor, uint64_t, void *buffer, uint32_t bufferBytes) override {
         return _processes.proc_pidinfo(pid, flavor, buffer, bufferBytes);
     }

@@ -163,6 +163,11 @@ std::optional<HXWalkDifference> HXLinuxPlatform::walkDifference(mach_port_t port
     return task->difference();
 }
 
+uint64_t HXLinuxPlatform::pageTableObject(mach_port_t port) {
+    const HXLinuxTask *task = _tasks.find(port);
+    return task == nullptr ? UINT64_MAX : _identifiers.ofPageTables(task->pid());
+}
+
 std::vector<task_held_object> HXLinuxPlatform::task_held_objects(mach_port_t port, HeldBy by) {
     std::vector<task_held_object> held;
     HXLinuxTask *task = _tasks.find(port);

@@ -94,20 +94,27 @@ fs::path followLinks(fs::path path) {
     return path;
 }
 
-// Opens what is no regular file for writing.
-HXDescriptor openAsItStands(const fs::path &path) {
-    // An open file of the process is not opened anew: what is written follows what was, and sockets do.
+// The open file of the process that `path`, its links followed, names (/dev/stdout, /dev/fd/3); none when it
+// names something else. It is not opened anew: what is written follows what was, and sockets do.
+std::optional<HXDescriptor> openFileAgain(const fs::path &path) {
     std::error_code error;
     const std::string name = path.filename();
     int number = 0;
-    if (HXIsNumber(name, &number) && fs::equivalent(path.parent_path(), "/proc/self/fd", error))
-        return HXDescriptor(::fcntl(number, F_DUPFD_CLOEXEC, 3));
+    if (!HXIsNumber(name, &number) || !fs::equivalent(path.parent_path(), "/proc/self/fd", error))
+        return std::nullopt;
+    return HXDescriptor(::fcntl(number, F_DUPFD_CLOEXEC, 3));
+}
+
+// Opens what is no regular file for writing.
+HXDescriptor openAsItStands(const fs::path &path) {
+    if (auto file = openFileAgain(path)) return std::move(*file);
     return HXDescriptor(::open(path.c_str(), O_WRONLY | O_CLOEXEC | O_NOCTTY));
 }
 
 } // namespace
 
 std::FILE *HXLinuxServices::openForReading(const std::string &path) {
+    if (auto file = openFileAgain(followLinks(path))) return openStream(std::move(*file), "r");
     struct ::stat status;
     if (::stat(path.c_str(), &status) == 0 && S_ISFIFO(status.st_mode)) return openFifo(path);
     return std::fopen(path.c_str(), "re");

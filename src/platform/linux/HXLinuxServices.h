@@ -7,8 +7,22 @@
 #include <chrono>
 #include <cstddef>
 
+// Looks at `dispatch_apply` while it waits, on its thread.
+class HXLoopObserver {
+  public:
+    virtual ~HXLoopObserver() = default;
+    // Some times a second. `done` of `all` iterations have returned; `waitingFor`, if any, sleeps in the
+    // kernel.
+    virtual void looked(const HXDispatchQueue &queue, size_t done, size_t all,
+                        std::optional<size_t> waitingFor) = 0;
+    virtual void ended() = 0;
+};
+
 class HXLinuxServices : public HXServices {
   public:
+    // Of `dispatch_apply` on queues with an activity. Null: none. Outlives its use. Main thread only.
+    void setLoopObserver(HXLoopObserver *observer) { _observer = observer; }
+
     // How many workers `dispatch_apply` has; 0: one for each usable processor. They are batch-scheduled.
     void setWorkerCount(size_t count) { _workerCount = count; }
     // How long an iteration of `dispatch_apply` may wait in the kernel before it is given up, at least 100
@@ -27,7 +41,7 @@ class HXLinuxServices : public HXServices {
     HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) override;
     std::vector<size_t> dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
                                        std::function<void(size_t)> work) override;
-    int finish(int status) override;
+    int finish(const char *program, int status) override;
     std::unique_ptr<HXDispatchSource> dispatch_source_create(int signal) override;
     void dispatch_source_set_event_handler(HXDispatchSource &source, std::function<void()> handler) override;
     void dispatch_resume(HXDispatchSource &source) override;
@@ -38,4 +52,5 @@ class HXLinuxServices : public HXServices {
     size_t _workerCount = 0;
     std::chrono::milliseconds _answerTime{10000};
     std::atomic<bool> _hasGivenUp = false;
+    HXLoopObserver *_observer = nullptr;
 };

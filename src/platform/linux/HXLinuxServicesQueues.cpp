@@ -1,5 +1,6 @@
 // Work queues.
 #include "platform/linux/HXLinuxServices.h"
+#include "platform/linux/HXStandardOutput.h"
 #include "platform/linux/HXWorkLoop.h"
 
 #include <sched.h>
@@ -8,6 +9,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <cstring>
 
 namespace {
 
@@ -34,16 +36,26 @@ HXDispatchQueue HXLinuxServices::dispatch_queue_create(const std::string &label,
     return {label, qualityOfService};
 }
 
-std::vector<size_t> HXLinuxServices::dispatch_apply(size_t iterations, const HXDispatchQueue &,
+std::vector<size_t> HXLinuxServices::dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
                                                     std::function<void(size_t)> work) {
     const size_t workers = _workerCount == 0 ? usableProcessorCount() : _workerCount;
-    auto givenUp = HXWorkLoop::run(iterations, workers, _answerTime, std::move(work));
+    HXWorkLoop::Look look;
+    if (_observer != nullptr && !queue.activity.empty())
+        look = [&](size_t done, std::optional<size_t> waitingFor) {
+            _observer->looked(queue, done, iterations, waitingFor);
+        };
+    auto givenUp = HXWorkLoop::run(iterations, workers, _answerTime, std::move(work), look);
+    if (look) _observer->ended();
     if (!givenUp.empty()) _hasGivenUp = true;
     return givenUp;
 }
 
-int HXLinuxServices::finish(int status) {
+int HXLinuxServices::finish(const char *program, int status) {
+    const int failure = HXFlushStandardOutput();
+    if (failure != 0 && failure != EPIPE) {
+        std::fprintf(stderr, "%s: standard output: %s\n", program, std::strerror(failure));
+        status = 1;
+    }
     if (!_hasGivenUp) return status;
-    std::fflush(stdout);
     ::_exit(status);
 }

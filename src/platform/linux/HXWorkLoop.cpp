@@ -35,12 +35,12 @@ bool isAsleep(const std::string &statPath) {
 } // namespace
 
 std::vector<size_t> HXWorkLoop::run(size_t iterations, size_t workers, std::chrono::milliseconds answerTime,
-                                    std::function<void(size_t)> work) {
+                                    std::function<void(size_t)> work, const Look &look) {
     const auto loop = std::make_shared<HXWorkLoop>(iterations, std::move(work));
     std::unique_lock lock(loop->_mutex);
     for (size_t i = 0; i < std::min(iterations, workers); i++)
         if (!loop->startWorker()) break;
-    loop->watch(lock, answerTime);
+    loop->watch(lock, answerTime, look);
     lock.unlock(); // no worker starts from here on
     for (const auto &worker : loop->_workers)
         worker->isGivenUp ? worker->thread.detach() : worker->thread.join();
@@ -79,13 +79,31 @@ void HXWorkLoop::runWorker(Worker &worker) {
     if (_running == 0) _ended.notify_all();
 }
 
-void HXWorkLoop::watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds answerTime) {
+// Without the lock, which workers need: whoever is told may wait for his terminal.
+void HXWorkLoop::tell(std::unique_lock<std::mutex> &lock, const Look &look) const {
+    size_t done = _next;
+    std::optional<size_t> waitingFor;
+    for (const auto &worker : _workers) {
+        if (!worker->iteration) continue;
+        done--;
+        if (!worker->isGivenUp && worker->looksWithoutProgress >= kPatientLooks && !waitingFor)
+            waitingFor = worker->iteration;
+    }
+    lock.unlock();
+    look(done, waitingFor);
+    lock.lock();
+}
+
+void HXWorkLoop::watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds answerTime,
+                       const Look &observer) {
     const auto pause = std::max(answerTime / kLooks, std::chrono::milliseconds(1));
     for (;;) {
         while (_running > 0)
-            if (_ended.wait_for(lock, pause) == std::cv_status::timeout)
+            if (_ended.wait_for(lock, pause) == std::cv_status::timeout) {
                 for (size_t i = 0; i < _workers.size(); i++)
                     look(*_workers[i]);
+                if (observer) tell(lock, observer);
+            }
         if (_next == _iterations || startWorker()) {
             if (_running == 0) return;
             continue;

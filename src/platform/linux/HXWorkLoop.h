@@ -19,10 +19,13 @@
 // it.
 class HXWorkLoop : public std::enable_shared_from_this<HXWorkLoop> {
   public:
-    // As HXServices::dispatch_apply says. A thread counts as waiting while it has used no processor time and
-    // sleeps; time is counted by looks at it, so that nobody is given up while the program was stopped.
+    // Told some times a second how many iterations have returned, and which one sleeps in the kernel.
+    using Look = std::function<void(size_t done, std::optional<size_t> waitingFor)>;
+    // As HXServices::dispatch_apply says; `look` may be null. A thread counts as waiting while it has used no
+    // processor time and sleeps; time is counted by looks at it, so that nobody is given up while the program
+    // was stopped.
     static std::vector<size_t> run(size_t iterations, size_t workers, std::chrono::milliseconds answerTime,
-                                   std::function<void(size_t)> work);
+                                   std::function<void(size_t)> work, const Look &look = nullptr);
 
     // For `run`.
     HXWorkLoop(size_t iterations, std::function<void(size_t)> work)
@@ -44,7 +47,9 @@ class HXWorkLoop : public std::enable_shared_from_this<HXWorkLoop> {
 
     bool startWorker();
     void runWorker(Worker &worker);
-    void watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds answerTime);
+    void watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds answerTime,
+               const Look &observer);
+    void tell(std::unique_lock<std::mutex> &lock, const Look &look) const;
     void look(Worker &worker);
     static bool hasProgressed(Worker &worker);
 

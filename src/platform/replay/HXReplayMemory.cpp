@@ -102,6 +102,11 @@ const HXMachineRegion *HXReplayPlatform::regionAt(const HXMachineProcess &proces
     return region != nullptr && region->address <= address ? region : nullptr;
 }
 
+uint64_t HXReplayPlatform::pageTableObject(mach_port_t task) {
+    const HXMachineProcess *const process = taskOf(task).process;
+    return process ? process->pageTableObject : UINT64_MAX;
+}
+
 std::vector<task_held_object> HXReplayPlatform::task_held_objects(mach_port_t task, HeldBy by) {
     const HXMachineProcess *const process = taskOf(task).process;
     std::vector<task_held_object> held;

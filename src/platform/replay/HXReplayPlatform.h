@@ -28,6 +28,7 @@ class HXReplayPlatform : public HXPlatform {
     std::vector<vm_region_share> mach_vm_region_shares(mach_port_t task, uint64_t address) override;
     kern_return_t mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,
                                            int32_t *state) override;
+    uint64_t pageTableObject(mach_port_t task) override;
     std::vector<task_held_object> task_held_objects(mach_port_t task, HeldBy by) override;
     std::vector<task_held_object> host_held_objects(mach_port_t host) override;
     uint32_t vm_kernel_page_size() override { return _machine.host.pageSize; }

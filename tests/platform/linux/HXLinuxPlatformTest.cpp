@@ -217,6 +217,14 @@ TEST_F(HXLinuxPlatformTest, ProcessesVanishAndRefuse) {
     for (const int32_t pid : {3, 4, 2, 0, -1})
         EXPECT_EQ(platform.task_for_pid(1, pid, &task), KERN_FAILURE) << pid;
 
+    // Its memory goes before itself.
+    process(5, "dying", "", 'R');
+    proc.write("5/stat", "5 (dying) R 7 8 9 0 -1 64 1 2 3 4 5 6 7 8 20 0 1 0 4242 0 0 0 0 0 0 0 0\n");
+    EXPECT_EQ(platform.task_for_pid(1, 5, &task), KERN_FAILURE);
+    proc_bsdshortinfo brief;
+    ASSERT_EQ(platform.proc_pidinfo(5, 13, 1, &brief, sizeof brief), 64);
+    EXPECT_EQ(brief.pbsi_status, SZOMB);
+
     process(10, "empty", "");
     process(11, "vanishes", kMapping);
     process(12, "recycled", kMapping);

@@ -63,6 +63,35 @@ TEST(HXLinuxDispatch, GivesUpWhatWaitsAlone) {
     shared->lateEnd.get_future().wait(); // a late one finds what it works on
 }
 
+TEST(HXLinuxDispatch, TellsWhomItWaitsFor) {
+    HXLinuxServices services;
+    services.setWorkerCount(1);
+    services.setAnswerTime(std::chrono::milliseconds(1000));
+    struct Observer : HXLoopObserver {
+        void looked(const HXDispatchQueue &queue, size_t done, size_t all,
+                    std::optional<size_t> waitingFor) override {
+            if (!waitingFor) return;
+            told = queue.activity + std::to_string(done) + std::to_string(all) + std::to_string(*waitingFor);
+            if (!std::exchange(isAnswered, true)) answer.set_value();
+        }
+        void ended() override { ends++; }
+        std::string told;
+        bool isAnswered = false;
+        std::promise<void> answer;
+        int ends = 0;
+    } observer;
+    services.setLoopObserver(&observer);
+    HXDispatchQueue queue = services.dispatch_queue_create("q", QOS_CLASS_UTILITY);
+    std::shared_future<void> answered(observer.answer.get_future());
+    services.dispatch_apply(1, queue, [](size_t) {}); // nobody needs to know
+    queue.activity = "x";
+    services.dispatch_apply(3, queue, [answered](size_t i) {
+        if (i == 2) answered.wait();
+    });
+    EXPECT_EQ(observer.told, "x232");
+    EXPECT_EQ(observer.ends, 1);
+}
+
 // In a process of its own, for signals are the whole process's.
 int statusOf(const std::function<int()> &body) {
     const pid_t child = fork();

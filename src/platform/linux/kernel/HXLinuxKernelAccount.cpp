@@ -5,6 +5,8 @@
 #include "platform/linux/procfs/HXTextNumber.h"
 
 #include <algorithm>
+#include <cinttypes>
+#include <cstdio>
 #include <cstring>
 #include <string>
 #include <unordered_map>
@@ -18,6 +20,10 @@ constexpr uint64_t kCounterManaged = 0, kCounterReserved = 1, kCounterWired = 2,
                    kCounterMapKernel = 6, kCounterMapZone = 7, kCounterMapKalloc = 8;
 
 constexpr uint64_t kHashBasis = 0xCBF29CE484222325, kHashPrime = 0x100000001B3; // FNV-1a of 64 bits
+
+// Sites of code become identifiers, which are below 2^53: an address, of which the lower bits suffice, or a
+// function's hash behind a bit that no such address has.
+constexpr uint64_t kFunctionBit = uint64_t{1} << 52, kSiteMask = kFunctionBit - 1;
 
 uint64_t hashOf(std::string_view text, uint64_t hash = kHashBasis) {
     for (const char c : text)
@@ -187,7 +193,9 @@ struct Site {
     uint64_t address = 0; // 0: named by its function
     uint64_t size = 0;
 
-    uint64_t number() const { return address ? address : HXKernelSiteForFunction(function, module); }
+    uint64_t number() const {
+        return address ? address & kSiteMask : HXKernelSiteForFunction(function, module);
+    }
 };
 
 // The areas of vmalloc, summed up by what they are for.
@@ -199,6 +207,12 @@ struct Areas {
     // callers have other names in this kernel: then all are left among the other sites.
     bool knowModules = false;
 };
+
+std::string siteName(uint64_t address) {
+    char name[32];
+    std::snprintf(name, sizeof name, "site 0x%" PRIx64, address);
+    return name;
+}
 
 Areas sumAreas(const HXLinuxKernelReadings &readings) {
     const auto isBy = [](const HXVmallocArea &area, std::string_view functions) {
@@ -296,7 +310,10 @@ void SiteBuilder::addModules() {
 void SiteBuilder::addAreas() {
     for (const Site &site : _areas.sites) {
         std::string name;
-        if (site.address == 0) name = site.function.empty() ? "vmalloc" : site.function;
+        if (site.address != 0)
+            name = siteName(site.address);
+        else
+            name = site.function.empty() ? "vmalloc" : site.function;
         if (!name.empty() && !site.module.empty()) name.append(" [").append(site.module).append("]");
         add(kCode, site.number(), site.size, name);
     }
@@ -352,7 +369,7 @@ HXLinuxKernelAccount HXAccountForKernelMemory(const HXLinuxKernelReadings &readi
 
 uint64_t HXKernelSiteForFunction(std::string_view function, std::string_view module) {
     const uint64_t hash = hashOf(module, hashOf(function) * kHashPrime);
-    return hash | 0x8000000000000000; // above every number that a tag or load tag has
+    return (hash & kSiteMask) | kFunctionBit; // above every number that a tag or load tag has
 }
 
 uint64_t HXKernelLoadTagForModule(std::string_view name) {

@@ -48,8 +48,8 @@ struct HXLinuxKernelAccount {
 // no part of the sums above.
 HXLinuxKernelAccount HXAccountForKernelMemory(const HXLinuxKernelReadings &readings);
 
-// The site of a kernel function that is known by its name alone: an address in no mapping, the same in every
-// run.
+// The site of a kernel function that is known by its name alone, the same in every run: below 2^53, like all
+// sites, and above those of addresses.
 uint64_t HXKernelSiteForFunction(std::string_view function, std::string_view module);
 
 // The load tag of a module, the same in every run and never 0; 32 bits.

@@ -96,6 +96,10 @@ uint64_t HXObjectIdentifiers::ofShared(int32_t pid, uint64_t start, uint64_t set
     return interned({Kind::shared, static_cast<uint32_t>(pid), set, start});
 }
 
+uint64_t HXObjectIdentifiers::ofPageTables(int32_t pid) {
+    return interned({Kind::pageTables, 0, static_cast<uint32_t>(pid), 0});
+}
+
 uint64_t HXObjectIdentifiers::ofFileSystem(uint32_t device) {
     return interned({Kind::fileSystem, device, 0, 0});
 }

@@ -58,11 +58,13 @@ class HXObjectIdentifiers {
     // That of the file or shared object, whatever pages of its own the mapping holds: by its kind, device and
     // inode.
     uint64_t ofObject(const HXMapping &mapping, uint64_t ipcNamespace);
+    // That of a process's page tables.
+    uint64_t ofPageTables(int32_t pid);
     // That of all files on a device.
     uint64_t ofFileSystem(uint32_t device);
 
   private:
-    enum class Kind : uint32_t { file = 1, mapping, systemV, vdso, shared, fileSystem };
+    enum class Kind : uint32_t { file = 1, mapping, systemV, vdso, shared, fileSystem, pageTables };
     struct Key {
         Kind kind;
         uint32_t device;

@@ -47,12 +47,12 @@ proc_bsdinfo bsdInfo(const HXStatRecord &stat, uint32_t flags) {
     return info;
 }
 
-proc_bsdshortinfo shortInfo(const HXStatRecord &stat, uint32_t flags) {
+proc_bsdshortinfo shortInfo(const HXStatRecord &stat, bool hasEnded, uint32_t flags) {
     proc_bsdshortinfo info{};
     info.pbsi_pid = stat.pid;
     info.pbsi_ppid = stat.ppid;
     info.pbsi_pgid = stat.pgid;
-    info.pbsi_status = stat.hasEnded() ? SZOMB : 0;
+    info.pbsi_status = hasEnded ? SZOMB : 0;
     info.pbsi_flags = flags;
     copyName(info.pbsi_comm, HXSafeName(stat.comm()));
     return info;
@@ -63,6 +63,7 @@ HXStatRecord kernelStat() {
     stat.commLength = static_cast<uint8_t>(HXLinuxProcesses::kernelName.size());
     std::memcpy(stat.commBytes, HXLinuxProcesses::kernelName.data(), stat.commLength);
     stat.state = 'R';
+    stat.virtualSize = 1; // of which nothing is told but that there is some
     return stat;
 }
 
@@ -98,7 +99,7 @@ HXDescriptor HXLinuxProcesses::openThread(int32_t pid, const HXDescriptor &leade
     for (const int32_t thread : threads) {
         HXDescriptor directory = HXOpenAt(AT_FDCWD, pathOf(thread, "").c_str(), O_PATH | O_DIRECTORY);
         const auto stat = directory ? HXReadStat(directory) : std::nullopt;
-        if (!stat || stat->isZombie()) continue;
+        if (!stat || stat->isEnding()) continue;
         // The number may have gone to another process in between.
         const std::string name = "task/" + std::to_string(thread);
         if (::faccessat(leader.get(), name.c_str(), F_OK, 0) == 0) return directory;
@@ -113,7 +114,8 @@ std::optional<HXOpenProcess> HXLinuxProcesses::open(int32_t pid) {
     const auto stat = directory ? HXReadStat(directory) : std::nullopt;
     if (stat && stat->lacksLeader()) directory = openThread(pid, directory);
     if (stat && directory) return HXOpenProcess{std::move(directory), *stat};
-    errno = watch.seen() ? EMFILE : ESRCH;
+    const bool isDenied = errno == EACCES || errno == EPERM;
+    if (watch.seen() || !isDenied) errno = watch.seen() ? EMFILE : ESRCH;
     return std::nullopt;
 }
 
@@ -187,6 +189,10 @@ int32_t HXLinuxProcesses::proc_listallpids(int32_t *pids, uint32_t bufferBytes) 
             }))
             return -1;
     }
+    if (found.size() == 1 && !HXIsProcMounted(_procPath)) {
+        errno = ENOENT;
+        return -1;
+    }
     if (pids == nullptr) return static_cast<int32_t>(found.size());
     const uint32_t room = bufferBytes / sizeof(int32_t);
     if (room == 0) return 0;
@@ -251,10 +257,11 @@ int32_t HXLinuxProcesses::proc_pidinfo(int32_t pid, int32_t flavor, void *buffer
     }
     // A 64-bit program runs on a 64-bit kernel alone.
     constexpr uint32_t kernelFlags = PROC_FLAG_SYSTEM | (sizeof(void *) == 8 ? PROC_FLAG_LP64 : 0);
-    const bool isWide = pid != 0 && !stat->hasEnded() && is64bit(*stat);
+    const bool hasEnded = pid != 0 && (stat->hasEnded() || (stat->lacksLeader() && !open(pid)));
+    const bool isWide = pid != 0 && !hasEnded && is64bit(*stat);
     const uint32_t flags = pid == 0 ? kernelFlags : isWide ? PROC_FLAG_LP64 : 0;
     if (isLong) return answer(bsdInfo(*stat, flags), buffer, bufferBytes);
-    return answer(shortInfo(*stat, flags), buffer, bufferBytes);
+    return answer(shortInfo(*stat, hasEnded, flags), buffer, bufferBytes);
 }
 
 bool HXLinuxProcesses::mayBeNamed(const proc_bsdinfo &info, std::string_view name) {

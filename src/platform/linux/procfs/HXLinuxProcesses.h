@@ -3,6 +3,7 @@
 
 #include "platform/HXHostRecords.h"
 #include "platform/linux/procfs/HXDescriptor.h"
+#include "platform/linux/procfs/HXProcMount.h"
 #include "platform/linux/procfs/HXProcText.h"
 
 #include <cstdint>
@@ -34,7 +35,7 @@ class HXLinuxProcesses {
     HXLinuxProcesses(std::string procPath, ForAll forAll)
         : _procPath(std::move(procPath)), _forAll(std::move(forAll)) {}
 
-    // None with errno set: ESRCH, or EMFILE when descriptors or memory do not suffice.
+    // None with errno set: ESRCH, EACCES or EPERM, or EMFILE when descriptors or memory do not suffice.
     std::optional<HXOpenProcess> open(int32_t pid);
 
     // The number of the running process here, which need not be the one that getpid(2) tells: /proc may be
@@ -42,6 +43,7 @@ class HXLinuxProcesses {
     int32_t ownPid();
     // As HXPlatform says.
     int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes);
+    std::optional<std::string> notTold(bool ofAll) const { return HXProcessesNotTold(_procPath, ofAll); }
     int32_t proc_pidinfo(int32_t pid, int32_t flavor, void *buffer, uint32_t bufferBytes);
     // The argument area of sysctl(KERN_PROCARGS2): 0 on success. It counts one argument and has one path: the
     // folder of what the process executes, and as the name what ps calls it, the `comm`; where that is cut,

@@ -31,7 +31,8 @@ std::optional<HXStatRecord> HXParseStat(std::string_view text) {
     };
     int32_t group = 0; // -1 while the process is being taken down
     if (!take(4, &record.ppid) || !take(5, &group) || !take(9, &record.flags) ||
-        !take(20, &record.threadCount) || !take(22, &record.startTime) || !take(28, &record.startStack))
+        !take(20, &record.threadCount) || !take(22, &record.startTime) || !take(23, &record.virtualSize) ||
+        !take(28, &record.startStack))
         return std::nullopt;
     record.pgid = static_cast<uint32_t>(group);
     return record;

@@ -19,17 +19,20 @@ struct HXStatRecord {
     uint32_t pgid{};
     uint32_t flags{};
     uint32_t threadCount{};
-    uint64_t startTime{};  // clock ticks since boot
-    uint64_t startStack{}; // an address; 0 when the reader may not know it
+    uint64_t startTime{};   // clock ticks since boot
+    uint64_t virtualSize{}; // bytes
+    uint64_t startStack{};  // an address; 0 when the reader may not know it
 
     std::string_view comm() const { return {commBytes, commLength}; }
     bool isKernelThread() const { return (flags & kernelThreadFlag) != 0; }
-    bool isZombie() const { return state == 'Z' || state == 'X' || state == 'x'; }
+    // Of a thread of a process: it has ended, or gives its address space back on its way there, which takes a
+    // while where that is large.
+    bool isEnding() const { return state == 'Z' || state == 'X' || state == 'x' || virtualSize == 0; }
     // Of a process: no thread of it runs any more.
-    bool hasEnded() const { return isZombie() && threadCount <= 1; }
+    bool hasEnded() const { return isEnding() && threadCount <= 1; }
     // Of a process: its leading thread has ended, others (may) run. What /proc/PID tells of memory is then
     // empty.
-    bool lacksLeader() const { return isZombie() && threadCount > 1; }
+    bool lacksLeader() const { return isEnding() && threadCount > 1; }
 };
 // None when the text is no stat line. The name may hold blanks, parentheses and newlines.
 std::optional<HXStatRecord> HXParseStat(std::string_view text);

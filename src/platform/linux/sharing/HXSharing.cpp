@@ -105,9 +105,12 @@ void HXSharing::measureNotTold(const std::vector<Tasks> &families) {
 }
 
 // Iterations that did not answer.
-std::vector<size_t> HXSharing::forAll(size_t count, std::function<void(size_t)> work) {
+std::vector<size_t> HXSharing::forAll(size_t count, std::function<void(size_t)> work,
+                                      const Activity &activity) {
     HXServices &services = *_setting.services;
-    const HXDispatchQueue queue = services.dispatch_queue_create("org.heft.sharing", QOS_CLASS_UTILITY);
+    HXDispatchQueue queue = services.dispatch_queue_create("org.heft.sharing", QOS_CLASS_UTILITY);
+    queue.activity = activity.text;
+    queue.processOf = activity.processOf;
     return services.dispatch_apply(count, queue, std::move(work));
 }
 
@@ -182,11 +185,12 @@ void HXSharing::readAddressSpaces(std::vector<Tasks> &families) {
     for (const Tasks &family : families)
         all.insert(all.end(), family.begin(), family.end());
     const auto isCancelled = _setting.isCancelled;
-    const auto givenUp = forAll(all.size(), [all, reader = _setting.reader,
-                                             needsDirtyPages = _setting.needsDirtyPages,
-                                             findsLazilyFreed = _findsLazilyFreed](size_t i) {
+    const auto read = [all, reader = _setting.reader, needsDirtyPages = _setting.needsDirtyPages,
+                       findsLazilyFreed = _findsLazilyFreed](size_t i) {
         all[i]->withDescriptors([&] { all[i]->readForSharing(*reader, needsDirtyPages, findsLazilyFreed); });
-    });
+    };
+    const auto givenUp = forAll(
+        all.size(), read, {"reading processes", [&all](size_t i) { return std::to_string(all[i]->pid()); }});
     for (const size_t i : givenUp) {
         _unanswering.insert(all[i]->pid());
         for (Tasks &family : families)
@@ -227,21 +231,25 @@ void HXSharing::readPages(std::vector<std::shared_ptr<Work>> &families, bool isS
             items.emplace_back(work, i);
     }
     const auto isCancelled = _setting.isCancelled;
-    const auto givenUp =
-        forAll(items.size(), [items, isSecond, isCancelled, findsLazilyFreed = _findsLazilyFreed,
-                              pageShift = _setting.reader->pageShift](size_t i) {
-            const auto &[work, stretch] = items[i];
-            const auto slots = work->slots;
-            if (isCancelled()) return;
-            Work::Slot &slot = (*slots)[stretch];
-            slot.pages = HXReadColumns({work->family, work->stretches[stretch], pageShift,
-                                        isSecond ? work->repeated : nullptr, findsLazilyFreed},
-                                       &slot.reading);
-        });
-    for (const size_t i : givenUp) {
+    const auto pidOf = [&items](size_t i) {
         const auto &[work, stretch] = items[i];
-        work->hasFailed = true;
-        _unanswering.insert(work->tasks[(*work->slots)[stretch].reading].task->pid());
+        return work->tasks[(*work->slots)[stretch].reading].task->pid();
+    };
+    const auto read = [items, isSecond, isCancelled, findsLazilyFreed = _findsLazilyFreed,
+                       pageShift = _setting.reader->pageShift](size_t i) {
+        const auto &[work, stretch] = items[i];
+        const auto slots = work->slots;
+        if (isCancelled()) return;
+        Work::Slot &slot = (*slots)[stretch];
+        slot.pages = HXReadColumns({work->family, work->stretches[stretch], pageShift,
+                                    isSecond ? work->repeated : nullptr, findsLazilyFreed},
+                                   &slot.reading);
+    };
+    const auto givenUp =
+        forAll(items.size(), read, {"comparing pages", [&](size_t i) { return std::to_string(pidOf(i)); }});
+    for (const size_t i : givenUp) {
+        items[i].first->hasFailed = true;
+        _unanswering.insert(pidOf(i));
     }
     constexpr size_t mostSets = size_t{1} << 17;
     for (const auto &work : families) {

@@ -43,7 +43,12 @@ class HXSharing {
 
     std::vector<Tasks> findFamilies(const Tasks &tasks);
     Tasks findMerged(const Tasks &tasks);
-    std::vector<size_t> forAll(size_t count, std::function<void(size_t)> work);
+    // HXDispatchQueue's.
+    struct Activity {
+        std::string text;
+        std::function<std::string(size_t)> processOf;
+    };
+    std::vector<size_t> forAll(size_t count, std::function<void(size_t)> work, const Activity &activity = {});
     void readAddressSpaces(std::vector<Tasks> &families);
     std::shared_ptr<Work> open(const Tasks &tasks);
     void readPages(std::vector<std::shared_ptr<Work>> &families, bool isSecond);

@@ -85,15 +85,16 @@ struct HXMadeUpKernel {
     }
     std::string nameOf(const mach_memory_info_record &site) {
         const uint64_t type = site.flags & VM_KERN_SITE_TYPE;
+        EXPECT_LT(site.site, uint64_t{1} << 53) << "a number of a JSON document";
         if (type == VM_KERN_SITE_TAG) return "tag " + std::to_string(site.site);
         if (type == VM_KERN_SITE_COUNTER) return "count " + std::to_string(site.site);
         if (type == VM_KERN_SITE_KMOD)
             for (const OSKextInfo &module : memory.OSKextCopyLoadedKextInfo())
                 if (module.OSBundleLoadTag == site.site)
                     return "module " + module.CFBundleIdentifier.value_or("-");
-        if (!(site.flags & VM_KERN_SITE_NAMED)) return "address " + std::to_string(site.site);
         const std::string name = cut(site.name);
-        const bool isWhole = name != "vmalloc" && name.size() < sizeof site.name;
+        const bool isWhole =
+            name != "vmalloc" && !name.starts_with("site ") && name.size() < sizeof site.name;
         return isWhole && site.site != siteOf(name) ? "wrong number of " + name : name;
     }
 };

@@ -57,6 +57,8 @@ TEST_F(HXObjectIdentifiersTest, TellObjectsApart) {
     for (const HXMapping &own : {written, anonymous, high, gate})
         for (const int32_t pid : {1, 2, largePid})
             ids.insert(id(own, pid));
+    for (const int32_t pid : {1, 2, largePid})
+        ids.insert(identifiers.ofPageTables(pid));
     for (const HXMapping &own : {swappedOut, huge})
         EXPECT_EQ(id(own, 1), id(written, 1));
     EXPECT_EQ(std::set<uint64_t>(ids.begin(), ids.end()).size(), ids.size());

@@ -17,8 +17,8 @@ std::vector<size_t> inTurn(size_t count, const std::function<void(size_t)> &work
 TEST(HXLinuxProcesses, DescribeByWidthOfTheirStack) {
     HXTemporaryFolder proc;
     const auto process = [&](const std::string &stack) {
-        proc.write("7/stat",
-                   "7 (tool) S 1 7 7 0 -1 4194560 0 0 0 0 0 0 0 0 20 0 1 0 9 0 0 0 0 0 " + stack + " 0 0\n");
+        proc.write("7/stat", "7 (tool) S 1 7 7 0 -1 4194560 0 0 0 0 0 0 0 0 20 0 1 0 9 4096 0 0 0 0 " +
+                                 stack + " 0 0\n");
     };
     HXLinuxProcesses processes(proc.path(), inTurn);
     process("0"); // kept secret
