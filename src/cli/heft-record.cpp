@@ -1,5 +1,6 @@
 // heft-record: writes captures of the live machine.
 #include "model/HXMemoryRegion.h"
+#include "platform/HXVersion.h"
 #include "platform/linux/HXLinuxPlatform.h"
 #include "process/HXProcessSnapshot.h"
 #include "record/HXMachineRecorder.h"
@@ -21,6 +22,7 @@ namespace {
 constexpr char kUsage[] =
     "Usage: heft-record machine [--anonymize] FILE [PID...]\n"
     "       heft-record memgraph [--vmObjectDirty] PID FILE\n"
+    "       heft-record --help | --version\n"
     "\n"
     "machine   writes the whole machine, or only the processes PID, as a machine file for heft-replay\n"
     "memgraph  writes the memory graph of a process, which heft takes as a target\n"
@@ -68,6 +70,7 @@ int writeFile(HXServices &services, const std::string &path, const std::function
         services.discardPendingFile(*file);
         return 1;
     }
+    std::fprintf(file->stream, "# heft-record %s\n", kHXVersion);
     return services.commitPendingFile(*file) ? 0 : fail(path, std::strerror(errno));
 }
 
@@ -129,6 +132,10 @@ int main(int argc, char *argv[]) {
     if (words.empty()) return failUsage();
     if (words[0] == "--help" || words[0] == "-h") {
         std::fputs(kUsage, stdout);
+        return 0;
+    }
+    if (words[0] == "--version") {
+        std::printf("heft-record %s\n", kHXVersion);
         return 0;
     }
     static HXLinuxPlatform live;

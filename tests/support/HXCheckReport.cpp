@@ -1,12 +1,15 @@
 #include "support/HXCheckReport.h"
 
 #include <algorithm>
+#include <cstdint>
 #include <gtest/gtest.h>
 #include <map>
 #include <nlohmann/json.hpp>
 #include <regex>
 #include <set>
 #include <sstream>
+#include <utility>
+#include <vector>
 
 namespace {
 using Json = nlohmann::ordered_json;

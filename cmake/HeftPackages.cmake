@@ -1,0 +1,50 @@
+# What the build needs beyond the compiler. All that is missing is told at once, by the names of Debian's packages.
+
+set(missing "")
+
+# Notes that `package` is missing unless `found` is true.
+macro(heft_need package found)
+    if(NOT ${found})
+        list(APPEND missing ${package})
+    endif()
+endmacro()
+
+# The same for a program that the tests run.
+macro(heft_need_program package program)
+    find_program(HEFT_HAS_${program} ${program})
+    mark_as_advanced(HEFT_HAS_${program})
+    heft_need(${package} HEFT_HAS_${program})
+endmacro()
+
+find_package(Threads REQUIRED)
+find_package(PkgConfig QUIET)
+if(PKG_CONFIG_FOUND)
+    pkg_check_modules(LIBBSD QUIET IMPORTED_TARGET libbsd)
+    heft_need(libbsd-dev LIBBSD_FOUND)
+else()
+    list(APPEND missing pkg-config libbsd-dev)
+endif()
+
+if(HEFT_TESTS)
+    find_package(GTest QUIET)
+    heft_need(libgtest-dev GTest_FOUND)
+    find_package(Python3 QUIET COMPONENTS Interpreter)
+    heft_need(python3 Python3_FOUND)
+    find_path(HEFT_NLOHMANN_JSON nlohmann/json.hpp)
+    mark_as_advanced(HEFT_NLOHMANN_JSON)
+    heft_need(nlohmann-json3-dev HEFT_NLOHMANN_JSON)
+    heft_need_program(jq jq)
+endif()
+if(HEFT_BENCH)
+    find_package(benchmark QUIET)
+    heft_need(libbenchmark-dev benchmark_FOUND)
+endif()
+
+if(missing)
+    list(JOIN missing " " missing)
+    set(hint "")
+    if(HEFT_TESTS)
+        set(hint "\nTo build without the tests: -DHEFT_TESTS=OFF")
+    endif()
+    message(FATAL_ERROR "These packages are missing: ${missing}${hint}")
+endif()
