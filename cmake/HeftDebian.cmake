@@ -7,7 +7,7 @@ file(WRITE ${doc}/copyright "Format: https://www.debian.org/doc/packaging-manual
 Upstream-Name: heft
 
 Files: *
-Copyright: the owner of heft
+Copyright: 2026 the owner of heft
 License: none-chosen
  The owner has not chosen a licence yet. Until then all rights are reserved.
 ")

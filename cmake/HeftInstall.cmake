@@ -24,13 +24,14 @@ endforeach()
 
 # script/package makes it.
 set(CPACK_GENERATOR DEB)
-set(CPACK_PACKAGE_CONTACT "The heft maintainers <root@localhost>")
+set(HEFT_CONTACT "heft maintainers <heft@example.org>" CACHE STRING "Whom the package names as its maintainer")
+set(CPACK_PACKAGE_CONTACT ${HEFT_CONTACT})
 set(CPACK_PACKAGE_DESCRIPTION_SUMMARY "physical memory charged to processes, explained")
 set(CPACK_DEBIAN_PACKAGE_DESCRIPTION
 "heft tells how much physical memory the kernel charges to a process, to a
- set of processes or to the whole machine, and explains the charge: by
- category, by the exact set of processes that share the memory and, on
- request, region by region. Captures of a machine can be reported on later.")
+set of processes or to the whole machine, and explains the charge: by
+category, by the exact set of processes that share the memory and, on
+request, region by region. Captures of a machine can be reported on later.")
 set(CPACK_DEBIAN_PACKAGE_SECTION utils)
 set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
 set(CPACK_DEBIAN_PACKAGE_RELEASE 1)
@@ -39,5 +40,4 @@ set(CPACK_STRIP_FILES ON)
 set(CPACK_INSTALL_DEFAULT_DIRECTORY_PERMISSIONS
     OWNER_READ OWNER_WRITE OWNER_EXECUTE GROUP_READ GROUP_EXECUTE WORLD_READ WORLD_EXECUTE)
 set(CPACK_PRE_BUILD_SCRIPTS ${CMAKE_SOURCE_DIR}/cmake/HeftDebian.cmake)
-set(CPACK_PROJECT_CONFIG_FILE "")
 include(CPack)

@@ -2,7 +2,7 @@
 
 roots=${HEFT_ROOTS:-/var/tmp/heft-roots}
 takes_expired=${takes_expired:-}
-build_packages=(g++ cmake ninja-build pkg-config libbsd-dev libgtest-dev nlohmann-json3-dev jq python3)
+build_packages=(g++ cmake ninja-build pkg-config libbsd-dev libgtest-dev nlohmann-json3-dev jq python3 python3-jsonschema mandoc)
 
 [ "$(id -u)" -eq 0 ] || { echo "$0: needs root" >&2; exit 1; }
 command -v mmdebstrap >/dev/null || { echo "$0: the package mmdebstrap is missing" >&2; exit 1; }
@@ -13,9 +13,10 @@ mirror() {
     apt-get indextargets --format '$(SITE) $(ORIGIN) $(LABEL)' 'Created-By: Packages' | awk '$2 == "Debian" && $3 == "Debian" { print $1; exit }'
 }
 
-# Prints the folder of a root of the release `suite`, which is made if it is not there; fails when it is not to be had.
+# Prints the folder of a root of the release `suite`, which is made if it is not there; fails when it is not to be had. With a second
+# word it is another root, of that name.
 bare_root() {
-    local suite=$1 root=$roots/$1 options=()
+    local suite=$1 root=$roots/$1${2:+-$2} options=()
     if [ -n "$takes_expired" ]; then options=(--aptopt='Acquire::Check-Valid-Until "false"'); fi
     if [ ! -e "$root/etc/debian_version" ]; then
         rm -rf "$root"
