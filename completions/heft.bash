@@ -14,11 +14,11 @@ _heft_processes() {
     _heft_pids
 }
 
-# Adds the lines that the command "$2 ..." prints and that begin with $1 to the answers, quoted as the shell needs them.
+# Adds the lines that the command "$2 ..." prints and that begin with $1 to the answers.
 _heft_offer() {
     local line
     while IFS= read -r line; do
-        [[ $line == "$1"* ]] && COMPREPLY+=("$(printf '%q' "$line")")
+        [[ $line == "$1"* ]] && COMPREPLY+=("$line")
     done < <("${@:2}" | sort -u)
 }
 
@@ -28,7 +28,6 @@ _heft_offer_words() {
 
 _heft_offer_files() {
     local line
-    compopt -o filenames 2>/dev/null
     while IFS= read -r line; do COMPREPLY+=("$line"); done < <(compgen -f -- "$1")
 }
 
@@ -75,8 +74,9 @@ _heft_record() {
 }
 
 _heft() {
-    local word=$2 before=$3
+    local word=${2//\\/} before=$3
     COMPREPLY=()
+    compopt -o filenames 2>/dev/null # the shell quotes what needs it: names may have blanks
     # An argument after "=", which bash takes for a word.
     if [ "$word" = = ]; then word=; fi
     if [ "$before" = = ]; then before=${COMP_WORDS[COMP_CWORD - 2]}; fi

@@ -37,9 +37,9 @@ install_packages() {
     DEBIAN_FRONTEND=noninteractive chroot "$root" apt-get -q install -y --no-install-recommends "$@"
 }
 
-# Copies the sources as they stand (not what git ignores) to a folder.
+# Copies the sources as they stand (not what git ignores) to a folder, where only what was built before stays.
 copy_sources() {
-    rm -rf "$1"
     mkdir -p "$1"
+    find "$1" -mindepth 1 -maxdepth 1 ! -name build -exec rm -rf {} +
     git ls-files --cached --others --exclude-standard -z | tar --null --ignore-failed-read -T - -cf - | tar -C "$1" --no-same-owner -xf -
 }
