@@ -3,13 +3,9 @@
 set(share ${CPACK_TEMPORARY_INSTALL_DIRECTORY}/usr/share)
 set(doc ${share}/doc/heft)
 
-file(WRITE ${doc}/copyright "Format: https://www.debian.org/doc/packaging-manuals/copyright-format/1.0/
-Upstream-Name: heft
+file(WRITE ${doc}/copyright "heft: Copyright 2026 the owner of heft.
 
-Files: *
-Copyright: 2026 the owner of heft
-License: none-chosen
- The owner has not chosen a licence yet. Until then all rights are reserved.
+The owner has not chosen a licence yet. Until then all rights are reserved.
 ")
 
 set(log ${doc}/changelog.Debian)
