@@ -102,7 +102,7 @@ TEST(HXLinuxKernelMemory, TellsWhatEachCaseExpects) {
     for (const HXCase &each : HXReadCases("linux-kernel.txt"))
         for (const auto &[label, expected] : each.expected) {
             HXMadeUpKernel kernel(each.input);
-            const auto told = [&, expected = expected] {
+            const auto told = [&, label = label, expected = expected] {
                 if (label == "record") return kernel.record();
                 if (label == "machine") return kernel.machine();
                 return HXAnswered(expected, [&](const auto &question) { return kernel.symbol(question); });
