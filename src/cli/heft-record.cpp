@@ -1,5 +1,6 @@
 // heft-record: writes captures of the live machine.
 #include "model/HXMemoryRegion.h"
+#include "platform/HXVersion.h"
 #include "platform/linux/HXLinuxPlatform.h"
 #include "process/HXProcessSnapshot.h"
 #include "record/HXMachineRecorder.h"
@@ -21,6 +22,7 @@ namespace {
 constexpr char kUsage[] =
     "Usage: heft-record machine [--anonymize] FILE [PID...]\n"
     "       heft-record memgraph [--vmObjectDirty] PID FILE\n"
+    "       heft-record --help | --version\n"
     "\n"
     "machine   writes the whole machine, or only the processes PID, as a machine file for heft-replay\n"
     "memgraph  writes the memory graph of a process, which heft takes as a target\n"
@@ -72,6 +74,7 @@ int writeFile(HXServices &services, const std::string &path, const std::function
     if (!isOutput) services.signal(HX_SIGPIPE, HXSignalDisposition::ignored);
     int status = write(file->stream);
     const bool isWhole = status == 0 || status == kNothingRead;
+    if (isWhole) std::fprintf(file->stream, "# heft-record %s\n", kHXVersion);
     if (isWhole && !services.commitPendingFile(*file)) status = kUnwritten;
     if (!isWhole) services.discardPendingFile(*file);
     if (status != kUnwritten) return status;
@@ -134,6 +137,10 @@ int run(HXPlatform &live, Words words) {
     if (words.empty()) return failUsage();
     if (words[0] == "--help" || words[0] == "-h") {
         std::fputs(kUsage, stdout);
+        return 0;
+    }
+    if (words[0] == "--version") {
+        std::printf("heft-record %s\n", kHXVersion);
         return 0;
     }
     for (const Capture &capture : kCaptures) {

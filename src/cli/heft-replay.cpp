@@ -1,5 +1,6 @@
 // heft-replay: heft over a machine that a file describes.
 #include "cli/HXHeftMain.h"
+#include "platform/HXVersion.h"
 #include "platform/linux/HXLinuxPlatform.h"
 #include "platform/replay/HXReplayPlatform.h"
 
@@ -9,8 +10,10 @@
 #include <vector>
 
 namespace {
+
 constexpr char kUsage[] =
     "Usage: heft-replay FILE [heft's arguments]\n"
+    "       heft-replay --help | --version\n"
     "\n"
     "Prints heft's report on the machine that the machine file FILE describes; - is\n"
     "standard input. heft-record writes such files; heft --help tells heft's arguments.\n";
@@ -22,6 +25,10 @@ int run(HXLinuxPlatform &live, int argc, char *argv[]) {
     }
     if (std::string_view(argv[1]) == "--help" || std::string_view(argv[1]) == "-h") {
         std::fputs(kUsage, stdout);
+        return 0;
+    }
+    if (std::string_view(argv[1]) == "--version") {
+        std::printf("heft-replay %s\n", kHXVersion);
         return 0;
     }
     std::string reason;
@@ -40,6 +47,7 @@ int run(HXLinuxPlatform &live, int argc, char *argv[]) {
     arguments.push_back(nullptr);
     return HXHeftMain(argc - 1, arguments.data());
 }
+
 } // namespace
 
 int main(int argc, char *argv[]) {

@@ -6,6 +6,7 @@
 #include "process/HXProcessSnapshot.h"
 
 #include <algorithm>
+#include <cerrno>
 
 bool HXUserProcess::initWithBsdInfo(const proc_bsdinfo &info, HXProcessSnapshot *snapshot) {
     if (!HXProcess::initWithBsdInfo(info, snapshot)) return false;

@@ -1,6 +1,7 @@
 // Whatever a machine is like, its report adds up.
 #include "support/HXRun.h"
 
+#include <cstdint>
 #include <gtest/gtest.h>
 #include <random>
 

@@ -1,4 +1,5 @@
 // The built programs, as a shell or an impatient user runs them.
+#include "platform/HXVersion.h"
 #include "support/HXBuilders.h"
 #include "support/HXCaseFile.h"
 #include "support/HXCheckReport.h"
@@ -63,6 +64,20 @@ TEST(HXProgramsTest, RecordSaysWhatIsWrongWithItsArguments) {
     const std::string rows = HXReadCases("record.txt")[0].input;
     EXPECT_EQ(HXAnswered(rows, answer), rows);
     EXPECT_TRUE(fs::is_empty(folder.path())); // nor is a half-written file left behind
+}
+
+TEST(HXProgramsTest, TellTheirVersion) {
+    const HXTemporaryFolder folder;
+    const std::string recordVersion = std::string("heft-record ") + kHXVersion + "\n";
+    EXPECT_EQ(HXRunProgram({HEFT_RECORD_PROGRAM, "--version"}).out, recordVersion);
+    EXPECT_EQ(HXRunProgram({HEFT_REPLAY_PROGRAM, "--version"}).out,
+              std::string("heft-replay ") + kHXVersion + "\n");
+    const std::string self = std::to_string(getpid()), graph = folder / "graph", machine = folder / "machine";
+    EXPECT_EQ(HXRunProgram({HEFT_RECORD_PROGRAM, "memgraph", self, graph}).status, 0);
+    EXPECT_EQ(HXRunProgram({HEFT_RECORD_PROGRAM, "machine", machine, self}).status, 0);
+    for (const std::string &capture : {graph, machine})
+        EXPECT_TRUE(contentOf(capture).ends_with("\n# " + recordVersion)) << capture;
+    EXPECT_EQ(HXRunProgram({HEFT_REPLAY_PROGRAM, machine, graph}).status, 0); // which are read all the same
 }
 
 // Standard error is a pipe that nobody reads, so gathering cannot come to its end.

@@ -1,8 +1,10 @@
 #include "model/HXRangeList.h"
 
+#include <algorithm>
 #include <gtest/gtest.h>
 #include <list>
 #include <random>
+#include <vector>
 
 namespace {
 // The merge as a plain linked list, scanned from its head: what the tree's results are compared with.

@@ -5,6 +5,7 @@
 #include "support/HXMadeUpMachine.h"
 
 #include <atomic>
+#include <cerrno>
 #include <future>
 #include <gtest/gtest.h>
 

@@ -3,6 +3,8 @@
 #include "support/HXCaseFile.h"
 #include "support/HXTemporaryFolder.h"
 
+#include <algorithm>
+#include <cstdlib>
 #include <gtest/gtest.h>
 #include <sstream>
 #include <utility>

@@ -1,12 +1,15 @@
 #include "support/HXCheckReport.h"
 
 #include <algorithm>
+#include <cstdint>
 #include <gtest/gtest.h>
 #include <map>
 #include <nlohmann/json.hpp>
 #include <regex>
 #include <set>
 #include <sstream>
+#include <utility>
+#include <vector>
 
 namespace {
 using Json = nlohmann::ordered_json;
@@ -38,7 +41,9 @@ Rows tableOf(const Json &categories) {
     Rows rows;
     Figures sums(6);
     for (const auto &[label, sizes] : categories.items()) {
-        const Figures figures(sizes.begin(), sizes.end());
+        Figures figures; // filled one by one: iterators of objects have no distance
+        for (const Json &size : sizes)
+            figures.push_back(size.get<uint64_t>());
         EXPECT_GE(figures[0], figures[1]) << label; // dirty bytes include swapped ones
         if (label == "total") {
             EXPECT_EQ(figures, sums);

@@ -1,6 +1,7 @@
 // Whole runs of the program over made-up machines.
 #pragma once
 
+#include <cstdint>
 #include <string>
 #include <vector>
 

@@ -3,6 +3,7 @@
 #include <cstdlib>
 #include <fstream>
 #include <stdexcept>
+#include <system_error>
 
 namespace fs = std::filesystem;
 

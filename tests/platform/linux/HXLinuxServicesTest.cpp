@@ -15,6 +15,7 @@
 #include <csignal>
 #include <filesystem>
 #include <future>
+#include <iterator>
 #include <new>
 
 namespace {

@@ -8,6 +8,7 @@
 
 #include <cerrno>
 #include <sstream>
+#include <tuple>
 
 namespace {
 

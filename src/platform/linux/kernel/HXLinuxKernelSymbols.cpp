@@ -7,6 +7,7 @@
 #include <fcntl.h>
 
 #include <algorithm>
+#include <iterator>
 
 namespace {
 // No function is longer; an address further behind the last symbol before it lies in no function, but in a

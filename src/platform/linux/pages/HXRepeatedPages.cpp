@@ -1,6 +1,7 @@
 #include "platform/linux/pages/HXRepeatedPages.h"
 
 #include <algorithm>
+#include <iterator>
 #include <map>
 #include <tuple>
 #include <utility>

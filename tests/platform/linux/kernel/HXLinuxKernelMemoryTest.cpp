@@ -103,10 +103,10 @@ TEST(HXLinuxKernelMemory, TellsWhatEachCaseExpects) {
     for (const HXCase &each : HXReadCases("linux-kernel.txt"))
         for (const auto &[label, expected] : each.expected) {
             HXMadeUpKernel kernel(each.input);
-            const auto told = [&, expected = expected] {
-                if (label == "record") return kernel.record();
-                if (label == "machine") return kernel.machine();
-                return HXAnswered(expected, [&](const auto &question) { return kernel.symbol(question); });
+            const auto told = [&, kind = label, answers = expected] {
+                if (kind == "record") return kernel.record();
+                if (kind == "machine") return kernel.machine();
+                return HXAnswered(answers, [&](const auto &question) { return kernel.symbol(question); });
             };
             EXPECT_EQ(told(), expected) << each.title;
         }

@@ -6,6 +6,7 @@
 
 #include <map>
 #include <sstream>
+#include <utility>
 
 namespace {
 

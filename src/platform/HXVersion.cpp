@@ -1,0 +1,3 @@
+#include "platform/HXVersion.h"
+
+const char *const kHXVersion = HEFT_VERSION;
