@@ -145,7 +145,7 @@ def out_of_reach():
             open(path + "/smaps").close()
         except PermissionError:
             total += figures(path + "/status", "RssAnon", "VmSwap")
-        except FileNotFoundError:
+        except (FileNotFoundError, ProcessLookupError):
             pass  # has ended
     return total
 
