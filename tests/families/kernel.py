@@ -101,23 +101,26 @@ def zero_frames():
 ZERO_FRAMES, ZERO_AREAS = zero_frames()
 
 
+def page_key(entry):
+    """The frame or swap slot that an entry tells; none where it is nobody's page."""
+    if not entry & (PRESENT | SWAPPED) or entry & GUARD:
+        return None
+    number, kind = entry & FRAME, entry & 31
+    if entry & PRESENT:
+        return None if number in ZERO_FRAMES else number << 1
+    if kind in MIGRATION_TYPES:
+        return number >> 5 << 1
+    return None if kind == MARKER_TYPE else number << 1 | 1
+
+
 def page_keys(pid, wanted=lambda mapping: True):
     """The frame or swap slot behind each page that a process's private mappings hold."""
     keys = []
     for mapping in mappings(pid):
         if mapping.rights.endswith("s") or mapping.name.startswith(("[vvar", "[vsyscall")) or not wanted(mapping):
             continue
-        for entry in pagemap(pid, mapping.start, mapping.end):
-            if not entry & (PRESENT | SWAPPED) or entry & (FILE | GUARD):
-                continue
-            number, kind = entry & FRAME, entry & 31
-            if entry & PRESENT:
-                if number not in ZERO_FRAMES:
-                    keys.append(number << 1)
-            elif kind in MIGRATION_TYPES:
-                keys.append(number >> 5 << 1)
-            elif kind != MARKER_TYPE:
-                keys.append(number << 1 | 1)
+        entries = (entry for entry in pagemap(pid, mapping.start, mapping.end) if not entry & FILE)
+        keys += [key for key in map(page_key, entries) if key is not None]
     return keys
 
 
@@ -142,7 +145,7 @@ def out_of_reach():
             open(path + "/smaps").close()
         except PermissionError:
             total += figures(path + "/status", "RssAnon", "VmSwap")
-        except FileNotFoundError:
+        except (FileNotFoundError, ProcessLookupError):
             pass  # has ended
     return total
 
