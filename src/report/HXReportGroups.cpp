@@ -1,8 +1,9 @@
 #include "report/HXReportGroups.h"
 
 #include <algorithm>
-#include <map>
+#include <numeric>
 #include <set>
+#include <tuple>
 #include <unordered_map>
 
 namespace {
@@ -136,6 +137,30 @@ std::optional<uint64_t> measured(const Naming::Group &group, const HXProcessPlac
     return sum;
 }
 
+// Leaves the `most` largest groups and one of all others. A group that has that one's name
+// comes last, and so belongs to it.
+void uniteSmallest(const HXReport &report, size_t most, Naming &naming) {
+    const std::vector<HXGroupFigures> figures =
+        HXFiguresOfGroups(report, naming.groupOf, naming.groups.size());
+    std::vector<Number> order(naming.groups.size());
+    std::iota(order.begin(), order.end(), Number{0});
+    const auto isOther = [&](Number group) { return naming.groups[group].name == kOtherGroup; };
+    std::ranges::sort(order, [&](Number a, Number b) {
+        return std::tuple(isOther(a), figures[b].heft, naming.groups[a].name, a) <
+               std::tuple(isOther(b), figures[a].heft, naming.groups[b].name, b);
+    });
+    std::vector<Naming::Group> groups;
+    std::vector<Number> renumbered(order.size());
+    for (size_t i = 0; i < order.size(); i++) {
+        renumbered[order[i]] = static_cast<Number>(std::min(i, most));
+        if (i < most) groups.push_back(std::move(naming.groups[order[i]]));
+    }
+    groups.push_back({kOtherGroup, 0, {}});
+    naming.groups = std::move(groups);
+    for (Number &group : naming.groupOf)
+        if (group != HXReport::kNone) group = renumbered[group];
+}
+
 } // namespace
 
 std::optional<HXGroupBy> HXGroupByOfName(std::string_view name) {
@@ -170,8 +195,9 @@ std::vector<HXGroupFigures> HXFiguresOfGroups(const HXReport &report, const std:
     return figures;
 }
 
-HXGroupedReport HXGroupReport(const HXReport &report, HXGroupBy by, HXProcessPlaces *places) {
+HXGroupedReport HXGroupReport(const HXReport &report, HXGroupBy by, HXProcessPlaces *places, size_t most) {
     Naming naming = Namer(by, places).nameAll(report);
+    if (naming.groups.size() > most) uniteSmallest(report, most, naming);
     const size_t named = naming.groups.size();
     HXGroupedReport grouped;
     uint32_t examined = 0;

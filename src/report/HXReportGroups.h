@@ -43,5 +43,9 @@ struct HXGroupedReport {
 std::vector<HXGroupFigures>
 HXFiguresOfGroups(const HXReport &report, const std::vector<HXReport::Number> &groupOf, size_t groupCount);
 
-// `places` tells of live processes; null: the report is not of this machine, or not of now.
-HXGroupedReport HXGroupReport(const HXReport &report, HXGroupBy by, HXProcessPlaces *places);
+// `places` tells of live processes; null: the report is not of this machine, or not of now. When there are
+// more than `most` groups, the largest stay, in order, and the others become one, the last, called
+// `kOtherGroup`.
+inline constexpr char kOtherGroup[] = "other";
+HXGroupedReport HXGroupReport(const HXReport &report, HXGroupBy by, HXProcessPlaces *places,
+                              size_t most = SIZE_MAX);

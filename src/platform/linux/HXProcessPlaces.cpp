@@ -51,6 +51,14 @@ bool isIdentifier(std::string_view text) {
            text.find_first_not_of("0123456789abcdef") == std::string_view::npos;
 }
 
+// The name of a unit, with an identifier in it cut.
+std::string unitName(std::string_view group) {
+    const size_t dot = group.rfind('.');
+    const size_t start = group.rfind('-', dot) + 1; // 0 where there is none
+    if (!isIdentifier(group.substr(start, dot - start))) return HXSafeName(group);
+    return HXSafeName(group.substr(0, start + kShortIdentifierLength)) + HXSafeName(group.substr(dot));
+}
+
 std::string containerName(std::string_view kind, std::string_view name) {
     if (isIdentifier(name)) name = name.substr(0, kShortIdentifierLength);
     return std::string(kind) + ':' + HXSafeName(name);
@@ -97,7 +105,7 @@ HXGroupNames HXNamesOnPath(std::string_view path) {
         }
         if (group.ends_with(".service") || group.ends_with(".scope")) {
             const bool isInside = !names.container.name.empty() && names.container.path != here;
-            names.unit = {(isInside ? names.container.name + '/' : std::string()) + HXSafeName(group), here};
+            names.unit = {(isInside ? names.container.name + '/' : std::string()) + unitName(group), here};
         }
         isInPod = isInPod || group.starts_with("kubepods");
         parent = group;
