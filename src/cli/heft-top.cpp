@@ -158,7 +158,7 @@ void printInPlace(const HXTop &top, uint64_t reading) {
     lines.insert(lines.begin(), "heft-top, reading " + std::to_string(reading) + ", " + timeNow());
     std::string screen = reading == 1 ? "\033[2J\033[H" : "\033[H";
     for (size_t i = 0; i < lines.size(); i++)
-        screen += (i > 0 ? "\r\n" : "") + std::string(HXCutText(lines[i], size.columns - 1)) + "\033[K";
+        screen += (i > 0 ? "\n" : "") + std::string(HXCutText(lines[i], size.columns - 1)) + "\033[K";
     screen += "\033[J";
     std::fwrite(screen.data(), 1, screen.size(), stdout);
 }
@@ -205,7 +205,7 @@ class Run {
             printBlock(_top, _setting, 1);
             if (isAboveLimit(_top, _setting)) status = kAbove;
         }
-        if (isInPlace) std::fputs("\r\n", stdout);
+        if (isInPlace) std::fputs("\n", stdout);
         return kProgram.finishOutput() ? status : kTrouble;
     }
     int finish(int status) { return _source ? _source->finish(status) : status; }
