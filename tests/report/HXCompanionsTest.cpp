@@ -4,15 +4,22 @@
 #include "support/HXProgramRun.h"
 #include "support/HXTemporaryFolder.h"
 
-#include <algorithm>
-#include <filesystem>
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
+
+#include <csignal>
+#include <fcntl.h>
+#include <filesystem>
 #include <regex>
+#include <sys/wait.h>
+#include <unistd.h>
 
 namespace {
 namespace fs = std::filesystem;
 
+constexpr char kSmallReport[] =
+    R"({"processes":[{"name":"the kernel","pid":0,"heft":0},{"name":"a","pid":7,"heft":4096,)"
+    R"("categories":{"heap":{"dirty":4096}}}],"summary":{"heap":{"dirty":4096},"total":{}}})";
 const fs::path kPrograms = fs::path(HEFT_PROGRAM).parent_path();
 
 void writeFile(const HXTemporaryFolder &folder, const std::string &name, const std::string &text) {
@@ -31,8 +38,9 @@ std::string printed(const HXTemporaryFolder &folder, const std::string &command)
     for (std::string &word : words)
         if (word.ends_with(".json") || word.ends_with(".machine")) word = folder / word;
     const HXProgramRun run = HXRunProgram(words);
-    const std::string all =
+    std::string all =
         run.out + run.err + (run.status == 0 ? "" : "status " + std::to_string(run.status) + "\n");
+    all = std::regex_replace(all, std::regex("(heft_duration_seconds) [0-9.]+"), "$1 TIME");
     return std::regex_replace(all, std::regex(folder.path().native() + "/"), "");
 }
 } // namespace
@@ -82,9 +90,7 @@ TEST(HXCompanionsTest, DiffFindsALeakAmongManyProcesses) {
 
 TEST(HXCompanionsTest, WatchingReadsTheFileAgainAndTellsTheChanges) {
     const HXTemporaryFolder folder;
-    folder.write("a.json",
-                 R"({"processes":[{"name":"the kernel","pid":0,"heft":0},{"name":"a","pid":7,"heft":4096,)"
-                 R"("categories":{"heap":{"dirty":4096}}}],"summary":{"heap":{"dirty":4096},"total":{}}})");
+    folder.write("a.json", kSmallReport);
     const auto lines = HXLinesOf(printed(folder, "heft-top --watch 0.001 --count 2 --json a.json"));
     ASSERT_EQ(lines.size(), 2u);
     const auto first = nlohmann::json::parse(lines[0]);
@@ -92,4 +98,48 @@ TEST(HXCompanionsTest, WatchingReadsTheFileAgainAndTellsTheChanges) {
     EXPECT_TRUE(first["groups"][0]["change"].is_null());
     EXPECT_EQ(second["groups"][0]["change"], 0);
     EXPECT_EQ(second["groups"][0]["growth"], 0);
+}
+
+// A watcher that waits for its next reading ends in order when it is interrupted.
+TEST(HXCompanionsTest, WatchingEndsWhenInterrupted) {
+    const HXTemporaryFolder folder;
+    folder.write("a.json", kSmallReport);
+    const std::string program = kPrograms / "heft-top";
+    const std::string document = folder / "a.json";
+    int out[2];
+    ASSERT_EQ(pipe2(out, O_CLOEXEC), 0);
+    const pid_t pid = fork();
+    if (pid == 0) {
+        dup2(out[1], 1);
+        execl(program.c_str(), "heft-top", "--watch", "100000", "--json", document.c_str(), nullptr);
+        _exit(127);
+    }
+    close(out[1]);
+    char first = 0;
+    EXPECT_EQ(read(out[0], &first, 1), 1); // the first reading is told
+    EXPECT_EQ(kill(pid, SIGINT), 0);
+    int status = 0;
+    EXPECT_EQ(waitpid(pid, &status, 0), pid);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+    close(out[0]);
+}
+
+TEST(HXCompanionsTest, MetricsAreWrittenWholeOrNotAtAll) {
+    const HXTemporaryFolder folder;
+    folder.write("a.json", kSmallReport);
+    const std::string output = folder / "heft.prom";
+    const std::string program = kPrograms / "heft-metrics";
+    const auto status = [&](const std::string &document) {
+        return HXRunProgram({program, "-o", output, folder / document}).status;
+    };
+    EXPECT_EQ(status("a.json"), 0);
+    const std::string text = contentOf(output);
+    EXPECT_TRUE(text.ends_with("# EOF\n"));
+    EXPECT_EQ(fs::status(output).permissions(), fs::perms(0644)); // the collector is another user
+    folder.write("bad.json", std::string(kSmallReport).substr(0, 50));
+    EXPECT_EQ(status("bad.json"), 1);
+    EXPECT_EQ(contentOf(output), text);
+    folder.remove("a.json");
+    folder.remove("bad.json");
+    EXPECT_EQ(std::distance(fs::directory_iterator(folder.path()), {}), 1); // nothing temporary is left
 }
