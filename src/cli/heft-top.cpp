@@ -67,8 +67,7 @@ std::vector<HXCompanionOption> optionsFor(Setting &setting) {
         {"by", 'b', true,
          [&](const std::string &argument) {
              std::string name;
-             const auto problem =
-                 takeChoice({std::begin(kGroupByNames), std::end(kGroupByNames)}, argument, &name);
+             auto problem = takeChoice({std::begin(kGroupByNames), std::end(kGroupByNames)}, argument, &name);
              if (problem.empty()) setting.top.by = *HXGroupByOfName(name);
              return problem;
          }},

@@ -185,7 +185,8 @@ class Comparison {
             _sides[side].addCategories(*numbers[side], kSides[side], categories);
         }
         row.parts = changedRows(categories);
-        if (_comparesRegions && row.pidBefore == row.pidAfter) addRegions(*before, *after, row);
+        if (_comparesRegions && before && after && row.pidBefore == row.pidAfter)
+            addRegions(*before, *after, row);
         if (row.change() != 0 || !row.parts.empty()) _diff.processes.push_back(std::move(row));
     }
 

@@ -69,11 +69,12 @@ void HXReportFormatter::printWholeGroup(const HXProcessGroup &group, const HXCat
     _report.addRows(setOf(group), rowsOf(categories));
 }
 
+// `prefix`: the keys above, each with ": " after it.
 void HXReportFormatter::addFigures(const HXAuxDictionary &data, const std::string &prefix) {
     for (const auto &[key, node] : data.entries()) {
-        const std::string name = prefix.empty() ? key : prefix + ": " + key;
+        const std::string name = prefix + key;
         if (node->isContainer())
-            addFigures(static_cast<const HXAuxDictionary &>(*node), name);
+            addFigures(static_cast<const HXAuxDictionary &>(*node), name + ": ");
         else
             _report.addFigure(
                 {_process, HXString::intern(name), static_cast<const HXAuxData &>(*node).value()});

@@ -29,27 +29,27 @@ enum class Place : uint8_t {
 
 struct Step {
     Place in;
-    std::string_view key; // empty: any key, or the element of an array
-    bool isObject;        // else an array
     Place to;
+    bool isObject;        // else an array
+    std::string_view key; // empty: any key, or the element of an array
 };
 constexpr Step kSteps[] = {
-    {Place::kRoot, "processes", false, Place::kProcesses},
-    {Place::kRoot, "errors", false, Place::kErrors},
-    {Place::kRoot, "warnings", false, Place::kWarnings},
-    {Place::kRoot, "summary", true, Place::kSummary},
-    {Place::kRoot, "shared", false, Place::kShared},
-    {Place::kProcesses, "", true, Place::kProcess},
-    {Place::kProcess, "regions", false, Place::kRegions},
-    {Place::kProcess, "categories", true, Place::kCategories},
-    {Place::kProcess, "auxiliary", true, Place::kAuxiliary},
-    {Place::kRegions, "", true, Place::kRegion},
-    {Place::kAuxiliary, "", true, Place::kAuxiliary},
-    {Place::kShared, "", true, Place::kSharedEntry},
-    {Place::kSharedEntry, "pids", false, Place::kPids},
-    {Place::kSharedEntry, "categories", true, Place::kCategories},
-    {Place::kCategories, "", true, Place::kSizes},
-    {Place::kSummary, "", true, Place::kSizes},
+    {Place::kRoot, Place::kProcesses, false, "processes"},
+    {Place::kRoot, Place::kErrors, false, "errors"},
+    {Place::kRoot, Place::kWarnings, false, "warnings"},
+    {Place::kRoot, Place::kSummary, true, "summary"},
+    {Place::kRoot, Place::kShared, false, "shared"},
+    {Place::kProcesses, Place::kProcess, true, ""},
+    {Place::kProcess, Place::kRegions, false, "regions"},
+    {Place::kProcess, Place::kCategories, true, "categories"},
+    {Place::kProcess, Place::kAuxiliary, true, "auxiliary"},
+    {Place::kRegions, Place::kRegion, true, ""},
+    {Place::kAuxiliary, Place::kAuxiliary, true, ""},
+    {Place::kShared, Place::kSharedEntry, true, ""},
+    {Place::kSharedEntry, Place::kPids, false, "pids"},
+    {Place::kSharedEntry, Place::kCategories, true, "categories"},
+    {Place::kCategories, Place::kSizes, true, ""},
+    {Place::kSummary, Place::kSizes, true, ""},
 };
 
 struct SizeName {
@@ -114,7 +114,7 @@ class Reader : public nlohmann::json_sax<nlohmann::json> {
     bool takePid(int64_t value, std::optional<int32_t> *pid);
     void beginSizes();
     void endSizes();
-    void endProcess();
+    bool endProcess();
     bool endSharedEntry();
     void endSummary();
 
@@ -184,8 +184,7 @@ bool Reader::end_object() {
         _entry.regions.push_back(_region);
         break;
     case Place::kProcess:
-        endProcess();
-        break;
+        return endProcess();
     case Place::kSummary:
         endSummary();
         break;
@@ -267,8 +266,9 @@ void Reader::endSizes() {
     _entry.rows.push_back(_row);
 }
 
-void Reader::endProcess() {
-    const Number process = _report.addProcess(_entry.pid.value_or(-1), _entry.name.value_or(HXString()));
+bool Reader::endProcess() {
+    if (!_entry.pid || *_entry.pid < 0) return fail("a process without a process id");
+    const Number process = _report.addProcess(*_entry.pid, _entry.name.value_or(HXString()));
     _report.setHeft(process, _entry.heft);
     if (_entry.hasErrors) _report.setHasErrors(process);
     if (!_entry.rows.empty()) _report.addRows(_report.set({process}), _entry.rows);
@@ -281,6 +281,7 @@ void Reader::endProcess() {
         figure.process = process;
         _report.addFigure(figure);
     }
+    return true;
 }
 
 bool Reader::endSharedEntry() {

@@ -142,8 +142,9 @@ TEST(HXReportTest, WhatIsNoDocumentIsRefused) {
     ASSERT_TRUE(HXReadReport(head + R"("shared":[]})", true, &reason)) << reason;
     for (const std::string &text :
          {std::string(), std::string("{}"), std::string("[]"), std::string("7"), head,
-          head + R"("shared":[{"pids":[]}]})", head + R"("shared":[{"pids":[4294967296]}]})",
-          head + R"("shared":[{"pids":[1.5]}]})", head + R"("shared":[]} x)"}) {
+          head + R"("processes":[{"name":"a"}],"shared":[]})", head + R"("shared":[{"pids":[]}]})",
+          head + R"("shared":[{"pids":[4294967296]}]})", head + R"("shared":[{"pids":[1.5]}]})",
+          head + R"("shared":[]} x)"}) {
         reason.clear();
         EXPECT_FALSE(HXReadReport(text, true, &reason)) << text;
         EXPECT_NE(reason, "") << text;
