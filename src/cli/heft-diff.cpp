@@ -156,12 +156,12 @@ void printJson(const HXReportDiff &diff, const Setting &setting) {
     std::printf("%s\n", document.dump().c_str());
 }
 
+std::unique_ptr<HXReportSource> sources[2];
+
 int run(const std::vector<std::string> &words, const Setting &setting) {
     std::optional<HXReport> reports[2];
     for (const size_t i : {0, 1}) {
         std::string reason;
-        // It lives on: a machine's replay may have had to leave a thread behind.
-        static std::unique_ptr<HXReportSource> sources[2];
         sources[i] = HXReportSource::withPath(words[i], &reason);
         reports[i] = sources[i] ? sources[i]->read(true, &reason) : std::nullopt;
         if (reports[i]) continue;
@@ -187,5 +187,9 @@ int main(int argc, char *argv[]) {
     int status = 0;
     const auto words =
         kProgram.words(own.services(), argc, argv, optionsFor(setting), 2, 2, kTrouble, &status);
-    return words ? run(*words, setting) : status;
+    if (!words) return status;
+    status = run(*words, setting);
+    for (const auto &source : sources)
+        if (source) status = source->finish(status);
+    return status;
 }

@@ -58,7 +58,7 @@ std::vector<HXCompanionOption> optionsFor(Setting &setting) {
     const auto count = [](auto *taken) {
         return [taken](const std::string &argument) -> std::string {
             const auto number = HXParseCount(argument, INT32_MAX);
-            if (!number || *number == 0) return "'" + argument + "' is no number of them";
+            if (!number || *number == 0) return "'" + argument + "' is no number above 0";
             *taken = *number;
             return "";
         };
@@ -100,6 +100,17 @@ std::vector<HXCompanionOption> optionsFor(Setting &setting) {
              return "";
          }},
     };
+}
+
+// Tells what one option asks of another.
+bool isConsistent(const Setting &setting) {
+    if (setting.readings > 0 && !setting.interval) {
+        kProgram.complain("--count", "there is one reading without --watch");
+        return false;
+    }
+    if (HXTop::hasSortColumn(setting.top)) return true;
+    kProgram.complain("--sort", "the table has no column " + setting.top.sort + " with these options");
+    return false;
 }
 
 // Waits between readings, until an interrupt from the keyboard.
@@ -266,6 +277,7 @@ int main(int argc, char *argv[]) {
     const auto words =
         kProgram.words(own.services(), argc, argv, optionsFor(setting), 0, 1, kTrouble, &status);
     if (!words) return status;
+    if (!isConsistent(setting)) return kTrouble;
     static Run run(own, setting, words->empty() ? std::nullopt : std::optional(words->front()));
     return run.finish(run.run());
 }

@@ -88,6 +88,11 @@ const std::vector<std::string> &HXTop::sortNames() {
     return names;
 }
 
+bool HXTop::hasSortColumn(const HXTopSetting &setting) {
+    const auto column = std::ranges::find(kColumns, setting.sort, &Column::name);
+    return column == std::end(kColumns) || isShown(*column, setting);
+}
+
 void HXTop::take(HXGroupedReport reading) {
     Hefts hefts;
     _rows.clear();

@@ -27,6 +27,8 @@ class HXTop {
     explicit HXTop(HXTopSetting setting) : _setting(std::move(setting)) {}
 
     static const std::vector<std::string> &sortNames();
+    // Whether the table has the column that it is to be sorted by.
+    static bool hasSortColumn(const HXTopSetting &setting);
     // Takes the next reading.
     void take(HXGroupedReport reading);
     // The rows of the last reading in order, all of them.
