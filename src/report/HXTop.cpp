@@ -31,7 +31,8 @@ std::optional<int64_t> sizeOf(uint64_t size) {
 
 constexpr Column kColumns[] = {
     {"HEFT", "heft", [](const Row &row) { return sizeOf(row.heft); }, When::always, false, true, 7},
-    {"FREED", "freed", [](const Row &row) { return sizeOf(row.freed); }, When::always, false, true, 7},
+    {"FREED", "freed", [](const Row &row) { return row.canBeStopped ? sizeOf(row.freed) : std::nullopt; },
+     When::always, false, true, 7},
     {"SHARED", "shared", [](const Row &row) { return sizeOf(row.shared); }, When::always, false, true, 7},
     {"SWAPPED", "swapped", [](const Row &row) { return sizeOf(row.swapped); }, When::always, false, true, 8},
     {"RECLAIM", "reclaimable", [](const Row &row) { return sizeOf(row.reclaimable); }, When::always, false,
@@ -118,6 +119,7 @@ void HXTop::take(HXGroupedReport reading) {
     _kernel = {};
     static_cast<HXGroupFigures &>(_kernel) = reading.kernel;
     _kernel.name = "the kernel";
+    _kernel.canBeStopped = false;
     compare(_kernel, {"kernel", noPid});
     _total = {};
     static_cast<HXGroupFigures &>(_total) = reading.total;
@@ -187,9 +189,9 @@ std::string HXTop::json() const {
     document["groups"] = Json::array();
     for (size_t i = 0; i < std::min(_rows.size(), _setting.most); i++)
         document["groups"].push_back(object(_rows[i]));
-    Row kernel = _kernel;
-    document["kernel"] = _kernel.processes > 0 ? object(kernel) : Json();
+    document["kernel"] = _kernel.processes > 0 ? object(_kernel) : Json();
     document["total"] = object(_total);
+    document["total"].erase("pid");
     document["total"]["processes"] = _reading.total.processes;
     document["unexamined"] = _reading.unexamined;
     return document.dump();

@@ -20,6 +20,7 @@ struct HXTopSetting {
 class HXTop {
   public:
     struct Row : HXReportGroup {
+        bool canBeStopped = true;         // not so the kernel
         std::optional<int64_t> sinceLast; // change of the heft; none at the first reading
         std::optional<int64_t> sinceStart;
     };

@@ -98,6 +98,8 @@ TEST(HXCompanionsTest, WatchingReadsTheFileAgainAndTellsTheChanges) {
     EXPECT_TRUE(first["groups"][0]["change"].is_null());
     EXPECT_EQ(second["groups"][0]["change"], 0);
     EXPECT_EQ(second["groups"][0]["growth"], 0);
+    EXPECT_TRUE(second["kernel"]["freed"].is_null()); // it cannot be stopped
+    EXPECT_FALSE(second["total"].contains("pid"));
 }
 
 // A watcher that waits for its next reading ends in order when it is interrupted.
