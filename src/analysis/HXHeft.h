@@ -94,6 +94,7 @@ class HXHeft : public HXHeftSwitches {
                        bool summarize);
     void reportGroups(const HXProcess &process, const HXHeftSharingData::Groups &groups,
                       const HXHeftSharingData &sharing, bool summarize);
+    void reportWholeGroups(const HXHeftSharingData &sharing, bool summarize);
 
     ProcessList _processes;
     std::unordered_map<int32_t, uint64_t> _pidToHeft;

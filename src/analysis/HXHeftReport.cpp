@@ -56,6 +56,22 @@ void HXHeft::reportProcess(const HXProcess &process, Report &report, const HXHef
         formatter->printProcessAuxData(auxData.get());
 }
 
+// For the formatters that ask for it.
+void HXHeft::reportWholeGroups(const HXHeftSharingData &sharing, bool summarize) {
+    std::vector<HXOutputFormatter *> asking;
+    for (HXOutputFormatter *formatter : _outputFormatters)
+        if (formatter->printsWholeGroups()) asking.push_back(formatter);
+    if (asking.empty()) return;
+    for (const HXProcessGroup &group : sharing.groups) {
+        if (group.isPrivate()) continue;
+        HXCategoryMap categories(summarize);
+        for (const HXMemoryObject *object : sharing.objectsOfGroup(group))
+            categories.categoryForObject(*object).addMemoryObject(object->wholeView());
+        for (HXOutputFormatter *formatter : asking)
+            formatter->printWholeGroup(group, categories);
+    }
+}
+
 void HXHeft::printOutputVerbose(bool verbose, bool summarize) {
     const Processes inOrder = _processesBySortingHeft(_notHiddenProcesses());
     if (verbose) printAtlasLikeOutputForProcesses(inOrder);
@@ -64,6 +80,7 @@ void HXHeft::printOutputVerbose(bool verbose, bool summarize) {
     Report report;
     for (const HXProcess *process : inOrder)
         reportProcess(*process, report, sharing, summarize);
+    reportWholeGroups(sharing, summarize);
 
     const HXGlobalMessages messages = {HXProcess::globalErrors(), _warnings};
     for (HXOutputFormatter *formatter : _outputFormatters)

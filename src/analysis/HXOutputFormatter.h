@@ -2,7 +2,7 @@
 // shown process printProcessHeader, printProcessTotal (unless it had errors), endProcessHeader,
 // printProcessCategories or printSharedCategories per group, printProcessAuxData; then the lists of warnings
 // and errors, the summary, the global auxiliary data and end. The region listings, if any, come before the
-// first process.
+// first process, what groups hold as a whole after the last one, each for the formatters that offer it.
 #pragma once
 
 #include "model/HXAuxData.h"
@@ -47,4 +47,8 @@ class HXOutputFormatter {
     // Optional: the full listing of a process's regions. A formatter that does not offer it is passed over.
     virtual bool printsAtlasLikeOutput() const { return false; }
     virtual void printAtlasLikeOutputForProcess(const HXProcess &, const HXMemoryRegionList &) {}
+
+    // Optional: what each group of several processes holds, every byte once, whatever its members see of it.
+    virtual bool printsWholeGroups() const { return false; }
+    virtual void printWholeGroup(const HXProcessGroup &, const HXCategoryMap &) {}
 };

@@ -121,6 +121,8 @@ class HXLinuxPlatform final : public HXPlatform {
                                                                               uint8_t pager) override;
 
     HXLinuxServices &services() override { return _services; }
+    // Whether a thread may still be using this platform (HXLinuxServices::hasGivenUp).
+    bool hasGivenUp() const { return _services.hasGivenUp(); }
 
   private:
     static constexpr mach_port_t kSelfPort = 1, kHostPort = 2; // below those of tasks

@@ -28,6 +28,9 @@ class HXLinuxServices : public HXServices {
     // How long an iteration of `dispatch_apply` may wait in the kernel before it is given up, at least 100
     // ms; to within a hundredth.
     void setAnswerTime(std::chrono::milliseconds time) { _answerTime = time; }
+    // Whether an iteration of `dispatch_apply` was given up, so that a thread may still use what it was
+    // given.
+    bool hasGivenUp() const { return _hasGivenUp.load(); }
 
     HXOptionScan getopt_long(int argc, char *const argv[], const char *shortOptions,
                              const std::vector<HXLongOption> &options, bool restart) override;

@@ -33,7 +33,9 @@ ssize_t writeNoting(void *, const char *text, size_t length) {
 void HXWatchStandardOutput() {
     std::FILE *const stream = ::fopencookie(nullptr, "w", {nullptr, writeNoting, nullptr, nullptr});
     if (stream == nullptr) return;
-    if (::isatty(STDOUT_FILENO) == 1) std::setvbuf(stream, nullptr, _IOLBF, BUFSIZ);
+    constexpr size_t piece = 1 << 16; // bytes
+    const bool isTerminal = ::isatty(STDOUT_FILENO) == 1;
+    std::setvbuf(stream, nullptr, isTerminal ? _IOLBF : _IOFBF, isTerminal ? BUFSIZ : piece);
     stdout = stream; // a variable, as the C library's manual says
 }
 
