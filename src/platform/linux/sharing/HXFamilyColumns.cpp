@@ -4,7 +4,9 @@
 
 #include <algorithm>
 #include <bit>
+#include <memory>
 #include <optional>
+#include <span>
 
 namespace {
 
@@ -100,13 +102,13 @@ class ColumnReader {
     std::atomic<uint32_t> &_reading;
     const uint32_t _memberCount;
     const uint64_t _windowPages, _stride;
-    std::vector<uint64_t> _entries; // of the window, then what they tell: keys
-    std::vector<uint64_t> _differs; // by page of the strip: not 0 where the active rows are not equal
+    const std::span<uint64_t> _entries; // of the window, then what they tell: keys
+    std::vector<uint64_t> _differs;     // by page of the strip: not 0 where the active rows are not equal
     std::vector<Row> _rows;
-    std::vector<uint32_t> _active;  // members with a mapping in the strip
-    std::vector<uint64_t> _allBits; // of these
-    std::vector<uint32_t> _layout;  // of the strip, then of the last that was counted
-    uint64_t _windowStart = 0;
+    std::vector<uint32_t> _active;                 // members with a mapping in the strip
+    std::vector<uint64_t> _allBits;                // of these
+    std::vector<uint32_t> _layout;                 // of the strip, then of the last that was counted
+    uint64_t _windowStart = 0, _windowLength = 0;  // pages
     uint64_t _windowEntries = 0, _windowFound = 0; // read, and of these such as tell a page
     bool _isSparse = false;                        // the last window
     size_t _stripOffset = 0;                       // of the strip in the window
@@ -122,6 +124,17 @@ class ColumnReader {
     std::unique_ptr<HXFamilyPages> _pages;
 };
 
+// Room for `count` entries, of any value, until the thread asks again.
+std::span<uint64_t> roomForEntries(size_t count) {
+    struct Room {
+        std::unique_ptr<uint64_t[]> entries;
+        size_t count = 0;
+    };
+    thread_local Room room; // most of its pages would be cleared for each stretch otherwise
+    if (room.count < count) room = {std::make_unique_for_overwrite<uint64_t[]>(count), count};
+    return {room.entries.get(), count};
+}
+
 uint64_t windowPagesFor(uint64_t members) {
     const uint64_t pages = std::bit_floor(std::max<uint64_t>(kWindowEntries / members, 64));
     return std::min(kWindowPages, pages);
@@ -131,7 +144,7 @@ ColumnReader::ColumnReader(const HXColumnRequest &request, std::atomic<uint32_t>
     : _request(request), _family(*request.family), _reading(*reading),
       _memberCount(static_cast<uint32_t>(_family.members.size())), _windowPages(windowPagesFor(_memberCount)),
       // Rows that lie a power of two apart would fight for the same lines of the processor's cache.
-      _stride(_windowPages + 8), _entries(_stride * _memberCount), _differs(_windowPages),
+      _stride(_windowPages + 8), _entries(roomForEntries(_stride * _memberCount)), _differs(_windowPages),
       _rows(_memberCount), _allBits((_memberCount + 63) / 64),
       _layout(_memberCount, HXFamilyPages::kNoMapping), _groups(_memberCount), _seen(*_family.seen),
       _pages(std::make_unique<HXFamilyPages>(_memberCount, kSetsOfStretch)) {
@@ -173,6 +186,7 @@ uint64_t ColumnReader::nextPage(uint64_t from) {
 
 void ColumnReader::readWindow(uint64_t first, uint64_t end) {
     _windowStart = first;
+    _windowLength = end - first;
     _windowEntries = _windowFound = 0;
     std::vector<uint64_t> borders = {first, end};
     for (uint32_t member = 0; member < _memberCount; member++) {
@@ -212,7 +226,8 @@ void ColumnReader::readRow(uint32_t member, uint64_t first, uint64_t end) {
     const ssize_t got = _family.members[member].pagemap.readAt(from * sizeof *entries, entries, bytes);
     // One whose address space has gone has nothing left to tell.
     const size_t count = got < 0 ? 0 : static_cast<size_t>(got) / sizeof *entries;
-    std::fill(entries + count, entries + (to - from), 0);
+    std::fill(this->row(member), entries, 0); // what another window or family has left
+    std::fill(entries + count, this->row(member) + (end - first), 0);
     if (std::all_of(entries, entries + count, [](uint64_t entry) { return entry == 0; }))
         skipHole(member, end);
 }
@@ -340,7 +355,7 @@ void ColumnReader::findLazilyFreed() {
     for (uint32_t member = 0; member < _memberCount; member++)
         if (_rows[member].isInWindow)
             _pages->mayBeLazilyFreed[member] |=
-                std::any_of(row(member), row(member) + _windowPages, [this](uint64_t key) {
+                std::any_of(row(member), row(member) + _windowLength, [this](uint64_t key) {
                     return std::binary_search(_lazilyFreed.begin(), _lazilyFreed.end(), key);
                 });
 }
