@@ -49,6 +49,7 @@ void HXHeft::gatherProcesses() {
     HXDispatchQueue queue = services.dispatch_queue_create(kQueueLabel, QOS_CLASS_UTILITY);
     queue.activity = "examining processes";
     queue.processOf = [&ordered](size_t i) { return ordered[i]->displayString(); };
+    queue.costOf = [&ordered](size_t i) { return HXPlatform::current().expectedCost(ordered[i]->pid()); };
     const auto givenUp =
         services.dispatch_apply(ordered.size(), queue, [ordered, isCancelled = _isCancelled](size_t i) {
             if (!isCancelled->load(std::memory_order_relaxed)) ordered[i]->gatherData();

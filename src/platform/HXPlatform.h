@@ -151,6 +151,10 @@ class HXPlatform {
     // not tell of all of them.
     virtual std::optional<std::string> processesNotTold(bool) { return std::nullopt; }
 
+    // How long it takes to gather a process whose task is open, compared with others; 0 where the host cannot
+    // tell or order matters.
+    virtual uint64_t expectedCost(int32_t) { return 0; }
+
     // Fills `buffer` with the record of `flavor` (PROC_PIDTBSDINFO, PROC_PIDT_SHORTBSDINFO) and answers its
     // length in bytes; 0 with errno set when it cannot (ENOMEM: too little room). A zombie has no record of
     // flavor 3.

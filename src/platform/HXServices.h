@@ -35,6 +35,9 @@ struct HXDispatchQueue {
     // null.
     std::string activity = {};
     std::function<std::string(size_t)> processOf = {};
+    // How long an iteration takes, compared with others: those that take longest may be started first, equals
+    // in their order. Null: as they come.
+    std::function<uint64_t(size_t)> costOf = {};
 };
 inline constexpr uint32_t QOS_CLASS_UTILITY = 0x11;
 
@@ -94,11 +97,11 @@ class HXServices {
 
     virtual HXDispatchQueue dispatch_queue_create(const std::string &label, uint32_t qualityOfService) = 0;
 
-    // Calls `work` with 0 … iterations − 1, starting them in that order, several at once. Returns when each
-    // has returned or was given up: those whose thread has waited in the kernel for so long, without a moment
-    // of processor time, that it may never come back. Answers the ones given up, in ascending order. They go
-    // on when the kernel lets them, maybe after this has returned: whatever `work` touches must be owned by
-    // it or live as long as the program, which must end with `finish`.
+    // Calls `work` with 0 … iterations − 1, starting them in that order (but for `costOf`), several at once.
+    // Returns when each has returned or was given up: those whose thread has waited in the kernel for so
+    // long, without a moment of processor time, that it may never come back. Answers the ones given up, in
+    // ascending order. They go on when the kernel lets them, maybe after this has returned: whatever `work`
+    // touches must be owned by it or live as long as the program, which must end with `finish`.
     virtual std::vector<size_t> dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
                                                std::function<void(size_t)> work) = 0;
 

@@ -65,6 +65,8 @@ class HXLinuxPlatform final : public HXPlatform {
         return _processes.proc_listallpids(pids, bufferBytes);
     }
     std::optional<std::string> processesNotTold(bool ofAll) override { return _processes.notTold(ofAll); }
+    // The kernel's record, then by resident memory.
+    uint64_t expectedCost(int32_t pid) override;
     int32_t proc_pidinfo(int32_t pid, int32_t flavor, uint64_t, void *buffer, uint32_t bufferBytes) override {
         return _processes.proc_pidinfo(pid, flavor, buffer, bufferBytes);
     }

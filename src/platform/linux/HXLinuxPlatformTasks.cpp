@@ -48,6 +48,12 @@ kern_return_t HXLinuxPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_
     return KERN_SUCCESS;
 }
 
+uint64_t HXLinuxPlatform::expectedCost(int32_t pid) {
+    if (pid == 0) return UINT64_MAX;
+    const HXLinuxTask *task = _tasks.findByPid(pid);
+    return task == nullptr ? 0 : task->residentSizeWhenOpened();
+}
+
 void HXLinuxPlatform::mach_port_deallocate(mach_port_t, mach_port_t task) {
     _tasks.remove(task);
 }

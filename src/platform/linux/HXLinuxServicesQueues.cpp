@@ -10,6 +10,8 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <memory>
+#include <numeric>
 
 namespace {
 
@@ -30,6 +32,18 @@ size_t usableProcessorCount() {
     return 1;
 }
 
+// In which the iterations are started.
+std::vector<size_t> orderOf(size_t iterations, const HXDispatchQueue &queue) {
+    std::vector<size_t> order(iterations);
+    std::iota(order.begin(), order.end(), size_t{0});
+    if (!queue.costOf) return order;
+    std::vector<uint64_t> costs;
+    for (size_t i = 0; i < iterations; i++)
+        costs.push_back(queue.costOf(i));
+    std::stable_sort(order.begin(), order.end(), [&](size_t a, size_t b) { return costs[a] > costs[b]; });
+    return order;
+}
+
 } // namespace
 
 HXDispatchQueue HXLinuxServices::dispatch_queue_create(const std::string &label, uint32_t qualityOfService) {
@@ -39,12 +53,19 @@ HXDispatchQueue HXLinuxServices::dispatch_queue_create(const std::string &label,
 std::vector<size_t> HXLinuxServices::dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
                                                     std::function<void(size_t)> work) {
     const size_t workers = _workerCount == 0 ? usableProcessorCount() : _workerCount;
+    const auto order = std::make_shared<const std::vector<size_t>>(orderOf(iterations, queue));
     HXWorkLoop::Look look;
     if (_observer != nullptr && !queue.activity.empty())
         look = [&](size_t done, std::optional<size_t> waitingFor) {
+            if (waitingFor) waitingFor = (*order)[*waitingFor];
             _observer->looked(queue, done, iterations, waitingFor);
         };
-    auto givenUp = HXWorkLoop::run(iterations, workers, _answerTime, std::move(work), look);
+    auto givenUp = HXWorkLoop::run(
+        iterations, workers, _answerTime,
+        [order, work = std::move(work)](size_t place) { work((*order)[place]); }, look);
+    for (size_t &iteration : givenUp)
+        iteration = (*order)[iteration];
+    std::sort(givenUp.begin(), givenUp.end());
     if (look) _observer->ended();
     if (!givenUp.empty()) _hasGivenUp = true;
     return givenUp;

@@ -26,7 +26,8 @@ bool HXDescriptorTurns::run(const std::function<void()> &read) {
 HXLinuxTask::HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, HXDescriptor maps,
                          bool keepsOpen, HXLinuxProcesses &processes, HXDescriptorTurns &turns)
     : _pid(pid), _number(number), _startTime(process.stat.startTime), _startStack(process.stat.startStack),
-      _processes(processes), _turns(turns), _status(HXReadStatus(process.directory)) {
+      _processes(processes), _turns(turns), _status(HXReadStatus(process.directory)),
+      _residentSize(_status ? _status->residentSize.value_or(0) : 0) {
     if (!keepsOpen) return;
     _directory = std::move(process.directory);
     _maps = std::move(maps);

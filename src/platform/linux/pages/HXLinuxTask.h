@@ -66,6 +66,7 @@ class HXLinuxTask {
     // Where the stack began when the process was executed: the same after fork(2). 0 where it is not told.
     uint64_t startStack() const { return _startStack; }
     uint32_t number() const { return _number; }
+    uint64_t residentSizeWhenOpened() const { return _residentSize; } // bytes; 0: not known
     const HXDescriptor &directory() const { return _directory; }
     // The same, opened where it is not; not open when the process is gone.
     const HXDescriptor &openDirectory();
@@ -126,6 +127,7 @@ class HXLinuxTask {
     size_t _cursor = 0;
     std::optional<HXPageReader> _pages;
     std::optional<HXStatusRecord> _status;
+    const uint64_t _residentSize;
     std::optional<HXWalkDifference> _difference;
     bool _awaitsSettling = false; // shared pages have been taken
     bool _mayBeLazilyFreed = false;
