@@ -12,12 +12,19 @@ file(GLOB documents CONFIGURE_DEPENDS docs/*.md docs/*.json)
 install(FILES README.md CHANGELOG.md DESTINATION ${CMAKE_INSTALL_DOCDIR})
 install(FILES ${documents} DESTINATION ${CMAKE_INSTALL_DOCDIR}/docs)
 
+# What heft-metrics is run by, and what asks for its figures. Nothing is enabled.
+if(HEFT_COMPANIONS)
+    set(HEFT_SYSTEMD_UNITS lib/systemd/system CACHE STRING "Folder of systemd's units")
+    install(DIRECTORY packaging/systemd/ DESTINATION ${HEFT_SYSTEMD_UNITS})
+    install(DIRECTORY packaging/prometheus packaging/grafana DESTINATION ${CMAKE_INSTALL_DOCDIR}/examples)
+endif()
+
 # Where the shells look below the prefix. Debian's zsh has another folder for packages than for /usr/local.
 set(HEFT_BASH_COMPLETIONS ${CMAKE_INSTALL_DATADIR}/bash-completion/completions CACHE STRING "Folder of bash's completions")
 set(HEFT_ZSH_COMPLETIONS ${CMAKE_INSTALL_DATADIR}/zsh/site-functions CACHE STRING "Folder of zsh's completions")
 set(HEFT_FISH_COMPLETIONS ${CMAKE_INSTALL_DATADIR}/fish/vendor_completions.d CACHE STRING "Folder of fish's completions")
 install(FILES completions/_heft DESTINATION ${HEFT_ZSH_COMPLETIONS})
-foreach(program heft heft-record heft-replay)
+foreach(program heft heft-record heft-replay ${COMPANIONS})
     install(FILES completions/heft.bash DESTINATION ${HEFT_BASH_COMPLETIONS} RENAME ${program})
     install(FILES completions/heft.fish DESTINATION ${HEFT_FISH_COMPLETIONS} RENAME ${program}.fish)
 endforeach()

@@ -1,4 +1,4 @@
-# bash completion of heft, heft-record and heft-replay: options, their arguments, names and ids of processes, files.
+# bash completion of heft and its companions: options, their arguments, names and ids of processes, files.
 
 # Ids of processes.
 _heft_pids() {
@@ -73,6 +73,27 @@ _heft_record() {
     esac
 }
 
+# heft-top, heft-diff, heft-html, heft-metrics: after the word $2, beginning with $3.
+_heft_companion() {
+    case $1:$2 in
+        heft-top:-b | heft-top:--by) _heft_offer_words "$3" process command user unit container ;;
+        heft-top:-s | heft-top:--sort)
+            _heft_offer_words "$3" heft freed shared swapped reclaimable cgroup change growth processes name
+            ;;
+        *:-n | *:--lines | *:--largest | *:-w | *:--watch | *:-c | *:--count | *:-l | *:--least | *:--fail-above) ;;
+        *)
+            local options="-h --help --version"
+            case $1 in
+                heft-top) options+=" -b --by -n --lines -s --sort -w --watch -c --count --fail-above -j --json" ;;
+                heft-diff) options+=" -l --least -n --lines --fail-above -j --json" ;;
+                heft-html) options+=" -o --output" ;;
+                heft-metrics) options+=" -o --output -n --largest" ;;
+            esac
+            if [[ $3 == -* ]]; then _heft_offer_words "$3" $options; else _heft_offer_files "$3"; fi
+            ;;
+    esac
+}
+
 _heft() {
     local word=${2//\\/} before=$3
     COMPREPLY=()
@@ -90,7 +111,8 @@ _heft() {
                 _heft_report "$before" "$word"
             fi
             ;;
-        *) _heft_report "$before" "$word" ;;
+        heft) _heft_report "$before" "$word" ;;
+        *) _heft_companion "${1##*/}" "$before" "$word" ;;
     esac
 }
-complete -F _heft heft heft-record heft-replay
+complete -F _heft heft heft-record heft-replay heft-top heft-diff heft-html heft-metrics

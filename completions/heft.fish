@@ -1,4 +1,4 @@
-# fish completion of heft, heft-record and heft-replay: options, their arguments, names and ids of processes, files.
+# fish completion of heft and its companions: options, their arguments, names and ids of processes, files.
 
 function __heft_pids
     for pid in (string match -r '[0-9]+$' /proc/*)
@@ -57,3 +57,22 @@ complete -c heft-record -n '__heft_record_at machine -gt 2' -a '0 (__heft_pids)'
 complete -c heft-record -n '__heft_record_at memgraph -eq 2' -l vmObjectDirty -d 'What the memory objects see'
 complete -c heft-record -n '__heft_record_at memgraph -eq 2' -a '(__heft_pids)'
 complete -c heft-record -n '__heft_record_at memgraph -eq 3' -F
+
+for program in heft-top heft-diff heft-html heft-metrics
+    complete -c $program -s h -l help -d 'Print the usage'
+    complete -c $program -l version -d 'Print the version'
+end
+for program in heft-top heft-diff
+    complete -c $program -s n -l lines -x -d 'At most so many lines'
+    complete -c $program -l fail-above -x -d 'Fail above this size'
+    complete -c $program -s j -l json -d 'Write JSON'
+end
+for program in heft-html heft-metrics
+    complete -c $program -s o -l output -rF -d 'Write it there'
+end
+complete -c heft-top -s b -l by -x -a 'process command user unit container' -d 'What a line is'
+complete -c heft-top -s s -l sort -x -a 'heft freed shared swapped reclaimable cgroup change growth processes name' -d 'Sort by'
+complete -c heft-top -s w -l watch -x -d 'Read again every so many seconds'
+complete -c heft-top -s c -l count -x -d 'End after so many readings'
+complete -c heft-diff -s l -l least -x -d 'Leave out smaller changes'
+complete -c heft-metrics -s n -l largest -x -d 'Tell so many by name'

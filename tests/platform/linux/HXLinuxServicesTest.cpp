@@ -35,6 +35,17 @@ TEST(HXLinuxDispatch, LoopCallsEachIterationOnce) {
     }
 }
 
+TEST(HXLinuxDispatch, WhatTakesLongestIsStartedFirst) {
+    HXLinuxServices services;
+    services.setWorkerCount(1);
+    HXDispatchQueue queue = services.dispatch_queue_create("q", QOS_CLASS_UTILITY);
+    const uint64_t costs[] = {1, 7, 1, UINT64_MAX, 7, 0};
+    queue.costOf = [&](size_t i) { return costs[i]; };
+    std::vector<size_t> started;
+    services.dispatch_apply(std::size(costs), queue, [&](size_t i) { started.push_back(i); });
+    EXPECT_EQ(started, (std::vector<size_t>{3, 1, 4, 0, 2, 5}));
+}
+
 // Waits in the kernel while the others' iterations come to an end, or uses the processor for longer than
 // that.
 TEST(HXLinuxDispatch, GivesUpWhatWaitsAlone) {
