@@ -12,9 +12,12 @@
 #include <gtest/gtest.h>
 
 #include <sys/mman.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <array>
+#include <csignal>
 #include <sstream>
 
 namespace {
@@ -271,6 +274,27 @@ TEST_P(HXLiveRegions, AreTheSameFromBothSources) {
     setting.mayScanPageTables = false;
     HXLinuxPlatform reading(setting);
     EXPECT_EQ(regionsAndPages(scanning, subject.pid()), regionsAndPages(reading, subject.pid()));
+}
+
+TEST(HXLiveTask, HasTheMemoryOfWhatItHasExecutedSinceItWasOpened) {
+    const HXSubject subject([] {
+        raise(SIGSTOP);
+        execl("/bin/sh", "sh", "-c", "kill -STOP $$", nullptr);
+    });
+    ASSERT_TRUE(subject.stopped());
+    HXLinuxPlatform platform;
+    mach_port_t task = 0;
+    ASSERT_EQ(platform.task_for_pid(platform.mach_task_self(), subject.pid(), &task), KERN_SUCCESS);
+    kill(subject.pid(), SIGCONT);
+    int status = 0;
+    ASSERT_EQ(waitpid(subject.pid(), &status, WUNTRACED), subject.pid());
+    ASSERT_TRUE(WIFSTOPPED(status));
+    vm_region_basic_info_64 info;
+    uint32_t count = VM_REGION_BASIC_INFO_COUNT_64;
+    uint64_t address = 0, size = 0;
+    ASSERT_EQ(platform.mach_vm_region(task, &address, &size, VM_REGION_BASIC_INFO_64, &info, &count),
+              KERN_SUCCESS);
+    EXPECT_EQ(address, HXReadSmaps(subject.pid()).front().start);
 }
 
 INSTANTIATE_TEST_SUITE_P(Subjects, HXLiveRegions, testing::ValuesIn(kRecipes),
