@@ -8,6 +8,23 @@ const MEASURES = ['heft', 'swapped', 'clean', 'reclaimable']; // in the order of
 const COLOURS = 9; // --c0 … --c8; --c9 is everything else's
 const state = {measure: 0, tint: 'category', zoom: null, kind: 'processes', filter: '', sort: {}, shown: 0};
 
+// Calls `handle` with the event and the datum. d3's own listeners changed from version to version.
+function listen(selection, types, handle) {
+  selection.each(function(datum) {
+    for (const type of types.split(' ')) this.addEventListener(type, event => handle(event, datum));
+  });
+}
+
+function grouped(items, keyOf) {
+  const groups = new Map();
+  for (const item of items) {
+    const key = keyOf(item);
+    if (!groups.has(key)) groups.set(key, []);
+    groups.get(key).push(item);
+  }
+  return groups;
+}
+
 // ---- Text ----
 
 function sizeText(bytes) {
@@ -18,6 +35,8 @@ function sizeText(bytes) {
 }
 const changeText = bytes => bytes === 0 ? '0' : (bytes < 0 ? '−' : '+') + sizeText(Math.abs(bytes));
 const plural = (number, noun) => number.toLocaleString('en') + ' ' + noun + (number === 1 ? '' : noun.endsWith('s') ? 'es' : 's');
+
+const isKernel = entity => entity.p === 0;
 
 function entityText(entity) {
   if (entity.p !== null) return `${entity.n || 'unnamed'} [${entity.p}]`;
@@ -59,20 +78,22 @@ function addParts(node, parts) {
                    name: category < 0 ? 'other categories' : data.categories[category]});
 }
 
+// What processes of one name have in common; no name has a line end. The kernel's namesakes are not the kernel.
+const commandOf = entity => entity.mixed ? '\n' : isKernel(entity) ? '\nkernel' : entity.n;
+
 function plantTree() {
   nodes.set(root.id, root);
   for (const set of data.sets) {
     set.members = entityNumbers(set.m);
-    const names = new Set(set.members.map(number => data.entities[number].mixed ? null : data.entities[number].n));
+    const names = new Set(set.members.map(number => commandOf(data.entities[number])));
     // A set inside one command belongs to its tile.
-    set.command = names.size === 1 && !set.o && !names.has(null) ? [...names][0] : null;
+    set.command = names.size === 1 && !set.o ? [...names][0] : null;
     set.number = data.sets.indexOf(set);
     for (const number of set.members) setsOf[number].push(set.number);
   }
-  const commands = d3.nest().key(entity => entity.mixed ? '\n' : entity.n).entries(data.entities);
   data.entities.forEach((entity, number) => { entity.number = number; });
   const places = new Map();
-  for (const {key, values} of commands) {
+  for (const [key, values] of grouped(data.entities, commandOf)) {
     const place = values.length === 1 ? root
       : addNode(root, {id: 'command ' + key, kind: 'command', name: key || 'unnamed', children: []});
     places.set(key, place);
@@ -105,10 +126,10 @@ const changeOf = new Map(); // pid: the process's change
 
 function chooseColours() {
   colourOf.clear();
-  const sums = d3.nest().key(leaf => leaf.data.category).rollup(leaves => d3.sum(leaves, leaf => leaf.value))
-    .entries(weighed(root).leaves().filter(leaf => leaf.data.category >= 0));
-  sums.sort((a, b) => b.value - a.value).slice(0, COLOURS).filter(sum => sum.value > 0)
-    .forEach((sum, number) => colourOf.set(Number(sum.key), number));
+  const leaves = weighed(root).leaves().filter(leaf => leaf.data.category >= 0);
+  const sums = [...grouped(leaves, leaf => leaf.data.category)].map(([category, all]) => [category, d3.sum(all, leaf => leaf.value)]);
+  sums.sort((a, b) => b[1] - a[1]).slice(0, COLOURS).filter(([, sum]) => sum > 0)
+    .forEach(([category], number) => colourOf.set(category, number));
 }
 
 function changeOfNode(node) {
@@ -175,6 +196,12 @@ function tileLabel(tile) {
   return words.join(', ');
 }
 
+// A tile that is too small for its parts stands for the largest of them.
+function largestPart(tile) {
+  if (!tile.children || state.tint === 'change' || tile.children.some(child => drawn.has(child.data.id))) return tile;
+  return largestPart(tile.children[0]);
+}
+
 function draw() {
   const tiles = layOut();
   drawn = new Map(tiles.map(tile => [tile.data.id, tile]));
@@ -188,7 +215,7 @@ function draw() {
   joined.attr('class', ({data: node, depth}) => `tile ${node.kind}` + (node.children ? '' : ' leaf') + (depth > 1 ? ' nested' : ''))
     .style('left', tile => tile.x0 + 'px').style('top', tile => tile.y0 + 'px')
     .style('width', tile => tile.x1 - tile.x0 + 'px').style('height', tile => tile.y1 - tile.y0 + 'px')
-    .style('background-color', tile => backgroundOf(tile.data))
+    .style('background-color', tile => backgroundOf(largestPart(tile).data))
     .attr('data-id', tile => tile.data.id)
     .attr('role', tile => tile.depth === 1 ? 'button' : null)
     .attr('aria-hidden', tile => tile.depth === 1 ? null : 'true')
@@ -208,8 +235,9 @@ function draw() {
 function drawPath() {
   const path = pathOf(state.zoom);
   const items = d3.select('#path').selectAll('.step').data(path).join('span').attr('class', 'step').text('');
-  items.append('button').attr('type', 'button').text(node => node.name)
-    .attr('aria-current', node => node === state.zoom ? 'true' : null).on('click', node => zoomTo(node));
+  const buttons = items.append('button').attr('type', 'button').text(node => node.name)
+    .attr('aria-current', node => node === state.zoom ? 'true' : null);
+  listen(buttons, 'click', (event, node) => zoomTo(node));
   items.filter((node, i) => i < path.length - 1).append('span').text(' › ');
   describe(null);
 }
@@ -227,7 +255,7 @@ function describe(node) {
   if (owner.entity) {
     const [heft, freed, shared] = owner.entity.f;
     const count = setsOf[owner.entity.number].length;
-    line('who', `${entityText(owner.entity)} holds ${sizeText(heft)}: ${sizeText(freed)} alone, which stopping it frees, and ` +
+    line('who', `${entityText(owner.entity)} holds ${sizeText(heft)}: ${sizeText(freed)} alone${isKernel(owner.entity) ? '' : ', which stopping it frees,'} and ` +
       `${sizeText(shared)} with others` + (count ? ` in ${plural(count, 'set')}, which light up` : ''));
   }
   if (owner.kind === 'command') line('who', 'The tile is what stopping all of them frees.');
@@ -434,18 +462,20 @@ function drawSets() {
       .attr('cx', step / 2).attr('cy', (row, i) => top + i * line + line / 2).attr('r', 5);
   });
   const node = set => nodes.get('set ' + set.number);
-  columnGroups.on('click', set => find(node(set))).on('mouseenter focus', set => show(node(set))).on('mouseleave blur', calm)
-    .on('keydown', function(set, i, all) {
-      const key = d3.event.key;
-      const next = {ArrowRight: i + 1, ArrowLeft: i - 1, Home: 0, End: all.length - 1}[key];
-      if (key === 'Enter' || key === ' ') find(node(set));
-      else if (next !== undefined && all[next]) {
-        columnGroups.attr('tabindex', -1);
-        all[next].setAttribute('tabindex', 0);
-        all[next].focus();
-      } else return;
-      d3.event.preventDefault();
-    });
+  listen(columnGroups, 'click', (event, set) => find(node(set)));
+  listen(columnGroups, 'mouseenter focus', (event, set) => show(node(set)));
+  listen(columnGroups, 'mouseleave blur', calm);
+  listen(columnGroups, 'keydown', (event, set) => {
+    const all = columnGroups.nodes(), i = columns.indexOf(set);
+    const next = {ArrowRight: i + 1, ArrowLeft: i - 1, Home: 0, End: all.length - 1}[event.key];
+    if (event.key === 'Enter' || event.key === ' ') find(node(set));
+    else if (next !== undefined && all[next]) {
+      columnGroups.attr('tabindex', -1);
+      all[next].setAttribute('tabindex', 0);
+      all[next].focus();
+    } else return;
+    event.preventDefault();
+  });
 }
 
 // ---- Tables ----
@@ -472,19 +502,21 @@ function tables() {
         nameColumn('category', row => row[0] === null ? 'other categories' : row[0]),
         ...[...MEASURES, 'wired'].map((name, i) => sizeColumn(name, row => row[1 + i])), countColumn('regions', row => row[6])]},
   };
+  const freed = kinds.processes.columns[3], freedText = freed.text;
+  freed.text = entity => isKernel(entity) ? '' : freedText(entity);
   if (!data.change) return kinds;
   const pidChange = entity => { const change = entity.p === null ? null : changeOf.get(entity.p); return change ? change.s[1] - change.s[0] : 0; };
   kinds.processes.columns.push(changeColumn(pidChange));
-  const most = change => d3.scan(change.c, (a, b) => Math.abs(b[2] - b[1]) - Math.abs(a[2] - a[1]));
+  const most = ({c}) => [...c].sort((a, b) => Math.abs(b[2] - b[1]) - Math.abs(a[2] - a[1]))[0];
   const fate = change => change.p < 0 ? ', gone' : change.q < 0 ? ', new' : change.p !== change.q ? `, was pid ${change.q}` : '';
   kinds.changed = {
     title: 'Changed processes', rows: data.change.processes, columns: [
       nameColumn('process', change => change.n + fate(change)), pidColumn,
       {...changeColumn(change => change.s[1] - change.s[0]), hasGauge: true},
       sizeColumn('before', change => change.s[0]), sizeColumn('after', change => change.s[1]),
-      {name: 'most in', value: change => change.c.length ? change.c[most(change)][0] : '', text: change => {
+      {name: 'most in', value: change => change.c.length ? most(change)[0] : '', text: change => {
         if (!change.c.length) return '';
-        const [name, before, after] = change.c[most(change)];
+        const [name, before, after] = most(change);
         return `${name} ${changeText(after - before)}`;
       }}]};
   kinds.changedCategories = {
@@ -517,20 +549,21 @@ function drawHead(columns) {
   const sorted = sorting();
   const cells = d3.select('thead').selectAll('tr').data([0]).join('tr').selectAll('th').data(columns).join('th').text('').attr('scope', 'col')
     .attr('aria-sort', (column, i) => i !== sorted.column ? null : sorted.isUp ? 'ascending' : 'descending');
-  cells.append('button').attr('type', 'button').attr('data-column', (column, i) => i)
-    .text((column, i) => column.name + (i !== sorted.column ? '' : sorted.isUp ? ' ▲' : ' ▼'))
-    .on('click', (column, i) => {
-      state.sort[state.kind] = {column: i, isUp: i === sorted.column ? !sorted.isUp : !column.isNumber};
-      drawTable();
-      document.querySelector(`th [data-column="${i}"]`).focus();
-    });
+  const buttons = cells.append('button').attr('type', 'button').attr('data-column', (column, i) => i)
+    .text((column, i) => column.name + (i !== sorted.column ? '' : sorted.isUp ? ' ▲' : ' ▼'));
+  listen(buttons, 'click', (event, column) => {
+    const i = columns.indexOf(column);
+    state.sort[state.kind] = {column: i, isUp: i === sorted.column ? !sorted.isUp : !column.isNumber};
+    drawTable();
+    document.querySelector(`th [data-column="${i}"]`).focus();
+  });
 }
 
 function fillCell(cell, column, row, largest) {
   const text = column.text(row);
   const target = column.target && column.target(row);
   if (!target) cell.text(text);
-  else cell.append('button').attr('type', 'button').text(text).on('click', () => find(target));
+  else listen(cell.append('button').attr('type', 'button').text(text), 'click', () => find(target));
   if (!column.hasGauge) return;
   const change = column.value(row);
   cell.append('span').attr('class', change < 0 ? 'gauge shrank' : 'gauge').style('width', `${5 * Math.abs(change) / largest}em`);
@@ -557,8 +590,9 @@ function makeTables() {
   kinds = tables();
   state.kind = data.change ? 'changed' : 'processes';
   state.shown = STEP;
-  d3.select('#kinds').selectAll('button').data(Object.entries(kinds)).join('button').attr('type', 'button').text(([, kind]) => kind.title)
-    .on('click', ([key]) => { state.kind = key; state.shown = STEP; drawTable(); });
+  const buttons = d3.select('#kinds').selectAll('button').data(Object.entries(kinds)).join('button').attr('type', 'button')
+    .text(([, kind]) => kind.title);
+  listen(buttons, 'click', (event, [key]) => { state.kind = key; state.shown = STEP; drawTable(); });
   byId('filter').addEventListener('input', event => { state.filter = event.target.value; drawTable(); });
   byId('more').addEventListener('click', () => { state.shown = Infinity; drawTable(); });
 }
@@ -570,7 +604,7 @@ function drawHeader() {
   byId('title').textContent = data.title;
   const lead = d3.select('#lead');
   lead.append('strong').text(sizeText(data.total[0]));
-  const words = [` charged to ${plural(data.processes, 'process')}`];
+  const words = [` charged to ${data.isWhole ? `${plural(data.processes - 1, 'process')} and the kernel` : plural(data.processes, 'process')}`];
   if (data.total[1]) words.push(`${sizeText(data.total[1])} of it swapped out`);
   if (data.change) {
     const [before, after] = data.change.total;

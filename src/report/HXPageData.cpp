@@ -84,14 +84,17 @@ Json jsonOf(const Sizes &sizes) {
     return list;
 }
 
-// Calls `add(key, sizes)` for the largest, with `rest` as the key of the others' sum.
+// Calls `add(key, sizes)` for the `most` with the largest heft and, of the others, half as many of the
+// largest in other sizes; then with `rest` as the key of what is left.
 template <typename Key, typename Add>
 void addLargest(std::vector<std::pair<Key, Sizes>> all, size_t most, const Key &rest, const Add &add) {
-    std::ranges::stable_sort(
-        all, [](const auto &a, const auto &b) { return weight(a.second) > weight(b.second); });
+    std::ranges::stable_sort(all, [](const auto &a, const auto &b) { return a.second.heft > b.second.heft; });
+    const size_t first = std::min(most, all.size());
+    std::stable_sort(all.begin() + static_cast<ptrdiff_t>(first), all.end(),
+                     [](const auto &a, const auto &b) { return weight(a.second) > weight(b.second); });
     Sizes others;
     for (size_t i = 0; i < all.size(); i++) {
-        if (i < most)
+        if (i < first + most / 2)
             add(all[i].first, all[i].second);
         else
             others += all[i].second;
@@ -133,7 +136,7 @@ class Page {
     Number addEntity(const std::string &name, bool isMixed);
     void addProcess(Number entity, Number process);
     void addSet(Number set);
-    Json jsonOfParts(const Parts &parts) const;
+    static Json jsonOfParts(const Parts &parts, size_t most);
     void addEntities(Json &json) const;
     void addSets(Json &json);
     void addSummary(Json &json) const;
@@ -227,13 +230,13 @@ void Page::addSet(Number set) {
         (*parts)[_categoryOf[row.category]] += row.sizes;
 }
 
-Json Page::jsonOfParts(const Parts &parts) const {
+Json Page::jsonOfParts(const Parts &parts, size_t most) {
     Json list = Json::array();
     constexpr int64_t rest = -1;
     std::vector<std::pair<int64_t, Sizes>> rows;
     for (const auto &[category, sizes] : parts)
         if (weight(sizes) != 0) rows.emplace_back(category, sizes);
-    addLargest(std::move(rows), _limits.parts, rest, [&list](int64_t category, const Sizes &sizes) {
+    addLargest(std::move(rows), most, rest, [&list](int64_t category, const Sizes &sizes) {
         Json part = {category};
         append(part, sizes);
         list.push_back(std::move(part));
@@ -247,13 +250,14 @@ void Page::addEntities(Json &json) const {
     for (size_t i = 0; i < _entities.size(); i++) {
         const Entity &entity = _entities[i];
         const HXGroupFigures &figure = figures[i];
+        const bool isBroad = entity.count > 1 || entity.pid == HXReport::kKernelPid;
         Json entry;
         entry["n"] = entity.name;
         entry["p"] = entity.pid < 0 ? Json() : Json(entity.pid);
         entry["k"] = entity.count;
         if (entity.isMixed) entry["mixed"] = true;
         entry["f"] = {figure.heft, figure.freed, figure.shared, figure.swapped, figure.reclaimable};
-        entry["parts"] = jsonOfParts(entity.parts);
+        entry["parts"] = jsonOfParts(entity.parts, isBroad ? _limits.restParts : _limits.parts);
         list.push_back(std::move(entry));
     }
     json["entities"] = std::move(list);
@@ -285,11 +289,11 @@ void Page::addSets(Json &json) {
         entry["m"] = ranges;
         entry["k"] = set->processes;
         if (set->hasOutsiders) entry["o"] = true;
-        entry["parts"] = jsonOfParts(set->parts);
+        entry["parts"] = jsonOfParts(set->parts, _limits.parts);
         list.push_back(std::move(entry));
     }
     json["sets"] = std::move(list);
-    json["otherSets"] = {{"k", otherCount}, {"parts", jsonOfParts(others)}};
+    json["otherSets"] = {{"k", otherCount}, {"parts", jsonOfParts(others, _limits.restParts)}};
 }
 
 void Page::addSummary(Json &json) const {

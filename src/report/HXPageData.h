@@ -7,13 +7,14 @@
 
 // How much is told one by one; the rest is added up.
 struct HXPageLimits {
-    size_t processes = 500;  // the largest; others by command
-    size_t commands = 200;   // of those others; the rest is one
-    size_t sets = 300;       // of processes that share memory
-    size_t members = 100000; // pairs of numbers in all sets together
-    size_t parts = 6;        // categories of a process or a set
-    size_t rows = 500;       // of the list of categories
-    size_t changes = 200;    // processes and categories that changed
+    size_t processes = 500; // the largest; others by command
+    size_t commands = 200;  // of those others; the rest is one
+    size_t sets = 300;      // of processes that share memory
+    size_t members = 30000; // runs of numbers in all sets together
+    size_t parts = 6;       // categories of a process or a set, by heft; half as many more by other sizes
+    size_t restParts = 40;  // of several that are told as one, and of the kernel
+    size_t rows = 500;      // of the list of categories
+    size_t changes = 200;   // processes and categories that changed
 };
 
 // A report with the name of where it comes from.

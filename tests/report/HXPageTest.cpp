@@ -36,7 +36,8 @@ HXReport madeUpReport() {
         const uint64_t heft = 700 - 100 * static_cast<uint64_t>(pid);
         report.setHeft(process, heft);
         const HXReport::Row rows[] = {row(report, "heap /tmp/x", heft - 30, 7), row(report, "heap", 20),
-                                      row(report, "stack", 6), row(report, "tmpfs", 4)};
+                                      row(report, "stack", 6), row(report, "tmpfs", 4),
+                                      row(report, "file", 0, 9)};
         report.addRows(report.set({process}), rows);
     }
     report.setHasErrors(report.addProcess(7, HXString::intern("failed")));
@@ -76,13 +77,14 @@ std::string contents(const fs::path &path) {
 TEST(HXPageTest, AddsUpWhatCannotBeSeenAndLosesNoByte) {
     const HXReport report = madeUpReport();
     constexpr uint64_t all = 2100 + 11500;
-    for (const HXPageLimits limits : {HXPageLimits(), HXPageLimits{2, 1, 2, 100, 2, 1, 1},
-                                      HXPageLimits{0, 0, 0, 0, 0, 0, 0}, HXPageLimits{6, 0, 9, 3, 1, 1, 1}}) {
+    for (const HXPageLimits limits :
+         {HXPageLimits(), HXPageLimits{2, 1, 2, 100, 2, 1, 1, 1}, HXPageLimits{0, 0, 0, 0, 0, 0, 0, 0},
+          HXPageLimits{6, 0, 9, 3, 1, 1, 1, 1}}) {
         const Json data = Json::parse(HXPageData({report, "r"}, nullptr, limits));
         EXPECT_EQ(sumOfTiles(data, 0), all) << limits.processes;
-        EXPECT_EQ(sumOfTiles(data, 2), 42u) << limits.processes;
+        EXPECT_EQ(sumOfTiles(data, 2), 96u) << limits.processes;
     }
-    const Json few = Json::parse(HXPageData({report, "r"}, nullptr, {2, 1, 2, 100, 2, 1, 1}));
+    const Json few = Json::parse(HXPageData({report, "r"}, nullptr, {2, 1, 2, 100, 2, 1, 1, 1}));
     const Json &entities = few["entities"];
     ASSERT_EQ(entities.size(), 4u);
     EXPECT_EQ(entities[1]["p"], 2);
@@ -91,9 +93,11 @@ TEST(HXPageTest, AddsUpWhatCannotBeSeenAndLosesNoByte) {
     EXPECT_EQ(entities[3]["mixed"], true);
     EXPECT_EQ(entities[3]["k"], 3);
     EXPECT_EQ(entities[3]["f"], Json::parse("[6600,3600,3000,0,0]"));
-    // What both b share is the rest's own; paths are left out, categories beyond two added up.
-    EXPECT_EQ(entities[3]["parts"], Json::parse("[[2,3012,0,0,0],[0,570,0,21,0],[-1,18,0,0,0]]"));
-    EXPECT_EQ(few["categories"], Json::parse(R"(["heap","stack","tmpfs"])"));
+    // What both b share is the rest's own; paths are left out, small categories added up.
+    EXPECT_EQ(entities[3]["parts"], Json::parse("[[2,3012,0,0,0],[-1,588,0,48,0]]"));
+    // The first two by heft, then the one with the most of something else.
+    EXPECT_EQ(entities[0]["parts"], Json::parse("[[0,590,0,7,0],[1,6,0,0,0],[3,0,0,9,0],[-1,4,0,0,0]]"));
+    EXPECT_EQ(few["categories"], Json::parse(R"(["heap","stack","tmpfs","file"])"));
     EXPECT_EQ(few["sets"][0]["m"], Json::parse("[0,2]"));
     EXPECT_EQ(few["sets"][1]["m"], Json::parse("[0,0,3,3]"));
     EXPECT_EQ(few["otherSets"], Json::parse(R"({"k":2,"parts":[[2,1500,0,0,0]]})"));
