@@ -39,7 +39,7 @@ bool writeFile(HXServices &services, const std::string &path, const std::string 
     return false;
 }
 
-// The page shows only where a document lies below, not all that leads to it.
+// A page tells a document's name, not the folders that lead to it.
 std::string titleOf(const std::string &path) {
     return HXSafeText(std::filesystem::path(path).filename().string());
 }

@@ -52,7 +52,8 @@ function entityNumbers(ranges) {
 
 function setText(set, most) {
   const numbers = set.members;
-  const words = numbers.slice(0, most).map(number => entityText(data.entities[number]));
+  const words = numbers.slice(0, most).map(number => data.entities[number])
+    .map(entity => (set.some && entity.k > 1 ? 'some of ' : '') + entityText(entity));
   if (numbers.length > most) words.push(`${numbers.length - most} more`);
   if (set.o) words.push('processes that are not in the report');
   return words.join(', ');
@@ -251,7 +252,7 @@ function describe(node) {
   const owner = holderOf(told);
   const title = told === owner ? told.name : `${told.name} of ${owner.name}`;
   line('what', title + ': ' + sizes.map(([name, size]) => `${name} ${sizeText(size)}`).join(', '));
-  if (owner.set) line('who', 'Held by exactly ' + setText(owner.set, 12));
+  if (owner.set) line('who', (owner.set.some ? 'Held by ' : 'Held by exactly ') + setText(owner.set, 12));
   if (owner.entity) {
     const [heft, freed, shared] = owner.entity.f;
     const count = setsOf[owner.entity.number].length;
@@ -495,7 +496,7 @@ function tables() {
         pidColumn, ...['heft', 'freed if stopped', 'shared', 'swapped', 'reclaimable'].map((name, i) => sizeColumn(name, entity => entity.f[i]))]},
     sets: {
       title: 'Shared sets', rows: data.sets, first: 1, columns: [
-        nameColumn('held by exactly', set => setText(set, 6), set => nodes.get('set ' + set.number)),
+        nameColumn('held by', set => setText(set, 6), set => nodes.get('set ' + set.number)),
         ...MEASURES.map((name, i) => sizeColumn(name, partSum(i))), countColumn('processes', set => set.k)]},
     categories: {
       title: 'Categories', rows: data.summary, first: 1, columns: [

@@ -11,7 +11,8 @@
 //       n name, p pid (null: several), k how many, mixed (several of different names),
 //       f [heft, freed, shared, swapped, reclaimable], parts: what it alone holds, part by part
 //   sets                entities that share memory: m [first, last, first, last, …] of entities, k processes,
-//                       o somebody of whom nothing is told shares it, too; parts
+//                       some: not all processes of each entity hold all of it; o: somebody of whom nothing is
+//                       told shares it, too; parts
 //   otherSets           how many sets are told as one: k, parts
 //   summary             [name, sizes …, wired, regions] by category; the rest last, its name null
 //   change              null, or what changed since the earlier report: total [before, after];
@@ -56,7 +57,8 @@ struct Entity {
 struct SharedSet {
     std::vector<Number> members; // entities, ascending
     bool hasOutsiders = false;
-    uint32_t processes = 0;
+    bool isPartial = false;        // not all processes of each entity hold all of it
+    std::vector<Number> processes; // who holds any of it, in any order, some more than once
     Parts parts;
     Sizes total;
 };
@@ -135,6 +137,7 @@ class Page {
     void makeEntities();
     Number addEntity(const std::string &name, bool isMixed);
     void addProcess(Number entity, Number process);
+    size_t countOf(const std::vector<Number> &entities) const; // of their processes
     void addSet(Number set);
     static Json jsonOfParts(const Parts &parts, size_t most);
     void addEntities(Json &json) const;
@@ -203,6 +206,11 @@ void Page::makeEntities() {
     }
 }
 
+size_t Page::countOf(const std::vector<Number> &entities) const {
+    return std::accumulate(entities.begin(), entities.end(), size_t{0},
+                           [this](size_t sum, Number entity) { return sum + _entities[entity].count; });
+}
+
 // Sets that are the same set of entities become one; what an entity shares with nobody else is its own.
 void Page::addSet(Number set) {
     std::vector<Number> members;
@@ -213,6 +221,7 @@ void Page::addSet(Number set) {
         else
             members.push_back(_entityOf[process]);
     }
+    const size_t known = members.size();
     if (members.empty()) return; // of an unexamined process, of whose memory nothing is told
     std::ranges::sort(members);
     members.erase(std::unique(members.begin(), members.end()), members.end());
@@ -223,7 +232,9 @@ void Page::addSet(Number set) {
         SharedSet &shared = _sets[{members, hasOutsiders}];
         shared.members = members;
         shared.hasOutsiders = hasOutsiders;
-        shared.processes = std::max(shared.processes, static_cast<uint32_t>(_report.members(set).size()));
+        shared.isPartial = !shared.processes.empty() || known < countOf(members);
+        const auto all = _report.members(set);
+        shared.processes.insert(shared.processes.end(), all.begin(), all.end());
         parts = &shared.parts;
     }
     for (const HXReport::Row &row : _report.rows(set))
@@ -276,7 +287,7 @@ void Page::addSets(Json &json) {
     Parts others;
     size_t otherCount = 0;
     size_t left = _limits.members;
-    for (const SharedSet *set : sets) {
+    for (SharedSet *set : sets) {
         const std::vector<Number> ranges = rangesOf(set->members);
         if (list.size() == _limits.sets || ranges.size() / 2 > left) {
             for (const auto &[category, sizes] : set->parts)
@@ -287,7 +298,9 @@ void Page::addSets(Json &json) {
         left -= ranges.size() / 2;
         Json entry;
         entry["m"] = ranges;
-        entry["k"] = set->processes;
+        std::ranges::sort(set->processes);
+        entry["k"] = std::unique(set->processes.begin(), set->processes.end()) - set->processes.begin();
+        if (set->isPartial) entry["some"] = true;
         if (set->hasOutsiders) entry["o"] = true;
         entry["parts"] = jsonOfParts(set->parts, _limits.parts);
         list.push_back(std::move(entry));
@@ -314,6 +327,7 @@ void Page::addSummary(Json &json) const {
 // The most changed, in the order in which they stand.
 std::vector<const HXDiffRow *> mostChanged(const std::vector<HXDiffRow> &rows, size_t most) {
     std::vector<const HXDiffRow *> changed;
+    changed.reserve(rows.size());
     for (const HXDiffRow &row : rows)
         changed.push_back(&row);
     const auto size = [](const HXDiffRow *row) {

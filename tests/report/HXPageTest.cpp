@@ -100,6 +100,10 @@ TEST(HXPageTest, AddsUpWhatCannotBeSeenAndLosesNoByte) {
     EXPECT_EQ(few["categories"], Json::parse(R"(["heap","stack","tmpfs","file"])"));
     EXPECT_EQ(few["sets"][0]["m"], Json::parse("[0,2]"));
     EXPECT_EQ(few["sets"][1]["m"], Json::parse("[0,0,3,3]"));
+    // All of the first, of the second one of the rest.
+    EXPECT_FALSE(few["sets"][0].contains("some"));
+    EXPECT_EQ(few["sets"][1]["some"], true);
+    EXPECT_EQ(few["sets"][1]["k"], 2);
     EXPECT_EQ(few["otherSets"], Json::parse(R"({"k":2,"parts":[[2,1500,0,0,0]]})"));
     EXPECT_EQ(few["unexamined"], 1);
     const Json whole = Json::parse(HXPageData({report, "r"}, nullptr));
