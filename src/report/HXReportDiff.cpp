@@ -16,17 +16,12 @@ using Pair = std::pair<uint64_t, uint64_t>;
 using Pairs = std::map<std::string, Pair>;
 constexpr uint64_t Pair::*kSides[] = {&Pair::first, &Pair::second};
 
-// A listing run tells categories apart by their paths, others do not.
-std::string withoutPath(const std::string &category) {
-    return category.substr(0, std::min(category.find(" /"), category.find(" [")));
-}
-
 // One report as it is compared.
 class Side {
   public:
     Side(const HXReport &report, bool dropsPaths) : _report(report) {
         for (const HXString name : report.categories())
-            _names.push_back(dropsPaths ? withoutPath(name.str()) : name.str());
+            _names.push_back(dropsPaths ? HXCategoryWithoutPath(name.str()) : name.str());
         _categories.resize(report.processes().size());
         for (Number set = 0; set < report.setCount(); set++)
             addSet(set);
@@ -234,10 +229,15 @@ bool HXReportDiff::hasGrowthAbove(uint64_t size) const {
     return grows(total) || std::ranges::any_of(processes, grows) || std::ranges::any_of(categories, grows);
 }
 
+std::string HXCategoryWithoutPath(const std::string &category) {
+    return category.substr(0, std::min(category.find(" /"), category.find(" [")));
+}
+
 HXReportDiff HXCompareReports(const HXReport &before, const HXReport &after) {
     const auto hasPaths = [](const HXReport &report) {
-        return std::ranges::any_of(report.categories(),
-                                   [](HXString name) { return withoutPath(name.str()) != name.str(); });
+        return std::ranges::any_of(report.categories(), [](HXString name) {
+            return HXCategoryWithoutPath(name.str()) != name.str();
+        });
     };
     return Comparison(before, after, hasPaths(before) != hasPaths(after)).compare();
 }

@@ -37,3 +37,7 @@ struct HXReportDiff {
 // Processes are matched by pid and name, those that are left by name, the largest first. Regions are compared
 // where both reports have them, of processes that kept their pid.
 HXReportDiff HXCompareReports(const HXReport &before, const HXReport &after);
+
+// The name of a category as runs tell it that do not list regions: a listing run tells them apart by path,
+// too.
+std::string HXCategoryWithoutPath(const std::string &category);

@@ -1,0 +1,16 @@
+# Writes OUTPUT, C++ code with the page: PAGE with its slots filled from the files beside it, D3 and its LICENCE.
+get_filename_component(folder ${PAGE} DIRECTORY)
+file(READ ${PAGE} page)
+file(READ ${folder}/page.css STYLE)
+file(READ ${folder}/page.js SCRIPT)
+file(READ ${D3} D3_SCRIPT)
+file(READ ${LICENCE} D3_LICENCE)
+foreach(slot STYLE SCRIPT D3_SCRIPT D3_LICENCE)
+    string(REPLACE "@${slot}@" "${${slot}}" page "${page}")
+endforeach()
+file(WRITE ${OUTPUT}.html "${page}")
+file(READ ${OUTPUT}.html bytes HEX)
+string(REGEX REPLACE "(................................................................)" "\\1\n" bytes "${bytes}")
+string(REGEX REPLACE "([0-9a-f][0-9a-f])" "0x\\1," bytes "${bytes}")
+file(WRITE ${OUTPUT} "#include <cstddef>\nextern const unsigned char kHXPage[];\nextern const size_t kHXPageSize;\n"
+    "const unsigned char kHXPage[] = {\n${bytes}};\nconst size_t kHXPageSize = sizeof kHXPage;\n")
