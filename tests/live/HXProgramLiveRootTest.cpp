@@ -99,9 +99,11 @@ TEST_F(HXProgramAsRoot, SaysWhenProcTellsNothingOrNotAll) {
     if (answer("mount -t proc -o hidepid=2 proc /proc").status != 0) GTEST_SKIP() << "no mount namespace";
     const std::string heft = HEFT_PROGRAM;
     for (const std::string &target : {std::string("-a"), std::string("1")}) {
-        const HXProgramRun run = answer("umount -l /proc && exec " + heft + " " + target);
+        // Sanitizers miss /proc, too, and say so.
+        const HXProgramRun run =
+            answer("umount -l /proc && ASAN_OPTIONS=detect_leaks=0 exec " + heft + " " + target);
         EXPECT_EQ(run.status, 1);
-        EXPECT_TRUE(run.err.starts_with("heft: /proc is not mounted\n")) << run.err;
+        EXPECT_NE(run.err.find("heft: /proc is not mounted\n"), std::string::npos) << run.err;
     }
     const std::string hidden =
         "mount -t proc -o hidepid=2,gid=12345 proc /proc && exec setpriv --bounding-set=-all "
