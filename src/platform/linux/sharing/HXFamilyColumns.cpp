@@ -14,7 +14,7 @@ namespace {
 // meanwhile is seldom counted twice or not at all.
 constexpr uint64_t kWindowPages = 16384;
 // Of memory that is mostly holes.
-constexpr uint64_t kSparseWindowPages = 2048, kEntriesOfSparsePage = 64;
+constexpr uint64_t kSparseWindowPages = 512, kEntriesOfSparsePage = 64;
 // So much memory is taken for the entries of a window: those of a large family are shorter.
 constexpr uint64_t kWindowEntries = uint64_t{1} << 19;
 constexpr size_t kSetsOfStretch = size_t{1} << 15;
@@ -110,7 +110,7 @@ class ColumnReader {
     std::vector<uint32_t> _layout;                 // of the strip, then of the last that was counted
     uint64_t _windowStart = 0, _windowLength = 0;  // pages
     uint64_t _windowEntries = 0, _windowFound = 0; // read, and of these such as tell a page
-    bool _isSparse = false;                        // the last window
+    bool _isSparse;                                // the last window, or what is expected of the first
     size_t _stripOffset = 0;                       // of the strip in the window
     uint32_t _layoutNumber = HXFamilyPages::kNoMapping;
     std::unordered_map<uint32_t, HXPageCount> _counts; // of the layout, by set
@@ -146,6 +146,7 @@ ColumnReader::ColumnReader(const HXColumnRequest &request, std::atomic<uint32_t>
       // Rows that lie a power of two apart would fight for the same lines of the processor's cache.
       _stride(_windowPages + 8), _entries(roomForEntries(_stride * _memberCount)), _differs(_windowPages),
       _rows(_memberCount), _allBits((_memberCount + 63) / 64),
+      _isSparse(request.stretch.end - request.stretch.first > kWindowPages),
       _layout(_memberCount, HXFamilyPages::kNoMapping), _groups(_memberCount), _seen(*_family.seen),
       _pages(std::make_unique<HXFamilyPages>(_memberCount, kSetsOfStretch)) {
     if (request.findsLazilyFreed) _flags.emplace();
@@ -224,11 +225,13 @@ void ColumnReader::readRow(uint32_t member, uint64_t first, uint64_t end) {
     _windowEntries += to - from;
     _reading.store(member, std::memory_order_relaxed);
     const ssize_t got = _family.members[member].pagemap.readAt(from * sizeof *entries, entries, bytes);
-    // One whose address space has gone has nothing left to tell.
     const size_t count = got < 0 ? 0 : static_cast<size_t>(got) / sizeof *entries;
     std::fill(this->row(member), entries, 0); // what another window or family has left
     std::fill(entries + count, this->row(member) + (end - first), 0);
-    if (std::all_of(entries, entries + count, [](uint64_t entry) { return entry == 0; }))
+    // One whose address space has gone has nothing left to tell, here or further on, and no holes to skip.
+    if (count == 0)
+        row.nothingUpTo = UINT64_MAX;
+    else if (std::all_of(entries, entries + count, [](uint64_t entry) { return entry == 0; }))
         skipHole(member, end);
 }
 
