@@ -107,10 +107,10 @@ class ColumnReader {
     std::vector<Row> _rows;
     std::vector<uint32_t> _active;                 // members with a mapping in the strip
     std::vector<uint64_t> _allBits;                // of these
+    bool _isSparse;                                // the last window, or what is expected of the first
     std::vector<uint32_t> _layout;                 // of the strip, then of the last that was counted
     uint64_t _windowStart = 0, _windowLength = 0;  // pages
     uint64_t _windowEntries = 0, _windowFound = 0; // read, and of these such as tell a page
-    bool _isSparse;                                // the last window, or what is expected of the first
     size_t _stripOffset = 0;                       // of the strip in the window
     uint32_t _layoutNumber = HXFamilyPages::kNoMapping;
     std::unordered_map<uint32_t, HXPageCount> _counts; // of the layout, by set
