@@ -4,9 +4,6 @@
 #include "report/HXPageData.h"
 #include "report/HXReportSource.h"
 
-#include <cerrno>
-#include <cstdio>
-#include <cstring>
 #include <filesystem>
 
 // The page with a slot for the data, made at build time of the files in src/html.
@@ -27,17 +24,6 @@ const HXCompanion kProgram = {
 
 constexpr int kTrouble = 2;
 constexpr std::string_view kSlot = "@DATA@";
-
-// The file appears only when it is complete.
-bool writeFile(HXServices &services, const std::string &path, const std::string &text) {
-    auto file = services.createPendingFile(path);
-    if (file) {
-        std::fwrite(text.data(), 1, text.size(), file->stream);
-        if (services.commitPendingFile(*file)) return true;
-    }
-    kProgram.complain(path, std::strerror(errno));
-    return false;
-}
 
 // A page tells a document's name, not the folders that lead to it.
 std::string titleOf(const std::string &path) {
@@ -64,9 +50,7 @@ int run(HXServices &services, const std::vector<std::string> &words, const std::
 
     std::string page(reinterpret_cast<const char *>(kHXPage), kHXPageSize);
     page.replace(page.find(kSlot), kSlot.size(), data);
-    if (!output.empty()) return writeFile(services, output, page) ? 0 : kTrouble;
-    std::fwrite(page.data(), 1, page.size(), stdout);
-    return kProgram.finishOutput() ? 0 : kTrouble;
+    return kProgram.write(services, output, page, HXCompanion::Reader::owner) ? 0 : kTrouble;
 }
 
 } // namespace

@@ -3,11 +3,7 @@
 #include "report/HXMetrics.h"
 #include "report/HXReportSource.h"
 
-#include <cerrno>
 #include <chrono>
-#include <cstdio>
-#include <cstring>
-#include <filesystem>
 
 namespace {
 
@@ -24,29 +20,9 @@ const HXCompanion kProgram = {
 constexpr int kTrouble = 1;
 
 struct Setting {
-    std::optional<std::string> output;
+    std::string output; // empty: standard output
     size_t most = HXMetricsSetting().most;
 };
-
-// The file appears only when it is complete.
-bool writeFile(HXServices &services, const std::string &path, const std::string &text) {
-    namespace fs = std::filesystem;
-    auto file = services.createPendingFile(path);
-    if (!file) {
-        kProgram.complain(path, std::strerror(errno));
-        return false;
-    }
-    // Written beside its place it is its owner's alone; the collector is somebody else.
-    std::error_code error;
-    constexpr auto readable =
-        fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read | fs::perms::others_read;
-    if (!file->temporaryPath.empty()) fs::permissions(file->temporaryPath, readable, error);
-    std::fwrite(text.data(), 1, text.size(), file->stream);
-    if (!error && services.commitPendingFile(*file)) return true;
-    kProgram.complain(path, error ? error.message() : std::strerror(errno));
-    services.discardPendingFile(*file);
-    return false;
-}
 
 int run(HXReportSource &source, const std::string &subject, HXServices &services, const Setting &setting) {
     const auto start = std::chrono::steady_clock::now();
@@ -61,10 +37,9 @@ int run(HXReportSource &source, const std::string &subject, HXServices &services
     metrics.most = setting.most;
     if (source.isLive()) metrics.places = &places;
     metrics.seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+    // The collector is somebody else than who writes.
     const std::string text = HXMetricsText(*report, metrics);
-    if (setting.output) return writeFile(services, *setting.output, text) ? 0 : kTrouble;
-    std::fwrite(text.data(), 1, text.size(), stdout);
-    return kProgram.finishOutput() ? 0 : kTrouble;
+    return kProgram.write(services, setting.output, text, HXCompanion::Reader::everybody) ? 0 : kTrouble;
 }
 
 } // namespace

@@ -19,7 +19,7 @@ HXMemoryCategory &HXCategoryMap::categoryForObject(const HXMemoryObject &object)
         return _categories[known->second];
     }
 
-    const size_t place = addCategory(naming.name(), detail, naming);
+    const size_t place = addCategory(naming, detail);
     _names.emplace_back(names, place);
     if (_names.size() > kFewNames) {
         if (_byName.empty()) _byName.insert(_names.begin(), _names.end());
@@ -29,8 +29,8 @@ HXMemoryCategory &HXCategoryMap::categoryForObject(const HXMemoryObject &object)
 }
 
 // The place of the category of that text, made where there is none.
-size_t HXCategoryMap::addCategory(HXString name, HXString detail, const HXMemoryRegion &naming) {
-    std::string fullName = _summarize ? name.str() : naming.fullName();
+size_t HXCategoryMap::addCategory(const HXMemoryRegion &naming, HXString detail) {
+    std::string fullName = _summarize ? naming.name().str() : naming.fullName();
     const size_t next = _categories.size();
     if (_names.size() < kFewNames) {
         const auto known = std::find_if(_categories.begin(), _categories.end(),
@@ -43,6 +43,6 @@ size_t HXCategoryMap::addCategory(HXString name, HXString detail, const HXMemory
         const auto [known, isNew] = _byFullName.try_emplace(fullName, next);
         if (!isNew) return known->second;
     }
-    _categories.emplace_back(std::move(fullName), name, detail);
+    _categories.emplace_back(std::move(fullName), naming.name(), detail);
     return next;
 }

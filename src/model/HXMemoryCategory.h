@@ -54,7 +54,7 @@ class HXCategoryMap {
         }
     };
 
-    size_t addCategory(HXString name, HXString detail, const HXMemoryRegion &naming);
+    size_t addCategory(const HXMemoryRegion &naming, HXString detail);
 
     bool _summarize;
     std::vector<HXMemoryCategory> _categories;

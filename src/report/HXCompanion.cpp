@@ -9,6 +9,8 @@
 #include <cmath>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
+#include <system_error>
 
 namespace {
 constexpr std::string_view kUnits = "KMGT";
@@ -61,6 +63,31 @@ std::optional<std::vector<std::string>> HXCompanion::words(HXServices &services,
 void HXCompanion::complain(std::string_view subject, std::string_view problem) const {
     std::fprintf(stderr, "%s: %.*s: %.*s\n", name.c_str(), static_cast<int>(subject.size()), subject.data(),
                  static_cast<int>(problem.size()), problem.data());
+}
+
+bool HXCompanion::write(HXServices &services, const std::string &path, const std::string &text,
+                        Reader reader) const {
+    namespace fs = std::filesystem;
+    if (path.empty()) {
+        std::fwrite(text.data(), 1, text.size(), stdout);
+        return finishOutput();
+    }
+    auto file = services.createPendingFile(path);
+    if (!file) {
+        complain(path, std::strerror(errno));
+        return false;
+    }
+    // Beside its place it is its owner's alone.
+    std::error_code error;
+    constexpr auto readable =
+        fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read | fs::perms::others_read;
+    if (reader == Reader::everybody && !file->temporaryPath.empty())
+        fs::permissions(file->temporaryPath, readable, error);
+    std::fwrite(text.data(), 1, text.size(), file->stream);
+    if (!error && services.commitPendingFile(*file)) return true;
+    complain(path, error ? error.message() : std::strerror(errno));
+    services.discardPendingFile(*file);
+    return false;
 }
 
 bool HXCompanion::finishOutput() const {

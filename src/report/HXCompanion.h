@@ -33,6 +33,10 @@ struct HXCompanion {
                                                   int *status) const;
     // Tells on standard error what is wrong with `subject`.
     void complain(std::string_view subject, std::string_view problem) const;
+    // Writes `text` to the file at `path`, which appears only when it is complete and is then for its owner
+    // or for everybody to read, or to standard output when `path` is empty; false, told, when that fails.
+    enum class Reader { owner, everybody };
+    bool write(HXServices &services, const std::string &path, const std::string &text, Reader reader) const;
     // Flushes standard output; false, told, when something could not be written. A reader that went away is
     // no failure.
     bool finishOutput() const;
