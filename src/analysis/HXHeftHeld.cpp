@@ -156,13 +156,6 @@ Answer askKernel() {
     return platform.host_held_objects(platform.mach_host_self());
 }
 
-Answer askForDescriptors(int32_t pid) {
-    HXPlatform &platform = HXPlatform::current();
-    HXTaskPort task(platform);
-    if (task.open(pid) != KERN_SUCCESS) return {}; // it has gone
-    return platform.task_held_objects(task.get(), HXPlatform::HeldBy::descriptor);
-}
-
 } // namespace
 
 void HXHeft::_addHeldObjects() {
@@ -177,7 +170,8 @@ void HXHeft::_addHeldObjects() {
         std::vector<int32_t> pids;
         for (const auto &process : _processes)
             pids.push_back(process->pid());
-        const auto answers = askAll(pids.size(), [pids](size_t i) { return askForDescriptors(pids[i]); });
+        const auto answers = askAll(
+            pids.size(), [pids](size_t i) { return HXPlatform::current().proc_held_objects(pids[i]); });
         for (size_t i = 0; i < answers.size(); i++)
             held.add(i, answers[i]);
         held.count(*this);

@@ -116,9 +116,12 @@ class HXPlatform {
     // Which object a task's page tables are, as a full object id. All bits set where the host does not tell.
     virtual uint64_t pageTableObject(mach_port_t) { return UINT64_MAX; }
 
-    // The shared memory that a task holds, each object once: what it maps, or what it has descriptors of.
-    enum class HeldBy { mapping, descriptor };
-    virtual std::vector<task_held_object> task_held_objects(mach_port_t, HeldBy) { return {}; }
+    // The shared memory that a task maps, each object once.
+    virtual std::vector<task_held_object> task_held_objects(mach_port_t) { return {}; }
+
+    // The shared memory that a process has descriptors of, each object once; nothing for a process whose task
+    // may not be had.
+    virtual std::vector<task_held_object> proc_held_objects(int32_t) { return {}; }
 
     // What the kernel holds itself: shared memory with a name, and what nobody has attached, as far as it is
     // in reach of the tasks that were asked before. No task holds any of these objects.

@@ -72,9 +72,9 @@ void HXUserProcess::gatherData() {
 // open (HXHeft).
 void HXUserProcess::_gatherHeldObjects() {
     HXPlatform &platform = HXPlatform::current();
-    _heldObjects = platform.task_held_objects(_task.get(), HXPlatform::HeldBy::mapping);
+    _heldObjects = platform.task_held_objects(_task.get());
     if (HXHeftSwitches::examinesWholeMachine()) return;
-    const auto open = platform.task_held_objects(_task.get(), HXPlatform::HeldBy::descriptor);
+    const auto open = platform.proc_held_objects(pid());
     _heldObjects.insert(_heldObjects.end(), open.begin(), open.end());
 }
 

@@ -169,8 +169,8 @@ bool HXProcessRecorder::recordMemory(int32_t pid) {
     recordImages(pid);
     if (_facts.sharedRegion) recordTops(pid);
     if (!recordRegions(pid)) return false;
-    for (const auto by : {HXPlatform::HeldBy::mapping, HXPlatform::HeldBy::descriptor})
-        for (const task_held_object &object : _host.task_held_objects(_task.get(), by))
+    for (const auto &held : {_host.task_held_objects(_task.get()), _host.proc_held_objects(pid)})
+        for (const task_held_object &object : held)
             HXRecordHeld(object, pid, &_body);
     return true;
 }

@@ -171,7 +171,7 @@ TEST_P(HXHostContract, PathsAreCutToWholeCharacters) {
 TEST_P(HXHostContract, WhatDescriptorsHold) {
     const int file = ::memfd_create("three pages", MFD_CLOEXEC);
     ASSERT_EQ(::write(file, std::string(3 * kPage, 'x').data(), 3 * kPage), ssize_t{3 * kPage});
-    const auto open = host->task_held_objects(task, HXPlatform::HeldBy::descriptor);
+    const auto open = host->proc_held_objects(self);
     EXPECT_EQ(std::count_if(open.begin(), open.end(),
                             [](const task_held_object &object) {
                                 return object.name == "memfd (unmapped)" && object.resident_size == 3 * kPage;
@@ -179,9 +179,9 @@ TEST_P(HXHostContract, WhatDescriptorsHold) {
               1);
     for (const task_held_object &object : open)
         EXPECT_EQ(object.flags, TASK_HELD_OPEN);
-    for (const task_held_object &object : host->task_held_objects(task, HXPlatform::HeldBy::mapping))
+    for (const task_held_object &object : host->task_held_objects(task))
         EXPECT_EQ(object.flags, 0U);
-    EXPECT_TRUE(host->task_held_objects(kNoPort, HXPlatform::HeldBy::mapping).empty());
+    EXPECT_TRUE(host->task_held_objects(kNoPort).empty());
     ::close(file);
 }
 

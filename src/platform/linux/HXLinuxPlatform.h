@@ -56,7 +56,8 @@ class HXLinuxPlatform final : public HXPlatform {
     std::vector<vm_region_share> mach_vm_region_shares(mach_port_t task, uint64_t address) override;
     std::optional<HXWalkDifference> walkDifference(mach_port_t task) override;
     uint64_t pageTableObject(mach_port_t task) override;
-    std::vector<task_held_object> task_held_objects(mach_port_t task, HeldBy by) override;
+    std::vector<task_held_object> task_held_objects(mach_port_t task) override;
+    std::vector<task_held_object> proc_held_objects(int32_t pid) override;
     std::vector<task_held_object> host_held_objects(mach_port_t) override { return _held.ofKernel(); }
     uint32_t vm_kernel_page_size() override { return _pageSize; }
     bool hasSharedRegion() override { return false; }

@@ -174,13 +174,20 @@ uint64_t HXLinuxPlatform::pageTableObject(mach_port_t port) {
     return task == nullptr ? UINT64_MAX : _identifiers.ofPageTables(task->pid());
 }
 
-std::vector<task_held_object> HXLinuxPlatform::task_held_objects(mach_port_t port, HeldBy by) {
+std::vector<task_held_object> HXLinuxPlatform::task_held_objects(mach_port_t port) {
     std::vector<task_held_object> held;
     HXLinuxTask *task = _tasks.find(port);
     if (task == nullptr) return held;
-    const HXAddressSpace *mapped = by == HeldBy::mapping ? &addressSpaceOf(task) : nullptr;
-    task->withDescriptors([&] {
-        held = mapped ? _held.mapped(task->directory(), *mapped) : _held.open(task->openDirectory());
+    const HXAddressSpace &addressSpace = addressSpaceOf(task);
+    task->withDescriptors([&] { held = _held.mapped(task->directory(), addressSpace); });
+    return held;
+}
+
+std::vector<task_held_object> HXLinuxPlatform::proc_held_objects(int32_t pid) {
+    std::vector<task_held_object> held;
+    (void)_turns.run([&] {
+        if (const auto process = pid > 0 ? _processes.open(pid) : std::nullopt)
+            held = _held.open(process->directory);
     });
     return held;
 }

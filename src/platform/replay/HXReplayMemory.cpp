@@ -107,15 +107,27 @@ uint64_t HXReplayPlatform::pageTableObject(mach_port_t task) {
     return process ? process->pageTableObject : UINT64_MAX;
 }
 
-std::vector<task_held_object> HXReplayPlatform::task_held_objects(mach_port_t task, HeldBy by) {
-    const HXMachineProcess *const process = taskOf(task).process;
+namespace {
+
+std::vector<task_held_object> heldBy(const HXMachineProcess *process, bool isOpen) {
     std::vector<task_held_object> held;
     if (process == nullptr) return held;
     std::copy_if(process->held.begin(), process->held.end(), std::back_inserter(held),
-                 [by](const task_held_object &object) {
-                     return ((object.flags & TASK_HELD_OPEN) != 0) == (by == HeldBy::descriptor);
+                 [isOpen](const task_held_object &object) {
+                     return ((object.flags & TASK_HELD_OPEN) != 0) == isOpen;
                  });
     return held;
+}
+
+} // namespace
+
+std::vector<task_held_object> HXReplayPlatform::task_held_objects(mach_port_t task) {
+    return heldBy(taskOf(task).process, false);
+}
+
+std::vector<task_held_object> HXReplayPlatform::proc_held_objects(int32_t pid) {
+    const HXMachineProcess *const process = _machine.process(pid);
+    return heldBy(process && process->taskError == KERN_SUCCESS ? process : nullptr, true);
 }
 
 std::vector<task_held_object> HXReplayPlatform::host_held_objects(mach_port_t) {

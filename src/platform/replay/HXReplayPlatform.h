@@ -29,7 +29,8 @@ class HXReplayPlatform : public HXPlatform {
     kern_return_t mach_vm_purgable_control(mach_port_t task, uint64_t address, int32_t control,
                                            int32_t *state) override;
     uint64_t pageTableObject(mach_port_t task) override;
-    std::vector<task_held_object> task_held_objects(mach_port_t task, HeldBy by) override;
+    std::vector<task_held_object> task_held_objects(mach_port_t task) override;
+    std::vector<task_held_object> proc_held_objects(int32_t pid) override;
     std::vector<task_held_object> host_held_objects(mach_port_t host) override;
     uint32_t vm_kernel_page_size() override { return _machine.host.pageSize; }
     bool hasSharedRegion() override { return _machine.host.sharedRegion; }

@@ -42,11 +42,6 @@ HXDescriptor HXLinuxTask::reopen() {
     return {};
 }
 
-const HXDescriptor &HXLinuxTask::openDirectory() {
-    if (!_directory) _directory = reopen();
-    return _directory;
-}
-
 bool HXLinuxTask::withDescriptors(const std::function<void()> &read) {
     const bool suffice = _turns.run(read);
     if (!suffice && _addressSpace) _addressSpace->endError = KERN_RESOURCE_SHORTAGE;
@@ -133,7 +128,7 @@ std::vector<vm_region_share> HXLinuxTask::sharesOf(size_t index) const {
 }
 
 void HXLinuxTask::read(const HXReaderSetting &setting, bool needsDirtyPages) {
-    openDirectory();
+    if (!_directory) _directory = reopen();
     readOnce(setting, needsDirtyPages);
     compare(setting, true);
     if (!_difference) return;

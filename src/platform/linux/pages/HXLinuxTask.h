@@ -68,8 +68,6 @@ class HXLinuxTask {
     uint32_t number() const { return _number; }
     uint64_t residentSizeWhenOpened() const { return _residentSize; } // bytes; 0: not known
     const HXDescriptor &directory() const { return _directory; }
-    // The same, opened where it is not; not open when the process is gone.
-    const HXDescriptor &openDirectory();
 
     // Runs `read` by turns; if descriptors do not suffice, the address space, once read, ends with that
     // error. Whether they do.

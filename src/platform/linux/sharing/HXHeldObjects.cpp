@@ -111,15 +111,15 @@ std::vector<task_held_object> HXHeldObjects::mapped(const HXDescriptor &process,
 }
 
 std::vector<task_held_object> HXHeldObjects::open(const HXDescriptor &process) {
-    _places.learn(process);
     std::vector<task_held_object> all;
     std::unordered_set<uint64_t> seen;
     const HXDescriptor descriptors = HXOpenAt(process, "fd", O_DIRECTORY);
     if (!descriptors) return all;
     HXForEachEntry(descriptors, [&](const char *name) {
         char buffer[PATH_MAX];
-        const auto link = HXReadLink(descriptors, name, buffer);
+        const auto link = *name == '.' ? std::nullopt : HXReadLink(descriptors, name, buffer);
         if (!link || !isNameless(*link)) return true;
+        _places.learn(process);
         const auto mount = mountOf(process, name);
         if (!mount || !_places.isMemoryMount(*mount)) return true;
         const auto found = find(process, (std::string("fd/") + name).c_str());
