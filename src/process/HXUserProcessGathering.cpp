@@ -4,9 +4,11 @@
 #include "process/HXUserProcess.h"
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <cstring>
 #include <iterator>
+#include <utility>
 
 namespace {
 
@@ -42,8 +44,19 @@ struct HXUserProcess::Gathering {
                    !HXHeftSwitches::isSharingAnalysisDisabled()),
           takesParts(process._isAlive() && !HXHeftSwitches::isSharingAnalysisDisabled()) {}
 
+    // HXMemoryRegion::categoryNameForTag. A process has few tags, which the host is asked for once.
+    HXString nameOfTag(uint32_t tag) {
+        auto &[known, name] = tagNames[tag % tagNames.size()];
+        if (!name || known != tag) {
+            known = tag;
+            name = HXMemoryRegion::categoryNameForTag(tag);
+        }
+        return name;
+    }
+
     HXMemoryRegionList regions;
     HXMemoryRegionList parts; // of these
+    std::array<std::pair<uint32_t, HXString>, 16> tagNames;
     HXImageEnumerator enumerator;
     HXSharedRegionCutter cutter;
     const bool hidden;
@@ -219,7 +232,7 @@ void HXUserProcess::nameRegion(HXMemoryRegion &region, Gathering &gathering,
         region.setName(mappedFile);
         if (path) region.setDetailedName(*path);
     } else {
-        region.setName(HXMemoryRegion::categoryNameForTag(info.user_tag));
+        region.setName(gathering.nameOfTag(info.user_tag));
         if (gathering.breakDown) chargeOwnedObject(region, gathering, info, purgeState);
     }
 }

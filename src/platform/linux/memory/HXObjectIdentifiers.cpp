@@ -8,10 +8,9 @@ namespace {
 
 constexpr uint32_t kProcessBits = 17, kPageBits = 35; // and one: 53
 constexpr uint32_t kSmallestPageShift = 12;
-// Of the table's identifiers: the higher bits, all set, far from the kernel's own and from those of memory
-// graphs, which are small; and where the lower ones begin, behind what the kernel's own have there.
+// The higher bits of the table's identifiers, all set, far from the kernel's own and from those of memory
+// graphs, which are small.
 constexpr uint64_t kHighBits = uint64_t{0x1FFFFF} << 32;
-constexpr uint32_t kFirstLowBits = 1 << 16;
 
 // Finaliser of a 64-bit linear generator; every bit of the result depends on every bit of the value.
 uint64_t mix(uint64_t value) {
@@ -41,13 +40,16 @@ size_t HXObjectIdentifiers::KeyHash::operator()(const Key &key) const {
     return mix(mix(mix(seed ^ static_cast<uint64_t>(key.kind) << 32 ^ key.device) ^ key.first) ^ key.second);
 }
 
+size_t HXObjectIdentifiers::KeyHash::operator()(uint32_t number) const {
+    return mix(seed ^ number);
+}
+
 HXObjectIdentifiers::HXObjectIdentifiers() : _processPool((1 << kProcessBits) - 1) {
-    constexpr uint32_t lowest = kFirstLowBits / 2, limit = uint32_t{1} << 31;
     const KeyHash hash{newSeed()};
     for (uint32_t i = 0; i < kShards; i++) {
         Shard &shard = _shards.emplace_back();
-        shard.numbers = std::unordered_map<Key, uint32_t, KeyHash>(0, hash);
-        shard.pool = HXNumberPool((limit - lowest) / kShards);
+        shard.given = std::unordered_map<uint32_t, Key, KeyHash>(0, hash);
+        shard.displaced = std::unordered_map<Key, uint32_t, KeyHash>(0, hash);
     }
 }
 
@@ -66,11 +68,23 @@ uint64_t HXObjectIdentifiers::interned(const Key &key) {
     const auto preferred = static_cast<uint32_t>(KeyHash{0}(key) >> 33);
     const uint32_t shardIndex = preferred % kShards;
     Shard &shard = _shards[shardIndex];
-    const std::lock_guard lock(shard.mutex);
-    const auto [entry, isNew] = shard.numbers.try_emplace(key, 0);
-    // As many as there are have room in no memory.
-    if (isNew) entry->second = shard.pool.take(preferred / kShards).value_or(0);
-    return kHighBits | (kFirstLowBits + uint64_t{2} * (entry->second * kShards + shardIndex));
+    uint32_t number = preferred / kShards;
+    {
+        const std::lock_guard lock(shard.mutex);
+        const bool isFree = number < kNumbers && shard.given.try_emplace(number, key).first->second == key;
+        if (!isFree) number = displacedNumber(shard, key);
+    }
+    return kHighBits | (kFirstLowBits + uint64_t{2} * (number * kShards + shardIndex));
+}
+
+// Of a key whose number another has. As many as there are have room in no memory.
+uint32_t HXObjectIdentifiers::displacedNumber(Shard &shard, const Key &key) {
+    const auto [entry, isNew] = shard.displaced.try_emplace(key, 0);
+    for (bool isFound = !isNew; !isFound && shard.next < kNumbers; shard.next++) {
+        isFound = shard.given.try_emplace(shard.next, key).second;
+        if (isFound) entry->second = shard.next;
+    }
+    return entry->second;
 }
 
 uint64_t HXObjectIdentifiers::of(const HXMapping &mapping, const HXMappingOwner &owner) {

@@ -77,16 +77,23 @@ class HXObjectIdentifiers {
     struct KeyHash {
         uint64_t seed;
         size_t operator()(const Key &key) const;
+        size_t operator()(uint32_t number) const;
     };
-    // Keys are spread by the number that they prefer, and so each shard has numbers of its own.
+    // Keys are spread by the number that they prefer, and so each shard has numbers of its own. Nearly all
+    // have the one that they prefer.
     struct Shard {
         std::mutex mutex;
-        std::unordered_map<Key, uint32_t, KeyHash> numbers;
-        HXNumberPool pool;
+        std::unordered_map<uint32_t, Key, KeyHash> given; // by number
+        std::unordered_map<Key, uint32_t, KeyHash> displaced;
+        uint32_t next = 0; // all below have been given
     };
     static constexpr uint32_t kShards = 64;
+    // Where the lower bits of the table's identifiers begin, behind what the kernel's own have there.
+    static constexpr uint32_t kFirstLowBits = 1 << 16;
+    static constexpr uint32_t kNumbers = ((uint32_t{1} << 31) - kFirstLowBits / 2) / kShards; // of a shard
 
     uint64_t interned(const Key &key);
+    static uint32_t displacedNumber(Shard &shard, const Key &key);
 
     std::deque<Shard> _shards;
     std::mutex _processMutex;

@@ -172,6 +172,18 @@ std::optional<HXStatusRecord> HXLinuxTask::status(StatusUse use) {
     return _status;
 }
 
+namespace {
+
+// What this thread asked for last: it asks for one task again and again while that is open.
+struct LastFound {
+    uint64_t table = 0;
+    uint32_t port = 0;
+    HXLinuxTask *task = nullptr;
+};
+thread_local LastFound last;
+
+} // namespace
+
 uint32_t HXTaskTable::add(std::unique_ptr<HXLinuxTask> task) {
     const std::unique_lock lock(_mutex);
     const uint32_t port = _nextPort++;
@@ -181,6 +193,7 @@ uint32_t HXTaskTable::add(std::unique_ptr<HXLinuxTask> task) {
 }
 
 void HXTaskTable::remove(uint32_t port) {
+    if (last.port == port) last = {};
     const std::unique_lock lock(_mutex);
     const auto found = _tasks.find(port);
     if (found == _tasks.end()) return;
@@ -205,9 +218,12 @@ std::vector<HXLinuxTask *> HXTaskTable::all() const {
 }
 
 HXLinuxTask *HXTaskTable::find(uint32_t port) const {
+    if (last.table == _number && last.port == port) return last.task;
     const std::shared_lock lock(_mutex);
     const auto found = _tasks.find(port);
-    return found == _tasks.end() ? nullptr : found->second.get();
+    if (found == _tasks.end()) return nullptr;
+    last = {_number, port, found->second.get()};
+    return last.task;
 }
 
 HXLinuxTask *HXTaskTable::findByPid(int32_t pid) const {

@@ -8,6 +8,7 @@
 #include "platform/linux/procfs/HXLinuxProcesses.h"
 #include "platform/linux/procfs/HXProcText.h"
 
+#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <functional>
@@ -139,7 +140,8 @@ class HXTaskTable {
     // The port of a new task, which lives until `remove`; no port is given twice.
     uint32_t add(std::unique_ptr<HXLinuxTask> task);
     void remove(uint32_t port);
-    // Null for a port that is none.
+    // Null for a port that was never given. Threads other than that which has removed one
+    // must not ask for it.
     HXLinuxTask *find(uint32_t port) const;
     size_t count() const;
     // Of each process the task that was opened last, ascending by pid.
@@ -148,6 +150,8 @@ class HXTaskTable {
     HXLinuxTask *findByPid(int32_t pid) const;
 
   private:
+    inline static std::atomic<uint64_t> _tables = 0; // that there were
+    const uint64_t _number = ++_tables;
     mutable std::shared_mutex _mutex;
     std::unordered_map<uint32_t, std::unique_ptr<HXLinuxTask>> _tasks;
     std::unordered_map<int32_t, uint32_t> _portsByPid;

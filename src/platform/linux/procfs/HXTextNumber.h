@@ -23,7 +23,9 @@ struct HXTextCursor {
         return true;
     }
     bool skip(std::string_view text) {
-        if (!rest.starts_with(text)) return false;
+        // Most texts differ in their first character, which takes no call to find out.
+        const bool mayBe = !rest.empty() && !text.empty() && rest.front() == text.front();
+        if (!mayBe || !rest.starts_with(text)) return text.empty();
         rest.remove_prefix(text.size());
         return true;
     }
@@ -44,8 +46,11 @@ struct HXTextCursor {
     // The text up to the next blank or the end of the line; empty at the end.
     std::string_view word() {
         skipBlanks();
-        const std::string_view found = rest.substr(0, rest.find_first_of(" \t\n"));
-        rest.remove_prefix(found.size());
+        size_t n = 0;
+        while (n < rest.size() && rest[n] != ' ' && rest[n] != '\t' && rest[n] != '\n')
+            n++;
+        const std::string_view found = rest.substr(0, n);
+        rest.remove_prefix(n);
         return found;
     }
     // The word at the end, taken off; the same for a line without tabs.
@@ -85,12 +90,14 @@ struct HXLabelledFigure {
 template <typename Record, size_t Count>
 Record HXParseLabelledFigures(std::string_view text, const HXLabelledFigure<Record> (&table)[Count]) {
     Record record;
-    for (HXTextCursor cursor{text}; !cursor.rest.empty();) {
+    size_t missing = Count; // each stands in one line
+    for (HXTextCursor cursor{text}; missing > 0 && !cursor.rest.empty();) {
         HXTextCursor line{cursor.line()};
         for (const HXLabelledFigure<Record> &entry : table) {
             if (!line.skip(entry.label)) continue;
             uint64_t value = 0;
             if (line.field(&value)) record.*entry.figure = value * entry.unitSize;
+            missing--;
             break;
         }
     }
