@@ -14,7 +14,9 @@
 #include <vector>
 
 #include <fcntl.h>
+#include <sched.h>
 #include <sys/mman.h>
+#include <sys/mount.h>
 #include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -172,9 +174,29 @@ class Population {
 struct Command {
     std::string name;
     std::string shell;
+    bool neverFreedLazily = false; // runs where /proc/vmstat says so
     std::vector<double> seconds = {}, processorSeconds = {}, serialSeconds = {};
     long peakKilobytes = 0;
 };
+
+// A copy of /proc/vmstat by which nobody ever freed lazily: its name. It goes with the program.
+const std::string &otherVmstat() {
+    static const std::string path = [] {
+        static std::string made = "/tmp/heft-vmstat-" + std::to_string(getpid());
+        const std::string copy = "sed 's/^pglazyfree .*/pglazyfree 0/' /proc/vmstat >" + made;
+        if (system(copy.c_str()) != 0) exit(1);
+        atexit([] { unlink(made.c_str()); });
+        return made;
+    }();
+    return path;
+}
+
+// Puts it in place for this process alone.
+void showNothingFreedLazily() {
+    if (unshare(CLONE_NEWNS) != 0 || mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+        mount(otherVmstat().c_str(), "/proc/vmstat", nullptr, MS_BIND, nullptr) != 0)
+        _exit(126);
+}
 
 double secondsOf(const timeval &time) {
     return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_usec) / 1e6;
@@ -189,6 +211,7 @@ std::optional<double> readSerialSeconds(int file) {
 
 void run(Command &command) {
     const int serial = memfd_create("serial", 0);
+    if (command.neverFreedLazily) otherVmstat();
     const auto before = std::chrono::steady_clock::now();
     const pid_t pid = fork();
     if (pid == 0) {
@@ -196,6 +219,7 @@ void run(Command &command) {
         dup2(null, 1);
         dup2(null, 2);
         dup2(serial, 9);
+        if (command.neverFreedLazily) showNothingFreedLazily();
         execl("/bin/sh", "sh", "-c", ("exec " + command.shell).c_str(), nullptr);
         _exit(127);
     }
@@ -240,7 +264,13 @@ std::vector<Command> commandsFor(const std::string &programs, const std::vector<
         {"heft -a, from smaps alone", variant + "smaps -a"},
         {"heft -a, from maps and scans", variant + "maps -a"},
         {"heft PID...", heft + named},
+        {"Where nobody ever freed lazily:", ""},
+        {"heft -a", heft + " -a", true},
+        {"heft -a --json", heft + " -a --json /dev/null", true},
+        {"heft -a, one worker", "taskset -c 0 " + heft + " -a", true},
+        {"heft -a, from maps and scans", variant + "maps -a", true},
     };
+    commands.push_back({"Peers:", ""});
     for (const char *peer : {"smem", "smemstat", "ps_mem"})
         if (system((std::string("command -v ") + peer + " >/dev/null 2>&1").c_str()) == 0)
             commands.push_back({peer, peer});
@@ -253,7 +283,7 @@ void compare(const PopulationPlan &plan, const std::string &programs, int rounds
     const size_t mappings = countMappings();
     for (int round = 0; round < rounds; round++)
         for (Command &command : commands)
-            run(command);
+            if (!command.shell.empty()) run(command);
 
     const Command &reference = commands.front();
     const auto memory =
@@ -264,6 +294,10 @@ void compare(const PopulationPlan &plan, const std::string &programs, int rounds
     printf("%-30s %10s %12s %10s %12s %10s %9s\n", "", "wall ms", "x cat smaps", "CPU ms", "x cat smaps",
            "peak KiB", "serial");
     for (const Command &command : commands) {
+        if (command.seconds.empty()) {
+            printf("%s\n", command.name.c_str());
+            continue;
+        }
         const double wall = median(command.seconds), processor = median(command.processorSeconds);
         printf("%-30s %10.1f %12.2f %10.1f %12.2f %10ld", command.name.c_str(), wall * 1e3,
                wall / median(reference.seconds), processor * 1e3,
