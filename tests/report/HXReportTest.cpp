@@ -1,4 +1,5 @@
 // The model of a report: filled from an analysis and read from the document of the same run.
+#include "report/HXReportGroups.h"
 #include "report/HXReportReader.h"
 #include "report/HXReportSource.h"
 
@@ -161,4 +162,29 @@ TEST(HXReportTest, NamesAreOnlyNames) {
     ASSERT_TRUE(report) << reason;
     EXPECT_EQ(report->processes()[0].name.str(), "a?[2J'");
     EXPECT_EQ(report->total().heft, 5u);
+}
+
+// One's control group has a unit and a container, another's the same container alone, a third has no place.
+TEST(HXReportTest, ProcessesAddUpByUnitAndContainer) {
+    const HXReport report = readReport(std::string(TEST_CASES) + "/groups.machine", false);
+    const HXTemporaryFolder folder;
+    const auto place = [&](const std::string &pid, const std::string &group) {
+        folder.write("proc/" + pid + "/status", "Name:\tx\nUid:\t0\t0\t0\t0\n");
+        folder.write("proc/" + pid + "/cgroup", "0::" + group + "\n");
+    };
+    place("10", "/lxc.payload.web/system.slice/ssh.service");
+    place("20", "/lxc.payload.web/init");
+    folder.write("group/lxc.payload.web/memory.current", "4096\n");
+    HXProcessPlaces places(folder / "proc", folder / "group");
+    const auto told = [&](HXGroupBy by) {
+        std::multiset<std::string> all;
+        for (const HXReportGroup &group : HXGroupReport(report, by, &places).groups)
+            all.insert(group.name + " " + std::to_string(group.processes) + " " +
+                       std::to_string(group.measured.value_or(0)));
+        return all;
+    };
+    using Groups = std::multiset<std::string>;
+    EXPECT_EQ(told(HXGroupBy::unit), (Groups{"- 3 0", "lxc:web/ssh.service 1 0"}));
+    EXPECT_EQ(told(HXGroupBy::container), (Groups{"- 2 0", "lxc:web 2 4096"}));
+    EXPECT_EQ(told(HXGroupBy::user), (Groups{"- 2 0", "root 2 0"}));
 }
