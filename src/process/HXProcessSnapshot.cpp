@@ -87,20 +87,28 @@ const std::string &HXProcessSnapshot::nameOf(const proc_bsdinfo &info) {
 
 void HXProcessSnapshot::openTasks(const std::vector<int32_t> &pids) {
     const auto openings = std::make_shared<std::vector<Opening>>();
-    for (size_t i = 0; i < pids.size(); i++)
+    const auto names = std::make_shared<std::vector<Naming>>(pids.size()); // whoever is given up writes here
+    for (size_t i = 0; i < pids.size(); i++) {
         openings->push_back({HXTaskPort(_host), KERN_FAILURE});
+        const auto listed = _positions.find(pids[i]);
+        if (listed != _positions.end() && !_names.contains(pids[i]))
+            (*names)[i].info = _records[listed->second];
+    }
     HXServices &services = _host.services();
     HXDispatchQueue queue = services.dispatch_queue_create("org.heft.opentasks", QOS_CLASS_UTILITY);
     queue.activity = "opening processes";
     queue.processOf = [&pids](size_t i) { return std::to_string(pids[i]); };
-    const auto givenUp = services.dispatch_apply(pids.size(), queue, [pids, openings](size_t i) {
+    const auto givenUp = services.dispatch_apply(pids.size(), queue, [pids, openings, names](size_t i) {
         Opening &opening = (*openings)[i];
         opening.error = opening.task.open(pids[i]);
+        Naming &naming = (*names)[i];
+        if (naming.info) naming.name = HXProcess::_nameForBsdInfo(*naming.info);
     });
     for (size_t i = 0; i < pids.size(); i++) {
         const bool isGivenUp = std::binary_search(givenUp.begin(), givenUp.end(), i);
         _opened.insert_or_assign(pids[i], isGivenUp ? Opening{HXTaskPort(_host), KERN_OPERATION_TIMED_OUT}
                                                     : std::move((*openings)[i]));
+        if (!isGivenUp && (*names)[i].info) _names.emplace(pids[i], std::move((*names)[i].name));
     }
 }
 

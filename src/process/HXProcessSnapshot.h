@@ -48,7 +48,7 @@ class HXProcessSnapshot {
     // HXProcess::_nameForBsdInfo. Valid as long as the snapshot.
     const std::string &nameOf(const proc_bsdinfo &info);
 
-    // Opens tasks, several at once, for `takeTask`.
+    // Opens tasks, several at once, for `takeTask`, and asks for the names of those that are listed.
     void openTasks(const std::vector<int32_t> &pids);
     // Hands over the task of a process, opened now if not before; or answers the error of `task_for_pid`,
     // KERN_OPERATION_TIMED_OUT when opening was given up.
@@ -72,6 +72,11 @@ class HXProcessSnapshot {
     struct Opening {
         HXTaskPort task;
         kern_return_t error;
+    };
+    // Of a listed process whose name is not known yet.
+    struct Naming {
+        std::optional<proc_bsdinfo> info;
+        std::string name;
     };
 
     HXPlatform &_host;

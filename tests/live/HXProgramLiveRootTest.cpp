@@ -105,11 +105,13 @@ TEST_F(HXProgramAsRoot, SaysWhenProcTellsNothingOrNotAll) {
         EXPECT_EQ(run.status, 1);
         EXPECT_NE(run.err.find("heft: /proc is not mounted\n"), std::string::npos) << run.err;
     }
-    const std::string hidden =
-        "mount -t proc -o hidepid=2,gid=12345 proc /proc && exec setpriv --bounding-set=-all "
-        "--inh-caps=-all " +
-        heft;
-    EXPECT_TRUE(answer(hidden + " -a").err.starts_with("heft: /proc hides processes (it is mounted with "));
+    for (const std::string &mode : {std::string("1"), std::string("2")}) {
+        const HXProgramRun run = answer("mount -t proc -o hidepid=" + mode +
+                                        ",gid=12345 proc /proc && exec setpriv --bounding-set=-all "
+                                        "--inh-caps=-all " +
+                                        heft + " -a");
+        EXPECT_TRUE(run.err.starts_with("heft: /proc hides processes (it is mounted with ")) << run.err;
+    }
     EXPECT_EQ(answer("mount -t proc -o hidepid=2 proc /proc && exec " + heft + " -a").err.find("hides"),
               std::string::npos);
 }
