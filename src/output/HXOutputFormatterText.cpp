@@ -30,7 +30,7 @@ std::string humanized(int64_t size) {
 
 void appendPadded(std::string &line, std::string_view text, int width) {
     const auto columns = static_cast<size_t>(width);
-    if (text.size() < columns) line.append(columns - text.size(), ' ');
+    line.append(columns - std::min(columns, text.size()), ' ');
     line += text;
 }
 

@@ -99,6 +99,7 @@ TEST(HXReportTest, AnAnalysisAndItsDocumentSayTheSame) {
         EXPECT_EQ(analysed.errors(), read.errors());
         EXPECT_EQ(analysed.warnings(), read.warnings());
         EXPECT_EQ(analysed.pageSize(), read.pageSize());
+        EXPECT_EQ(analysed.isOfObjects(), read.isOfObjects());
 
         std::vector<std::string> verbose = replay;
         verbose.push_back("-v");

@@ -336,6 +336,8 @@ TEST_F(HXLinuxPlatformTest, LeavesThePagesOfAnotherProgramAlone) {
         proc.write(std::to_string(pid) + "/pagemap", std::string(8, '\0'));
         EXPECT_EQ(HXPagesAt(platform, open(pid), 0, 0x1000), expected) << range;
     }
+    process(14, "p", "0-1000 rw-p 0 00:00 0\n");
+    EXPECT_EQ(HXPagesAt(platform, open(14), 0, 0x1000), "(os/kern) invalid argument") << "without any";
 }
 
 TEST_F(HXLinuxPlatformTest, TellsWhenMemoryMovedWhileItWasRead) {

@@ -100,10 +100,10 @@ bool isKmallocCache(std::string_view name) {
 
 struct Zone {
     std::string_view name;
-    uint64_t size = 0; // bytes, as all sizes here
-    uint64_t activeObjects = 0;
-    uint64_t objectSize = 0;
-    bool isReclaimable = false;
+    uint64_t size; // bytes, as all sizes here
+    uint64_t activeObjects;
+    uint64_t objectSize;
+    bool isReclaimable;
     // Bytes that go with the other kind; only where the kind was guessed by name.
     uint64_t otherSize = 0;
 };

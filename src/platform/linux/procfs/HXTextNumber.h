@@ -90,14 +90,12 @@ struct HXLabelledFigure {
 template <typename Record, size_t Count>
 Record HXParseLabelledFigures(std::string_view text, const HXLabelledFigure<Record> (&table)[Count]) {
     Record record;
-    size_t missing = Count; // each stands in one line
-    for (HXTextCursor cursor{text}; missing > 0 && !cursor.rest.empty();) {
+    for (HXTextCursor cursor{text}; !cursor.rest.empty();) {
         HXTextCursor line{cursor.line()};
         for (const HXLabelledFigure<Record> &entry : table) {
             if (!line.skip(entry.label)) continue;
             uint64_t value = 0;
             if (line.field(&value)) record.*entry.figure = value * entry.unitSize;
-            missing--;
             break;
         }
     }

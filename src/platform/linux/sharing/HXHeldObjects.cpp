@@ -15,6 +15,7 @@
 #include <climits>
 #include <cstdio>
 #include <unordered_set>
+#include <utility>
 
 namespace {
 
@@ -115,11 +116,12 @@ std::vector<task_held_object> HXHeldObjects::open(const HXDescriptor &process) {
     std::unordered_set<uint64_t> seen;
     const HXDescriptor descriptors = HXOpenAt(process, "fd", O_DIRECTORY);
     if (!descriptors) return all;
+    bool knowsPlaces = false; // few processes have such descriptors
     HXForEachEntry(descriptors, [&](const char *name) {
         char buffer[PATH_MAX];
         const auto link = *name == '.' ? std::nullopt : HXReadLink(descriptors, name, buffer);
         if (!link || !isNameless(*link)) return true;
-        _places.learn(process);
+        if (!std::exchange(knowsPlaces, true)) _places.learn(process);
         const auto mount = mountOf(process, name);
         if (!mount || !_places.isMemoryMount(*mount)) return true;
         const auto found = find(process, (std::string("fd/") + name).c_str());
