@@ -99,10 +99,11 @@ void HXProcessSnapshot::openTasks(const std::vector<int32_t> &pids) {
     queue.activity = "opening processes";
     queue.processOf = [&pids](size_t i) { return std::to_string(pids[i]); };
     const auto givenUp = services.dispatch_apply(pids.size(), queue, [pids, openings, names](size_t i) {
-        Opening &opening = (*openings)[i];
-        opening.error = opening.task.open(pids[i]);
+        // Who is given up here uses nothing of the run's any more when he answers after all.
         Naming &naming = (*names)[i];
         if (naming.info) naming.name = HXProcess::_nameForBsdInfo(*naming.info);
+        Opening &opening = (*openings)[i];
+        opening.error = opening.task.open(pids[i]);
     });
     for (size_t i = 0; i < pids.size(); i++) {
         const bool isGivenUp = std::binary_search(givenUp.begin(), givenUp.end(), i);
