@@ -14,6 +14,7 @@
 #include <sys/uio.h>
 #include <sys/utsname.h>
 
+#include <algorithm>
 #include <bit>
 #include <cerrno>
 #include <cstring>
@@ -86,6 +87,11 @@ void HXLinuxPlatform::prepareProcess(const char *program) {
     if (::getrlimit(RLIMIT_NOFILE, &limit) != 0) return;
     limit.rlim_cur = limit.rlim_max;
     ::setrlimit(RLIMIT_NOFILE, &limit);
+    // The table of descriptors grows without ado as long as there is one thread; later everybody who opens a
+    // file then waits some milliseconds for each doubling, until no processor can be looking at the old one.
+    constexpr rlim_t many = 8192; // 64 KiB: two for each of some thousand processes
+    const int high = ::fcntl(0, F_DUPFD_CLOEXEC, static_cast<int>(std::min(limit.rlim_cur, many) - 1));
+    if (high >= 0) ::close(high);
 }
 
 // ---- Processes
