@@ -70,6 +70,7 @@ int scan(const HXDescriptor &pagemap, uint64_t categories, uint64_t start, uint6
     argument.vectorLength = regions.size();
     argument.anyOfCategories = kPresent | kSwapped;
     argument.returnedCategories = categories;
+    HXGiveWay();
     const int count = ::ioctl(pagemap.get(), kScanRequest, &argument);
     *walkEnd = argument.walkEnd;
     return count;

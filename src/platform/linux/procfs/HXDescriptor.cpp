@@ -1,5 +1,20 @@
 #include "platform/linux/procfs/HXDescriptor.h"
 
+#include <sched.h>
+
+namespace {
+
+void giveWayBeforeReading(size_t length) {
+    constexpr size_t much = 8192; // the files of a few figures are read with less
+    if (length > much) HXGiveWay();
+}
+
+} // namespace
+
+void HXGiveWay() {
+    ::sched_yield();
+}
+
 void HXDescriptor::reset(int descriptor) {
     if (_descriptor >= 0) {
         const int kept = errno;
@@ -10,6 +25,7 @@ void HXDescriptor::reset(int descriptor) {
 }
 
 ssize_t HXDescriptor::read(std::span<char> buffer) const {
+    giveWayBeforeReading(buffer.size());
     for (;;) {
         const ssize_t got = ::read(_descriptor, buffer.data(), buffer.size());
         if (got >= 0 || errno != EINTR) return got;
@@ -28,5 +44,6 @@ ssize_t HXDescriptor::readFully(std::span<char> buffer) const {
 }
 
 ssize_t HXDescriptor::readAt(uint64_t position, void *buffer, size_t length) const {
+    giveWayBeforeReading(length);
     return ::pread(_descriptor, buffer, length, static_cast<off_t>(position));
 }

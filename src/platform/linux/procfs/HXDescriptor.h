@@ -9,6 +9,11 @@
 #include <span>
 #include <utility>
 
+// Before what takes the kernel long, such as a walk of page tables or a look at many pages: lets those run
+// who wait for this processor (sched_yield(2)). The scheduler would let them wait for its next tick, some
+// milliseconds. Costs a third of a microsecond where nobody waits.
+void HXGiveWay();
+
 class HXDescriptor {
   public:
     HXDescriptor() = default;
@@ -27,7 +32,8 @@ class HXDescriptor {
     // Keeps errno.
     void reset(int descriptor = -1);
 
-    // One read(2), begun anew when a signal interrupts it: bytes read, 0 at the end, -1 with errno set.
+    // One read(2), begun anew when a signal interrupts it: bytes read, 0 at the end, -1 with errno set. This
+    // and `readAt` give way (HXGiveWay) before reading much.
     ssize_t read(std::span<char> buffer) const;
     // Reads from the descriptor's place until `buffer` is full or the file ends: bytes read. -1 with errno
     // set when a read fails, the first or a later one: what came before it is no answer.
