@@ -2,7 +2,9 @@
 #include "analysis/HXHeft.h"
 
 #include <algorithm>
+#include <array>
 #include <cstdio>
+#include <span>
 #include <utility>
 
 namespace {
@@ -95,7 +97,7 @@ void HXHeft::reserveMaps() {
     _maps->_linkeditMemoryObjects.reserve(2 * _processes.size());
 }
 
-HXHeft::ObjectMap &HXHeft::mapForRegion(const HXMemoryRegion &region, const HXProcess &process) {
+HXObjectMap &HXHeft::mapForRegion(const HXMemoryRegion &region, const HXProcess &process) {
     if (region.inSharedCache())
         return process.is64bit() ? _maps->_sharedCache64MemoryObjects : _maps->_sharedCache32MemoryObjects;
     if (region.segment() == HXSegmentText) return _maps->_textMemoryObjects;
@@ -103,25 +105,40 @@ HXHeft::ObjectMap &HXHeft::mapForRegion(const HXMemoryRegion &region, const HXPr
     return _maps->_memoryObjects;
 }
 
-HXMemoryObject &HXHeft::objectForRegion(const HXMemoryRegion &region, const HXProcess &process) {
+HXHeft::Place HXHeft::placeOf(HXMemoryRegion &region, const HXProcess &process) {
     constexpr uint64_t noKey = UINT64_MAX;
     uint64_t key = region.inSharedCache() ? region.start() : region.object_id();
-    if (key == noKey) return _objects.add();
+    if (key == noKey) return {&region};
     // What a process has copied on write is its own, whoever else maps the object.
     if (region.share_mode() == SM_COW && (region.dirtySize() != 0 || region.swappedSize() != 0))
         key ^= uint64_t{static_cast<uint32_t>(process.pid())} << 32;
-    if (key == 0 || key == noKey) return _objects.add();
-    HXMemoryObject *&object = mapForRegion(region, process)[key];
+    if (key == 0 || key == noKey) return {&region};
+    HXObjectMap &map = mapForRegion(region, process);
+    map.announce(key);
+    return {&region, &map, key};
+}
+
+HXMemoryObject &HXHeft::objectAt(const Place &place) {
+    if (!place.map) return _objects.add();
+    HXMemoryObject *&object = (*place.map)[place.key];
     if (!object) object = &_objects.add();
     return *object;
 }
 
 void HXHeft::_addProcess(HXProcess &process) {
     const bool breakDown = breakDownPhysHeft();
-    for (HXMemoryRegion &region : process.memoryRegions()) {
-        HXMemoryObject &object = objectForRegion(region, process);
-        merge(region, process, object);
-        if (breakDown && region.ownedExclusivelyByParentProcess()) object.setOwnerPid(process.pid());
+    auto &regions = process.memoryRegions();
+    std::array<Place, 32> places; // as many lookups as wait for memory together
+    for (auto next = regions.begin(); next != regions.end();) {
+        size_t count = 0;
+        for (; count < places.size() && next != regions.end(); ++next)
+            places[count++] = placeOf(*next, process);
+        for (const Place &place : std::span(places).first(count)) {
+            HXMemoryObject &object = objectAt(place);
+            merge(*place.region, process, object);
+            if (breakDown && place.region->ownedExclusivelyByParentProcess())
+                object.setOwnerPid(process.pid());
+        }
     }
 }
 

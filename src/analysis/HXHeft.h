@@ -3,6 +3,7 @@
 #pragma once
 
 #include "analysis/HXHeftSharingData.h"
+#include "analysis/HXObjectMap.h"
 #include "analysis/HXOutputFormatter.h"
 #include "model/HXHeftSwitches.h"
 #include "model/HXMemoryCategory.h"
@@ -14,7 +15,6 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <memory_resource>
 #include <unordered_map>
 #include <vector>
 
@@ -73,22 +73,21 @@ class HXHeft : public HXHeftSwitches {
     const HXMemoryObjects &memoryObjects() const { return _objects; }
 
   private:
-    // A key's low bits tell little: object identifiers are often numbered or aligned.
-    struct KeyHash {
-        size_t operator()(uint64_t key) const {
-            key = (key ^ (key >> 32)) * 0x9E3779B97F4A7C15;
-            return static_cast<size_t>(key ^ (key >> 29));
-        }
+    // Where a region's object is found; without a map it shares with nothing.
+    struct Place {
+        HXMemoryRegion *region = nullptr;
+        HXObjectMap *map = nullptr;
+        uint64_t key = 0;
     };
-    using ObjectMap = std::pmr::unordered_map<uint64_t, HXMemoryObject *, KeyHash>;
     struct Report;
 
     void examineTogether();
     void gatherProcesses();
     void setAside(const HXProcess &unanswering);
     void reserveMaps();
-    ObjectMap &mapForRegion(const HXMemoryRegion &region, const HXProcess &process);
-    HXMemoryObject &objectForRegion(const HXMemoryRegion &region, const HXProcess &process);
+    HXObjectMap &mapForRegion(const HXMemoryRegion &region, const HXProcess &process);
+    Place placeOf(HXMemoryRegion &region, const HXProcess &process);
+    HXMemoryObject &objectAt(const Place &place);
     void merge(HXMemoryRegion &region, const HXProcess &process, HXMemoryObject &object);
     void reportProcess(const HXProcess &process, Report &report, const HXHeftSharingData &sharing,
                        bool summarize);
@@ -101,12 +100,11 @@ class HXHeft : public HXHeftSwitches {
     HXMemoryObjects _objects;
     // What merging looks objects up in. The maps only grow, and go together once all processes are merged.
     struct ObjectMaps {
-        std::pmr::monotonic_buffer_resource memory;
-        ObjectMap _memoryObjects{&memory};
-        ObjectMap _sharedCache64MemoryObjects{&memory};
-        ObjectMap _sharedCache32MemoryObjects{&memory};
-        ObjectMap _textMemoryObjects{&memory};
-        ObjectMap _linkeditMemoryObjects{&memory};
+        HXObjectMap _memoryObjects;
+        HXObjectMap _sharedCache64MemoryObjects;
+        HXObjectMap _sharedCache32MemoryObjects;
+        HXObjectMap _textMemoryObjects;
+        HXObjectMap _linkeditMemoryObjects;
     };
     std::unique_ptr<ObjectMaps> _maps;
     std::vector<HXOutputFormatter *> _outputFormatters;

@@ -4,10 +4,16 @@
 #include "model/HXRegionOwner.h"
 
 #include <algorithm>
+#include <bit>
+#include <utility>
 
 namespace {
 
 using ProcessRegion = HXMemoryObject::ProcessRegion;
+
+bool canDifferByProcess(const HXMemoryRegion &region) {
+    return region.object_id() != 0 && region.eligibleForProcessView();
+}
 
 bool byPid(const ProcessRegion &a, const ProcessRegion &b) {
     return a.pid < b.pid;
@@ -39,23 +45,14 @@ HXSizes sizesOfView(std::span<const ProcessRegion> regions, const HXRegionOwner 
 
 } // namespace
 
-void HXRegionSet::add(HXMemoryRegion *region) {
-    if (!_first) {
-        _first = region;
-        return;
-    }
-    if (!_all) _all = std::make_unique<std::vector<HXMemoryRegion *>>(1, _first);
-    _all->push_back(region);
-}
-
-std::span<HXMemoryRegion *const> HXRegionSet::regions() const {
-    if (_all) return *_all;
+std::span<HXMemoryRegion *const> HXMemoryObject::memoryRegions() const {
+    if (_more && !_more->regions.empty()) return _more->regions;
     return {&_first, _first ? 1U : 0U};
 }
 
 std::span<const HXMemoryObject::ProcessRegion> HXMemoryObject::processMemoryRegions() const {
-    if (!_processMemoryRegions) return {};
-    return *_processMemoryRegions;
+    if (!_more) return {};
+    return _more->processMemoryRegions;
 }
 
 void HXMemoryObject::addRegion(HXMemoryRegion &region, const HXRegionOwner &process) {
@@ -68,13 +65,27 @@ void HXMemoryObject::addRegion(HXMemoryRegion &region, uint32_t pageSize) {
 
 void HXMemoryObject::_addRegion(HXMemoryRegion &region, uint32_t pageSize, const HXRegionOwner *process) {
     HXRequire(!_accurateSizes, "HXMemoryObject addRegion", "!_accurateSizes");
-    _memoryRegions.add(&region);
+    addToRegions(region, process);
     if (region.object_id() == 0) return; // remembered, but without a share in the sizes
-    if (process && (_processMemoryRegions || region.eligibleForProcessView())) {
-        if (!_processMemoryRegions) _processMemoryRegions = std::make_unique<std::vector<ProcessRegion>>();
-        _processMemoryRegions->push_back({process->pid(), &region});
-    }
     addRuns(region, pageSize);
+}
+
+void HXMemoryObject::addToRegions(HXMemoryRegion &region, const HXRegionOwner *process) {
+    _containsFakeRegion = _containsFakeRegion || region.isFake();
+    if (!_first) {
+        _first = &region;
+        _isFirstOfProcess = process && canDifferByProcess(region);
+        if (process) _firstPid = process->pid();
+        return;
+    }
+    auto &[regions, byProcess, rangeList, onlyRun] = more();
+    if (regions.empty()) {
+        regions.push_back(_first);
+        if (_isFirstOfProcess) byProcess.push_back({_firstPid, _first});
+    }
+    regions.push_back(&region);
+    if (process && (canDifferByProcess(region) || (!byProcess.empty() && region.object_id() != 0)))
+        byProcess.push_back({process->pid(), &region});
 }
 
 void HXMemoryObject::addRuns(HXMemoryRegion &region, uint32_t pageSize) {
@@ -82,30 +93,36 @@ void HXMemoryObject::addRuns(HXMemoryRegion &region, uint32_t pageSize) {
         _sizes += region.countedSizes();
         return;
     }
-    if (!_rangeList && !_onlyRun) {
-        _rangeList = region.takeSubrangeList();
-        if (_rangeList) return;
-        _onlyRun = &region;
-        _onlyRunPageSize = pageSize;
+    if (_onlyRunPageWidth == 0) {
+        _onlyRunPageWidth = static_cast<uint8_t>(std::bit_width(pageSize));
+        if (auto runs = region.takeSubrangeList())
+            more().rangeList = std::move(runs);
+        else if (&region != _first)
+            more().onlyRun = &region;
         return;
     }
-    if (!_rangeList) {
-        _rangeList = std::make_unique<HXRangeList>();
-        _rangeList->addRegion(*_onlyRun, _onlyRunPageSize);
-        _onlyRun = nullptr;
+    auto &runs = more().rangeList;
+    if (!runs) {
+        runs = std::make_unique<HXRangeList>();
+        runs->addRegion(*onlyRun(), uint32_t{1} << (_onlyRunPageWidth - 1));
     }
-    _rangeList->addRegion(region, pageSize);
+    runs->addRegion(region, pageSize);
     region.freeSubrangeList();
 }
 
-HXSizes HXMemoryObject::sumOfRuns() const {
-    if (_rangeList) return _rangeList->sum();
-    return _onlyRun ? _onlyRun->sizes() : HXSizes{};
+// The region that would be the only run of a range list, while there is none and any run.
+const HXMemoryRegion *HXMemoryObject::onlyRun() const {
+    return _more && _more->onlyRun ? _more->onlyRun : _first;
 }
 
+HXSizes HXMemoryObject::sumOfRuns() const {
+    if (_more && _more->rangeList) return _more->rangeList->sum();
+    return _onlyRunPageWidth != 0 ? onlyRun()->sizes() : HXSizes{};
+}
+
+// The regions of each process, where they are sorted by pid.
 template <typename Each>
-void HXMemoryObject::forEachProcess(Each each) const {
-    const std::span<const ProcessRegion> all = processMemoryRegions();
+void HXMemoryObject::forEachProcess(std::span<const ProcessRegion> all, Each each) {
     for (size_t first = 0, next = 0; first < all.size(); first = next) {
         while (next < all.size() && all[next].pid == all[first].pid)
             next++;
@@ -120,8 +137,9 @@ bool HXMemoryObject::isMadeOfParts() const {
 
 // With the kernel's charge for each region, an object holds at least what any one process is charged for it.
 // So does one of pages that all its processes share.
-void HXMemoryObject::raiseToLargestProcess() {
-    forEachProcess([this](std::span<const ProcessRegion> regions) {
+void HXMemoryObject::raiseToLargestProcess(std::span<const ProcessRegion> all) {
+    if (!isMadeOfParts() && !HXHeftSwitches::breakDownPhysHeft()) return;
+    forEachProcess(all, [this](std::span<const ProcessRegion> regions) {
         const HXSizes charged = sumOfRegions(regions);
         _sizes.dirty = std::max(_sizes.dirty, charged.dirty);
         _sizes.swapped = std::max(_sizes.swapped, charged.swapped);
@@ -131,7 +149,7 @@ void HXMemoryObject::raiseToLargestProcess() {
 bool HXMemoryObject::processRegionsTellMore() const {
     size_t processes = 0;
     bool anyDiffers = false;
-    forEachProcess([&](std::span<const ProcessRegion> regions) {
+    forEachProcess(processMemoryRegions(), [&](std::span<const ProcessRegion> regions) {
         processes++;
         anyDiffers = anyDiffers || regions.size() > 1 || regions.front().region->sizes() != _sizes;
     });
@@ -141,20 +159,23 @@ bool HXMemoryObject::processRegionsTellMore() const {
 void HXMemoryObject::finalize() {
     HXRequire(!_accurateSizes, "HXMemoryObject finalize", "!_accurateSizes");
     _sizes += sumOfRuns();
-    if (_processMemoryRegions) {
-        std::stable_sort(_processMemoryRegions->begin(), _processMemoryRegions->end(), byPid);
-        if (isMadeOfParts() || HXHeftSwitches::breakDownPhysHeft()) raiseToLargestProcess();
-        if (!processRegionsTellMore()) _processMemoryRegions.reset();
+    if (memoryRegions().size() > 1) {
+        auto &byProcess = _more->processMemoryRegions;
+        std::stable_sort(byProcess.begin(), byProcess.end(), byPid);
+        raiseToLargestProcess(byProcess);
+        if (!processRegionsTellMore()) byProcess = {};
+        _more->rangeList.reset();
+    } else {
+        const ProcessRegion only = {_firstPid, _first};
+        if (_isFirstOfProcess) raiseToLargestProcess({&only, 1});
+        _more.reset();
     }
-    _rangeList.reset();
-    _onlyRun = nullptr;
-    nameFakeRegions();
+    if (_containsFakeRegion) nameFakeRegions();
     _accurateSizes = true;
 }
 
 // Unmapped owned memory is named after the object's mapped regions.
 void HXMemoryObject::nameFakeRegions() {
-    if (!containsFakeRegion()) return;
     const HXMemoryRegion *canonical = _canonicalRegion();
     if (canonical->isFake()) return;
     for (HXMemoryRegion *region : memoryRegions()) {
@@ -162,11 +183,6 @@ void HXMemoryObject::nameFakeRegions() {
         region->setName(canonical->name());
         region->setDetailedName(canonical->detailedName());
     }
-}
-
-bool HXMemoryObject::containsFakeRegion() const {
-    const auto regions = memoryRegions();
-    return std::any_of(regions.begin(), regions.end(), [](const HXMemoryRegion *r) { return r->isFake(); });
 }
 
 const HXMemoryRegion *HXMemoryObject::_canonicalRegion() const {
@@ -193,7 +209,7 @@ HXMemoryObjectView HXMemoryObject::wholeView() const {
 
 HXMemoryObjectView HXMemoryObject::viewForProcess(const HXRegionOwner &process) const {
     HXMemoryObjectView view = wholeView();
-    if (_processMemoryRegions) {
+    if (!processMemoryRegions().empty()) {
         const auto regions = regionsOfProcess(process.pid());
         if (regions.empty()) return view;
         view = {{sizesOfView(regions, process), static_cast<uint32_t>(regions.size())}, false};

@@ -13,19 +13,6 @@
 
 class HXRegionOwner;
 
-// The regions of an object, in the order in which they were added. Most objects have one: it takes no
-// allocation.
-class HXRegionSet {
-  public:
-    // A region is added to one object once.
-    void add(HXMemoryRegion *region);
-    std::span<HXMemoryRegion *const> regions() const;
-
-  private:
-    HXMemoryRegion *_first = nullptr;
-    std::unique_ptr<std::vector<HXMemoryRegion *>> _all; // from the second region on
-};
-
 // What is seen of an object: its sizes and the number of its regions.
 struct HXMemoryObjectView : HXMemoryTotal {
     bool isWhole = true; // what everybody sees; otherwise one process's own view
@@ -48,7 +35,8 @@ class HXMemoryObject {
 
     // Final once the object is finalised.
     const HXSizes &sizes() const { return _sizes; }
-    std::span<HXMemoryRegion *const> memoryRegions() const { return _memoryRegions.regions(); }
+    // In the order in which they were added.
+    std::span<HXMemoryRegion *const> memoryRegions() const;
     // Pid of the owner, or kNoOwner.
     int32_t ownerPid() const { return _ownerPid; }
     void setOwnerPid(int32_t pid) { _ownerPid = pid; }
@@ -70,31 +58,44 @@ class HXMemoryObject {
     // The part of the object that a process maps, or the whole as clean memory when another process owns it.
     HXMemoryObjectView viewForProcess(const HXRegionOwner &process) const;
 
-    bool containsFakeRegion() const;
+    bool containsFakeRegion() const { return _containsFakeRegion; }
     // The region that names the object.
     const HXMemoryRegion *_canonicalRegion() const;
 
   private:
     void _addRegion(HXMemoryRegion &region, uint32_t pageSize, const HXRegionOwner *process);
+    void addToRegions(HXMemoryRegion &region, const HXRegionOwner *process);
     void addRuns(HXMemoryRegion &region, uint32_t pageSize);
+    const HXMemoryRegion *onlyRun() const;
     HXSizes sumOfRuns() const;
     bool isMadeOfParts() const;
-    void raiseToLargestProcess();
+    void raiseToLargestProcess(std::span<const ProcessRegion> all);
     bool processRegionsTellMore() const;
     void nameFakeRegions();
-    // Calls `each` with the regions of every process of the map.
     template <typename Each>
-    void forEachProcess(Each each) const;
+    static void forEachProcess(std::span<const ProcessRegion> all, Each each);
     std::span<const ProcessRegion> regionsOfProcess(int32_t pid) const;
 
+    // What most objects do without, having one region.
+    struct More {
+        std::vector<HXMemoryRegion *> regions; // all, from the second region on
+        std::vector<ProcessRegion> processMemoryRegions;
+        std::unique_ptr<HXRangeList> rangeList;  // the merged page runs, from the second run to finalisation
+        const HXMemoryRegion *onlyRun = nullptr; // null: the first region
+    };
+    More &more() {
+        if (!_more) _more = std::make_unique<More>();
+        return *_more;
+    }
+
     HXSizes _sizes;
-    HXRegionSet _memoryRegions;
-    std::unique_ptr<std::vector<ProcessRegion>> _processMemoryRegions;
-    std::unique_ptr<HXRangeList> _rangeList; // the merged page runs, from the second run to finalisation
-    // While there is no range list: the one region that would be its only run, and its page size.
-    const HXMemoryRegion *_onlyRun = nullptr;
-    uint32_t _onlyRunPageSize = 0;
+    HXMemoryRegion *_first = nullptr;
+    std::unique_ptr<More> _more;
+    int32_t _firstPid = 0;
     int32_t _ownerPid = kNoOwner;
     uint32_t _index = 0;
-    bool _accurateSizes = false; // finalised
+    uint8_t _onlyRunPageWidth = 0;      // in bits; 0: there is no run yet
+    bool _isFirstOfProcess : 1 = false; // that of _firstPid
+    bool _containsFakeRegion : 1 = false;
+    bool _accurateSizes : 1 = false; // finalised
 };

@@ -70,8 +70,9 @@ std::string HXMemoryRegion::fullName() const {
 }
 
 void HXMemoryRegion::addSubrange(HXRange range, const HXSizes &sizes, uint32_t pageSize) {
-    if (!_subrangeList) _subrangeList = std::make_unique<HXRangeList>();
-    _subrangeList->addRange(range, pageSize, sizes);
+    auto &list = rest().subrangeList;
+    if (!list) list = std::make_unique<HXRangeList>();
+    list->addRange(range, pageSize, sizes);
 }
 
 HXMemoryRegion HXMemoryRegion::takePart(uint64_t id, const HXSizes &part, const HXSizes &counted) {
@@ -82,6 +83,7 @@ HXMemoryRegion HXMemoryRegion::takePart(uint64_t id, const HXSizes &part, const 
         return taken;
     };
     HXMemoryRegion taken;
+    Rest &own = rest(), &its = taken.rest();
     taken._isPart = true;
     taken._segment = HXSegmentNoImage;
     taken._share_mode = SM_SHARED;
@@ -90,18 +92,17 @@ HXMemoryRegion HXMemoryRegion::takePart(uint64_t id, const HXSizes &part, const 
     taken._detailedName = _detailedName;
     taken._start = _start;
     taken._object_id = id;
-    taken._dirtySize = take(&_dirtySize, &_sharedDirtySize, part.dirty);
-    taken._swappedSize = take(&_swappedSize, &_sharedSwappedSize, part.swapped);
+    taken._dirtySize = take(&_dirtySize, &own.sharedDirtySize, part.dirty);
+    taken._swappedSize = take(&_swappedSize, &own.sharedSwappedSize, part.swapped);
     taken._size = taken.sizes().heft();
-    taken._sharedDirtySize = std::min(counted.dirty, taken._dirtySize);
-    taken._sharedSwappedSize = std::min(counted.swapped, taken._swappedSize);
+    its.sharedDirtySize = std::min(counted.dirty, taken._dirtySize);
+    its.sharedSwappedSize = std::min(counted.swapped, taken._swappedSize);
     return taken;
 }
 
 HXSizes HXMemoryRegion::listedSizes() const {
     HXSizes listed = sizes();
-    listed.dirty += _sharedDirtySize;
-    listed.swapped += _sharedSwappedSize;
+    listed += sharedSizes();
     return listed;
 }
 
@@ -114,9 +115,9 @@ bool HXMemoryRegion::eligibleForProcessView() const {
 
 bool HXMemoryRegion::eligibleForSubrangesUsingPageSize(uint32_t pageSize) const {
     if (!eligibleForProcessView() || _size <= pageSize || _ownedExclusivelyByParentProcess) return false;
-    if ((_sharedDirtySize | _sharedSwappedSize) != 0) return false; // the runs have what is in parts, too
+    if (sharedSizes() != HXSizes{}) return false; // the runs have what is in parts, too
     bool anyNonZero = false;
-    for (const uint64_t part : {_dirtySize, _swappedSize, _cleanNonSpecSize, _reclaimableSize}) {
+    for (const uint64_t part : {_dirtySize, _swappedSize, _cleanNonSpecSize, reclaimableSize()}) {
         if (part == _size) return false; // wholly in one state: nothing to split
         anyNonZero = anyNonZero || part != 0;
     }

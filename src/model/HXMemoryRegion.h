@@ -7,11 +7,14 @@
 #include "platform/HXHostRecords.h"
 #include "platform/HXInternalError.h"
 
+#include <cstddef>
 #include <cstdint>
-#include <deque>
+#include <iterator>
 #include <memory>
 #include <string>
 #include <string_view>
+#include <utility>
+#include <vector>
 
 class HXMemoryObject;
 
@@ -88,8 +91,10 @@ class HXMemoryRegion {
 
     uint64_t dirtySize() const { return _dirtySize; }
     void setDirtySize(uint64_t size) { _dirtySize = size; }
-    uint64_t reclaimableSize() const { return _reclaimableSize; }
-    void setReclaimableSize(uint64_t size) { _reclaimableSize = size; }
+    uint64_t reclaimableSize() const { return _rest ? _rest->reclaimableSize : 0; }
+    void setReclaimableSize(uint64_t size) {
+        if (_rest || size != 0) rest().reclaimableSize = size;
+    }
     uint64_t swappedSize() const { return _swappedSize; }
     void setSwappedSize(uint64_t size) { _swappedSize = size; }
     // Clean resident bytes that were not brought in speculatively.
@@ -97,7 +102,7 @@ class HXMemoryRegion {
     void setCleanNonSpecSize(uint64_t size) { _cleanNonSpecSize = size; }
     uint64_t wiredSize() const { return _wired ? _size : 0; }
     HXSizes sizes() const {
-        return {_dirtySize, _swappedSize, _cleanNonSpecSize, _reclaimableSize, wiredSize()};
+        return {_dirtySize, _swappedSize, _cleanNonSpecSize, reclaimableSize(), wiredSize()};
     }
 
     // The region stands for pages of a mapping that one set of processes shares (`takePart`): an entry of
@@ -109,19 +114,21 @@ class HXMemoryRegion {
     // All of a mapping's bytes, its parts included.
     HXSizes listedSizes() const;
     // Of a part: see `takePart`.
-    HXSizes countedSizes() const { return {_sharedDirtySize, _sharedSwappedSize}; }
+    HXSizes countedSizes() const { return sharedSizes(); }
 
     // Identifier of the VM object; 0 when there is none.
     uint64_t object_id() const { return _object_id; }
     void setObject_id(uint64_t id) { _object_id = id; }
 
     // The region's page runs, where page queries split it; null otherwise. Exists only until the merge.
-    const HXRangeList *subrangeList() const { return _subrangeList.get(); }
+    const HXRangeList *subrangeList() const { return _rest ? _rest->subrangeList.get() : nullptr; }
     // Adds a run, located by its offset in the VM object.
     void addSubrange(HXRange range, const HXSizes &sizes, uint32_t pageSize);
-    void freeSubrangeList() { _subrangeList.reset(); }
+    void freeSubrangeList() { takeSubrangeList(); }
     // Hands the page runs over; the region has none afterwards.
-    std::unique_ptr<HXRangeList> takeSubrangeList() { return std::move(_subrangeList); }
+    std::unique_ptr<HXRangeList> takeSubrangeList() {
+        return _rest ? std::move(_rest->subrangeList) : nullptr;
+    }
 
     // Stands for owned memory that no mapping shows.
     bool isFake() const { return _user_tag == kFakeRegionTag; }
@@ -134,6 +141,22 @@ class HXMemoryRegion {
     static HXString categoryNameForTag(uint32_t tag);
 
   private:
+    // What few regions have.
+    struct Rest {
+        uint64_t reclaimableSize = 0;
+        // In parts; of a part, the bytes that count.
+        uint64_t sharedDirtySize = 0;
+        uint64_t sharedSwappedSize = 0;
+        std::unique_ptr<HXRangeList> subrangeList;
+    };
+    HXSizes sharedSizes() const {
+        return _rest ? HXSizes{_rest->sharedDirtySize, _rest->sharedSwappedSize} : HXSizes{};
+    }
+    Rest &rest() {
+        if (!_rest) _rest = std::make_unique<Rest>();
+        return *_rest;
+    }
+
     bool _wired : 1 = false;
     bool _inSharedCache : 1 = false;
     bool _unusedSharedCacheRegion : 1 = false;
@@ -145,19 +168,79 @@ class HXMemoryRegion {
     HXMemoryObject *_memoryObject = nullptr;
     HXString _name;
     HXString _detailedName;
-    std::unique_ptr<HXRangeList> _subrangeList;
+    std::unique_ptr<Rest> _rest;
     uint64_t _offset = 0;
     uint64_t _start = 0;
     uint64_t _size = 0;
     uint64_t _dirtySize = 0;
-    uint64_t _reclaimableSize = 0;
     uint64_t _swappedSize = 0;
     uint64_t _cleanNonSpecSize = 0;
     uint64_t _object_id = 0;
-    // In parts; of a part, the bytes that count.
-    uint64_t _sharedDirtySize = 0;
-    uint64_t _sharedSwappedSize = 0;
 };
 
 // A process's regions: their addresses stay as the list grows at its end.
-using HXMemoryRegionList = std::deque<HXMemoryRegion>;
+class HXMemoryRegionList {
+    template <typename List, typename Region>
+    class Iterator {
+      public:
+        using iterator_category = std::forward_iterator_tag;
+        using value_type = HXMemoryRegion;
+        using difference_type = std::ptrdiff_t;
+        using pointer = Region *;
+        using reference = Region &;
+
+        Iterator() = default;
+        Iterator(List &list, size_t index) : _list(&list), _index(index) {}
+        Region &operator*() const { return (*_list)[_index]; }
+        Region *operator->() const { return &**this; }
+        Iterator &operator++() {
+            _index++;
+            return *this;
+        }
+        Iterator operator++(int) { return {*_list, _index++}; }
+        bool operator==(const Iterator &) const = default;
+
+      private:
+        List *_list = nullptr;
+        size_t _index = 0;
+    };
+
+  public:
+    using value_type = HXMemoryRegion;
+    using iterator = Iterator<HXMemoryRegionList, HXMemoryRegion>;
+    using const_iterator = Iterator<const HXMemoryRegionList, const HXMemoryRegion>;
+
+    HXMemoryRegion &emplace_back() { return lastChunk().emplace_back(); }
+    HXMemoryRegion &emplace_back(HXMemoryRegion region) {
+        return lastChunk().emplace_back(std::move(region));
+    }
+    void push_back(HXMemoryRegion region) { emplace_back(std::move(region)); }
+    void pop_back() {
+        _chunks.back().pop_back();
+        if (_chunks.back().empty()) _chunks.pop_back();
+    }
+    size_t size() const {
+        return _chunks.empty() ? 0 : (_chunks.size() - 1) * kChunkSize + _chunks.back().size();
+    }
+    bool empty() const { return _chunks.empty(); }
+    HXMemoryRegion &operator[](size_t index) { return _chunks[index / kChunkSize][index % kChunkSize]; }
+    const HXMemoryRegion &operator[](size_t index) const {
+        return _chunks[index / kChunkSize][index % kChunkSize];
+    }
+    iterator begin() { return {*this, 0}; }
+    iterator end() { return {*this, size()}; }
+    const_iterator begin() const { return {*this, 0}; }
+    const_iterator end() const { return {*this, size()}; }
+
+  private:
+    static constexpr size_t kChunkSize = 32; // about as many as a small process has
+
+    // With room for one more.
+    std::vector<HXMemoryRegion> &lastChunk() {
+        if (_chunks.empty() || _chunks.back().size() == kChunkSize)
+            _chunks.emplace_back().reserve(kChunkSize);
+        return _chunks.back();
+    }
+
+    std::vector<std::vector<HXMemoryRegion>> _chunks; // none of them empty; a chunk stays where it is
+};
