@@ -92,6 +92,7 @@ GroupedObjects groupObjects(const HXHeft &heft, MemberSets &sets) {
         shownPids.insert(process->pid());
     GroupedObjects grouped;
     grouped.setOf.resize(heft.memoryObjects().size(), MemberSets::kEmpty);
+    grouped.order.reserve(heft.memoryObjects().size());
     for (const auto &process : heft.processes()) {
         for (const HXMemoryRegion &region : process->memoryRegions()) {
             const HXMemoryObject *object = region.memoryObject();
@@ -121,6 +122,9 @@ HXHeftSharingData HXHeft::_sharingData() const {
     const GroupedObjects grouped = groupObjects(*this, sets);
     HXHeftSharingData sharing;
     std::vector<std::pair<const HXProcessGroup *, HXHeftSharingData::Objects *>> bySet(sets.size());
+    std::vector<uint32_t> counts(sets.size());
+    for (const uint32_t set : grouped.setOf)
+        counts[set]++;
     for (const HXMemoryObject *object : grouped.order) {
         const uint32_t set = sets.unified(grouped.setOf[object->index()]);
         auto &[group, objects] = bySet[set];
@@ -128,6 +132,7 @@ HXHeftSharingData HXHeft::_sharingData() const {
             group = &sharing.groups.emplace_back(sets.members(set));
             indexGroupByProcess(*group, sharing);
             objects = &sharing.processGroupToObjects[group];
+            objects->reserve(counts[set]);
         }
         objects->push_back(object);
     }
