@@ -62,6 +62,13 @@ struct HXFamilyFigures {
     uint32_t resident = 0;
     uint32_t anonymous = 0;
     uint32_t swapped = 0;
+
+    HXFamilyFigures &operator+=(const HXFamilyFigures &other) {
+        resident += other.resident;
+        anonymous += other.anonymous;
+        swapped += other.swapped;
+        return *this;
+    }
 };
 
 // Where a page was met that lies at more than one place.

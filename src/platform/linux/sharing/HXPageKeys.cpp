@@ -99,6 +99,11 @@ std::atomic<uint64_t> &HXSeenKeys::Cursor::wordOf(HXPageKey key) {
     return known.words[(key & ((uint64_t{1} << kChunkShift) - 1)) / 64];
 }
 
+void HXSeenKeys::clear() {
+    const std::lock_guard lock(_mutex);
+    _chunks.clear();
+}
+
 std::atomic<uint64_t> *HXSeenKeys::chunk(uint64_t number) {
     const std::lock_guard lock(_mutex);
     auto &chunk = _chunks[number];

@@ -100,6 +100,9 @@ class HXSeenKeys {
         std::array<Known, 64> _known; // by the low bits of their numbers
     };
 
+    // Forgets all keys. No thread may have a way in.
+    void clear();
+
   private:
     static constexpr uint32_t kChunkShift = 18; // keys in a chunk: 1 GiB of frames of 4 KiB, in 32 KiB
     using Chunk = std::array<std::atomic<uint64_t>, (size_t{1} << kChunkShift) / 64>;

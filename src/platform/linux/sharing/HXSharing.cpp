@@ -52,6 +52,7 @@ struct HXSharing::Work {
     std::shared_ptr<HXFamily> family;
     std::vector<HXPageStretch> stretches;
     std::shared_ptr<std::vector<Slot>> slots;
+    std::atomic<size_t> unread = 0; // stretches
     std::shared_ptr<HXSeenKeys> repeated;
     std::optional<HXFamilyPages> pages;
     bool hasFailed = false;
@@ -227,6 +228,7 @@ void HXSharing::readPages(std::vector<std::shared_ptr<Work>> &families, bool isS
     std::vector<std::pair<std::shared_ptr<Work>, size_t>> items;
     for (const auto &work : families) {
         work->slots = std::make_shared<std::vector<Work::Slot>>(work->stretches.size());
+        work->unread = work->stretches.size();
         for (size_t i = 0; i < work->stretches.size(); i++)
             items.emplace_back(work, i);
     }
@@ -244,6 +246,8 @@ void HXSharing::readPages(std::vector<std::shared_ptr<Work>> &families, bool isS
         slot.pages = HXReadColumns({work->family, work->stretches[stretch], pageShift,
                                     isSecond ? work->repeated : nullptr, findsLazilyFreed},
                                    &slot.reading);
+        // The next family then takes the same memory.
+        if (--work->unread == 0) work->family->seen->clear();
     };
     const auto givenUp =
         forAll(items.size(), read, {"comparing pages", [&](size_t i) { return std::to_string(pidOf(i)); }});
