@@ -186,8 +186,11 @@ std::vector<task_held_object> HXLinuxPlatform::task_held_objects(mach_port_t por
 std::vector<task_held_object> HXLinuxPlatform::proc_held_objects(int32_t pid) {
     std::vector<task_held_object> held;
     (void)_turns.run([&] {
-        if (const auto process = pid > 0 ? _processes.open(pid) : std::nullopt)
-            held = _held.open(process->directory);
+        if (pid <= 0) return;
+        if (auto found = _held.open(_processes.openDirectory(pid)))
+            held = std::move(*found);
+        else if (const auto process = _processes.open(pid)) // maybe through another thread
+            held = _held.open(process->directory).value_or(held);
     });
     return held;
 }

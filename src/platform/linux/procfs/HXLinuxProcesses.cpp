@@ -97,7 +97,7 @@ HXDescriptor HXLinuxProcesses::openThread(int32_t pid, const HXDescriptor &leade
             return {};
     }
     for (const int32_t thread : threads) {
-        HXDescriptor directory = HXOpenAt(AT_FDCWD, pathOf(thread, "").c_str(), O_PATH | O_DIRECTORY);
+        HXDescriptor directory = openDirectory(thread);
         const auto stat = directory ? HXReadStat(directory) : std::nullopt;
         if (!stat || stat->isEnding()) continue;
         // The number may have gone to another process in between.
@@ -108,9 +108,13 @@ HXDescriptor HXLinuxProcesses::openThread(int32_t pid, const HXDescriptor &leade
     return {};
 }
 
+HXDescriptor HXLinuxProcesses::openDirectory(int32_t pid) const {
+    return HXOpenAt(AT_FDCWD, pathOf(pid, "").c_str(), O_PATH | O_DIRECTORY);
+}
+
 std::optional<HXOpenProcess> HXLinuxProcesses::open(int32_t pid) {
     const HXShortageWatch watch;
-    HXDescriptor directory = HXOpenAt(AT_FDCWD, pathOf(pid, "").c_str(), O_PATH | O_DIRECTORY);
+    HXDescriptor directory = openDirectory(pid);
     const auto stat = directory ? HXReadStat(directory) : std::nullopt;
     if (stat && stat->lacksLeader()) directory = openThread(pid, directory);
     if (stat && directory) return HXOpenProcess{std::move(directory), *stat};

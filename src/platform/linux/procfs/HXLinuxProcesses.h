@@ -38,6 +38,9 @@ class HXLinuxProcesses {
     // None with errno set: ESRCH, EACCES or EPERM, or EMFILE when descriptors or memory do not suffice.
     std::optional<HXOpenProcess> open(int32_t pid);
 
+    // Its directory alone, as it is; not open with errno set.
+    HXDescriptor openDirectory(int32_t pid) const;
+
     // The number of the running process here, which need not be the one that getpid(2) tells: /proc may be
     // that of another pid namespace (pid_namespaces(7)). -1 when the process is not in it.
     int32_t ownPid();

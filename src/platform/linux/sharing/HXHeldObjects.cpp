@@ -111,15 +111,18 @@ std::vector<task_held_object> HXHeldObjects::mapped(const HXDescriptor &process,
     return all;
 }
 
-std::vector<task_held_object> HXHeldObjects::open(const HXDescriptor &process) {
+std::optional<std::vector<task_held_object>> HXHeldObjects::open(const HXDescriptor &process) {
     std::vector<task_held_object> all;
     std::unordered_set<uint64_t> seen;
     const HXDescriptor descriptors = HXOpenAt(process, "fd", O_DIRECTORY);
-    if (!descriptors) return all;
+    if (!descriptors) return std::nullopt;
+    bool showsAny = false;
     bool knowsPlaces = false; // few processes have such descriptors
     HXForEachEntry(descriptors, [&](const char *name) {
+        if (*name == '.') return true;
+        showsAny = true;
         char buffer[PATH_MAX];
-        const auto link = *name == '.' ? std::nullopt : HXReadLink(descriptors, name, buffer);
+        const auto link = HXReadLink(descriptors, name, buffer);
         if (!link || !isNameless(*link)) return true;
         if (!std::exchange(knowsPlaces, true)) _places.learn(process);
         const auto mount = mountOf(process, name);
@@ -138,7 +141,7 @@ std::vector<task_held_object> HXHeldObjects::open(const HXDescriptor &process) {
         all.back().flags = TASK_HELD_OPEN;
         return true;
     });
-    return all;
+    return showsAny ? std::optional(std::move(all)) : std::nullopt;
 }
 
 std::vector<task_held_object> HXHeldObjects::ofKernel() {
