@@ -8,7 +8,9 @@
 
 #include <cctype>
 #include <cerrno>
+#include <memory>
 #include <system_error>
+#include <vector>
 
 namespace {
 
@@ -66,6 +68,12 @@ void gatherInterruptibly(HXHeft &heft) {
     services.signal(HX_SIGINT, HXSignalDisposition::byDefault);
 }
 
+// Never destroyed: the program ends with its report, and to give back each region first would only take time.
+HXHeft &keptUntilTheEnd(HXHeft::ProcessList targets) {
+    static auto &kept = *new std::vector<std::unique_ptr<HXHeft>>;
+    return *kept.emplace_back(std::make_unique<HXHeft>(std::move(targets)));
+}
+
 } // namespace
 
 int HXHeftMain(int argc, char *const argv[]) {
@@ -99,7 +107,7 @@ int HXHeftMain(int argc, char *const argv[]) {
         HXPlatform::current().services().signal(HX_SIGPIPE, HXSignalDisposition::ignored);
     }
 
-    HXHeft heft(std::move(*targets));
+    HXHeft &heft = keptUntilTheEnd(std::move(*targets));
     gatherInterruptibly(heft);
     HXOutputFormatterText text(args->summaryFormat(), args->textOptions(), args->textSort());
     heft.addOutputFormatter(text);

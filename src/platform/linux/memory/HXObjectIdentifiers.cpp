@@ -29,13 +29,6 @@ uint64_t newSeed() {
 
 } // namespace
 
-std::optional<uint32_t> HXNumberPool::take(uint32_t preferred) {
-    if (preferred < _limit && _given.insert(preferred).second) return preferred;
-    while (_next < _limit)
-        if (_given.insert(_next++).second) return _next - 1;
-    return std::nullopt;
-}
-
 size_t HXObjectIdentifiers::KeyHash::operator()(const Key &key) const {
     return mix(mix(mix(seed ^ static_cast<uint64_t>(key.kind) << 32 ^ key.device) ^ key.first) ^ key.second);
 }
@@ -44,23 +37,18 @@ size_t HXObjectIdentifiers::KeyHash::operator()(uint32_t number) const {
     return mix(seed ^ number);
 }
 
-HXObjectIdentifiers::HXObjectIdentifiers() : _processPool((1 << kProcessBits) - 1) {
-    const KeyHash hash{newSeed()};
-    for (uint32_t i = 0; i < kShards; i++) {
-        Shard &shard = _shards.emplace_back();
-        shard.given = std::unordered_map<uint32_t, Key, KeyHash>(0, hash);
-        shard.displaced = std::unordered_map<Key, uint32_t, KeyHash>(0, hash);
-    }
+HXObjectIdentifiers::HXObjectIdentifiers() : HXObjectIdentifiers(KeyHash{newSeed()}) {}
+
+HXObjectIdentifiers::HXObjectIdentifiers(KeyHash hash) : _processNumbers((1 << kProcessBits) - 1, hash) {
+    for (uint32_t i = 0; i < kShards; i++)
+        _shards.emplace_back(hash);
 }
 
 uint32_t HXObjectIdentifiers::numberOfProcess(int32_t pid) {
     const std::lock_guard lock(_processMutex);
-    const auto [entry, isNew] = _processNumbers.try_emplace(pid, 0);
-    if (!isNew) return entry->second;
-    const uint32_t preferred = static_cast<uint32_t>(pid) % ((1 << kProcessBits) - 1);
-    const auto number = _processPool.take(preferred);
-    entry->second = number ? *number + 1 : 0;
-    return entry->second;
+    const auto key = static_cast<uint32_t>(pid);
+    const auto number = _processNumbers.of(key, key % ((1 << kProcessBits) - 1));
+    return number ? *number + 1 : 0;
 }
 
 uint64_t HXObjectIdentifiers::interned(const Key &key) {
@@ -68,23 +56,12 @@ uint64_t HXObjectIdentifiers::interned(const Key &key) {
     const auto preferred = static_cast<uint32_t>(KeyHash{0}(key) >> 33);
     const uint32_t shardIndex = preferred % kShards;
     Shard &shard = _shards[shardIndex];
-    uint32_t number = preferred / kShards;
+    uint32_t number = 0;
     {
         const std::lock_guard lock(shard.mutex);
-        const bool isFree = number < kNumbers && shard.given.try_emplace(number, key).first->second == key;
-        if (!isFree) number = displacedNumber(shard, key);
+        number = shard.numbers.of(key, preferred / kShards).value_or(0); // more have room in no memory
     }
     return kHighBits | (kFirstLowBits + uint64_t{2} * (number * kShards + shardIndex));
-}
-
-// Of a key whose number another has. As many as there are have room in no memory.
-uint32_t HXObjectIdentifiers::displacedNumber(Shard &shard, const Key &key) {
-    const auto [entry, isNew] = shard.displaced.try_emplace(key, 0);
-    for (bool isFound = !isNew; !isFound && shard.next < kNumbers; shard.next++) {
-        isFound = shard.given.try_emplace(shard.next, key).second;
-        if (isFound) entry->second = shard.next;
-    }
-    return entry->second;
 }
 
 uint64_t HXObjectIdentifiers::of(const HXMapping &mapping, const HXMappingOwner &owner) {

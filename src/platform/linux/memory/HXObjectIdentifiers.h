@@ -18,7 +18,6 @@
 #include <mutex>
 #include <optional>
 #include <unordered_map>
-#include <unordered_set>
 
 // Whose a mapping is.
 struct HXMappingOwner {
@@ -27,17 +26,29 @@ struct HXMappingOwner {
     uint64_t ipcNamespace = 0;  // tells System V identifiers of different namespaces apart
 };
 
-// Numbers below `limit` of which each is given once.
-class HXNumberPool {
+// Numbers below `limit`, of which each key has its own. Nearly all have the one that they prefer.
+template <typename Key, typename Hash>
+class HXNumberTable {
   public:
-    explicit HXNumberPool(uint32_t limit = 0) : _limit(limit) {}
-    // `preferred` if it is free, else any that is; none when all are given. Takes no longer the more are.
-    std::optional<uint32_t> take(uint32_t preferred);
+    HXNumberTable(uint32_t limit, Hash hash) : _limit(limit), _given(0, hash), _displaced(0, hash) {}
+
+    // The key's number: from the first time it is asked for on `preferred`, if no other key has that, else
+    // any that is free; none when all are given. Takes no longer the more are.
+    std::optional<uint32_t> of(const Key &key, uint32_t preferred) {
+        if (preferred < _limit && _given.try_emplace(preferred, key).first->second == key) return preferred;
+        const auto [entry, isNew] = _displaced.try_emplace(key, _limit);
+        for (bool isFound = !isNew; !isFound && _next < _limit; _next++) {
+            isFound = _given.try_emplace(_next, key).second;
+            if (isFound) entry->second = _next;
+        }
+        return entry->second < _limit ? std::optional(entry->second) : std::nullopt;
+    }
 
   private:
-    uint32_t _limit;
-    uint32_t _next = 0; // all below have been given
-    std::unordered_set<uint32_t> _given;
+    const uint32_t _limit;
+    uint32_t _next = 0;                             // all below have been given
+    std::unordered_map<uint32_t, Key, Hash> _given; // by number
+    std::unordered_map<Key, uint32_t, Hash> _displaced;
 };
 
 // Any thread.
@@ -79,24 +90,21 @@ class HXObjectIdentifiers {
         size_t operator()(const Key &key) const;
         size_t operator()(uint32_t number) const;
     };
-    // Keys are spread by the number that they prefer, and so each shard has numbers of its own. Nearly all
-    // have the one that they prefer.
-    struct Shard {
-        std::mutex mutex;
-        std::unordered_map<uint32_t, Key, KeyHash> given; // by number
-        std::unordered_map<Key, uint32_t, KeyHash> displaced;
-        uint32_t next = 0; // all below have been given
-    };
     static constexpr uint32_t kShards = 64;
     // Where the lower bits of the table's identifiers begin, behind what the kernel's own have there.
     static constexpr uint32_t kFirstLowBits = 1 << 16;
     static constexpr uint32_t kNumbers = ((uint32_t{1} << 31) - kFirstLowBits / 2) / kShards; // of a shard
+    // Keys are spread by the number that they prefer, and so each shard has numbers of its own.
+    struct Shard {
+        explicit Shard(KeyHash hash) : numbers(kNumbers, hash) {}
+        std::mutex mutex;
+        HXNumberTable<Key, KeyHash> numbers;
+    };
 
+    explicit HXObjectIdentifiers(KeyHash hash);
     uint64_t interned(const Key &key);
-    static uint32_t displacedNumber(Shard &shard, const Key &key);
 
     std::deque<Shard> _shards;
     std::mutex _processMutex;
-    std::unordered_map<int32_t, uint32_t> _processNumbers;
-    HXNumberPool _processPool;
+    HXNumberTable<uint32_t, KeyHash> _processNumbers; // by pid
 };
