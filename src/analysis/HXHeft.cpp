@@ -86,7 +86,7 @@ void HXHeft::gatherData() {
     _buildProcessToHeftMap();
 }
 
-// Growing a map step by step would leave every smaller table behind.
+// Growing a map step by step would move every entry several times.
 void HXHeft::reserveMaps() {
     size_t regions = 0;
     for (const auto &process : _processes)

@@ -73,7 +73,7 @@ class HXHeft : public HXHeftSwitches {
     const HXMemoryObjects &memoryObjects() const { return _objects; }
 
   private:
-    // Where a region's object is found; without a map it shares with nothing.
+    // Where a region's object is found; without a map the region shares with nothing.
     struct Place {
         HXMemoryRegion *region = nullptr;
         HXObjectMap *map = nullptr;

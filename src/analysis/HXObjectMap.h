@@ -1,7 +1,7 @@
 // What merging looks memory objects up in.
 #pragma once
 
-#include <algorithm>
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <utility>
@@ -10,7 +10,8 @@
 class HXMemoryObject;
 
 // Objects by key, which is never 0. Only grows. The entries lie side by side (open addressing), so that a
-// lookup waits for memory once, or not at all if it was announced some lookups before.
+// lookup waits for memory once, or not at all if it was announced some lookups before. Where a key belongs is
+// different in each map: a program that chooses its addresses chooses keys.
 class HXObjectMap {
   public:
     // Makes room for so many keys at once.
@@ -46,8 +47,15 @@ class HXObjectMap {
 
     // A key's low bits tell little: object identifiers are often numbered or aligned.
     size_t placeOf(uint64_t key) const {
-        const uint64_t hash = ((key ^ (key >> 32)) * 0x9E3779B97F4A7C15) >> 32;
+        const uint64_t product = (key ^ (key >> 32)) * _multiplier;
+        const uint64_t hash = ((product ^ (product >> 32)) * 0x9E3779B97F4A7C15) >> 32;
         return static_cast<size_t>((hash * _entries.size()) >> 32);
+    }
+
+    // Odd, and known to nobody before: to the nanosecond, where time is told so.
+    static uint64_t newMultiplier() {
+        const auto now = std::chrono::steady_clock::now().time_since_epoch().count();
+        return (static_cast<uint64_t>(now) * 0xBF58476D1CE4E5B9) | 1;
     }
 
     // That of the key, or the free one where it belongs.
@@ -64,6 +72,7 @@ class HXObjectMap {
             if (entry.key != 0) entryOf(entry.key) = entry;
     }
 
+    const uint64_t _multiplier = newMultiplier();
     std::vector<Entry> _entries;
     size_t _count = 0;
 };

@@ -74,14 +74,14 @@ void HXMemoryObject::addToRegions(HXMemoryRegion &region, const HXRegionOwner *p
     _containsFakeRegion = _containsFakeRegion || region.isFake();
     if (!_first) {
         _first = &region;
-        _isFirstOfProcess = process && canDifferByProcess(region);
+        _isFirstByProcess = process && canDifferByProcess(region);
         if (process) _firstPid = process->pid();
         return;
     }
     auto &[regions, byProcess, rangeList, onlyRun] = more();
     if (regions.empty()) {
         regions.push_back(_first);
-        if (_isFirstOfProcess) byProcess.push_back({_firstPid, _first});
+        if (_isFirstByProcess) byProcess.push_back({_firstPid, _first});
     }
     regions.push_back(&region);
     if (process && (canDifferByProcess(region) || (!byProcess.empty() && region.object_id() != 0)))
@@ -93,8 +93,8 @@ void HXMemoryObject::addRuns(HXMemoryRegion &region, uint32_t pageSize) {
         _sizes += region.countedSizes();
         return;
     }
-    if (_onlyRunPageWidth == 0) {
-        _onlyRunPageWidth = static_cast<uint8_t>(std::bit_width(pageSize));
+    if (_runPageWidth == 0) {
+        _runPageWidth = static_cast<uint8_t>(std::bit_width(pageSize));
         if (auto runs = region.takeSubrangeList())
             more().rangeList = std::move(runs);
         else if (&region != _first)
@@ -104,7 +104,7 @@ void HXMemoryObject::addRuns(HXMemoryRegion &region, uint32_t pageSize) {
     auto &runs = more().rangeList;
     if (!runs) {
         runs = std::make_unique<HXRangeList>();
-        runs->addRegion(*onlyRun(), uint32_t{1} << (_onlyRunPageWidth - 1));
+        runs->addRegion(*onlyRun(), uint32_t{1} << (_runPageWidth - 1));
     }
     runs->addRegion(region, pageSize);
     region.freeSubrangeList();
@@ -117,10 +117,10 @@ const HXMemoryRegion *HXMemoryObject::onlyRun() const {
 
 HXSizes HXMemoryObject::sumOfRuns() const {
     if (_more && _more->rangeList) return _more->rangeList->sum();
-    return _onlyRunPageWidth != 0 ? onlyRun()->sizes() : HXSizes{};
+    return _runPageWidth != 0 ? onlyRun()->sizes() : HXSizes{};
 }
 
-// The regions of each process, where they are sorted by pid.
+// Calls `each` with the regions of every process; `all` is sorted by pid.
 template <typename Each>
 void HXMemoryObject::forEachProcess(std::span<const ProcessRegion> all, Each each) {
     for (size_t first = 0, next = 0; first < all.size(); first = next) {
@@ -163,11 +163,11 @@ void HXMemoryObject::finalize() {
         auto &byProcess = _more->processMemoryRegions;
         std::stable_sort(byProcess.begin(), byProcess.end(), byPid);
         raiseToLargestProcess(byProcess);
-        if (!processRegionsTellMore()) byProcess = {};
+        if (!processRegionsTellMore()) byProcess = std::vector<ProcessRegion>(); // and gives the memory back
         _more->rangeList.reset();
     } else {
         const ProcessRegion only = {_firstPid, _first};
-        if (_isFirstOfProcess) raiseToLargestProcess({&only, 1});
+        if (_isFirstByProcess) raiseToLargestProcess({&only, 1});
         _more.reset();
     }
     if (_containsFakeRegion) nameFakeRegions();

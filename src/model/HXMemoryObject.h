@@ -81,7 +81,7 @@ class HXMemoryObject {
         std::vector<HXMemoryRegion *> regions; // all, from the second region on
         std::vector<ProcessRegion> processMemoryRegions;
         std::unique_ptr<HXRangeList> rangeList;  // the merged page runs, from the second run to finalisation
-        const HXMemoryRegion *onlyRun = nullptr; // null: the first region
+        const HXMemoryRegion *onlyRun = nullptr; // while there is no range list; null: the first region
     };
     More &more() {
         if (!_more) _more = std::make_unique<More>();
@@ -94,8 +94,8 @@ class HXMemoryObject {
     int32_t _firstPid = 0;
     int32_t _ownerPid = kNoOwner;
     uint32_t _index = 0;
-    uint8_t _onlyRunPageWidth = 0;      // in bits; 0: there is no run yet
-    bool _isFirstOfProcess : 1 = false; // that of _firstPid
+    uint8_t _runPageWidth = 0;          // of the first run: how many bits its page size has; 0: no run yet
+    bool _isFirstByProcess : 1 = false; // the first region counts among those of its process, _firstPid
     bool _containsFakeRegion : 1 = false;
     bool _accurateSizes : 1 = false; // finalised
 };

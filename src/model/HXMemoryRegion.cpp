@@ -76,14 +76,13 @@ void HXMemoryRegion::addSubrange(HXRange range, const HXSizes &sizes, uint32_t p
 }
 
 HXMemoryRegion HXMemoryRegion::takePart(uint64_t id, const HXSizes &part, const HXSizes &counted) {
-    const auto take = [](uint64_t *own, uint64_t *shared, uint64_t wanted) {
+    const auto take = [this](uint64_t *own, uint64_t Rest::*shared, uint64_t wanted) {
         const uint64_t taken = std::min(*own, wanted);
         *own -= taken;
-        *shared += taken;
+        if (taken != 0) rest().*shared += taken;
         return taken;
     };
     HXMemoryRegion taken;
-    Rest &own = rest(), &its = taken.rest();
     taken._isPart = true;
     taken._segment = HXSegmentNoImage;
     taken._share_mode = SM_SHARED;
@@ -92,11 +91,15 @@ HXMemoryRegion HXMemoryRegion::takePart(uint64_t id, const HXSizes &part, const 
     taken._detailedName = _detailedName;
     taken._start = _start;
     taken._object_id = id;
-    taken._dirtySize = take(&_dirtySize, &own.sharedDirtySize, part.dirty);
-    taken._swappedSize = take(&_swappedSize, &own.sharedSwappedSize, part.swapped);
+    taken._dirtySize = take(&_dirtySize, &Rest::sharedDirtySize, part.dirty);
+    taken._swappedSize = take(&_swappedSize, &Rest::sharedSwappedSize, part.swapped);
     taken._size = taken.sizes().heft();
-    its.sharedDirtySize = std::min(counted.dirty, taken._dirtySize);
-    its.sharedSwappedSize = std::min(counted.swapped, taken._swappedSize);
+    const uint64_t dirty = std::min(counted.dirty, taken._dirtySize);
+    const uint64_t swapped = std::min(counted.swapped, taken._swappedSize);
+    if ((dirty | swapped) != 0) {
+        taken.rest().sharedDirtySize = dirty;
+        taken.rest().sharedSwappedSize = swapped;
+    }
     return taken;
 }
 

@@ -32,3 +32,23 @@ TEST(HXMemoryRegionTest, IsWhatItsTableSays) {
     for (size_t i = 0; i < tables.size(); i++)
         EXPECT_EQ(HXAnswered(tables[i].input, answers[i]), tables[i].input) << tables[i].title;
 }
+
+TEST(HXMemoryRegionTest, StaysWhereItIsInItsList) {
+    HXMemoryRegionList list;
+    std::vector<const HXMemoryRegion *> places;
+    for (uint64_t i = 0; i < 100; i++) {
+        HXMemoryRegion region;
+        region.setStart(i);
+        places.push_back(&list.emplace_back(std::move(region)));
+        list.emplace_back();
+        list.pop_back(); // also where it was alone in its piece
+    }
+    const HXMemoryRegionList moved = std::move(list);
+    ASSERT_EQ(moved.size(), places.size());
+    uint64_t i = 0;
+    for (const HXMemoryRegion &region : moved) {
+        EXPECT_EQ(&region, places[i]);
+        EXPECT_EQ(region.start(), i++);
+    }
+    EXPECT_EQ(i, places.size());
+}

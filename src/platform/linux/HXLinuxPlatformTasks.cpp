@@ -186,11 +186,11 @@ std::vector<task_held_object> HXLinuxPlatform::task_held_objects(mach_port_t por
 std::vector<task_held_object> HXLinuxPlatform::proc_held_objects(int32_t pid) {
     std::vector<task_held_object> held;
     (void)_turns.run([&] {
-        if (pid <= 0) return;
-        if (auto found = _held.open(_processes.openDirectory(pid)))
-            held = std::move(*found);
-        else if (const auto process = _processes.open(pid)) // maybe through another thread
-            held = _held.open(process->directory).value_or(held);
+        auto found = pid > 0 ? _held.open(_processes.openDirectory(pid)) : std::nullopt;
+        // Another thread shows them where the leading one has ended.
+        if (const auto process = pid > 0 && !found ? _processes.open(pid) : std::nullopt)
+            if (process->stat.lacksLeader()) found = _held.open(process->directory);
+        held = found ? std::move(*found) : std::vector<task_held_object>();
     });
     return held;
 }

@@ -2,17 +2,24 @@
 
 #include <sched.h>
 
+#include <chrono>
+
 namespace {
 
 void giveWayBeforeReading(size_t length) {
-    constexpr size_t much = 8192; // the files of a few figures are read with less
+    constexpr size_t much = 8192; // a file of few figures is read with less
     if (length > much) HXGiveWay();
 }
 
 } // namespace
 
 void HXGiveWay() {
+    using Clock = std::chrono::steady_clock;
+    constexpr std::chrono::milliseconds turn(1); // whoever comes instead has some
+    thread_local Clock::time_point last;
+    if (Clock::now() - last < turn) return;
     ::sched_yield();
+    last = Clock::now();
 }
 
 void HXDescriptor::reset(int descriptor) {

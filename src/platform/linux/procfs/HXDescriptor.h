@@ -10,8 +10,8 @@
 #include <utility>
 
 // Before what takes the kernel long, such as a walk of page tables or a look at many pages: lets those run
-// who wait for this processor (sched_yield(2)). The scheduler would let them wait for its next tick, some
-// milliseconds. Costs a third of a microsecond where nobody waits.
+// who wait for this processor (sched_yield(2)), once a millisecond. The scheduler would let them wait for its
+// next tick, some milliseconds. More often would be too polite: each of them has a turn of milliseconds.
 void HXGiveWay();
 
 class HXDescriptor {

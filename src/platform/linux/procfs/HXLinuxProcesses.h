@@ -38,7 +38,7 @@ class HXLinuxProcesses {
     // None with errno set: ESRCH, EACCES or EPERM, or EMFILE when descriptors or memory do not suffice.
     std::optional<HXOpenProcess> open(int32_t pid);
 
-    // Its directory alone, as it is; not open with errno set.
+    // The directory of `pid` alone, whatever has become of its leading thread; not open with errno set.
     HXDescriptor openDirectory(int32_t pid) const;
 
     // The number of the running process here, which need not be the one that getpid(2) tells: /proc may be

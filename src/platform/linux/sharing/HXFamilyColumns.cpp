@@ -81,7 +81,6 @@ class ColumnReader {
         size_t range = 0;         // the first of its ranges that ends behind the window's start
         uint64_t nothingUpTo = 0; // before this page there is none, as far as is known
         bool isInWindow = false;
-        HXFamilyFigures figures = {}; // of its mapping in the current strip
     };
 
     // The first active row of the strip, as it was read.
