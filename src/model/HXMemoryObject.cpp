@@ -45,6 +45,11 @@ HXSizes sizesOfView(std::span<const ProcessRegion> regions, const HXRegionOwner 
 
 } // namespace
 
+HXSizes HXMemoryObject::sizes() const {
+    if (_hasSizesOfFirst) return _first->sizes();
+    return _more ? _more->sizes : HXSizes{};
+}
+
 std::span<HXMemoryRegion *const> HXMemoryObject::memoryRegions() const {
     if (_more && !_more->regions.empty()) return _more->regions;
     return {&_first, _first ? 1U : 0U};
@@ -78,7 +83,8 @@ void HXMemoryObject::addToRegions(HXMemoryRegion &region, const HXRegionOwner *p
         if (process) _firstPid = process->pid();
         return;
     }
-    auto &[regions, byProcess, rangeList, onlyRun] = more();
+    auto &regions = more().regions;
+    auto &byProcess = _more->processMemoryRegions;
     if (regions.empty()) {
         regions.push_back(_first);
         if (_isFirstByProcess) byProcess.push_back({_firstPid, _first});
@@ -90,7 +96,7 @@ void HXMemoryObject::addToRegions(HXMemoryRegion &region, const HXRegionOwner *p
 
 void HXMemoryObject::addRuns(HXMemoryRegion &region, uint32_t pageSize) {
     if (region.isPart()) {
-        _sizes += region.countedSizes();
+        more().sizes += region.countedSizes();
         return;
     }
     if (_runPageWidth == 0) {
@@ -137,38 +143,43 @@ bool HXMemoryObject::isMadeOfParts() const {
 
 // With the kernel's charge for each region, an object holds at least what any one process is charged for it.
 // So does one of pages that all its processes share.
-void HXMemoryObject::raiseToLargestProcess(std::span<const ProcessRegion> all) {
+void HXMemoryObject::raiseToLargestProcess(std::span<const ProcessRegion> all, HXSizes *sizes) const {
     if (!isMadeOfParts() && !HXHeftSwitches::breakDownPhysHeft()) return;
-    forEachProcess(all, [this](std::span<const ProcessRegion> regions) {
+    forEachProcess(all, [&](std::span<const ProcessRegion> regions) {
         const HXSizes charged = sumOfRegions(regions);
-        _sizes.dirty = std::max(_sizes.dirty, charged.dirty);
-        _sizes.swapped = std::max(_sizes.swapped, charged.swapped);
+        sizes->dirty = std::max(sizes->dirty, charged.dirty);
+        sizes->swapped = std::max(sizes->swapped, charged.swapped);
     });
 }
 
-bool HXMemoryObject::processRegionsTellMore() const {
+bool HXMemoryObject::processRegionsTellMore(const HXSizes &sizes) const {
     size_t processes = 0;
     bool anyDiffers = false;
     forEachProcess(processMemoryRegions(), [&](std::span<const ProcessRegion> regions) {
         processes++;
-        anyDiffers = anyDiffers || regions.size() > 1 || regions.front().region->sizes() != _sizes;
+        anyDiffers = anyDiffers || regions.size() > 1 || regions.front().region->sizes() != sizes;
     });
     return processes >= 2 && anyDiffers;
 }
 
 void HXMemoryObject::finalize() {
     HXRequire(!_accurateSizes, "HXMemoryObject finalize", "!_accurateSizes");
-    _sizes += sumOfRuns();
+    HXSizes sizes = this->sizes();
+    sizes += sumOfRuns();
     if (memoryRegions().size() > 1) {
         auto &byProcess = _more->processMemoryRegions;
         std::stable_sort(byProcess.begin(), byProcess.end(), byPid);
-        raiseToLargestProcess(byProcess);
-        if (!processRegionsTellMore()) byProcess = std::vector<ProcessRegion>(); // and gives the memory back
+        raiseToLargestProcess(byProcess, &sizes);
+        if (!processRegionsTellMore(sizes))
+            byProcess = std::vector<ProcessRegion>(); // and gives the memory back
         _more->rangeList.reset();
+        _more->sizes = sizes;
     } else {
         const ProcessRegion only = {_firstPid, _first};
-        if (_isFirstByProcess) raiseToLargestProcess({&only, 1});
+        if (_isFirstByProcess) raiseToLargestProcess({&only, 1}, &sizes);
         _more.reset();
+        _hasSizesOfFirst = _first && sizes == _first->sizes();
+        if (!_hasSizesOfFirst && sizes != HXSizes{}) more().sizes = sizes;
     }
     if (_containsFakeRegion) nameFakeRegions();
     _accurateSizes = true;
@@ -204,7 +215,7 @@ std::span<const HXMemoryObject::ProcessRegion> HXMemoryObject::regionsOfProcess(
 
 HXMemoryObjectView HXMemoryObject::wholeView() const {
     HXRequire(_accurateSizes, "HXMemoryObject view", "_accurateSizes");
-    return {{_sizes, static_cast<uint32_t>(memoryRegions().size())}};
+    return {{sizes(), static_cast<uint32_t>(memoryRegions().size())}};
 }
 
 HXMemoryObjectView HXMemoryObject::viewForProcess(const HXRegionOwner &process) const {
@@ -216,7 +227,7 @@ HXMemoryObjectView HXMemoryObject::viewForProcess(const HXRegionOwner &process) 
     }
     if (_ownerPid != kNoOwner && _ownerPid != process.pid()) {
         // The charge of the whole object is its owner's: to others its dirty and swapped bytes are clean.
-        view.clean += _sizes.heft();
+        view.clean += sizes().heft();
         view.dirty = 0;
         view.swapped = 0;
         view.isWhole = false;

@@ -34,7 +34,7 @@ class HXMemoryObject {
     HXMemoryObject &operator=(const HXMemoryObject &) = delete;
 
     // Final once the object is finalised.
-    const HXSizes &sizes() const { return _sizes; }
+    HXSizes sizes() const;
     // In the order in which they were added.
     std::span<HXMemoryRegion *const> memoryRegions() const;
     // Pid of the owner, or kNoOwner.
@@ -69,15 +69,16 @@ class HXMemoryObject {
     const HXMemoryRegion *onlyRun() const;
     HXSizes sumOfRuns() const;
     bool isMadeOfParts() const;
-    void raiseToLargestProcess(std::span<const ProcessRegion> all);
-    bool processRegionsTellMore() const;
+    void raiseToLargestProcess(std::span<const ProcessRegion> all, HXSizes *sizes) const;
+    bool processRegionsTellMore(const HXSizes &sizes) const;
     void nameFakeRegions();
     template <typename Each>
     static void forEachProcess(std::span<const ProcessRegion> all, Each each);
     std::span<const ProcessRegion> regionsOfProcess(int32_t pid) const;
 
-    // What most objects do without, having one region.
+    // What most objects do without, having one region and its sizes.
     struct More {
+        HXSizes sizes;                         // until finalisation what counts of parts alone
         std::vector<HXMemoryRegion *> regions; // all, from the second region on
         std::vector<ProcessRegion> processMemoryRegions;
         std::unique_ptr<HXRangeList> rangeList;  // the merged page runs, from the second run to finalisation
@@ -88,7 +89,6 @@ class HXMemoryObject {
         return *_more;
     }
 
-    HXSizes _sizes;
     HXMemoryRegion *_first = nullptr;
     std::unique_ptr<More> _more;
     int32_t _firstPid = 0;
@@ -97,5 +97,6 @@ class HXMemoryObject {
     uint8_t _runPageWidth = 0;          // of the first run: how many bits its page size has; 0: no run yet
     bool _isFirstByProcess : 1 = false; // the first region counts among those of its process, _firstPid
     bool _containsFakeRegion : 1 = false;
-    bool _accurateSizes : 1 = false; // finalised
+    bool _hasSizesOfFirst : 1 = false; // then there is no more
+    bool _accurateSizes : 1 = false;   // finalised
 };
