@@ -433,6 +433,11 @@ std::vector<HXPageStretch> HXStretchesOfFamily(const HXFamily &family) {
     return stretches;
 }
 
+// Longer ones are mostly what lies between mappings.
+uint64_t HXCostOfStretch(const HXFamily &family, const HXPageStretch &stretch) {
+    return std::min(stretch.end - stretch.first, kWindowPages) * family.members.size();
+}
+
 std::unique_ptr<HXFamilyPages> HXReadColumns(const HXColumnRequest &request, std::atomic<uint32_t> *reading) {
     return ColumnReader(request, reading).read();
 }

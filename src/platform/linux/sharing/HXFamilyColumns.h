@@ -17,6 +17,9 @@ struct HXPageStretch {
 // Stretches that together hold all ranges of the family and can be read side by side; a page lies in one.
 std::vector<HXPageStretch> HXStretchesOfFamily(const HXFamily &family);
 
+// How long it takes to read one, compared with others.
+uint64_t HXCostOfStretch(const HXFamily &family, const HXPageStretch &stretch);
+
 struct HXColumnRequest {
     std::shared_ptr<const HXFamily> family;
     HXPageStretch stretch;

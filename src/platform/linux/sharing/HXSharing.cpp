@@ -112,6 +112,7 @@ std::vector<size_t> HXSharing::forAll(size_t count, std::function<void(size_t)> 
     HXDispatchQueue queue = services.dispatch_queue_create("org.heft.sharing", QOS_CLASS_UTILITY);
     queue.activity = activity.text;
     queue.processOf = activity.processOf;
+    queue.costOf = activity.costOf;
     return services.dispatch_apply(count, queue, std::move(work));
 }
 
@@ -190,8 +191,9 @@ void HXSharing::readAddressSpaces(std::vector<Tasks> &families) {
                        findsLazilyFreed = _findsLazilyFreed](size_t i) {
         all[i]->withDescriptors([&] { all[i]->readForSharing(*reader, needsDirtyPages, findsLazilyFreed); });
     };
-    const auto givenUp = forAll(
-        all.size(), read, {"reading processes", [&all](size_t i) { return std::to_string(all[i]->pid()); }});
+    const auto givenUp =
+        forAll(all.size(), read,
+               {"reading processes", [&all](size_t i) { return std::to_string(all[i]->pid()); }, nullptr});
     for (const size_t i : givenUp) {
         _unanswering.insert(all[i]->pid());
         for (Tasks &family : families)
@@ -249,8 +251,12 @@ void HXSharing::readPages(std::vector<std::shared_ptr<Work>> &families, bool isS
         // The next family then takes the same memory.
         if (--work->unread == 0) work->family->seen->clear();
     };
-    const auto givenUp =
-        forAll(items.size(), read, {"comparing pages", [&](size_t i) { return std::to_string(pidOf(i)); }});
+    const auto costOf = [&items](size_t i) {
+        const auto &[work, stretch] = items[i];
+        return HXCostOfStretch(*work->family, work->stretches[stretch]);
+    };
+    const auto givenUp = forAll(
+        items.size(), read, {"comparing pages", [&](size_t i) { return std::to_string(pidOf(i)); }, costOf});
     for (const size_t i : givenUp) {
         items[i].first->hasFailed = true;
         _unanswering.insert(pidOf(i));

@@ -47,6 +47,7 @@ class HXSharing {
     struct Activity {
         std::string text;
         std::function<std::string(size_t)> processOf;
+        std::function<uint64_t(size_t)> costOf;
     };
     std::vector<size_t> forAll(size_t count, std::function<void(size_t)> work, const Activity &activity = {});
     void readAddressSpaces(std::vector<Tasks> &families);
