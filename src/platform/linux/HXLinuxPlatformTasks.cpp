@@ -12,6 +12,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <utility>
 
 namespace {
 
@@ -185,12 +186,14 @@ std::vector<task_held_object> HXLinuxPlatform::task_held_objects(mach_port_t por
 
 std::vector<task_held_object> HXLinuxPlatform::proc_held_objects(int32_t pid) {
     std::vector<task_held_object> held;
+    if (pid <= 0) return held;
     (void)_turns.run([&] {
-        auto found = pid > 0 ? _held.open(_processes.openDirectory(pid)) : std::nullopt;
-        // Another thread shows them where the leading one has ended.
-        if (const auto process = pid > 0 && !found ? _processes.open(pid) : std::nullopt)
-            if (process->stat.lacksLeader()) found = _held.open(process->directory);
-        held = found ? std::move(*found) : std::vector<task_held_object>();
+        auto found = _held.open(_processes.openDirectory(pid));
+        if (!found) { // another thread shows them where the leading one has ended
+            const auto process = _processes.open(pid);
+            if (process && process->stat.lacksLeader()) found = _held.open(process->directory);
+        }
+        held = std::move(found).value_or(std::vector<task_held_object>());
     });
     return held;
 }
