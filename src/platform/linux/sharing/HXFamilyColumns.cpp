@@ -19,6 +19,9 @@ constexpr uint64_t kSparseWindowPages = 512, kEntriesOfSparsePage = 64;
 // So much memory is taken for the entries of a window: those of a large family are shorter.
 constexpr uint64_t kWindowEntries = uint64_t{1} << 19;
 constexpr size_t kSetsOfStretch = size_t{1} << 15;
+// So many entries are compared at once: a row's differences are kept in one word.
+constexpr size_t kPiecePages = 512;
+static_assert(kWindowPages / kPiecePages <= 64);
 
 // Groups the members of a column by what they hold. Used again for each column: entries of earlier ones are
 // told by their stamp.
@@ -81,28 +84,38 @@ class ColumnReader {
         size_t range = 0;         // the first of its ranges that ends behind the window's start
         uint64_t nothingUpTo = 0; // before this page there is none, as far as is known
         bool isInWindow = false;
+        size_t from = 0, to = 0; // places in the window: what was read
+        uint64_t alike = 0;      // by piece: whether that is what the reference holds there
     };
 
-    // The first active row of the strip, as it was read.
-    struct First {
-        bool isFile = false;
-        std::vector<uint64_t> entries;
-        std::vector<HXFamilyFigures> figures; // of each piece
+    // Of the window, within one strip. The base is the strip's first active member.
+    struct Piece {
+        size_t place, end;
+        HXFamilyFigures figures; // of the base
     };
-    static constexpr size_t kPiecePages = 512;
 
     void readWindow(uint64_t first, uint64_t end);
     void readRow(uint32_t member, uint64_t first, uint64_t end);
+    void keepRow(uint32_t member);
     void skipHole(uint32_t member, uint64_t from);
     uint64_t nextPage(uint64_t from);
     void countStrip(uint64_t first, uint64_t end);
     HXFamilyFigures takeEntries(std::span<uint64_t> entries, bool isFile) const;
-    void takeRow(uint32_t member, const HXFamilyRange &range, size_t pages);
-    void countColumn(size_t page);
+    HXFamilyFigures takeBase(uint32_t member, bool isFile);
+    HXFamilyFigures takeRow(uint32_t member, bool isFile, bool baseIsFile);
+    void countColumn(size_t piece, size_t place);
     void countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t sharers);
     void endStrip();
     void findLazilyFreed();
-    uint64_t *row(uint32_t member) { return _entries.data() + member * _stride; }
+    uint64_t *row(uint32_t member) { return _entries.data() + (kOwnRows + member) * _stride; }
+    // As they were read.
+    const uint64_t *entriesAt(uint32_t member, size_t place) {
+        const bool isKept = (_rows[member].alike >> place / kPiecePages & 1) == 0;
+        return (isKept ? row(member) : _reference) + place;
+    }
+    uint64_t *bits(std::vector<uint64_t> &ofPieces, size_t piece) {
+        return ofPieces.data() + piece * _allBits.size();
+    }
     const std::vector<HXFamilyRange> &ranges(uint32_t member) const { return _family.members[member].ranges; }
 
     const HXColumnRequest &_request;
@@ -110,9 +123,16 @@ class ColumnReader {
     std::atomic<uint32_t> &_reading;
     const uint32_t _memberCount;
     const uint64_t _windowPages, _stride;
-    const std::span<uint64_t> _entries; // of the window, then what they tell: keys
-    std::vector<uint64_t> _differs;     // by page of the strip: not 0 where the active rows are not equal
-    First _first;
+    // Of the window. Most rows of a family are alike, entry by entry: each is read into the same memory,
+    // which stays in the processor's cache, and only what differs from the first one's is kept.
+    static constexpr size_t kOwnRows = 3;
+    const std::span<uint64_t> _entries; // the rows of the next line, then those of members
+    uint64_t *const _reference, *const _scratch, *const _keys; // the first row, the one just read, the bases'
+    std::optional<uint32_t> _referenceMember;
+    std::vector<Piece> _pieces;
+    std::vector<uint64_t> _same,
+        _own; // by piece, a bit for each active member: holds the base's keys, or its own
+    std::vector<uint64_t> _differs; // by place: not 0 where the active rows are not equal
     std::vector<Row> _rows;
     std::vector<uint32_t> _active;                 // members with a mapping in the strip
     std::vector<uint64_t> _allBits;                // of these
@@ -120,7 +140,7 @@ class ColumnReader {
     std::vector<uint32_t> _layout;                 // of the strip, then of the last that was counted
     uint64_t _windowStart = 0, _windowLength = 0;  // pages
     uint64_t _windowEntries = 0, _windowFound = 0; // read, and of these such as tell a page
-    size_t _stripOffset = 0;                       // of the strip in the window
+    size_t _stripPiece = 0;                        // the strip's first
     uint32_t _layoutNumber = HXFamilyPages::kNoMapping;
     std::unordered_map<uint32_t, HXPageCount> _counts; // of the layout, by set
     uint32_t _lastSet = HXSharerSets::kNone;
@@ -153,8 +173,9 @@ ColumnReader::ColumnReader(const HXColumnRequest &request, std::atomic<uint32_t>
     : _request(request), _family(*request.family), _reading(*reading),
       _memberCount(static_cast<uint32_t>(_family.members.size())), _windowPages(windowPagesFor(_memberCount)),
       // Rows that lie a power of two apart would fight for the same lines of the processor's cache.
-      _stride(_windowPages + 8), _entries(roomForEntries(_stride * _memberCount)), _differs(_windowPages),
-      _rows(_memberCount), _allBits((_memberCount + 63) / 64),
+      _stride(_windowPages + 8), _entries(roomForEntries(_stride * (kOwnRows + _memberCount))),
+      _reference(_entries.data()), _scratch(_reference + _stride), _keys(_scratch + _stride),
+      _differs(_windowPages), _rows(_memberCount), _allBits((_memberCount + 63) / 64),
       _isSparse(request.stretch.end - request.stretch.first > kWindowPages),
       _layout(_memberCount, HXFamilyPages::kNoMapping), _groups(_memberCount), _seen(*_family.seen),
       _pages(std::make_unique<HXFamilyPages>(_memberCount, kSetsOfStretch)) {
@@ -198,6 +219,10 @@ void ColumnReader::readWindow(uint64_t first, uint64_t end) {
     _windowStart = first;
     _windowLength = end - first;
     _windowEntries = _windowFound = 0;
+    _referenceMember.reset();
+    _pieces.clear();
+    _same.clear();
+    _own.clear();
     std::vector<uint64_t> borders = {first, end};
     for (uint32_t member = 0; member < _memberCount; member++) {
         Row &row = _rows[member];
@@ -229,19 +254,40 @@ void ColumnReader::readRow(uint32_t member, uint64_t first, uint64_t end) {
     while (last + 1 < all.size() && all[last + 1].first < end)
         last++;
     const uint64_t to = std::min(all[last].end, end);
-    uint64_t *const entries = this->row(member) + (from - first);
+    row.from = from - first;
+    row.to = to - first;
+    uint64_t *const entries = (_referenceMember ? _scratch : _reference) + row.from;
     const size_t bytes = (to - from) * sizeof *entries;
     _windowEntries += to - from;
     _reading.store(member, std::memory_order_relaxed);
     const ssize_t got = _family.members[member].pagemap.readAt(from * sizeof *entries, entries, bytes);
     const size_t count = got < 0 ? 0 : static_cast<size_t>(got) / sizeof *entries;
-    std::fill(this->row(member), entries, 0); // what another window or family has left
-    std::fill(entries + count, this->row(member) + (end - first), 0);
+    std::fill(entries + count, entries + (to - from), 0); // where another window or family has left something
+    if (_referenceMember)
+        keepRow(member);
+    else
+        _referenceMember = member, row.alike = ~uint64_t{0};
     // One whose address space has gone has nothing left to tell, here or further on, and no holes to skip.
     if (count == 0)
         row.nothingUpTo = UINT64_MAX;
     else if (std::all_of(entries, entries + count, [](uint64_t entry) { return entry == 0; }))
         skipHole(member, end);
+}
+
+// Of the row just read, what is not the reference's.
+void ColumnReader::keepRow(uint32_t member) {
+    Row &row = _rows[member];
+    const Row &reference = _rows[*_referenceMember];
+    row.alike = 0;
+    for (size_t piece = row.from / kPiecePages; piece * kPiecePages < row.to; piece++) {
+        const size_t from = std::max(row.from, piece * kPiecePages);
+        const size_t to = std::min(row.to, (piece + 1) * kPiecePages);
+        if (from >= reference.from && to <= reference.to &&
+            std::memcmp(_scratch + from, _reference + from, (to - from) * sizeof *_scratch) == 0)
+            row.alike |= uint64_t{1} << piece;
+        else
+            std::copy(_scratch + from, _scratch + to, this->row(member) + from);
+    }
 }
 
 // Asks where the next page is: mappings can be far larger than what is in them.
@@ -262,7 +308,16 @@ void ColumnReader::countStrip(uint64_t first, uint64_t end) {
     _active.clear();
     std::fill(_allBits.begin(), _allBits.end(), 0);
     std::vector<uint32_t> layout(_memberCount, HXFamilyPages::kNoMapping);
-    _stripOffset = first - _windowStart;
+    _stripPiece = _pieces.size();
+    const size_t stripEnd = end - _windowStart;
+    for (size_t place = first - _windowStart; place < stripEnd;) {
+        const size_t next = std::min(stripEnd, (place / kPiecePages + 1) * kPiecePages);
+        _pieces.push_back({place, next, {}});
+        place = next;
+    }
+    _same.resize(_pieces.size() * _allBits.size());
+    _own.resize(_same.size());
+    bool baseIsFile = false;
     for (uint32_t member = 0; member < _memberCount; member++) {
         if (!_rows[member].isInWindow) continue;
         const auto &all = ranges(member);
@@ -273,17 +328,30 @@ void ColumnReader::countStrip(uint64_t first, uint64_t end) {
         layout[member] = all[i].mapping;
         _active.push_back(member);
         _allBits[member / 64] |= uint64_t{1} << (member % 64);
-        takeRow(member, all[i], end - first);
+        const bool isBase = _active.size() == 1;
+        if (isBase) baseIsFile = all[i].isFile;
+        const HXFamilyFigures figures =
+            isBase ? takeBase(member, baseIsFile) : takeRow(member, all[i].isFile, baseIsFile);
+        _windowFound += figures.resident + figures.swapped;
+        auto &told = _pages->figures[member];
+        if (told.empty() || told.back().first != all[i].mapping)
+            told.emplace_back(all[i].mapping, figures);
+        else
+            told.back().second += figures;
     }
-    if (_active.empty()) return;
+    if (_active.empty()) {
+        _pieces.resize(_stripPiece);
+        return;
+    }
     if (layout != _layout || _layoutNumber == HXFamilyPages::kNoMapping) {
         endStrip();
         _layoutNumber = static_cast<uint32_t>(_pages->layouts.size() / _memberCount);
         _pages->layouts.insert(_pages->layouts.end(), layout.begin(), layout.end());
         _layout = std::move(layout);
     }
-    for (size_t page = 0; page < end - first; page++)
-        countColumn(page);
+    for (size_t piece = _stripPiece; piece < _pieces.size(); piece++)
+        for (size_t place = _pieces[piece].place; place < _pieces[piece].end; place++)
+            countColumn(piece, place);
 }
 
 // Turns entries into keys, and counts them.
@@ -299,52 +367,57 @@ HXFamilyFigures ColumnReader::takeEntries(std::span<uint64_t> entries, bool isFi
     return figures;
 }
 
-// Takes the next member's part of the strip. Most rows of a family are alike, entry by entry: what the first
-// one's tell is copied from it, piece by piece, which costs less than half.
-void ColumnReader::takeRow(uint32_t member, const HXFamilyRange &range, size_t pages) {
-    const std::span<uint64_t> keys(row(member) + _stripOffset, pages);
-    const bool isFirst = _active.front() == member;
-    if (isFirst) {
-        _first.isFile = range.isFile;
-        _first.entries.assign(keys.begin(), keys.end());
-        _first.figures.clear();
-        std::fill_n(_differs.begin(), pages, 0);
-    }
-    const uint64_t *const firstKeys = row(_active.front()) + _stripOffset;
+// The base's part of the strip.
+HXFamilyFigures ColumnReader::takeBase(uint32_t member, bool isFile) {
     HXFamilyFigures figures;
-    for (size_t from = 0; from < pages; from += kPiecePages) {
-        const std::span<uint64_t> piece = keys.subspan(from, std::min(kPiecePages, pages - from));
-        if (isFirst) {
-            _first.figures.push_back(takeEntries(piece, range.isFile));
-            figures += _first.figures.back();
-        } else if (range.isFile == _first.isFile &&
-                   std::memcmp(piece.data(), &_first.entries[from], piece.size_bytes()) == 0) {
-            std::copy_n(firstKeys + from, piece.size(), piece.begin());
-            figures += _first.figures[from / kPiecePages];
-        } else {
-            figures += takeEntries(piece, range.isFile);
-            for (size_t page = 0; page < piece.size(); page++)
-                _differs[from + page] |= piece[page] ^ firstKeys[from + page];
-        }
+    for (size_t piece = _stripPiece; piece < _pieces.size(); piece++) {
+        auto &[place, end, ofBase] = _pieces[piece];
+        std::copy_n(entriesAt(member, place), end - place, _keys + place);
+        ofBase = takeEntries({_keys + place, end - place}, isFile);
+        figures += ofBase;
+        bits(_same, piece)[member / 64] |= uint64_t{1} << (member % 64);
+        std::fill(_differs.begin() + static_cast<ptrdiff_t>(place),
+                  _differs.begin() + static_cast<ptrdiff_t>(end), 0);
     }
-    _windowFound += figures.resident + figures.swapped;
-    auto &told = _pages->figures[member];
-    if (told.empty() || told.back().first != range.mapping)
-        told.emplace_back(range.mapping, figures);
-    else
-        told.back().second += figures;
+    return figures;
 }
 
-void ColumnReader::countColumn(size_t page) {
-    const size_t place = _stripOffset + page;
-    if (_differs[page] == 0) {
-        const HXPageKey key = row(_active.front())[place];
-        if (key != 0) countGroup(key, _allBits, static_cast<uint32_t>(_active.size()));
+// Another member's. Where its entries are the base's there is nothing left to do, which costs less than half.
+HXFamilyFigures ColumnReader::takeRow(uint32_t member, bool isFile, bool baseIsFile) {
+    HXFamilyFigures figures;
+    const uint32_t base = _active.front();
+    for (size_t piece = _stripPiece; piece < _pieces.size(); piece++) {
+        const auto &[place, end, ofBase] = _pieces[piece];
+        const uint64_t *const entries = entriesAt(member, place), *const baseEntries = entriesAt(base, place);
+        const bool isSame =
+            isFile == baseIsFile && (entries == baseEntries ||
+                                     std::memcmp(entries, baseEntries, (end - place) * sizeof *entries) == 0);
+        bits(isSame ? _same : _own, piece)[member / 64] |= uint64_t{1} << (member % 64);
+        if (isSame) {
+            figures += ofBase;
+            continue;
+        }
+        uint64_t *const own = row(member);
+        if (entries != own + place) std::copy_n(entries, end - place, own + place);
+        figures += takeEntries({own + place, end - place}, isFile);
+        for (size_t i = place; i < end; i++)
+            _differs[i] |= own[i] ^ _keys[i];
+    }
+    return figures;
+}
+
+void ColumnReader::countColumn(size_t piece, size_t place) {
+    const HXPageKey ofBase = _keys[place];
+    if (_differs[place] == 0) {
+        if (ofBase != 0) countGroup(ofBase, _allBits, static_cast<uint32_t>(_active.size()));
         return;
     }
     _groups.begin();
-    for (const uint32_t member : _active)
-        if (const HXPageKey key = row(member)[place]) _groups.add(member, key);
+    const uint64_t *const own = bits(_own, piece);
+    for (const uint32_t member : _active) {
+        const bool hasOwn = (own[member / 64] >> member % 64 & 1) != 0;
+        if (const HXPageKey key = hasOwn ? row(member)[place] : ofBase) _groups.add(member, key);
+    }
     for (size_t group = 0; group < _groups.groups().size(); group++)
         countGroup(_groups.groups()[group].key, _groups.bits(group), _groups.groups()[group].count);
 }
@@ -372,19 +445,25 @@ void ColumnReader::countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t s
         _pages->addRest(bits, _layout, page);
 }
 
-// Of the window, whose rows are keys by now; those of members that are not in it are old.
+// Of the window, whose pieces are keys by now.
 void ColumnReader::findLazilyFreed() {
     _lazilyFreed.clear();
     _flags->findLazilyFreed(&_frames, &_lazilyFreed);
     _frames.clear();
     if (_lazilyFreed.empty()) return;
     std::sort(_lazilyFreed.begin(), _lazilyFreed.end());
-    for (uint32_t member = 0; member < _memberCount; member++)
-        if (_rows[member].isInWindow)
-            _pages->mayBeLazilyFreed[member] |=
-                std::any_of(row(member), row(member) + _windowLength, [this](uint64_t key) {
-                    return std::binary_search(_lazilyFreed.begin(), _lazilyFreed.end(), key);
-                });
+    const auto areIn = [&](const uint64_t *keys, const Piece &piece) {
+        return std::any_of(keys + piece.place, keys + piece.end, [this](uint64_t key) {
+            return std::binary_search(_lazilyFreed.begin(), _lazilyFreed.end(), key);
+        });
+    };
+    for (size_t i = 0; i < _pieces.size(); i++) {
+        const HXSharerSets::Bits same(bits(_same, i), _allBits.size()), own(bits(_own, i), _allBits.size());
+        if (areIn(_keys, _pieces[i]))
+            HXSharerSets::forEachMember(same, [&](uint32_t m) { _pages->mayBeLazilyFreed[m] = true; });
+        HXSharerSets::forEachMember(
+            own, [&](uint32_t m) { _pages->mayBeLazilyFreed[m] |= areIn(row(m), _pieces[i]); });
+    }
 }
 
 void ColumnReader::endStrip() {
