@@ -103,8 +103,11 @@ class ColumnReader {
     HXFamilyFigures takeEntries(std::span<uint64_t> entries, bool isFile) const;
     HXFamilyFigures takeBase(uint32_t member, bool isFile);
     HXFamilyFigures takeRow(uint32_t member, bool isFile, bool baseIsFile);
+    bool isUniform(size_t piece);
+    void countPiece(const Piece &piece);
     void countColumn(size_t piece, size_t place);
     void countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t sharers);
+    void countSharers(const HXPageCount &pages, HXSharerSets::Bits bits);
     void endStrip();
     void findLazilyFreed();
     uint64_t *row(uint32_t member) { return _entries.data() + (kOwnRows + member) * _stride; }
@@ -349,9 +352,14 @@ void ColumnReader::countStrip(uint64_t first, uint64_t end) {
         _pages->layouts.insert(_pages->layouts.end(), layout.begin(), layout.end());
         _layout = std::move(layout);
     }
-    for (size_t piece = _stripPiece; piece < _pieces.size(); piece++)
+    for (size_t piece = _stripPiece; piece < _pieces.size(); piece++) {
+        if (!_repeated && isUniform(piece)) {
+            countPiece(_pieces[piece]);
+            continue;
+        }
         for (size_t place = _pieces[piece].place; place < _pieces[piece].end; place++)
             countColumn(piece, place);
+    }
 }
 
 // Turns entries into keys, and counts them.
@@ -406,6 +414,24 @@ HXFamilyFigures ColumnReader::takeRow(uint32_t member, bool isFile, bool baseIsF
     return figures;
 }
 
+// Whether all active members hold the base's keys.
+bool ColumnReader::isUniform(size_t piece) {
+    const uint64_t *const own = bits(_own, piece);
+    return std::all_of(own, own + _allBits.size(), [](uint64_t word) { return word == 0; });
+}
+
+void ColumnReader::countPiece(const Piece &piece) {
+    const std::span<const HXPageKey> keys(_keys + piece.place, piece.end - piece.place);
+    _seen.add(keys, &_pages->metAgain);
+    HXPageCount pages;
+    for (const HXPageKey key : keys) {
+        if (key == 0) continue;
+        pages.add(key);
+        if (_flags && (key & kSwappedKey) == 0) _frames.push_back(key);
+    }
+    if (pages.all() != 0 && _active.size() > 1) countSharers(pages, _allBits);
+}
+
 void ColumnReader::countColumn(size_t piece, size_t place) {
     const HXPageKey ofBase = _keys[place];
     if (_differs[place] == 0) {
@@ -433,16 +459,20 @@ void ColumnReader::countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t s
         return;
     }
     if (sharers < 2) return;
+    HXPageCount page;
+    page.add(key);
+    countSharers(page, bits);
+}
+
+void ColumnReader::countSharers(const HXPageCount &pages, HXSharerSets::Bits bits) {
     if (_lastCount == nullptr || !std::ranges::equal(_pages->sets.bits(_lastSet), bits)) {
         _lastSet = _pages->sets.number(bits);
         _lastCount = _lastSet == HXSharerSets::kNone ? nullptr : &_counts[_lastSet];
     }
-    HXPageCount page;
-    page.add(key);
     if (_lastCount != nullptr)
-        *_lastCount += page;
+        *_lastCount += pages;
     else
-        _pages->addRest(bits, _layout, page);
+        _pages->addRest(bits, _layout, pages);
 }
 
 // Of the window, whose pieces are keys by now.

@@ -99,6 +99,21 @@ std::atomic<uint64_t> &HXSeenKeys::Cursor::wordOf(HXPageKey key) {
     return known.words[(key & ((uint64_t{1} << kChunkShift) - 1)) / 64];
 }
 
+void HXSeenKeys::Cursor::add(std::span<const HXPageKey> keys, std::vector<HXPageKey> *metAgain) {
+    const auto bitOf = [](HXPageKey key) { return uint64_t{1} << (key & 63); };
+    for (size_t first = 0, next = 0; first < keys.size(); first = next) {
+        const HXPageKey word = keys[first] >> 6;
+        uint64_t bits = 0;
+        for (; next < keys.size() && keys[next] >> 6 == word && (bits & bitOf(keys[next])) == 0; next++)
+            bits |= bitOf(keys[next]);
+        if (word == 0) bits &= ~uint64_t{1};
+        const uint64_t known =
+            bits == 0 ? 0 : wordOf(keys[first]).fetch_or(bits, std::memory_order_relaxed) & bits;
+        for (size_t i = first; known != 0 && i < next; i++)
+            if ((known & bitOf(keys[i])) != 0) metAgain->push_back(keys[i]);
+    }
+}
+
 void HXSeenKeys::clear() {
     const std::lock_guard lock(_mutex);
     _chunks.clear();

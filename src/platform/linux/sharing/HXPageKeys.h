@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <memory>
 #include <mutex>
+#include <span>
 #include <unordered_map>
 #include <vector>
 
@@ -85,6 +86,9 @@ class HXSeenKeys {
             const uint64_t bit = uint64_t{1} << (key & 63);
             return (wordOf(key).fetch_or(bit, std::memory_order_relaxed) & bit) != 0;
         }
+        // Adds those that are not 0. What had been added, or comes twice, is appended to `metAgain`. Faster
+        // by far where neighbours follow each other.
+        void add(std::span<const HXPageKey> keys, std::vector<HXPageKey> *metAgain);
         bool contains(HXPageKey key) {
             return (wordOf(key).load(std::memory_order_relaxed) >> (key & 63) & 1) != 0;
         }
@@ -97,14 +101,14 @@ class HXSeenKeys {
             uint64_t number = UINT64_MAX;
             std::atomic<uint64_t> *words = nullptr;
         };
-        std::array<Known, 64> _known; // by the low bits of their numbers
+        std::array<Known, 128> _known; // by the low bits of their numbers
     };
 
     // Forgets all keys. No thread may have a way in.
     void clear();
 
   private:
-    static constexpr uint32_t kChunkShift = 18; // keys in a chunk: 1 GiB of frames of 4 KiB, in 32 KiB
+    static constexpr uint32_t kChunkShift = 16; // keys in a chunk: 256 MiB of frames of 4 KiB, in 8 KiB
     using Chunk = std::array<std::atomic<uint64_t>, (size_t{1} << kChunkShift) / 64>;
 
     std::atomic<uint64_t> *chunk(uint64_t number);
