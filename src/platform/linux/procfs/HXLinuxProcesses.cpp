@@ -115,7 +115,8 @@ HXDescriptor HXLinuxProcesses::openDirectory(int32_t pid) const {
 std::optional<HXOpenProcess> HXLinuxProcesses::open(int32_t pid) {
     const HXShortageWatch watch;
     HXDescriptor directory = openDirectory(pid);
-    const auto stat = directory ? HXReadStat(directory) : std::nullopt;
+    auto stat = directory ? takeListed(pid, &Listed::isOpened) : std::nullopt;
+    if (directory && !stat) stat = HXReadStat(directory);
     if (stat && stat->lacksLeader()) directory = openThread(pid, directory);
     if (stat && directory) return HXOpenProcess{std::move(directory), *stat};
     const bool isDenied = errno == EACCES || errno == EPERM;
@@ -142,16 +143,16 @@ std::optional<HXStatRecord> HXLinuxProcesses::readStat(int32_t pid) const {
     return stat;
 }
 
-std::optional<HXStatRecord> HXLinuxProcesses::takeListed(int32_t pid) {
+std::optional<HXStatRecord> HXLinuxProcesses::takeListed(int32_t pid, bool Listed::*isUsed) {
     const std::lock_guard lock(_mutex);
     const auto found = _listed.find(pid);
-    if (found == _listed.end() || found->second.isUsed) return std::nullopt;
-    found->second.isUsed = true;
+    if (found == _listed.end() || found->second.*isUsed) return std::nullopt;
+    found->second.*isUsed = true;
     return found->second.stat;
 }
 
 std::optional<HXStatRecord> HXLinuxProcesses::statOf(int32_t pid) {
-    const auto listed = takeListed(pid);
+    const auto listed = takeListed(pid, &Listed::isAnswered);
     return listed ? listed : readStat(pid);
 }
 

@@ -58,11 +58,11 @@ class HXLinuxProcesses {
     static bool mayBeNamed(const proc_bsdinfo &info, std::string_view name);
 
   private:
-    // A stat record read while processes were listed; good for one answer, so that listing and describing a
-    // process costs one reading.
+    // A stat record read while processes were listed; good for one answer and for one opening, so that
+    // listing, describing and opening a process costs one reading.
     struct Listed {
         HXStatRecord stat;
-        bool isUsed = false;
+        bool isAnswered = false, isOpened = false;
     };
 
     std::string pathOf(int32_t pid, const char *file) const;
@@ -70,7 +70,7 @@ class HXLinuxProcesses {
     bool is64bit(const HXStatRecord &stat);
     std::optional<HXStatRecord> readStat(int32_t pid) const;
     std::optional<std::vector<HXStatRecord>> readStats(std::vector<int32_t> pids);
-    std::optional<HXStatRecord> takeListed(int32_t pid);
+    std::optional<HXStatRecord> takeListed(int32_t pid, bool Listed::*isUsed);
     std::optional<HXStatRecord> statOf(int32_t pid);
     std::optional<HXStatRecord> statForName(int32_t pid);
 
