@@ -130,6 +130,7 @@ class HXLinuxPlatform final : public HXPlatform {
   private:
     static constexpr mach_port_t kSelfPort = 1, kHostPort = 2; // below those of tasks
 
+    kern_return_t openTask(int32_t pid, bool asListed, std::unique_ptr<HXLinuxTask> *task);
     const HXAddressSpace &addressSpaceOf(HXLinuxTask *task);
     // The first mapping whose end lies above *address, of which it stores the place; null with *error.
     const HXMapping *mappingAt(HXLinuxTask *task, uint64_t *address, uint64_t *size, kern_return_t *error);

@@ -37,15 +37,24 @@ kern_return_t errorOfOpening(int error) {
 
 // Looks at no mapping: that could wait for another thread of the process as long as that likes.
 kern_return_t HXLinuxPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_t *task) {
+    std::unique_ptr<HXLinuxTask> opened;
+    kern_return_t error = openTask(pid, true, &opened);
+    // It may have ended since it was listed.
+    if (opened && opened->residentSizeWhenOpened() == 0) error = openTask(pid, false, &opened);
+    if (error == KERN_SUCCESS) *task = _tasks.add(std::move(opened));
+    return error;
+}
+
+kern_return_t HXLinuxPlatform::openTask(int32_t pid, bool asListed, std::unique_ptr<HXLinuxTask> *task) {
     if (pid <= 0) return KERN_FAILURE;
-    auto process = _processes.open(pid);
+    auto process = _processes.open(pid, asListed);
     if (!process) return errorOfOpening(errno);
     if (process->stat.hasEnded() || process->stat.isKernelThread()) return KERN_FAILURE;
     HXDescriptor maps = HXOpenAt(process->directory, "maps");
     if (!maps) return errorOfOpening(errno);
-    *task = _tasks.add(std::make_unique<HXLinuxTask>(
-        pid, _identifiers.numberOfProcess(pid), std::move(*process), std::move(maps),
-        maySpareDescriptors(_tasks.count()), _processes, _turns));
+    *task = std::make_unique<HXLinuxTask>(pid, _identifiers.numberOfProcess(pid), std::move(*process),
+                                          std::move(maps), maySpareDescriptors(_tasks.count()), _processes,
+                                          _turns);
     return KERN_SUCCESS;
 }
 

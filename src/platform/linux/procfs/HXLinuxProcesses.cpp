@@ -112,10 +112,10 @@ HXDescriptor HXLinuxProcesses::openDirectory(int32_t pid) const {
     return HXOpenAt(AT_FDCWD, pathOf(pid, "").c_str(), O_PATH | O_DIRECTORY);
 }
 
-std::optional<HXOpenProcess> HXLinuxProcesses::open(int32_t pid) {
+std::optional<HXOpenProcess> HXLinuxProcesses::open(int32_t pid, bool asListed) {
     const HXShortageWatch watch;
     HXDescriptor directory = openDirectory(pid);
-    auto stat = directory ? takeListed(pid, &Listed::isOpened) : std::nullopt;
+    auto stat = directory && asListed ? takeListed(pid, &Listed::isOpened) : std::nullopt;
     if (directory && !stat) stat = HXReadStat(directory);
     if (stat && stat->lacksLeader()) directory = openThread(pid, directory);
     if (stat && directory) return HXOpenProcess{std::move(directory), *stat};

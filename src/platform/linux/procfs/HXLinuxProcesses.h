@@ -36,7 +36,8 @@ class HXLinuxProcesses {
         : _procPath(std::move(procPath)), _forAll(std::move(forAll)) {}
 
     // None with errno set: ESRCH, EACCES or EPERM, or EMFILE when descriptors or memory do not suffice.
-    std::optional<HXOpenProcess> open(int32_t pid);
+    // With `asListed` the record may be as old as the list that has the process, but once.
+    std::optional<HXOpenProcess> open(int32_t pid, bool asListed = false);
 
     // The directory of `pid` alone, whatever has become of its leading thread; not open with errno set.
     HXDescriptor openDirectory(int32_t pid) const;
