@@ -152,6 +152,23 @@ void HXHeft::merge(HXMemoryRegion &region, const HXProcess &process, HXMemoryObj
 
 // Every object lives in exactly one of the maps or shares with nothing; together they are all objects.
 void HXHeft::finalizeObjects() {
-    for (HXMemoryObject &object : _objects)
-        object.finalize();
+    constexpr size_t piece = 4096;
+    forAll((_objects.size() + piece - 1) / piece, [this](size_t number) {
+        const size_t end = std::min((number + 1) * piece, _objects.size());
+        for (size_t i = number * piece; i < end; i++)
+            _objects[i].finalize();
+    });
+}
+
+void HXHeft::forAll(size_t count, std::function<void(size_t)> work) const {
+    constexpr size_t leastObjects = 4096; // that are worth starting threads for
+    if (_objects.size() < leastObjects) {
+        for (size_t i = 0; i < count; i++)
+            work(i);
+        return;
+    }
+    HXServices &services = HXPlatform::current().services();
+    HXDispatchQueue queue = services.dispatch_queue_create("org.heft.analyse", QOS_CLASS_UTILITY);
+    queue.isOwnWork = true;
+    services.dispatch_apply(count, queue, std::move(work));
 }

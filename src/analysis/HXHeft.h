@@ -80,7 +80,17 @@ class HXHeft : public HXHeftSwitches {
         uint64_t key = 0;
     };
     struct Report;
+    // What a report says of the objects that exactly one group maps, as one process sees them.
+    struct GroupReport {
+        const HXProcessGroup *group;
+        std::shared_ptr<const HXCategoryMap> categories;
+        HXMemoryTotal total;
+        bool hasProcessView = false;
+    };
+    using GroupReports = std::vector<GroupReport>;
 
+    // Calls `work` with all numbers below `count`, several at once where there is much to be done.
+    void forAll(size_t count, std::function<void(size_t)> work) const;
     void examineTogether();
     void gatherProcesses();
     void setAside(const HXProcess &unanswering);
@@ -89,10 +99,11 @@ class HXHeft : public HXHeftSwitches {
     Place placeOf(HXMemoryRegion &region, const HXProcess &process);
     HXMemoryObject &objectAt(const Place &place);
     void merge(HXMemoryRegion &region, const HXProcess &process, HXMemoryObject &object);
-    void reportProcess(const HXProcess &process, Report &report, const HXHeftSharingData &sharing,
-                       bool summarize);
-    void reportGroups(const HXProcess &process, const HXHeftSharingData::Groups &groups,
-                      const HXHeftSharingData &sharing, bool summarize);
+    void reportProcesses(const Processes &processes, Report &report, const HXHeftSharingData &sharing,
+                         bool summarize);
+    void reportProcess(const HXProcess &process, Report &report, const GroupReports &groups);
+    GroupReports groupReports(const HXProcess &process, const HXHeftSharingData &sharing,
+                              bool summarize) const;
     void reportWholeGroups(const HXHeftSharingData &sharing, bool summarize);
 
     ProcessList _processes;

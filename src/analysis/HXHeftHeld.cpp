@@ -70,11 +70,14 @@ class HeldObjects {
         }
     }
 
+    explicit HeldObjects(const HXHeft &heft)
+        : _objectCount(heft.memoryObjects().size()), _mapped(mappedObjects(heft)) {}
+
     // Works out what of each object is known otherwise, anew when more have been added.
-    void count(const HXHeft &heft) {
+    void count() {
         for (Held &held : _all)
             held.known = {};
-        countRegions(heft);
+        countRegions();
         countParts();
     }
 
@@ -89,18 +92,35 @@ class HeldObjects {
     std::vector<Held> &all() { return _all; }
 
   private:
-    // Each merged object once: where several processes have copied the object's pages on write, each has one.
-    void countRegions(const HXHeft &heft) {
-        std::vector<bool> counted(heft.memoryObjects().size());
+    // An identifier, and an object with a region of that identifier.
+    using Mapped = std::vector<std::pair<uint64_t, const HXMemoryObject *>>;
+
+    // Of all regions that may be of what is held, in their order.
+    static Mapped mappedObjects(const HXHeft &heft) {
+        Mapped mapped;
+        std::vector<bool> isThere(heft.memoryObjects().size()); // with its first region's identifier
         for (const auto &process : heft.processes()) {
             for (const HXMemoryRegion &region : process->memoryRegions()) {
                 if (region.share_mode() == SM_PRIVATE) continue; // most of all
-                Held *held = find(region.object_id());
                 const HXMemoryObject &object = *region.memoryObject();
-                if (!held || counted[object.index()]) continue;
-                counted[object.index()] = true;
-                held->known += object.sizes();
+                const uint64_t id = region.object_id();
+                const bool isUsual = id == object.memoryRegions().front()->object_id();
+                if (isUsual && isThere[object.index()]) continue;
+                if (isUsual) isThere[object.index()] = true;
+                mapped.emplace_back(id, &object);
             }
+        }
+        return mapped;
+    }
+
+    // Each merged object once: where several processes have copied the object's pages on write, each has one.
+    void countRegions() {
+        std::vector<bool> counted(_objectCount);
+        for (const auto &[id, object] : _mapped) {
+            Held *held = find(id);
+            if (!held || counted[object->index()]) continue;
+            counted[object->index()] = true;
+            held->known += object->sizes();
         }
     }
 
@@ -132,6 +152,8 @@ class HeldObjects {
         return found == _all.end() ? nullptr : &*found;
     }
 
+    const size_t _objectCount;
+    const Mapped _mapped;
     std::vector<Held> _all;
     std::unordered_map<uint64_t, size_t> _index;
 };
@@ -159,13 +181,13 @@ Answer askKernel() {
 } // namespace
 
 void HXHeft::_addHeldObjects() {
-    HeldObjects held;
+    HeldObjects held(*this);
     for (size_t i = 0; i < _processes.size(); i++) {
         held.add(i, _processes[i]->heldObjects());
         if (dynamic_cast<const HXKernelProcess *>(_processes[i].get()))
             held.add(i, askAll(1, [](size_t) { return askKernel(); }).front());
     }
-    held.count(*this);
+    held.count();
     if (held.leavesMuchOpen()) {
         std::vector<int32_t> pids;
         for (const auto &process : _processes)
@@ -174,7 +196,7 @@ void HXHeft::_addHeldObjects() {
             pids.size(), [pids](size_t i) { return HXPlatform::current().proc_held_objects(pids[i]); });
         for (size_t i = 0; i < answers.size(); i++)
             held.add(i, answers[i]);
-        held.count(*this);
+        held.count();
     }
     for (Held &each : held.all()) {
         if (each.object.name.empty() || each.restSize() == 0) continue;

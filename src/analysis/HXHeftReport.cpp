@@ -14,24 +14,21 @@ void HXHeft::printAtlasLikeOutputForProcesses(const Processes &processes) {
                 formatter->printAtlasLikeOutputForProcess(*process, process->memoryRegions());
 }
 
-void HXHeft::reportGroups(const HXProcess &process, const HXHeftSharingData::Groups &groups,
-                          const HXHeftSharingData &sharing, bool summarize) {
-    for (const HXProcessGroup *group : groups) {
-        bool hasProcessView = false;
-        const auto categories = std::make_shared<const HXCategoryMap>(
-            _categoriesForObjects(sharing.objectsOfGroup(*group), process, &hasProcessView, summarize));
-        const HXMemoryTotal total = _totalForCategories(*categories);
-        for (HXOutputFormatter *formatter : _outputFormatters) {
-            if (group->isPrivate())
-                formatter->printProcessCategories(*categories, total);
-            else
-                formatter->printSharedCategories(categories, *group, process, hasProcessView, total);
-        }
+HXHeft::GroupReports HXHeft::groupReports(const HXProcess &process, const HXHeftSharingData &sharing,
+                                          bool summarize) const {
+    GroupReports reports;
+    const HXHeftSharingData::Groups *groups = sharing.groupsOfProcess(process.pid());
+    if (process.hasErrors() || !groups) return reports;
+    for (const HXProcessGroup *group : *groups) {
+        GroupReport &report = reports.emplace_back(GroupReport{group, nullptr, {}});
+        report.categories = std::make_shared<const HXCategoryMap>(_categoriesForObjects(
+            sharing.objectsOfGroup(*group), process, &report.hasProcessView, summarize));
+        report.total = _totalForCategories(*report.categories);
     }
+    return reports;
 }
 
-void HXHeft::reportProcess(const HXProcess &process, Report &report, const HXHeftSharingData &sharing,
-                           bool summarize) {
+void HXHeft::reportProcess(const HXProcess &process, Report &report, const GroupReports &groups) {
     const bool failed = process.hasErrors();
     const HXAuxTree auxData = process.auxData();
     if (!process.warnings().empty()) report.withWarnings.push_back(&process);
@@ -45,15 +42,30 @@ void HXHeft::reportProcess(const HXProcess &process, Report &report, const HXHef
         if (!failed) formatter->printProcessTotal(_pidToHeft[process.pid()], process);
         formatter->endProcessHeader(process);
     }
-    const HXHeftSharingData::Groups *groups = sharing.groupsOfProcess(process.pid());
-    if (!failed && groups) {
-        reportGroups(process, *groups, sharing, summarize);
-    } else {
+    for (const auto &[group, categories, total, hasProcessView] : groups)
+        for (HXOutputFormatter *formatter : _outputFormatters)
+            if (group->isPrivate())
+                formatter->printProcessCategories(*categories, total);
+            else
+                formatter->printSharedCategories(categories, *group, process, hasProcessView, total);
+    if (groups.empty())
         for (HXOutputFormatter *formatter : _outputFormatters)
             formatter->printProcessCategories(HXCategoryMap(), HXMemoryTotal());
-    }
     for (HXOutputFormatter *formatter : _outputFormatters)
         formatter->printProcessAuxData(auxData.get());
+}
+
+// What is said of each is worked out for many at a time, which is little enough to keep.
+void HXHeft::reportProcesses(const Processes &processes, Report &report, const HXHeftSharingData &sharing,
+                             bool summarize) {
+    constexpr size_t most = 512;
+    for (size_t first = 0; first < processes.size(); first += most) {
+        std::vector<GroupReports> groups(std::min(most, processes.size() - first));
+        forAll(groups.size(),
+               [&](size_t i) { groups[i] = groupReports(*processes[first + i], sharing, summarize); });
+        for (size_t i = 0; i < groups.size(); i++)
+            reportProcess(*processes[first + i], report, groups[i]);
+    }
 }
 
 // For the formatters that ask for it.
@@ -76,16 +88,21 @@ void HXHeft::printOutputVerbose(bool verbose, bool summarize) {
     const Processes inOrder = _processesBySortingHeft(_notHiddenProcesses());
     if (verbose) printAtlasLikeOutputForProcesses(inOrder);
 
-    const HXHeftSharingData sharing = _sharingData();
+    HXHeftSharingData sharing;
+    HXCategoryMap summary;
+    forAll(2, [&](size_t i) {
+        if (i == 0)
+            sharing = _sharingData();
+        else
+            summary = _categoriesForAllProcessesShouldSummarize(summarize);
+    });
     Report report;
-    for (const HXProcess *process : inOrder)
-        reportProcess(*process, report, sharing, summarize);
+    reportProcesses(inOrder, report, sharing, summarize);
     reportWholeGroups(sharing, summarize);
 
     const HXGlobalMessages messages = {HXProcess::globalErrors(), _warnings};
     for (HXOutputFormatter *formatter : _outputFormatters)
         formatter->printProcessesWithWarnings(report.withWarnings, report.withErrors, messages);
-    const HXCategoryMap summary = _categoriesForAllProcessesShouldSummarize(summarize);
     const HXMemoryTotal total = _totalForCategories(summary);
     const bool hadErrors = !messages.errors.empty() || !report.withErrors.empty();
     for (HXOutputFormatter *formatter : _outputFormatters) {

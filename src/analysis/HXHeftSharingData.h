@@ -20,6 +20,7 @@ class HXMemoryObjects {
         return object;
     }
     size_t size() const { return _objects.size(); }
+    HXMemoryObject &operator[](size_t index) { return _objects[index]; }
     auto begin() { return _objects.begin(); }
     auto end() { return _objects.end(); }
     auto begin() const { return _objects.begin(); }

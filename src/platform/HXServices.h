@@ -38,6 +38,9 @@ struct HXDispatchQueue {
     // How long an iteration takes, compared with others: those that take longest may be started first, equals
     // in their order. Null: as they come.
     std::function<uint64_t(size_t)> costOf = {};
+    // The work is the program's own and asks nothing of other processes: it is waited for however long it
+    // takes.
+    bool isOwnWork = false;
 };
 inline constexpr uint32_t QOS_CLASS_UTILITY = 0x11;
 

@@ -61,7 +61,7 @@ std::vector<size_t> HXLinuxServices::dispatch_apply(size_t iterations, const HXD
             _observer->looked(queue, done, iterations, waitingFor);
         };
     auto givenUp = HXWorkLoop::run(
-        iterations, workers, _answerTime,
+        iterations, workers, queue.isOwnWork ? std::nullopt : std::optional(_answerTime),
         [order, work = std::move(work)](size_t place) { work((*order)[place]); }, look);
     for (size_t &iteration : givenUp)
         iteration = (*order)[iteration];

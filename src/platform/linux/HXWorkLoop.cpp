@@ -13,8 +13,9 @@
 
 namespace {
 
-constexpr int kLooks = 100;      // without progress, until an iteration is given up
-constexpr int kPatientLooks = 3; // until another worker joins
+constexpr int kLooks = 100;                                // without progress, until an iteration is given up
+constexpr std::chrono::milliseconds kPauseWithoutEnd{100}; // between looks where none is
+constexpr int kPatientLooks = 3;                           // until another worker joins
 
 // The stat file of the calling thread, by its number in the namespace that /proc is of.
 std::string ownStatPath() {
@@ -34,13 +35,16 @@ bool isAsleep(const std::string &statPath) {
 
 } // namespace
 
-std::vector<size_t> HXWorkLoop::run(size_t iterations, size_t workers, std::chrono::milliseconds answerTime,
+std::vector<size_t> HXWorkLoop::run(size_t iterations, size_t workers,
+                                    std::optional<std::chrono::milliseconds> answerTime,
                                     std::function<void(size_t)> work, const Look &look) {
-    const auto loop = std::make_shared<HXWorkLoop>(iterations, std::move(work));
+    const auto loop = std::make_shared<HXWorkLoop>(iterations, answerTime.has_value(), std::move(work));
     std::unique_lock lock(loop->_mutex);
     for (size_t i = 0; i < std::min(iterations, workers); i++)
         if (!loop->startWorker()) break;
-    loop->watch(lock, answerTime, look);
+    const auto pause =
+        answerTime ? std::max(*answerTime / kLooks, std::chrono::milliseconds(1)) : kPauseWithoutEnd;
+    loop->watch(lock, pause, look);
     lock.unlock(); // no worker starts from here on
     for (const auto &worker : loop->_workers)
         worker->isGivenUp ? worker->thread.detach() : worker->thread.join();
@@ -94,9 +98,8 @@ void HXWorkLoop::tell(std::unique_lock<std::mutex> &lock, const Look &look) cons
     lock.lock();
 }
 
-void HXWorkLoop::watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds answerTime,
+void HXWorkLoop::watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds pause,
                        const Look &observer) {
-    const auto pause = std::max(answerTime / kLooks, std::chrono::milliseconds(1));
     for (;;) {
         while (_running > 0)
             if (_ended.wait_for(lock, pause) == std::cv_status::timeout) {
@@ -124,7 +127,7 @@ void HXWorkLoop::look(Worker &worker) {
     }
     worker.looksWithoutProgress++;
     if (worker.looksWithoutProgress == kPatientLooks && _next < _iterations) startWorker();
-    if (worker.looksWithoutProgress < kLooks) return;
+    if (worker.looksWithoutProgress < kLooks || !_givesUp) return;
     worker.isGivenUp = true;
     _running--;
     _givenUp.push_back(*worker.iteration);

@@ -21,15 +21,16 @@ class HXWorkLoop : public std::enable_shared_from_this<HXWorkLoop> {
   public:
     // Told some times a second how many iterations have returned, and which one sleeps in the kernel.
     using Look = std::function<void(size_t done, std::optional<size_t> waitingFor)>;
-    // As HXServices::dispatch_apply says; `look` may be null. A thread counts as waiting while it has used no
-    // processor time and sleeps; time is counted by looks at it, so that nobody is given up while the program
-    // was stopped.
-    static std::vector<size_t> run(size_t iterations, size_t workers, std::chrono::milliseconds answerTime,
+    // As HXServices::dispatch_apply says; without an answer time nobody is given up; `look` may be null. A
+    // thread counts as waiting while it has used no processor time and sleeps; time is counted by looks at
+    // it, so that nobody is given up while the program was stopped.
+    static std::vector<size_t> run(size_t iterations, size_t workers,
+                                   std::optional<std::chrono::milliseconds> answerTime,
                                    std::function<void(size_t)> work, const Look &look = nullptr);
 
     // For `run`.
-    HXWorkLoop(size_t iterations, std::function<void(size_t)> work)
-        : _iterations(iterations), _work(std::move(work)) {}
+    HXWorkLoop(size_t iterations, bool givesUp, std::function<void(size_t)> work)
+        : _iterations(iterations), _givesUp(givesUp), _work(std::move(work)) {}
 
   private:
     // What the watching thread knows of a worker, under the loop's lock.
@@ -47,13 +48,13 @@ class HXWorkLoop : public std::enable_shared_from_this<HXWorkLoop> {
 
     bool startWorker();
     void runWorker(Worker &worker);
-    void watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds answerTime,
-               const Look &observer);
+    void watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds pause, const Look &observer);
     void tell(std::unique_lock<std::mutex> &lock, const Look &look) const;
     void look(Worker &worker);
     static bool hasProgressed(Worker &worker);
 
     const size_t _iterations;
+    const bool _givesUp;
     const std::function<void(size_t)> _work;
     std::mutex _mutex;
     std::condition_variable _ended;

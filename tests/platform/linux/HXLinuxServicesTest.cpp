@@ -75,6 +75,19 @@ TEST(HXLinuxDispatch, GivesUpWhatWaitsAlone) {
     shared->lateEnd.get_future().wait(); // a late one finds what it works on
 }
 
+TEST(HXLinuxDispatch, WaitsForOwnWorkHoweverLong) {
+    HXLinuxServices services;
+    services.setAnswerTime(std::chrono::milliseconds(100));
+    HXDispatchQueue queue = services.dispatch_queue_create("q", QOS_CLASS_UTILITY);
+    queue.isOwnWork = true;
+    bool hasEnded = false;
+    const auto givenUp = services.dispatch_apply(1, queue, [&](size_t) {
+        std::promise<void>().get_future().wait_for(std::chrono::milliseconds(300));
+        hasEnded = true;
+    });
+    EXPECT_TRUE(givenUp.empty() && hasEnded);
+}
+
 TEST(HXLinuxDispatch, TellsWhomItWaitsFor) {
     HXLinuxServices services;
     services.setWorkerCount(1);
