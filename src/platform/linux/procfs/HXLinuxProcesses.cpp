@@ -14,6 +14,7 @@
 #include <climits>
 #include <cstring>
 #include <memory>
+#include <utility>
 #include <vector>
 
 namespace {
@@ -183,7 +184,8 @@ std::optional<std::vector<HXStatRecord>> HXLinuxProcesses::readStats(std::vector
     return found;
 }
 
-int32_t HXLinuxProcesses::proc_listallpids(int32_t *pids, uint32_t bufferBytes) {
+// The kernel, and what /proc shows; none with errno set.
+std::optional<std::vector<int32_t>> HXLinuxProcesses::findAll() const {
     std::vector<int32_t> found = {0};
     {
         const HXDescriptor list = HXOpenAt(AT_FDCWD, _procPath.c_str(), O_DIRECTORY);
@@ -192,13 +194,28 @@ int32_t HXLinuxProcesses::proc_listallpids(int32_t *pids, uint32_t bufferBytes) 
                 if (pid) found.push_back(*pid);
                 return true;
             }))
-            return -1;
+            return std::nullopt;
     }
-    if (found.size() == 1 && !HXIsProcMounted(_procPath)) {
-        errno = ENOENT;
-        return -1;
+    if (found.size() > 1 || HXIsProcMounted(_procPath)) return found;
+    errno = ENOENT;
+    return std::nullopt;
+}
+
+int32_t HXLinuxProcesses::proc_listallpids(int32_t *pids, uint32_t bufferBytes) {
+    std::optional<std::vector<int32_t>> all;
+    {
+        const std::lock_guard lock(_mutex);
+        all = std::exchange(_counted, std::nullopt);
     }
-    if (pids == nullptr) return static_cast<int32_t>(found.size());
+    if (!all || pids == nullptr) all = findAll();
+    if (!all) return -1;
+    const std::vector<int32_t> &found = *all;
+    if (pids == nullptr) {
+        const auto count = static_cast<int32_t>(found.size());
+        const std::lock_guard lock(_mutex);
+        _counted = std::move(all);
+        return count;
+    }
     const uint32_t room = bufferBytes / sizeof(int32_t);
     if (room == 0) return 0;
     const auto stats = readStats({found.begin() + 1, found.end()});

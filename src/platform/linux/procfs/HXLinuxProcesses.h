@@ -67,6 +67,7 @@ class HXLinuxProcesses {
     };
 
     std::string pathOf(int32_t pid, const char *file) const;
+    std::optional<std::vector<int32_t>> findAll() const;
     HXDescriptor openThread(int32_t pid, const HXDescriptor &leader);
     bool is64bit(const HXStatRecord &stat);
     std::optional<HXStatRecord> readStat(int32_t pid) const;
@@ -79,4 +80,5 @@ class HXLinuxProcesses {
     const ForAll _forAll;
     std::mutex _mutex;
     std::unordered_map<int32_t, Listed> _listed;
+    std::optional<std::vector<int32_t>> _counted; // found to be counted: who counts them lists them next
 };
