@@ -1,5 +1,7 @@
 #include "model/HXString.h"
 
+#include "platform/HXAdaptiveMutex.h"
+
 #include <array>
 #include <functional>
 #include <mutex>
@@ -14,7 +16,7 @@ struct TextHash {
 
 // Sharded, so that workers which intern at the same time seldom wait for each other.
 struct Shard {
-    std::mutex mutex;
+    HXAdaptiveMutex mutex;
     std::unordered_set<std::string, TextHash, std::equal_to<>> strings;
 };
 

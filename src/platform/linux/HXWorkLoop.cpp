@@ -41,7 +41,7 @@ std::vector<size_t> HXWorkLoop::run(size_t iterations, size_t workers,
     const auto loop = std::make_shared<HXWorkLoop>(iterations, answerTime.has_value(), std::move(work));
     std::unique_lock lock(loop->_mutex);
     for (size_t i = 0; i < std::min(iterations, workers); i++)
-        if (!loop->startWorker()) break;
+        if (loop->_next == loop->_iterations || !loop->startWorker(lock)) break;
     const auto pause =
         answerTime ? std::max(*answerTime / kLooks, std::chrono::milliseconds(1)) : kPauseWithoutEnd;
     loop->watch(lock, pause, look);
@@ -52,17 +52,23 @@ std::vector<size_t> HXWorkLoop::run(size_t iterations, size_t workers,
     return loop->_givenUp;
 }
 
-// False when no thread may be had: those that run share the work.
-bool HXWorkLoop::startWorker() {
+// False when no thread may be had: those that run share the work. They go on meanwhile.
+bool HXWorkLoop::startWorker(std::unique_lock<std::mutex> &lock) {
     Worker &worker = *_workers.emplace_back(std::make_unique<Worker>());
-    try {
-        worker.thread = std::thread([loop = shared_from_this(), &worker] { loop->runWorker(worker); });
-    } catch (const std::system_error &) {
-        _workers.pop_back();
-        return false;
-    }
     _running++;
-    return true;
+    lock.unlock();
+    std::thread thread;
+    try {
+        thread = std::thread([loop = shared_from_this(), &worker] { loop->runWorker(worker); });
+    } catch (const std::system_error &) {
+    }
+    lock.lock();
+    const bool isStarted = thread.joinable();
+    worker.thread = std::move(thread);
+    if (isStarted) return true;
+    _workers.pop_back();
+    _running--;
+    return false;
 }
 
 void HXWorkLoop::runWorker(Worker &worker) {
@@ -104,10 +110,10 @@ void HXWorkLoop::watch(std::unique_lock<std::mutex> &lock, std::chrono::millisec
         while (_running > 0)
             if (_ended.wait_for(lock, pause) == std::cv_status::timeout) {
                 for (size_t i = 0; i < _workers.size(); i++)
-                    look(*_workers[i]);
+                    look(*_workers[i], lock);
                 if (observer) tell(lock, observer);
             }
-        if (_next == _iterations || startWorker()) {
+        if (_next == _iterations || startWorker(lock)) {
             if (_running == 0) return;
             continue;
         }
@@ -119,14 +125,14 @@ void HXWorkLoop::watch(std::unique_lock<std::mutex> &lock, std::chrono::millisec
     }
 }
 
-void HXWorkLoop::look(Worker &worker) {
+void HXWorkLoop::look(Worker &worker, std::unique_lock<std::mutex> &lock) {
     if (worker.hasEnded || worker.isGivenUp) return;
     if (!worker.iteration || hasProgressed(worker)) {
         worker.looksWithoutProgress = 0;
         return;
     }
     worker.looksWithoutProgress++;
-    if (worker.looksWithoutProgress == kPatientLooks && _next < _iterations) startWorker();
+    if (worker.looksWithoutProgress == kPatientLooks && _next < _iterations) startWorker(lock);
     if (worker.looksWithoutProgress < kLooks || !_givesUp) return;
     worker.isGivenUp = true;
     _running--;

@@ -46,11 +46,11 @@ class HXWorkLoop : public std::enable_shared_from_this<HXWorkLoop> {
         bool hasEnded = false;
     };
 
-    bool startWorker();
+    bool startWorker(std::unique_lock<std::mutex> &lock);
     void runWorker(Worker &worker);
     void watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds pause, const Look &observer);
     void tell(std::unique_lock<std::mutex> &lock, const Look &look) const;
-    void look(Worker &worker);
+    void look(Worker &worker, std::unique_lock<std::mutex> &lock);
     static bool hasProgressed(Worker &worker);
 
     const size_t _iterations;

@@ -5,6 +5,7 @@
 
 #include <fcntl.h>
 
+#include <mutex>
 #include <optional>
 #include <string>
 #include <utility>

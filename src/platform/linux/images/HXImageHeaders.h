@@ -1,13 +1,13 @@
 // The program headers of the files that processes map, read once a run for each file.
 #pragma once
 
+#include "platform/HXAdaptiveMutex.h"
 #include "platform/linux/images/HXElfHeaders.h"
 #include "platform/linux/memory/HXAddressSpace.h"
 #include "platform/linux/memory/HXFileSystems.h"
 
 #include <cstdint>
 #include <map>
-#include <mutex>
 #include <optional>
 #include <utility>
 
@@ -33,6 +33,6 @@ class HXImageHeaders {
     };
 
     HXFileSystems &_fileSystems;
-    std::mutex _mutex;
+    HXAdaptiveMutex _mutex;
     std::map<FileKey, File> _files;
 };

@@ -4,6 +4,8 @@
 
 #include <sys/random.h>
 
+#include <mutex>
+
 namespace {
 
 constexpr uint32_t kProcessBits = 17, kPageBits = 35; // and one: 53

@@ -11,11 +11,11 @@
 // which happens to the second kind alone; so its lower bits decide.
 #pragma once
 
+#include "platform/HXAdaptiveMutex.h"
 #include "platform/linux/procfs/HXMapping.h"
 
 #include <cstdint>
 #include <deque>
-#include <mutex>
 #include <optional>
 #include <unordered_map>
 
@@ -97,7 +97,7 @@ class HXObjectIdentifiers {
     // Keys are spread by the number that they prefer, and so each shard has numbers of its own.
     struct Shard {
         explicit Shard(KeyHash hash) : numbers(kNumbers, hash) {}
-        std::mutex mutex;
+        HXAdaptiveMutex mutex;
         HXNumberTable<Key, KeyHash> numbers;
     };
 
@@ -105,6 +105,6 @@ class HXObjectIdentifiers {
     uint64_t interned(const Key &key);
 
     std::deque<Shard> _shards;
-    std::mutex _processMutex;
+    HXAdaptiveMutex _processMutex;
     HXNumberTable<uint32_t, KeyHash> _processNumbers; // by pid
 };

@@ -185,7 +185,7 @@ thread_local LastFound last;
 } // namespace
 
 uint32_t HXTaskTable::add(std::unique_ptr<HXLinuxTask> task) {
-    const std::unique_lock lock(_mutex);
+    const std::lock_guard lock(_mutex);
     const uint32_t port = _nextPort++;
     _portsByPid[task->pid()] = port;
     _tasks[port] = std::move(task);
@@ -194,21 +194,23 @@ uint32_t HXTaskTable::add(std::unique_ptr<HXLinuxTask> task) {
 
 void HXTaskTable::remove(uint32_t port) {
     if (last.port == port) last = {};
-    const std::unique_lock lock(_mutex);
+    std::unique_ptr<HXLinuxTask> removed; // which takes a while, and others look for theirs
+    const std::lock_guard lock(_mutex);
     const auto found = _tasks.find(port);
     if (found == _tasks.end()) return;
-    const auto byPid = _portsByPid.find(found->second->pid());
+    removed = std::move(found->second);
+    const auto byPid = _portsByPid.find(removed->pid());
     if (byPid != _portsByPid.end() && byPid->second == port) _portsByPid.erase(byPid);
     _tasks.erase(found);
 }
 
 size_t HXTaskTable::count() const {
-    const std::shared_lock lock(_mutex);
+    const std::lock_guard lock(_mutex);
     return _tasks.size();
 }
 
 std::vector<HXLinuxTask *> HXTaskTable::all() const {
-    const std::shared_lock lock(_mutex);
+    const std::lock_guard lock(_mutex);
     std::vector<HXLinuxTask *> all;
     for (const auto &[pid, port] : _portsByPid)
         all.push_back(_tasks.at(port).get());
@@ -219,7 +221,7 @@ std::vector<HXLinuxTask *> HXTaskTable::all() const {
 
 HXLinuxTask *HXTaskTable::find(uint32_t port) const {
     if (last.table == _number && last.port == port) return last.task;
-    const std::shared_lock lock(_mutex);
+    const std::lock_guard lock(_mutex);
     const auto found = _tasks.find(port);
     if (found == _tasks.end()) return nullptr;
     last = {_number, port, found->second.get()};
@@ -227,7 +229,7 @@ HXLinuxTask *HXTaskTable::find(uint32_t port) const {
 }
 
 HXLinuxTask *HXTaskTable::findByPid(int32_t pid) const {
-    const std::shared_lock lock(_mutex);
+    const std::lock_guard lock(_mutex);
     const auto found = _portsByPid.find(pid);
     return found == _portsByPid.end() ? nullptr : _tasks.at(found->second).get();
 }

@@ -1,6 +1,7 @@
 // One process that has been opened for examination.
 #pragma once
 
+#include "platform/HXAdaptiveMutex.h"
 #include "platform/linux/pages/HXAddressSpaceReader.h"
 #include "platform/linux/pages/HXPageReader.h"
 #include "platform/linux/pages/HXWalkDifference.h"
@@ -152,7 +153,7 @@ class HXTaskTable {
   private:
     inline static std::atomic<uint64_t> _tables = 0; // that there were
     const uint64_t _number = ++_tables;
-    mutable std::shared_mutex _mutex;
+    mutable HXAdaptiveMutex _mutex;
     std::unordered_map<uint32_t, std::unique_ptr<HXLinuxTask>> _tasks;
     std::unordered_map<int32_t, uint32_t> _portsByPid;
     uint32_t _nextPort = 0x100; // lower ones are the host's

@@ -14,6 +14,7 @@
 #include <climits>
 #include <cstring>
 #include <memory>
+#include <mutex>
 #include <utility>
 #include <vector>
 

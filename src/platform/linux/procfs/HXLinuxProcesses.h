@@ -1,6 +1,7 @@
 // The processes of the machine and what /proc tells of each without its address space.
 #pragma once
 
+#include "platform/HXAdaptiveMutex.h"
 #include "platform/HXHostRecords.h"
 #include "platform/linux/procfs/HXDescriptor.h"
 #include "platform/linux/procfs/HXProcMount.h"
@@ -8,7 +9,6 @@
 
 #include <cstdint>
 #include <functional>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -78,7 +78,7 @@ class HXLinuxProcesses {
 
     const std::string _procPath;
     const ForAll _forAll;
-    std::mutex _mutex;
+    HXAdaptiveMutex _mutex;
     std::unordered_map<int32_t, Listed> _listed;
     std::optional<std::vector<int32_t>> _counted; // found to be counted: who counts them lists them next
 };

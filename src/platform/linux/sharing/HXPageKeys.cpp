@@ -6,6 +6,7 @@
 #include <sys/mman.h>
 
 #include <algorithm>
+#include <mutex>
 
 namespace {
 
@@ -120,8 +121,12 @@ void HXSeenKeys::clear() {
 }
 
 std::atomic<uint64_t> *HXSeenKeys::chunk(uint64_t number) {
+    {
+        const std::lock_guard lock(_mutex);
+        const auto known = _chunks.find(number);
+        if (known != _chunks.end()) return known->second->data();
+    }
+    auto chunk = std::make_unique<Chunk>(); // clearing it takes a while
     const std::lock_guard lock(_mutex);
-    auto &chunk = _chunks[number];
-    if (!chunk) chunk = std::make_unique<Chunk>();
-    return chunk->data();
+    return _chunks.try_emplace(number, std::move(chunk)).first->second->data();
 }

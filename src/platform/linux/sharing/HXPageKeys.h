@@ -2,13 +2,13 @@
 // entries of pagemap have them (Documentation/admin-guide/mm/pagemap.rst).
 #pragma once
 
+#include "platform/HXAdaptiveMutex.h"
 #include "platform/linux/procfs/HXDescriptor.h"
 
 #include <array>
 #include <atomic>
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <span>
 #include <unordered_map>
 #include <vector>
@@ -113,6 +113,6 @@ class HXSeenKeys {
 
     std::atomic<uint64_t> *chunk(uint64_t number);
 
-    std::mutex _mutex;
+    HXAdaptiveMutex _mutex;
     std::unordered_map<uint64_t, std::unique_ptr<Chunk>> _chunks;
 };
