@@ -58,7 +58,7 @@ const HXElfHeaders *HXImageHeaders::headersOf(const HXAddressSpace &addressSpace
     const HXDescriptor opened = _fileSystems.openLocal(process, mapping, [&] {
         HXDescriptor place = HXLocateMapped(process, mapping);
         return place ? std::move(place)
-                     : locateByPath(mapping, addressSpace.path(mapping.path).text, process);
+                     : locateByPath(mapping, std::string(addressSpace.path(mapping.path).text), process);
     });
     Outcome outcome;
     if (opened) outcome = readHeaders(opened);

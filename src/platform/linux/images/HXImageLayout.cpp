@@ -74,7 +74,7 @@ void Finder::findCandidates(const HXHeadersOfMapping &headersOf) {
 
 void Finder::addVdso(const HXMapping &mapping) {
     const RVRegion whole{kText, mapping.start, mapping.end - mapping.start};
-    HXLoadedImage image{_addressSpace.path(mapping.path).text, mapping.start, {whole}};
+    HXLoadedImage image{std::string(_addressSpace.path(mapping.path).text), mapping.start, {whole}};
     _candidates.push_back({nullptr, 0, 0, 0, std::move(image), mapping.end});
 }
 
@@ -116,7 +116,7 @@ void Finder::addCandidate(const HXMapping &mapping, const HXElfHeaders &headers)
         const HXElfLoad &last = headers.loads.back();
         Candidate candidate{
             &headers, loadStart - _pages.down(load.address), mapping.device, mapping.inode, {}, 0};
-        candidate.image = {_addressSpace.path(mapping.path).text, loadStart - distance, {}};
+        candidate.image = {std::string(_addressSpace.path(mapping.path).text), loadStart - distance, {}};
         candidate.end = candidate.bias + _pages.up(last.address + last.memorySize);
         if (candidate.end <= candidate.image.baseAddress) continue;
         const bool isKnown = std::any_of(_candidates.begin(), _candidates.end(), [&](const Candidate &other) {

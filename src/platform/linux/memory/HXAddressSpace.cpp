@@ -4,6 +4,7 @@
 #include "platform/HXSafeText.h"
 
 #include <algorithm>
+#include <string>
 
 HXAddressSpace::HXAddressSpace() {
     _paths.emplace_back();
@@ -52,23 +53,36 @@ std::string plainPath(std::string_view path) {
     return plain;
 }
 
-HXMappedPath mappedPath(std::string_view raw, HXNamedTags &tags) {
+} // namespace
+
+// A copy in the memory of the address space.
+std::string_view HXAddressSpace::kept(std::string_view text) {
+    char *const bytes = static_cast<char *>(_memory.allocate(text.size(), 1));
+    std::copy(text.begin(), text.end(), bytes);
+    return {bytes, text.size()};
+}
+
+// `raw` is kept.
+HXMappedPath HXAddressSpace::mappedPath(std::string_view raw, HXNamedTags &tags) {
     HXMappedPath path;
-    path.text = HXSafeText(raw.find('\\') == std::string_view::npos ? std::string(raw) : plainPath(raw));
+    const std::string text =
+        HXSafeText(raw.find('\\') == std::string_view::npos ? std::string(raw) : plainPath(raw));
+    path.text = text == raw ? raw : kept(text);
     path.kind = HXPathKindOf(raw);
     const std::string_view name = HXGivenName(path.text);
     if (!name.empty()) path.namedTag = static_cast<uint8_t>(tags.tagForName(name).value_or(0));
     return path;
 }
 
-} // namespace
-
 uint32_t HXAddressSpace::intern(std::string_view path, HXNamedTags &tags) {
     if (path.empty()) return 0;
     if (path == _lastPath) return _lastPathIndex;
-    _lastPath = path;
-    const auto [found, isNew] = _pathIndexes.try_emplace(_lastPath, static_cast<uint32_t>(_paths.size()));
-    if (isNew) _paths.push_back(mappedPath(path, tags));
+    auto found = _pathIndexes.find(path);
+    if (found == _pathIndexes.end()) {
+        found = _pathIndexes.emplace(kept(path), static_cast<uint32_t>(_paths.size())).first;
+        _paths.push_back(mappedPath(found->first, tags));
+    }
+    _lastPath = found->first;
     _lastPathIndex = found->second;
     return _lastPathIndex;
 }

@@ -8,14 +8,14 @@
 #include <cstddef>
 #include <cstdint>
 #include <deque>
-#include <string>
+#include <memory_resource>
 #include <string_view>
 #include <unordered_map>
 #include <vector>
 
-// A path that mappings name; `text` is safe.
+// A path that mappings name; `text` is safe, and lives as long as the address space.
 struct HXMappedPath {
-    std::string text;
+    std::string_view text;
     HXPathKind kind = HXPathKind::none;
     uint8_t namedTag = 0; // of the name that the program gave the memory
 };
@@ -57,9 +57,15 @@ class HXAddressSpace {
     const HXMappedPath &path(uint32_t index) const { return _paths[index]; }
 
   private:
-    std::deque<HXMapping> _mappings; // a million may come, which nobody should copy as they grow
-    std::deque<HXMappedPath> _paths; // the first one is empty
-    std::unordered_map<std::string, uint32_t> _pathIndexes;
-    std::string _lastPath; // mappings of one file mostly follow each other
+    std::string_view kept(std::string_view text);
+    HXMappedPath mappedPath(std::string_view raw, HXNamedTags &tags);
+
+    // All of what follows: taken from the heap in few pieces, which threads would else wait to give back.
+    std::pmr::monotonic_buffer_resource _memory{4096};
+    std::pmr::deque<HXMapping> _mappings{
+        &_memory}; // a million may come, which nobody should copy as they grow
+    std::pmr::deque<HXMappedPath> _paths{&_memory}; // the first one is empty
+    std::pmr::unordered_map<std::string_view, uint32_t> _pathIndexes{&_memory};
+    std::string_view _lastPath; // mappings of one file mostly follow each other
     uint32_t _lastPathIndex = 0;
 };

@@ -182,7 +182,7 @@ HXFileSystemKind Reader::fileSystemOf(const HXMapping &mapping, const HXMappedPa
 // file.
 bool Reader::isDeviceFile(const HXMapping &mapping, const HXMappedPath &path) const {
     HXDescriptor place = HXLocateMapped(_request.process, mapping);
-    if (!place) place = HXLocateBelowRoot(_request.process, path.text);
+    if (!place) place = HXLocateBelowRoot(_request.process, std::string(path.text));
     return !place || !HXIsMappedFile(mapping, place);
 }
 

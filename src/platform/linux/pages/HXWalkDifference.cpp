@@ -13,7 +13,7 @@ struct Pages {
 
 bool mayBeDrivers(const HXMapping &mapping, const HXAddressSpace &addressSpace) {
     if (!mapping.isFile()) return mapping.kind != HXPathKind::none;
-    const std::string &path = addressSpace.path(mapping.path).text;
+    const std::string_view path = addressSpace.path(mapping.path).text;
     return !path.starts_with('/') || path.starts_with("/dev/");
 }
 
