@@ -3,7 +3,7 @@
 
 #include <pthread.h>
 
-// Whoever finds it taken tries again for some microseconds before he sleeps. For std::lock_guard and the like.
+// Whoever finds it taken tries again for some microseconds before he sleeps. For std::lock_guard.
 class HXAdaptiveMutex {
   public:
     HXAdaptiveMutex() = default;

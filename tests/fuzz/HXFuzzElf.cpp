@@ -12,9 +12,8 @@ void require(bool holds) {
     if (!holds) std::abort();
 }
 
-// A mapping of the file for each load, one behind the other.
-HXAddressSpace loaded(const HXElfHeaders &headers) {
-    HXAddressSpace addressSpace;
+// Appends a mapping of the file for each load, one behind the other.
+void load(const HXElfHeaders &headers, HXAddressSpace &addressSpace) {
     for (const HXElfLoad &load : headers.loads) {
         HXMapping mapping{.inode = 1, .kind = HXPathKind::file};
         mapping.start = kBase + load.address / kPage * kPage;
@@ -23,7 +22,6 @@ HXAddressSpace loaded(const HXElfHeaders &headers) {
         mapping.flags = load.executable ? HXMappingReadable | HXMappingExecutable : HXMappingReadable;
         if (mapping.end > mapping.start) addressSpace.append(mapping);
     }
-    return addressSpace;
 }
 
 } // namespace
@@ -45,7 +43,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     require(isExecutable && headers->relocatedStart <= headers->relocatedEnd);
     const std::set<std::string_view> names = {"__TEXT",       "__LINKEDIT", "__CONST",
                                               "__DATA_CONST", "__DATA",     "__BSS"};
-    const HXAddressSpace addressSpace = loaded(*headers);
+    HXAddressSpace addressSpace;
+    load(*headers, addressSpace);
     for (const auto &image : HXFindImages(addressSpace, kPage, [&](size_t) { return &*headers; })) {
         for (const RVRegion &segment : image.segments) {
             require(names.contains(segment.name) && segment.length > 0 && segment.start >= last);
