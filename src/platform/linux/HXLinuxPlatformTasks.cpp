@@ -21,9 +21,9 @@ class TaskSymbolicator final : public RVSymbolicator {
     std::vector<HXLoadedImage> images;
 };
 
-// Whether one more task may keep two descriptors: half of them are for reading.
+// Whether one more task may keep three descriptors: half of them are for reading.
 bool maySpareDescriptors(size_t taskCount) {
-    constexpr rlim_t share = 4;
+    constexpr rlim_t share = 6;
     rlimit limit;
     return ::getrlimit(RLIMIT_NOFILE, &limit) == 0 && taskCount < limit.rlim_cur / share;
 }

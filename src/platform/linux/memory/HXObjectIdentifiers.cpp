@@ -4,6 +4,7 @@
 
 #include <sys/random.h>
 
+#include <array>
 #include <mutex>
 
 namespace {
@@ -53,9 +54,19 @@ uint32_t HXObjectIdentifiers::numberOfProcess(int32_t pid) {
     return number ? *number + 1 : 0;
 }
 
+// What this thread was told: most processes map the same files.
+struct HXObjectIdentifiers::Remembered {
+    uint64_t table = 0;
+    uint64_t identifier = 0;
+    Key key = {};
+};
+
 uint64_t HXObjectIdentifiers::interned(const Key &key) {
     // Not by the seed: it is to be the same in every run.
     const auto preferred = static_cast<uint32_t>(KeyHash{0}(key) >> 33);
+    thread_local std::array<Remembered, 256> known;
+    Remembered &remembered = known[preferred % known.size()];
+    if (remembered.table == _table && remembered.key == key) return remembered.identifier;
     const uint32_t shardIndex = preferred % kShards;
     Shard &shard = _shards[shardIndex];
     uint32_t number = 0;
@@ -63,7 +74,9 @@ uint64_t HXObjectIdentifiers::interned(const Key &key) {
         const std::lock_guard lock(shard.mutex);
         number = shard.numbers.of(key, preferred / kShards).value_or(0); // more have room in no memory
     }
-    return kHighBits | (kFirstLowBits + uint64_t{2} * (number * kShards + shardIndex));
+    const uint64_t identifier = kHighBits | (kFirstLowBits + uint64_t{2} * (number * kShards + shardIndex));
+    remembered = {_table, identifier, key};
+    return identifier;
 }
 
 uint64_t HXObjectIdentifiers::of(const HXMapping &mapping, const HXMappingOwner &owner) {

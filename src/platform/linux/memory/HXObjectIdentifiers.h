@@ -14,6 +14,7 @@
 #include "platform/HXAdaptiveMutex.h"
 #include "platform/linux/procfs/HXMapping.h"
 
+#include <atomic>
 #include <cstdint>
 #include <deque>
 #include <optional>
@@ -85,6 +86,7 @@ class HXObjectIdentifiers {
         bool operator==(const Key &) const = default;
     };
     // With a seed of this run, so that nobody can choose keys that meet in one bucket.
+    struct Remembered;
     struct KeyHash {
         uint64_t seed;
         size_t operator()(const Key &key) const;
@@ -104,6 +106,8 @@ class HXObjectIdentifiers {
     explicit HXObjectIdentifiers(KeyHash hash);
     uint64_t interned(const Key &key);
 
+    inline static std::atomic<uint64_t> _tables = 0; // that there were
+    const uint64_t _table = ++_tables;
     std::deque<Shard> _shards;
     HXAdaptiveMutex _processMutex;
     HXNumberTable<uint32_t, KeyHash> _processNumbers; // by pid

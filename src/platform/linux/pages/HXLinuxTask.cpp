@@ -1,6 +1,7 @@
 #include "platform/linux/pages/HXLinuxTask.h"
 
 #include "platform/linux/pages/HXRepeatedPages.h"
+#include "platform/linux/procfs/HXProcFile.h"
 #include "platform/linux/procfs/HXTaskFiles.h"
 
 #include <algorithm>
@@ -26,9 +27,13 @@ bool HXDescriptorTurns::run(const std::function<void()> &read) {
 HXLinuxTask::HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, HXDescriptor maps,
                          bool keepsOpen, HXLinuxProcesses &processes, HXDescriptorTurns &turns)
     : _pid(pid), _number(number), _startTime(process.stat.startTime), _startStack(process.stat.startStack),
-      _processes(processes), _turns(turns), _status(HXReadStatus(process.directory)),
+      _processes(processes), _turns(turns), _openStatus(HXOpenAt(process.directory, "status")),
+      _status(HXReadOpenStatus(_openStatus, process.directory)),
       _residentSize(_status ? _status->residentSize.value_or(0) : 0) {
-    if (!keepsOpen) return;
+    if (!keepsOpen) {
+        _openStatus = {};
+        return;
+    }
     _directory = std::move(process.directory);
     _maps = std::move(maps);
 }
@@ -142,12 +147,17 @@ void HXLinuxTask::readOnce(const HXReaderSetting &setting, bool needsDirtyPages)
     _maps.reset();
 }
 
+std::optional<HXStatusRecord> HXLinuxTask::readStatus() {
+    const HXDescriptor open = std::move(_openStatus);
+    return open ? HXReadOpenStatus(open, _directory) : HXReadStatus(_directory);
+}
+
 // The first reading is compared with the counters behind it alone, so that most processes cost one more small
 // file, which also answers the next question for the status.
 void HXLinuxTask::compare(const HXReaderSetting &setting, bool isFirst) {
     _difference.reset();
     if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return;
-    const auto before = std::exchange(_status, HXReadStatus(_directory));
+    const auto before = std::exchange(_status, readStatus());
     _used[0] = _used[1] = false;
     if (!_status) return;
     const uint64_t error = setting.machine->counterErrorPages(_status->threadCount.value_or(1));
