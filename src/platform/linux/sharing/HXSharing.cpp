@@ -26,8 +26,11 @@ bool holdsPages(const HXMapping &mapping) {
     return (mapping.anonymousPages | mapping.swappedPages | mapping.hugePages) != 0;
 }
 
-HXFamilyMember memberOf(const HXLinuxTask &task, const HXAddressSpace &addressSpace, uint32_t pageShift) {
+// Without a page map where the task cannot be compared with others.
+HXFamilyMember memberOf(const HXLinuxTask &task, uint32_t pageShift) {
     HXFamilyMember member;
+    const HXAddressSpace &addressSpace = task.addressSpace();
+    if (addressSpace.endError != KERN_INVALID_ADDRESS || addressSpace.count() == 0) return member;
     member.pagemap = HXOpenAt(task.directory(), "pagemap");
     for (size_t i = 0; i < addressSpace.count(); i++) {
         const HXMapping &mapping = addressSpace[i];
@@ -163,10 +166,10 @@ HXSharing::Tasks HXSharing::findMerged(const Tasks &tasks) {
 }
 
 void HXSharing::readFamilies(std::vector<Tasks> families) {
-    readAddressSpaces(families);
+    Members members = readAddressSpaces(families);
     std::vector<std::shared_ptr<Work>> works;
     for (const Tasks &family : families)
-        if (auto work = open(family)) works.push_back(std::move(work));
+        if (auto work = open(family, members)) works.push_back(std::move(work));
     readPages(works, false);
     std::vector<std::shared_ptr<Work>> repeating;
     for (const auto &work : works) {
@@ -182,14 +185,18 @@ void HXSharing::readFamilies(std::vector<Tasks> families) {
         give(*work);
 }
 
-void HXSharing::readAddressSpaces(std::vector<Tasks> &families) {
+// Those that answer; the others are no longer in their families.
+HXSharing::Members HXSharing::readAddressSpaces(std::vector<Tasks> &families) {
     Tasks all;
     for (const Tasks &family : families)
         all.insert(all.end(), family.begin(), family.end());
-    const auto isCancelled = _setting.isCancelled;
-    const auto read = [all, reader = _setting.reader, needsDirtyPages = _setting.needsDirtyPages,
+    const auto found = std::make_shared<std::vector<HXFamilyMember>>(all.size());
+    const auto read = [all, found, reader = _setting.reader, needsDirtyPages = _setting.needsDirtyPages,
                        findsLazilyFreed = _findsLazilyFreed](size_t i) {
-        all[i]->withDescriptors([&] { all[i]->readForSharing(*reader, needsDirtyPages, findsLazilyFreed); });
+        all[i]->withDescriptors([&] {
+            all[i]->readForSharing(*reader, needsDirtyPages, findsLazilyFreed);
+            (*found)[i] = memberOf(*all[i], reader->pageShift);
+        });
     };
     const auto givenUp =
         forAll(all.size(), read,
@@ -199,22 +206,23 @@ void HXSharing::readAddressSpaces(std::vector<Tasks> &families) {
         for (Tasks &family : families)
             std::erase(family, all[i]);
     }
+    Members members;
+    for (size_t i = 0; i < all.size(); i++)
+        if (!_unanswering.contains(all[i]->pid())) members[all[i]] = std::move((*found)[i]);
+    return members;
 }
 
 // Null where nothing is shared, or what is cannot be read: every page is its task's own then.
-std::shared_ptr<HXSharing::Work> HXSharing::open(const Tasks &tasks) {
+std::shared_ptr<HXSharing::Work> HXSharing::open(const Tasks &tasks, Members &members) {
     auto work = std::make_shared<Work>();
     work->family = std::make_shared<HXFamily>();
     work->family->entries = _entries;
     work->family->seen = std::make_shared<HXSeenKeys>();
-    const uint32_t pageShift = _setting.reader->pageShift;
     for (HXLinuxTask *task : tasks) {
         const HXAddressSpace *const addressSpace = task->addressSpaceRead();
         if (addressSpace == nullptr) continue;
-        HXFamilyMember member;
-        if (addressSpace->endError == KERN_INVALID_ADDRESS && addressSpace->count() > 0)
-            member = memberOf(*task, *addressSpace, pageShift);
-        if (!member.pagemap) {
+        HXFamilyMember member = std::move(members[task]);
+        if (!member.pagemap || addressSpace->endError != KERN_INVALID_ADDRESS) {
             task->forget();
             continue;
         }

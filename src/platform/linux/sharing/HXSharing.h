@@ -14,6 +14,7 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 // What HXSharing works with; outlives it.
@@ -39,6 +40,7 @@ class HXSharing {
 
   private:
     using Tasks = std::vector<HXLinuxTask *>;
+    using Members = std::unordered_map<const HXLinuxTask *, HXFamilyMember>;
     struct Work;
 
     std::vector<Tasks> findFamilies(const Tasks &tasks);
@@ -50,8 +52,8 @@ class HXSharing {
         std::function<uint64_t(size_t)> costOf;
     };
     std::vector<size_t> forAll(size_t count, std::function<void(size_t)> work, const Activity &activity = {});
-    void readAddressSpaces(std::vector<Tasks> &families);
-    std::shared_ptr<Work> open(const Tasks &tasks);
+    Members readAddressSpaces(std::vector<Tasks> &families);
+    std::shared_ptr<Work> open(const Tasks &tasks, Members &members);
     void readPages(std::vector<std::shared_ptr<Work>> &families, bool isSecond);
     void readFamilies(std::vector<Tasks> families);
     void give(Work &family);
