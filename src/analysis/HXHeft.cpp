@@ -161,7 +161,7 @@ void HXHeft::finalizeObjects() {
 }
 
 void HXHeft::forAll(size_t count, std::function<void(size_t)> work) const {
-    constexpr size_t leastObjects = 16384; // that are worth starting threads for
+    constexpr size_t leastObjects = 8192; // that are worth starting threads for
     if (_objects.size() < leastObjects) {
         for (size_t i = 0; i < count; i++)
             work(i);

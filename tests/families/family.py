@@ -19,7 +19,7 @@ import time
 PAGE, MIB = mmap.PAGESIZE, 1 << 20
 PAYLOAD = "anonymous code"
 HUGE_POOL, MOVE_TO = 0x40000, 1 | 2  # MAP_HUGETLB, MREMAP_MAYMOVE | MREMAP_FIXED
-DONTNEED, DONTFORK, MERGEABLE, HUGEPAGE, PAGEOUT = 4, 10, 12, 14, 21
+DONTNEED, FREE, DONTFORK, MERGEABLE, HUGEPAGE, PAGEOUT = 4, 8, 10, 12, 14, 21
 IPC_CREAT, IPC_RMID, IPC_PRIVATE = 0o1000, 0, 0
 PRIVATE = mmap.MAP_PRIVATE | mmap.MAP_ANONYMOUS
 
@@ -146,6 +146,29 @@ def dontfork():
     payload.advise(DONTFORK, 0, 3 * MIB)
     fork("child")
     return {PAYLOAD: in_mib(parent=3, parent_child=5)}
+
+
+def freed_lazily(who):
+    """One of them wrote to half of the memory and freed half of that lazily."""
+    payload = Memory(8 * MIB).write()
+
+    other = Memory(PAGE, code=False)
+
+    def free():
+        payload.write(0, 4 * MIB, 2)
+        payload.advise(FREE, 0, 2 * MIB)
+        # Each processor keeps a few such pages to itself until it locks one.
+        for processor in os.sched_getaffinity(0):
+            os.sched_setaffinity(0, {processor})
+            call("mlock", other.start, PAGE)
+            call("munlock", other.start, PAGE)
+
+    fork("child", free if who == "child" else lambda: None)
+    fork("other")
+    if who == "parent":
+        free()
+    rest = "parent other" if who == "child" else "child other"
+    return {PAYLOAD: {who: 2 * MIB, rest: 4 * MIB, "parent child other": 4 * MIB}}
 
 
 def transparent():

@@ -6,6 +6,7 @@ import glob
 import mmap
 import os
 import re
+import sys
 
 PAGE = mmap.PAGESIZE
 MIB = 1 << 20
@@ -101,13 +102,22 @@ def zero_frames():
 ZERO_FRAMES, ZERO_AREAS = zero_frames()
 
 
+flags = None  # /proc/kpageflags, while there is a family that frees memory lazily
+
+
+def is_lazily_freed(frame):
+    """Private memory that is dropped without swapping: KPF_ANON without KPF_SWAPBACKED."""
+    entry = int.from_bytes(os.pread(flags.fileno(), 8, frame * 8), sys.byteorder)
+    return entry & (1 << 12 | 1 << 14) == 1 << 12
+
+
 def page_key(entry):
     """The frame or swap slot that an entry tells; none where it is nobody's page."""
     if not entry & (PRESENT | SWAPPED) or entry & GUARD:
         return None
     number, kind = entry & FRAME, entry & 31
     if entry & PRESENT:
-        return None if number in ZERO_FRAMES else number << 1
+        return None if number in ZERO_FRAMES or flags and is_lazily_freed(number) else number << 1
     if kind in MIGRATION_TYPES:
         return number >> 5 << 1
     return None if kind == MARKER_TYPE else number << 1 | 1

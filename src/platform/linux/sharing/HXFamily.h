@@ -25,6 +25,7 @@ struct HXFamilyRange {
 struct HXFamilyMember {
     HXDescriptor pagemap;
     std::vector<HXFamilyRange> ranges; // of private mappings, ascending
+    bool hasNoLazyFree = false;        // for sure, before its page tables were read
 };
 
 // What is the same for all who read it, on any thread.

@@ -107,6 +107,10 @@ class ColumnReader {
     void countPiece(const Piece &piece);
     void countColumn(size_t piece, size_t place);
     void countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t sharers);
+    void wantFlags(HXPageKey key) {
+        if ((key & kSwappedKey) == 0) _frames.push_back(key);
+    }
+    bool needsFlags(HXSharerSets::Bits bits) const;
     void countSharers(const HXPageCount &pages, HXSharerSets::Bits bits);
     void endStrip();
     void findLazilyFreed();
@@ -139,6 +143,7 @@ class ColumnReader {
     std::vector<Row> _rows;
     std::vector<uint32_t> _active;                 // members with a mapping in the strip
     std::vector<uint64_t> _allBits;                // of these
+    std::vector<uint64_t> _withoutLazyFree;        // members, as HXFamilyMember says
     bool _isSparse;                                // the last window, or what is expected of the first
     std::vector<uint32_t> _layout;                 // of the strip, then of the last that was counted
     uint64_t _windowStart = 0, _windowLength = 0;  // pages
@@ -179,10 +184,14 @@ ColumnReader::ColumnReader(const HXColumnRequest &request, std::atomic<uint32_t>
       _stride(_windowPages + 8), _entries(roomForEntries(_stride * (kOwnRows + _memberCount))),
       _reference(_entries.data()), _scratch(_reference + _stride), _keys(_scratch + _stride),
       _differs(_windowPages), _rows(_memberCount), _allBits((_memberCount + 63) / 64),
+      _withoutLazyFree(_allBits.size()),
       _isSparse(request.stretch.end - request.stretch.first > kWindowPages),
       _layout(_memberCount, HXFamilyPages::kNoMapping), _groups(_memberCount), _seen(*_family.seen),
       _pages(std::make_unique<HXFamilyPages>(_memberCount, kSetsOfStretch)) {
     if (request.findsLazilyFreed) _flags.emplace();
+    for (uint32_t member = 0; member < _memberCount; member++)
+        if (_family.members[member].hasNoLazyFree)
+            _withoutLazyFree[member / 64] |= uint64_t{1} << (member % 64);
     if (request.repeated) _repeated.emplace(*request.repeated);
 }
 
@@ -423,11 +432,12 @@ bool ColumnReader::isUniform(size_t piece) {
 void ColumnReader::countPiece(const Piece &piece) {
     const std::span<const HXPageKey> keys(_keys + piece.place, piece.end - piece.place);
     _seen.add(keys, &_pages->metAgain);
+    const bool wantsFlags = needsFlags(_allBits);
     HXPageCount pages;
     for (const HXPageKey key : keys) {
         if (key == 0) continue;
         pages.add(key);
-        if (_flags && (key & kSwappedKey) == 0) _frames.push_back(key);
+        if (wantsFlags) wantFlags(key);
     }
     if (pages.all() != 0 && _active.size() > 1) countSharers(pages, _allBits);
 }
@@ -449,7 +459,7 @@ void ColumnReader::countColumn(size_t piece, size_t place) {
 }
 
 void ColumnReader::countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t sharers) {
-    if (_flags && (key & kSwappedKey) == 0) _frames.push_back(key);
+    if (needsFlags(bits)) wantFlags(key);
     if (!_repeated) {
         if (_seen.add(key)) _pages->metAgain.push_back(key);
     } else if (_repeated->contains(key)) {
@@ -462,6 +472,14 @@ void ColumnReader::countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t s
     HXPageCount page;
     page.add(key);
     countSharers(page, bits);
+}
+
+// Whether what these members hold may be lazily freed.
+bool ColumnReader::needsFlags(HXSharerSets::Bits bits) const {
+    if (!_flags) return false;
+    for (size_t i = 0; i < bits.size(); i++)
+        if ((bits[i] & _withoutLazyFree[i]) != 0) return false;
+    return true;
 }
 
 void ColumnReader::countSharers(const HXPageCount &pages, HXSharerSets::Bits bits) {
