@@ -123,6 +123,7 @@ std::vector<size_t> HXSharing::forAll(size_t count, std::function<void(size_t)> 
     queue.activity = activity.text;
     queue.processOf = activity.processOf;
     queue.costOf = activity.costOf;
+    queue.isOwnWork = activity.isOwnWork;
     return services.dispatch_apply(count, queue, std::move(work));
 }
 
@@ -188,8 +189,7 @@ void HXSharing::readFamilies(std::vector<Tasks> families) {
         repeating.push_back(work);
     }
     readPages(repeating, true);
-    for (const auto &work : works)
-        give(*work);
+    (void)forAll(works.size(), [this, works](size_t i) { give(*works[i]); }, {"", nullptr, nullptr, true});
 }
 
 // Those that answer; the others are no longer in their families.
@@ -212,9 +212,9 @@ HXSharing::Members HXSharing::readAddressSpaces(std::vector<Tasks> &families) {
             (*found)[i].hasNoLazyFree = findsLazilyFreed && isFirst[i] && hasNoLazyFree(*all[i]);
         });
     };
-    const auto givenUp =
-        forAll(all.size(), read,
-               {"reading processes", [&all](size_t i) { return std::to_string(all[i]->pid()); }, nullptr});
+    const auto givenUp = forAll(
+        all.size(), read,
+        {"reading processes", [&all](size_t i) { return std::to_string(all[i]->pid()); }, nullptr, false});
     for (const size_t i : givenUp) {
         _unanswering.insert(all[i]->pid());
         for (Tasks &family : families)
@@ -277,8 +277,9 @@ void HXSharing::readPages(std::vector<std::shared_ptr<Work>> &families, bool isS
         const auto &[work, stretch] = items[i];
         return HXCostOfStretch(*work->family, work->stretches[stretch]);
     };
-    const auto givenUp = forAll(
-        items.size(), read, {"comparing pages", [&](size_t i) { return std::to_string(pidOf(i)); }, costOf});
+    const auto givenUp =
+        forAll(items.size(), read,
+               {"comparing pages", [&](size_t i) { return std::to_string(pidOf(i)); }, costOf, false});
     for (const size_t i : givenUp) {
         items[i].first->hasFailed = true;
         _unanswering.insert(pidOf(i));
@@ -295,7 +296,8 @@ void HXSharing::readPages(std::vector<std::shared_ptr<Work>> &families, bool isS
     }
 }
 
-void HXSharing::give(Work &work) {
+// On any thread, each once.
+void HXSharing::give(Work &work) const {
     std::vector<HXSharedPages> told;
     if (!work.hasFailed)
         told = HXSharesOfFamily(work.tasks, std::move(*work.pages), _setting.reader->pageShift,

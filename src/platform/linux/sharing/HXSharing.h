@@ -50,13 +50,14 @@ class HXSharing {
         std::string text;
         std::function<std::string(size_t)> processOf;
         std::function<uint64_t(size_t)> costOf;
+        bool isOwnWork;
     };
     std::vector<size_t> forAll(size_t count, std::function<void(size_t)> work, const Activity &activity = {});
     Members readAddressSpaces(std::vector<Tasks> &families);
     std::shared_ptr<Work> open(const Tasks &tasks, Members &members);
     void readPages(std::vector<std::shared_ptr<Work>> &families, bool isSecond);
     void readFamilies(std::vector<Tasks> families);
-    void give(Work &family);
+    void give(Work &family) const;
     void measureNotTold(const std::vector<Tasks> &families);
 
     const HXSharingSetting _setting;
