@@ -100,11 +100,14 @@ class ColumnReader {
     void skipHole(uint32_t member, uint64_t from);
     uint64_t nextPage(uint64_t from);
     void countStrip(uint64_t first, uint64_t end);
+    void addPieces(size_t place, size_t end);
+    void addFigures(uint32_t member, uint32_t mapping, const HXFamilyFigures &figures);
     HXFamilyFigures takeEntries(std::span<uint64_t> entries, bool isFile) const;
     HXFamilyFigures takeBase(uint32_t member, bool isFile);
     HXFamilyFigures takeRow(uint32_t member, bool isFile, bool baseIsFile);
     bool isUniform(size_t piece);
-    void countPiece(const Piece &piece);
+    void countPiece(size_t piece);
+    void countUniform(std::span<const HXPageKey> keys);
     void countColumn(size_t piece, size_t place);
     void countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t sharers);
     void wantFlags(HXPageKey key) {
@@ -320,15 +323,7 @@ void ColumnReader::countStrip(uint64_t first, uint64_t end) {
     _active.clear();
     std::fill(_allBits.begin(), _allBits.end(), 0);
     std::vector<uint32_t> layout(_memberCount, HXFamilyPages::kNoMapping);
-    _stripPiece = _pieces.size();
-    const size_t stripEnd = end - _windowStart;
-    for (size_t place = first - _windowStart; place < stripEnd;) {
-        const size_t next = std::min(stripEnd, (place / kPiecePages + 1) * kPiecePages);
-        _pieces.push_back({place, next, {}});
-        place = next;
-    }
-    _same.resize(_pieces.size() * _allBits.size());
-    _own.resize(_same.size());
+    addPieces(first - _windowStart, end - _windowStart);
     bool baseIsFile = false;
     for (uint32_t member = 0; member < _memberCount; member++) {
         if (!_rows[member].isInWindow) continue;
@@ -344,12 +339,7 @@ void ColumnReader::countStrip(uint64_t first, uint64_t end) {
         if (isBase) baseIsFile = all[i].isFile;
         const HXFamilyFigures figures =
             isBase ? takeBase(member, baseIsFile) : takeRow(member, all[i].isFile, baseIsFile);
-        _windowFound += figures.resident + figures.swapped;
-        auto &told = _pages->figures[member];
-        if (told.empty() || told.back().first != all[i].mapping)
-            told.emplace_back(all[i].mapping, figures);
-        else
-            told.back().second += figures;
+        addFigures(member, all[i].mapping, figures);
     }
     if (_active.empty()) {
         _pieces.resize(_stripPiece);
@@ -361,14 +351,29 @@ void ColumnReader::countStrip(uint64_t first, uint64_t end) {
         _pages->layouts.insert(_pages->layouts.end(), layout.begin(), layout.end());
         _layout = std::move(layout);
     }
-    for (size_t piece = _stripPiece; piece < _pieces.size(); piece++) {
-        if (!_repeated && isUniform(piece)) {
-            countPiece(_pieces[piece]);
-            continue;
-        }
-        for (size_t place = _pieces[piece].place; place < _pieces[piece].end; place++)
-            countColumn(piece, place);
+    for (size_t piece = _stripPiece; piece < _pieces.size(); piece++)
+        countPiece(piece);
+}
+
+// Those of a strip, by its places in the window.
+void ColumnReader::addPieces(size_t place, size_t end) {
+    _stripPiece = _pieces.size();
+    while (place < end) {
+        const size_t next = std::min(end, (place / kPiecePages + 1) * kPiecePages);
+        _pieces.push_back({place, next, {}});
+        place = next;
     }
+    _same.resize(_pieces.size() * _allBits.size());
+    _own.resize(_same.size());
+}
+
+void ColumnReader::addFigures(uint32_t member, uint32_t mapping, const HXFamilyFigures &figures) {
+    _windowFound += figures.resident + figures.swapped;
+    auto &told = _pages->figures[member];
+    if (told.empty() || told.back().first != mapping)
+        told.emplace_back(mapping, figures);
+    else
+        told.back().second += figures;
 }
 
 // Turns entries into keys, and counts them.
@@ -429,8 +434,14 @@ bool ColumnReader::isUniform(size_t piece) {
     return std::all_of(own, own + _allBits.size(), [](uint64_t word) { return word == 0; });
 }
 
-void ColumnReader::countPiece(const Piece &piece) {
-    const std::span<const HXPageKey> keys(_keys + piece.place, piece.end - piece.place);
+void ColumnReader::countPiece(size_t piece) {
+    const auto &[place, end, ofBase] = _pieces[piece];
+    if (!_repeated && isUniform(piece)) return countUniform({_keys + place, end - place});
+    for (size_t i = place; i < end; i++)
+        countColumn(piece, i);
+}
+
+void ColumnReader::countUniform(std::span<const HXPageKey> keys) {
     _seen.add(keys, &_pages->metAgain);
     const bool wantsFlags = needsFlags(_allBits);
     HXPageCount pages;
