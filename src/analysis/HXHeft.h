@@ -29,8 +29,8 @@ class HXHeft : public HXHeftSwitches {
     // The targets, in the order given.
     const ProcessList &processes() const { return _processes; }
 
-    // Gathers every process, several at once, then merges and finalises on the calling thread. Once. A
-    // process whose gathering is given up has an error instead of regions.
+    // Gathers every process, several at once, merges them on the calling thread and finalises, several
+    // objects at once. Once. A process whose gathering is given up has an error instead of regions.
     void gatherData();
     // Ends gathering early: processes not yet started are left out. Any thread.
     void cancel() { _isCancelled->store(true, std::memory_order_relaxed); }

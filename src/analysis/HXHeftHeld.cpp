@@ -70,6 +70,7 @@ class HeldObjects {
         }
     }
 
+    // Takes the regions as they are by now.
     explicit HeldObjects(const HXHeft &heft)
         : _objectCount(heft.memoryObjects().size()), _mapped(mappedObjects(heft)) {}
 

@@ -1,6 +1,8 @@
 // The report: what the formatters are called with, in which order.
 #include "analysis/HXHeft.h"
 
+#include <algorithm>
+
 struct HXHeft::Report {
     Processes withWarnings;
     Processes withErrors;

@@ -19,7 +19,7 @@ struct HXMemoryObjectView : HXMemoryTotal {
 };
 
 // Open (regions may be added), then finalised (sizes fixed). Not owned: its regions, which belong to their
-// processes. Created, filled and finalised by one thread.
+// processes. Created and filled by one thread; finalised by one, which may be another.
 class HXMemoryObject {
   public:
     static constexpr int32_t kNoOwner = -1;

@@ -15,5 +15,9 @@ class HXAdaptiveMutex {
     void unlock() { ::pthread_mutex_unlock(&_mutex); }
 
   private:
-    pthread_mutex_t _mutex = PTHREAD_ADAPTIVE_MUTEX_INITIALIZER_NP; // a kind of the GNU C library's
+#ifdef PTHREAD_ADAPTIVE_MUTEX_INITIALIZER_NP // a kind of the GNU C library's
+    pthread_mutex_t _mutex = PTHREAD_ADAPTIVE_MUTEX_INITIALIZER_NP;
+#else
+    pthread_mutex_t _mutex = PTHREAD_MUTEX_INITIALIZER;
+#endif
 };

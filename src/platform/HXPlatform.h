@@ -146,8 +146,8 @@ class HXPlatform {
     // is no such process, EINVAL for a flavor or command that there is not.
 
     // Fills `pids` with the pids of all processes, as many as there is room for, and answers how many were
-    // filled. With a null buffer: how many there are about. Kernel threads are no processes; the kernel
-    // itself is pid 0.
+    // filled. With a null buffer: how many there are about; the next list may be of that moment. Kernel
+    // threads are no processes; the kernel itself is pid 0.
     virtual int32_t proc_listallpids(int32_t *pids, uint32_t bufferBytes) = 0;
 
     // Why the host does not tell of processes, for a message; none when it does. `ofAll`: also why it does

@@ -47,7 +47,7 @@ void HXPidDescriptions::remove(const std::set<int32_t> &pids) {
 
 // Fills the list; false when there is none.
 bool HXProcessSnapshot::readList() {
-    constexpr size_t slack = 20; // processes that start between the two calls
+    constexpr size_t slack = 20; // processes that may start between the two calls
     const int32_t expected = _host.proc_listallpids(nullptr, 0);
     if (expected < 0) return false;
     std::vector<int32_t> pids(static_cast<size_t>(expected) + slack);

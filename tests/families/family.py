@@ -149,13 +149,14 @@ def dontfork():
 
 
 def freed_lazily(who):
-    """One of them wrote to half of the memory and freed half of that lazily."""
+    """One of them wrote to half of the memory and freed half of that lazily; an "heir" frees memory that others have, too."""
     payload = Memory(8 * MIB).write()
 
     other = Memory(PAGE, code=False)
 
     def free():
-        payload.write(0, 4 * MIB, 2)
+        if who != "heir":
+            payload.write(0, 4 * MIB, 2)
         payload.advise(FREE, 0, 2 * MIB)
         # Each processor keeps a few such pages to itself until it locks one.
         for processor in os.sched_getaffinity(0):
@@ -163,8 +164,10 @@ def freed_lazily(who):
             call("mlock", other.start, PAGE)
             call("munlock", other.start, PAGE)
 
-    fork("child", free if who == "child" else lambda: None)
+    fork("child", free if who != "parent" else lambda: None)
     fork("other")
+    if who == "heir":
+        return {}
     if who == "parent":
         free()
     rest = "parent other" if who == "child" else "child other"

@@ -12,6 +12,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <memory>
 #include <utility>
 
 namespace {
@@ -21,9 +22,9 @@ class TaskSymbolicator final : public RVSymbolicator {
     std::vector<HXLoadedImage> images;
 };
 
-// Whether one more task may keep three descriptors: half of them are for reading.
+// Whether one more task may keep two descriptors: half of them are for reading.
 bool maySpareDescriptors(size_t taskCount) {
-    constexpr rlim_t share = 6;
+    constexpr rlim_t share = 4;
     rlimit limit;
     return ::getrlimit(RLIMIT_NOFILE, &limit) == 0 && taskCount < limit.rlim_cur / share;
 }
@@ -39,8 +40,9 @@ kern_return_t errorOfOpening(int error) {
 kern_return_t HXLinuxPlatform::task_for_pid(mach_port_t, int32_t pid, mach_port_t *task) {
     std::unique_ptr<HXLinuxTask> opened;
     kern_return_t error = openTask(pid, true, &opened);
-    // It may have ended since it was listed.
-    if (opened && opened->residentSizeWhenOpened() == 0) error = openTask(pid, false, &opened);
+    // It may have ended since it was listed, or its leading thread alone.
+    if (error == KERN_FAILURE || (opened && opened->residentSizeWhenOpened() == 0))
+        error = openTask(pid, false, &opened);
     if (error == KERN_SUCCESS) *task = _tasks.add(std::move(opened));
     return error;
 }

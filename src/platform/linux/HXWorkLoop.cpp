@@ -52,7 +52,7 @@ std::vector<size_t> HXWorkLoop::run(size_t iterations, size_t workers,
     return loop->_givenUp;
 }
 
-// False when no thread may be had: those that run share the work. They go on meanwhile.
+// False when no thread may be had: those that run share the work.
 bool HXWorkLoop::startWorker(std::unique_lock<std::mutex> &lock) {
     Worker &worker = *_workers.emplace_back(std::make_unique<Worker>());
     _running++;

@@ -46,11 +46,12 @@ class HXWorkLoop : public std::enable_shared_from_this<HXWorkLoop> {
         bool hasEnded = false;
     };
 
+    // These give the lock up while a thread is started; `_workers` is changed by the watching thread alone.
     bool startWorker(std::unique_lock<std::mutex> &lock);
+    void look(Worker &worker, std::unique_lock<std::mutex> &lock);
     void runWorker(Worker &worker);
     void watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds pause, const Look &observer);
     void tell(std::unique_lock<std::mutex> &lock, const Look &look) const;
-    void look(Worker &worker, std::unique_lock<std::mutex> &lock);
     static bool hasProgressed(Worker &worker);
 
     const size_t _iterations;

@@ -207,6 +207,27 @@ TEST_F(HXLinuxPlatformTest, FindsMappingsInAnyOrder) {
     EXPECT_EQ(region(task), MACH_SEND_INVALID_DEST);
 }
 
+// The list's records serve for opening, but not for what has ended since.
+TEST_F(HXLinuxPlatformTest, ProcessesEndAfterTheyWereListed) {
+    process(5, "runs", kMapping);
+    process(6, "ends", kMapping);
+    process(7, "goes", kMapping);
+    EXPECT_EQ(platform.proc_listallpids(nullptr, 0), 4);
+    process(8, "comes", kMapping); // one list is of one moment
+    int32_t pids[10];
+    EXPECT_EQ(platform.proc_listallpids(pids, sizeof pids), 4);
+    EXPECT_EQ(platform.proc_listallpids(pids, sizeof pids), 5);
+    process(6, "ends", "", 'Z');
+    for (const char *const file : {"7/stat", "7/comm", "7/maps", "7/smaps"})
+        proc.remove(file);
+    proc.remove("5/stat");
+    mach_port_t task = 0;
+    EXPECT_EQ(platform.task_for_pid(1, 6, &task), KERN_FAILURE);
+    EXPECT_EQ(platform.task_for_pid(1, 7, &task), KERN_FAILURE);
+    proc.write("5/status", "VmRSS:\t      12 kB\nThreads:\t1\n");
+    EXPECT_EQ(platform.task_for_pid(1, 5, &task), KERN_SUCCESS) << "its record is read once";
+}
+
 TEST_F(HXLinuxPlatformTest, ProcessesVanishAndRefuse) {
     mach_port_t task = 0;
     kernelThread(2);

@@ -60,7 +60,7 @@ class HXAddressSpace {
     std::string_view kept(std::string_view text);
     HXMappedPath mappedPath(std::string_view raw, HXNamedTags &tags);
 
-    // All of what follows: taken from the heap in few pieces, which threads would else wait to give back.
+    // Of all that follows. Freed piece by piece it would make threads wait for one another.
     std::pmr::monotonic_buffer_resource _memory{4096};
     std::pmr::deque<HXMapping> _mappings{
         &_memory}; // a million may come, which nobody should copy as they grow

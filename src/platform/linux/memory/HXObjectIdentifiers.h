@@ -86,7 +86,6 @@ class HXObjectIdentifiers {
         bool operator==(const Key &) const = default;
     };
     // With a seed of this run, so that nobody can choose keys that meet in one bucket.
-    struct Remembered;
     struct KeyHash {
         uint64_t seed;
         size_t operator()(const Key &key) const;
@@ -102,6 +101,8 @@ class HXObjectIdentifiers {
         HXAdaptiveMutex mutex;
         HXNumberTable<Key, KeyHash> numbers;
     };
+
+    struct Remembered; // by a thread
 
     explicit HXObjectIdentifiers(KeyHash hash);
     uint64_t interned(const Key &key);

@@ -1,7 +1,6 @@
 #include "platform/linux/pages/HXLinuxTask.h"
 
 #include "platform/linux/pages/HXRepeatedPages.h"
-#include "platform/linux/procfs/HXProcFile.h"
 #include "platform/linux/procfs/HXTaskFiles.h"
 
 #include <algorithm>
@@ -27,13 +26,9 @@ bool HXDescriptorTurns::run(const std::function<void()> &read) {
 HXLinuxTask::HXLinuxTask(int32_t pid, uint32_t number, HXOpenProcess process, HXDescriptor maps,
                          bool keepsOpen, HXLinuxProcesses &processes, HXDescriptorTurns &turns)
     : _pid(pid), _number(number), _startTime(process.stat.startTime), _startStack(process.stat.startStack),
-      _processes(processes), _turns(turns), _openStatus(HXOpenAt(process.directory, "status")),
-      _status(HXReadOpenStatus(_openStatus, process.directory)),
+      _processes(processes), _turns(turns), _status(HXReadStatus(process.directory)),
       _residentSize(_status ? _status->residentSize.value_or(0) : 0) {
-    if (!keepsOpen) {
-        _openStatus = {};
-        return;
-    }
+    if (!keepsOpen) return;
     _directory = std::move(process.directory);
     _maps = std::move(maps);
 }
@@ -147,17 +142,12 @@ void HXLinuxTask::readOnce(const HXReaderSetting &setting, bool needsDirtyPages)
     _maps.reset();
 }
 
-std::optional<HXStatusRecord> HXLinuxTask::readStatus() {
-    const HXDescriptor open = std::move(_openStatus);
-    return open ? HXReadOpenStatus(open, _directory) : HXReadStatus(_directory);
-}
-
 // The first reading is compared with the counters behind it alone, so that most processes cost one more small
 // file, which also answers the next question for the status.
 void HXLinuxTask::compare(const HXReaderSetting &setting, bool isFirst) {
     _difference.reset();
     if (_addressSpace->endError != KERN_INVALID_ADDRESS || _addressSpace->count() == 0) return;
-    const auto before = std::exchange(_status, readStatus());
+    const auto before = std::exchange(_status, HXReadStatus(_directory));
     _used[0] = _used[1] = false;
     if (!_status) return;
     const uint64_t error = setting.machine->counterErrorPages(_status->threadCount.value_or(1));
@@ -204,7 +194,7 @@ uint32_t HXTaskTable::add(std::unique_ptr<HXLinuxTask> task) {
 
 void HXTaskTable::remove(uint32_t port) {
     if (last.port == port) last = {};
-    std::unique_ptr<HXLinuxTask> removed; // which takes a while, and others look for theirs
+    std::unique_ptr<HXLinuxTask> removed; // destroyed behind the lock: others look for theirs meanwhile
     const std::lock_guard lock(_mutex);
     const auto found = _tasks.find(port);
     if (found == _tasks.end()) return;

@@ -112,7 +112,6 @@ class HXLinuxTask {
     void settle(const HXReaderSetting &setting);
     bool readLazilyFreed(const HXReaderSetting &setting);
     void finishReading(const HXReaderSetting &setting);
-    std::optional<HXStatusRecord> readStatus();
     void compare(const HXReaderSetting &setting, bool isFirst);
 
     const int32_t _pid;
@@ -122,7 +121,7 @@ class HXLinuxTask {
     HXLinuxProcesses &_processes;
     HXDescriptorTurns &_turns;
     HXDescriptor _directory;
-    HXDescriptor _maps, _openStatus; // until the first reading
+    HXDescriptor _maps; // until the first reading
     const std::chrono::steady_clock::time_point _opened = std::chrono::steady_clock::now();
     std::unique_ptr<HXAddressSpace> _addressSpace;
     size_t _cursor = 0;

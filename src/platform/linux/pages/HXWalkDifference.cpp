@@ -1,6 +1,7 @@
 #include "platform/linux/pages/HXWalkDifference.h"
 
 #include <algorithm>
+#include <string_view>
 
 namespace {
 

@@ -20,7 +20,7 @@ struct HXOpenProcess {
     // Its directory in /proc; of one whose leading thread has ended that of another thread, which shows the
     // same memory.
     HXDescriptor directory;
-    HXStatRecord stat; // of its leading thread, whose start time tells the process from others of its pid
+    HXStatRecord stat; // of its leading thread; the start time tells the process from others of its pid
 };
 
 class HXLinuxProcesses {
@@ -36,7 +36,9 @@ class HXLinuxProcesses {
         : _procPath(std::move(procPath)), _forAll(std::move(forAll)) {}
 
     // None with errno set: ESRCH, EACCES or EPERM, or EMFILE when descriptors or memory do not suffice.
-    // With `asListed` the record may be as old as the list that has the process, but once.
+    // With `asListed` the first opening takes the record that the list read: it may be of a state before the
+    // process ended or executed another program, or of an earlier process of that pid. The directory is
+    // today's.
     std::optional<HXOpenProcess> open(int32_t pid, bool asListed = false);
 
     // The directory of `pid` alone, whatever has become of its leading thread; not open with errno set.

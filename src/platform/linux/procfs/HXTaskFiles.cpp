@@ -33,15 +33,10 @@ uint64_t HXReadNamespace(const HXDescriptor &process, const char *link) {
 }
 
 std::optional<HXStatusRecord> HXReadStatus(const HXDescriptor &process) {
-    return HXReadOpenStatus(HXOpenAt(process, "status"), process);
-}
-
-std::optional<HXStatusRecord> HXReadOpenStatus(const HXDescriptor &status, const HXDescriptor &process) {
     char buffer[8192]; // of a process in few groups
-    const ssize_t got = status ? status.readAt(0, buffer, sizeof buffer) : -1;
-    if (got < 0) return std::nullopt;
-    const std::string_view text(buffer, static_cast<size_t>(got));
-    if (isWholeStatus(text)) return HXParseStatus(text);
+    const auto text = HXReadOnce(process, "status", buffer);
+    if (!text) return std::nullopt;
+    if (isWholeStatus(*text)) return HXParseStatus(*text);
     // A process may have 65536 groups (NGROUPS_MAX), whose numbers of up to ten digits come before the
     // figures.
     constexpr size_t limit = 1 << 20;

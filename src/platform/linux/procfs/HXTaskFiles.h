@@ -14,5 +14,3 @@ uint64_t HXReadNamespace(const HXDescriptor &process, const char *link);
 
 // None with errno set, as for a text that is cut (EIO).
 std::optional<HXStatusRecord> HXReadStatus(const HXDescriptor &process);
-// The same of an open status file, as it is now.
-std::optional<HXStatusRecord> HXReadOpenStatus(const HXDescriptor &status, const HXDescriptor &process);

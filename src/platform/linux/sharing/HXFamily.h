@@ -25,7 +25,6 @@ struct HXFamilyRange {
 struct HXFamilyMember {
     HXDescriptor pagemap;
     std::vector<HXFamilyRange> ranges; // of private mappings, ascending
-    bool hasNoLazyFree = false;        // for sure, before its page tables were read
 };
 
 // What is the same for all who read it, on any thread.

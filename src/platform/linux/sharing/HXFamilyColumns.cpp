@@ -111,9 +111,8 @@ class ColumnReader {
     void countColumn(size_t piece, size_t place);
     void countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t sharers);
     void wantFlags(HXPageKey key) {
-        if ((key & kSwappedKey) == 0) _frames.push_back(key);
+        if (_flags && (key & kSwappedKey) == 0) _frames.push_back(key);
     }
-    bool needsFlags(HXSharerSets::Bits bits) const;
     void countSharers(const HXPageCount &pages, HXSharerSets::Bits bits);
     void endStrip();
     void findLazilyFreed();
@@ -140,13 +139,12 @@ class ColumnReader {
     uint64_t *const _reference, *const _scratch, *const _keys; // the first row, the one just read, the bases'
     std::optional<uint32_t> _referenceMember;
     std::vector<Piece> _pieces;
-    std::vector<uint64_t> _same,
-        _own; // by piece, a bit for each active member: holds the base's keys, or its own
+    // By piece, a bit for each active member: it holds the base's keys, or its own.
+    std::vector<uint64_t> _same, _own;
     std::vector<uint64_t> _differs; // by place: not 0 where the active rows are not equal
     std::vector<Row> _rows;
     std::vector<uint32_t> _active;                 // members with a mapping in the strip
     std::vector<uint64_t> _allBits;                // of these
-    std::vector<uint64_t> _withoutLazyFree;        // members, as HXFamilyMember says
     bool _isSparse;                                // the last window, or what is expected of the first
     std::vector<uint32_t> _layout;                 // of the strip, then of the last that was counted
     uint64_t _windowStart = 0, _windowLength = 0;  // pages
@@ -187,14 +185,10 @@ ColumnReader::ColumnReader(const HXColumnRequest &request, std::atomic<uint32_t>
       _stride(_windowPages + 8), _entries(roomForEntries(_stride * (kOwnRows + _memberCount))),
       _reference(_entries.data()), _scratch(_reference + _stride), _keys(_scratch + _stride),
       _differs(_windowPages), _rows(_memberCount), _allBits((_memberCount + 63) / 64),
-      _withoutLazyFree(_allBits.size()),
       _isSparse(request.stretch.end - request.stretch.first > kWindowPages),
       _layout(_memberCount, HXFamilyPages::kNoMapping), _groups(_memberCount), _seen(*_family.seen),
       _pages(std::make_unique<HXFamilyPages>(_memberCount, kSetsOfStretch)) {
     if (request.findsLazilyFreed) _flags.emplace();
-    for (uint32_t member = 0; member < _memberCount; member++)
-        if (_family.members[member].hasNoLazyFree)
-            _withoutLazyFree[member / 64] |= uint64_t{1} << (member % 64);
     if (request.repeated) _repeated.emplace(*request.repeated);
 }
 
@@ -404,7 +398,7 @@ HXFamilyFigures ColumnReader::takeBase(uint32_t member, bool isFile) {
     return figures;
 }
 
-// Another member's. Where its entries are the base's there is nothing left to do, which costs less than half.
+// Another member's. Where its entries are the base's there is nothing left to do.
 HXFamilyFigures ColumnReader::takeRow(uint32_t member, bool isFile, bool baseIsFile) {
     HXFamilyFigures figures;
     const uint32_t base = _active.front();
@@ -443,12 +437,11 @@ void ColumnReader::countPiece(size_t piece) {
 
 void ColumnReader::countUniform(std::span<const HXPageKey> keys) {
     _seen.add(keys, &_pages->metAgain);
-    const bool wantsFlags = needsFlags(_allBits);
     HXPageCount pages;
     for (const HXPageKey key : keys) {
         if (key == 0) continue;
         pages.add(key);
-        if (wantsFlags) wantFlags(key);
+        wantFlags(key);
     }
     if (pages.all() != 0 && _active.size() > 1) countSharers(pages, _allBits);
 }
@@ -470,7 +463,7 @@ void ColumnReader::countColumn(size_t piece, size_t place) {
 }
 
 void ColumnReader::countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t sharers) {
-    if (needsFlags(bits)) wantFlags(key);
+    wantFlags(key);
     if (!_repeated) {
         if (_seen.add(key)) _pages->metAgain.push_back(key);
     } else if (_repeated->contains(key)) {
@@ -483,14 +476,6 @@ void ColumnReader::countGroup(HXPageKey key, HXSharerSets::Bits bits, uint32_t s
     HXPageCount page;
     page.add(key);
     countSharers(page, bits);
-}
-
-// Whether what these members hold may be lazily freed.
-bool ColumnReader::needsFlags(HXSharerSets::Bits bits) const {
-    if (!_flags) return false;
-    for (size_t i = 0; i < bits.size(); i++)
-        if ((bits[i] & _withoutLazyFree[i]) != 0) return false;
-    return true;
 }
 
 void ColumnReader::countSharers(const HXPageCount &pages, HXSharerSets::Bits bits) {

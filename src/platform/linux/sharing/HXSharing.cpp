@@ -26,13 +26,6 @@ bool holdsPages(const HXMapping &mapping) {
     return (mapping.anonymousPages | mapping.swappedPages | mapping.hugePages) != 0;
 }
 
-// Whether the kernel says that no page is lazily freed; it looks at all of them.
-bool hasNoLazyFree(const HXLinuxTask &task) {
-    char text[4096]; // of some 25 lines
-    const auto rollup = HXReadOnce(task.directory(), "smaps_rollup", text);
-    return rollup && HXParseLabelled(*rollup, "LazyFree:") == 0;
-}
-
 // Without a page map where the task cannot be compared with others.
 HXFamilyMember memberOf(const HXLinuxTask &task, uint32_t pageShift) {
     HXFamilyMember member;
@@ -195,21 +188,14 @@ void HXSharing::readFamilies(std::vector<Tasks> families) {
 // Those that answer; the others are no longer in their families.
 HXSharing::Members HXSharing::readAddressSpaces(std::vector<Tasks> &families) {
     Tasks all;
-    std::vector<bool> isFirst;
-    for (const Tasks &family : families) {
+    for (const Tasks &family : families)
         all.insert(all.end(), family.begin(), family.end());
-        isFirst.resize(all.size());
-        isFirst[all.size() - family.size()] = true;
-    }
     const auto found = std::make_shared<std::vector<HXFamilyMember>>(all.size());
-    const auto read = [all, isFirst, found, reader = _setting.reader,
-                       needsDirtyPages = _setting.needsDirtyPages,
+    const auto read = [all, found, reader = _setting.reader, needsDirtyPages = _setting.needsDirtyPages,
                        findsLazilyFreed = _findsLazilyFreed](size_t i) {
         all[i]->withDescriptors([&] {
             all[i]->readForSharing(*reader, needsDirtyPages, findsLazilyFreed);
             (*found)[i] = memberOf(*all[i], reader->pageShift);
-            // Most of a family's pages are the first one's, too, and flags of frames cost more.
-            (*found)[i].hasNoLazyFree = findsLazilyFreed && isFirst[i] && hasNoLazyFree(*all[i]);
         });
     };
     const auto givenUp = forAll(

@@ -57,7 +57,7 @@ class HXSharing {
     std::shared_ptr<Work> open(const Tasks &tasks, Members &members);
     void readPages(std::vector<std::shared_ptr<Work>> &families, bool isSecond);
     void readFamilies(std::vector<Tasks> families);
-    void give(Work &family) const;
+    void give(Work &work) const;
     void measureNotTold(const std::vector<Tasks> &families);
 
     const HXSharingSetting _setting;
