@@ -152,16 +152,15 @@ void HXHeft::merge(HXMemoryRegion &region, const HXProcess &process, HXMemoryObj
 
 // Every object lives in exactly one of the maps or shares with nothing; together they are all objects.
 void HXHeft::finalizeObjects() {
-    constexpr size_t piece = 4096;
-    forAll((_objects.size() + piece - 1) / piece, [this](size_t number) {
+    constexpr size_t piece = 4096, leastObjects = 32768;
+    forAll((_objects.size() + piece - 1) / piece, leastObjects, [this](size_t number) {
         const size_t end = std::min((number + 1) * piece, _objects.size());
         for (size_t i = number * piece; i < end; i++)
             _objects[i].finalize();
     });
 }
 
-void HXHeft::forAll(size_t count, std::function<void(size_t)> work) const {
-    constexpr size_t leastObjects = 8192; // that are worth starting threads for
+void HXHeft::forAll(size_t count, size_t leastObjects, std::function<void(size_t)> work) const {
     if (_objects.size() < leastObjects) {
         for (size_t i = 0; i < count; i++)
             work(i);

@@ -89,8 +89,9 @@ class HXHeft : public HXHeftSwitches {
     };
     using GroupReports = std::vector<GroupReport>;
 
-    // Calls `work` with all numbers below `count`, several at once where there is much to be done.
-    void forAll(size_t count, std::function<void(size_t)> work) const;
+    // Calls `work` with all numbers below `count`, several at once where there are `leastObjects`: for fewer
+    // threads cost more than they save.
+    void forAll(size_t count, size_t leastObjects, std::function<void(size_t)> work) const;
     void examineTogether();
     void gatherProcesses();
     void setAside(const HXProcess &unanswering);

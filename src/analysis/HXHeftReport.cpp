@@ -60,10 +60,10 @@ void HXHeft::reportProcess(const HXProcess &process, Report &report, const Group
 // What is said of each is worked out for many at a time, which is little enough to keep.
 void HXHeft::reportProcesses(const Processes &processes, Report &report, const HXHeftSharingData &sharing,
                              bool summarize) {
-    constexpr size_t most = 512;
+    constexpr size_t most = 512, leastObjects = 8192;
     for (size_t first = 0; first < processes.size(); first += most) {
         std::vector<GroupReports> groups(std::min(most, processes.size() - first));
-        forAll(groups.size(),
+        forAll(groups.size(), leastObjects,
                [&](size_t i) { groups[i] = groupReports(*processes[first + i], sharing, summarize); });
         for (size_t i = 0; i < groups.size(); i++)
             reportProcess(*processes[first + i], report, groups[i]);
@@ -92,7 +92,8 @@ void HXHeft::printOutputVerbose(bool verbose, bool summarize) {
 
     HXHeftSharingData sharing;
     HXCategoryMap summary;
-    forAll(2, [&](size_t i) {
+    constexpr size_t leastObjects = 16384;
+    forAll(2, leastObjects, [&](size_t i) {
         if (i == 0)
             sharing = _sharingData();
         else
