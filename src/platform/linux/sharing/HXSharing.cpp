@@ -95,7 +95,7 @@ void HXSharing::measureNotTold(const std::vector<Tasks> &families) {
     for (const Tasks &family : families)
         all.insert(all.end(), family.begin(), family.end());
     const auto size = std::make_shared<std::atomic<uint64_t>>(0);
-    const auto givenUp = forAll(all.size(), [all, size](size_t i) {
+    const auto givenUp = _setting.services->dispatch_apply(all.size(), newQueue(), [all, size](size_t i) {
         char text[4096]; // of some 25 lines
         const auto rollup = HXReadOnce(all[i]->directory(), "smaps_rollup", text);
         if (!rollup) return;
@@ -108,16 +108,8 @@ void HXSharing::measureNotTold(const std::vector<Tasks> &families) {
     _sizeNotTold = _sizeNotTold.value_or(0) + *size;
 }
 
-// Iterations that did not answer.
-std::vector<size_t> HXSharing::forAll(size_t count, std::function<void(size_t)> work,
-                                      const Activity &activity) {
-    HXServices &services = *_setting.services;
-    HXDispatchQueue queue = services.dispatch_queue_create("org.heft.sharing", QOS_CLASS_UTILITY);
-    queue.activity = activity.text;
-    queue.processOf = activity.processOf;
-    queue.costOf = activity.costOf;
-    queue.isOwnWork = activity.isOwnWork;
-    return services.dispatch_apply(count, queue, std::move(work));
+HXDispatchQueue HXSharing::newQueue() const {
+    return _setting.services->dispatch_queue_create("org.heft.sharing", QOS_CLASS_UTILITY);
 }
 
 // Processes that were forked from each other and executed nothing since have their stacks at one place, which
@@ -154,7 +146,7 @@ HXSharing::Tasks HXSharing::findMerged(const Tasks &tasks) {
     uint64_t pages = 0;
     if (!shared || !HXTextCursor{*shared}.number(&pages) || pages == 0) return {};
     const auto isMerged = std::make_shared<std::vector<std::atomic<bool>>>(tasks.size());
-    (void)forAll(tasks.size(), [tasks, isMerged](size_t i) {
+    (void)_setting.services->dispatch_apply(tasks.size(), newQueue(), [tasks, isMerged](size_t i) {
         char text[512];
         const auto figures = HXReadOnce(tasks[i]->directory(), "ksm_stat", text);
         // A kernel that does not tell (before 6.1) may have merged any.
@@ -182,7 +174,10 @@ void HXSharing::readFamilies(std::vector<Tasks> families) {
         repeating.push_back(work);
     }
     readPages(repeating, true);
-    (void)forAll(works.size(), [this, works](size_t i) { give(*works[i]); }, {"", nullptr, nullptr, true});
+    HXDispatchQueue queue = newQueue();
+    queue.isOwnWork = true;
+    (void)_setting.services->dispatch_apply(works.size(), queue,
+                                            [this, works](size_t i) { give(*works[i]); });
 }
 
 // Those that answer; the others are no longer in their families.
@@ -198,10 +193,10 @@ HXSharing::Members HXSharing::readAddressSpaces(std::vector<Tasks> &families) {
             (*found)[i] = memberOf(*all[i], reader->pageShift);
         });
     };
-    const auto givenUp = forAll(
-        all.size(), read,
-        {"reading processes", [&all](size_t i) { return std::to_string(all[i]->pid()); }, nullptr, false});
-    for (const size_t i : givenUp) {
+    HXDispatchQueue queue = newQueue();
+    queue.activity = "reading processes";
+    queue.processOf = [&all](size_t i) { return std::to_string(all[i]->pid()); };
+    for (const size_t i : _setting.services->dispatch_apply(all.size(), queue, read)) {
         _unanswering.insert(all[i]->pid());
         for (Tasks &family : families)
             std::erase(family, all[i]);
@@ -263,10 +258,11 @@ void HXSharing::readPages(std::vector<std::shared_ptr<Work>> &families, bool isS
         const auto &[work, stretch] = items[i];
         return HXCostOfStretch(*work->family, work->stretches[stretch]);
     };
-    const auto givenUp =
-        forAll(items.size(), read,
-               {"comparing pages", [&](size_t i) { return std::to_string(pidOf(i)); }, costOf, false});
-    for (const size_t i : givenUp) {
+    HXDispatchQueue queue = newQueue();
+    queue.activity = "comparing pages";
+    queue.processOf = [&](size_t i) { return std::to_string(pidOf(i)); };
+    queue.costOf = costOf;
+    for (const size_t i : _setting.services->dispatch_apply(items.size(), queue, read)) {
         items[i].first->hasFailed = true;
         _unanswering.insert(pidOf(i));
     }

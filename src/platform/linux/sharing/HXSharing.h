@@ -45,14 +45,7 @@ class HXSharing {
 
     std::vector<Tasks> findFamilies(const Tasks &tasks);
     Tasks findMerged(const Tasks &tasks);
-    // HXDispatchQueue's.
-    struct Activity {
-        std::string text;
-        std::function<std::string(size_t)> processOf;
-        std::function<uint64_t(size_t)> costOf;
-        bool isOwnWork;
-    };
-    std::vector<size_t> forAll(size_t count, std::function<void(size_t)> work, const Activity &activity = {});
+    HXDispatchQueue newQueue() const;
     Members readAddressSpaces(std::vector<Tasks> &families);
     std::shared_ptr<Work> open(const Tasks &tasks, Members &members);
     void readPages(std::vector<std::shared_ptr<Work>> &families, bool isSecond);
