@@ -62,8 +62,8 @@ class HXAddressSpace {
 
     // Of all that follows. Freed piece by piece it would make threads wait for one another.
     std::pmr::monotonic_buffer_resource _memory{4096};
-    std::pmr::deque<HXMapping> _mappings{
-        &_memory}; // a million may come, which nobody should copy as they grow
+    // A million may come, which nobody should copy as they grow.
+    std::pmr::deque<HXMapping> _mappings{&_memory};
     std::pmr::deque<HXMappedPath> _paths{&_memory}; // the first one is empty
     std::pmr::unordered_map<std::string_view, uint32_t> _pathIndexes{&_memory};
     std::string_view _lastPath; // mappings of one file mostly follow each other

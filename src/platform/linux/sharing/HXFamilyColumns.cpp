@@ -272,10 +272,12 @@ void ColumnReader::readRow(uint32_t member, uint64_t first, uint64_t end) {
     const ssize_t got = _family.members[member].pagemap.readAt(from * sizeof *entries, entries, bytes);
     const size_t count = got < 0 ? 0 : static_cast<size_t>(got) / sizeof *entries;
     std::fill(entries + count, entries + (to - from), 0); // where another window or family has left something
-    if (_referenceMember)
+    if (_referenceMember) {
         keepRow(member);
-    else
-        _referenceMember = member, row.alike = ~uint64_t{0};
+    } else {
+        _referenceMember = member;
+        row.alike = ~uint64_t{0};
+    }
     // One whose address space has gone has nothing left to tell, here or further on, and no holes to skip.
     if (count == 0)
         row.nothingUpTo = UINT64_MAX;
