@@ -79,10 +79,13 @@ void HXLinuxPlatform::prepareProcess(const char *program) {
         [[maybe_unused]] const int opened = ::open("/dev/null", O_RDWR);
     }
     HXWatchStandardOutput();
-    // Heaps of worker threads then grow in few steps, each of which is a system call that stops the others:
-    // by a mebibyte instead of 128 KiB.
-    constexpr int heapStep = 1 << 20;
+    // The first heap grows in few steps, and all keep what is free in them (mallopt(3)): what one process
+    // took serves for the next. Only pieces that hardly come twice are mapped by themselves; HXWorkLoop's
+    // room for a thread must not be.
+    constexpr int heapStep = 1 << 20, mappedAlone = 8 << 20, keptFree = 64 << 20;
     ::mallopt(M_TOP_PAD, heapStep);
+    ::mallopt(M_MMAP_THRESHOLD, mappedAlone);
+    ::mallopt(M_TRIM_THRESHOLD, keptFree);
     rlimit limit;
     if (::getrlimit(RLIMIT_NOFILE, &limit) != 0) return;
     limit.rlim_cur = limit.rlim_max;

@@ -7,6 +7,7 @@
 #include "platform/linux/procfs/HXTaskFiles.h"
 #include "platform/linux/sharing/HXSharing.h"
 
+#include <fcntl.h>
 #include <sys/resource.h>
 
 #include <algorithm>
@@ -199,10 +200,11 @@ std::vector<task_held_object> HXLinuxPlatform::proc_held_objects(int32_t pid) {
     std::vector<task_held_object> held;
     if (pid <= 0) return held;
     (void)_turns.run([&] {
-        auto found = _held.open(_processes.openDirectory(pid));
+        auto found = _held.open(_processes.openDescriptors(pid));
         if (!found) { // another thread shows them where the leading one has ended
             const auto process = _processes.open(pid);
-            if (process && process->stat.lacksLeader()) found = _held.open(process->directory);
+            if (process && process->stat.lacksLeader())
+                found = _held.open(HXOpenAt(process->directory, "fd", O_DIRECTORY));
         }
         held = std::move(found).value_or(std::vector<task_held_object>());
     });

@@ -114,6 +114,10 @@ HXDescriptor HXLinuxProcesses::openDirectory(int32_t pid) const {
     return HXOpenAt(AT_FDCWD, pathOf(pid, "").c_str(), O_PATH | O_DIRECTORY);
 }
 
+HXDescriptor HXLinuxProcesses::openDescriptors(int32_t pid) const {
+    return HXOpenAt(AT_FDCWD, pathOf(pid, "fd").c_str(), O_DIRECTORY);
+}
+
 std::optional<HXOpenProcess> HXLinuxProcesses::open(int32_t pid, bool asListed) {
     const HXShortageWatch watch;
     HXDescriptor directory = openDirectory(pid);

@@ -41,8 +41,9 @@ class HXLinuxProcesses {
     // today's.
     std::optional<HXOpenProcess> open(int32_t pid, bool asListed = false);
 
-    // The directory of `pid` alone, whatever has become of its leading thread; not open with errno set.
-    HXDescriptor openDirectory(int32_t pid) const;
+    // The list of descriptors of `pid` alone, whatever has become of its leading thread; not open with errno
+    // set.
+    HXDescriptor openDescriptors(int32_t pid) const;
 
     // The number of the running process here, which need not be the one that getpid(2) tells: /proc may be
     // that of another pid namespace (pid_namespaces(7)). -1 when the process is not in it.
@@ -69,6 +70,7 @@ class HXLinuxProcesses {
     };
 
     std::string pathOf(int32_t pid, const char *file) const;
+    HXDescriptor openDirectory(int32_t pid) const;
     std::optional<std::vector<int32_t>> findAll() const;
     HXDescriptor openThread(int32_t pid, const HXDescriptor &leader);
     bool is64bit(const HXStatRecord &stat);

@@ -111,20 +111,23 @@ std::vector<task_held_object> HXHeldObjects::mapped(const HXDescriptor &process,
     return all;
 }
 
-std::optional<std::vector<task_held_object>> HXHeldObjects::open(const HXDescriptor &process) {
+std::optional<std::vector<task_held_object>> HXHeldObjects::open(const HXDescriptor &descriptors) {
     std::vector<task_held_object> all;
     std::unordered_set<uint64_t> seen;
-    const HXDescriptor descriptors = HXOpenAt(process, "fd", O_DIRECTORY);
     if (!descriptors) return std::nullopt;
     bool showsAny = false;
-    bool knowsPlaces = false; // few processes have such descriptors
+    HXDescriptor process; // few have such descriptors
     HXForEachEntry(descriptors, [&](const char *name) {
         if (*name == '.') return true;
         showsAny = true;
         char buffer[PATH_MAX];
         const auto link = HXReadLink(descriptors, name, buffer);
         if (!link || !isNameless(*link)) return true;
-        if (!std::exchange(knowsPlaces, true)) _places.learn(process);
+        if (!process) {
+            process = HXOpenAt(descriptors, "..", O_PATH | O_DIRECTORY);
+            if (!process) return true;
+            _places.learn(process);
+        }
         const auto mount = mountOf(process, name);
         if (!mount || !_places.isMemoryMount(*mount)) return true;
         const auto found = find(process, (std::string("fd/") + name).c_str());

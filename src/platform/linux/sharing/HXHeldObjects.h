@@ -24,7 +24,8 @@ class HXHeldObjects {
     std::vector<task_held_object> mapped(const HXDescriptor &process, const HXAddressSpace &addressSpace);
     // What a process has descriptors of, without a name. The links of all descriptors are read; followed are
     // only those of files that are in memory by their mount. None where the process shows no descriptor.
-    std::optional<std::vector<task_held_object>> open(const HXDescriptor &process);
+    // `descriptors`: its directory "fd".
+    std::optional<std::vector<task_held_object>> open(const HXDescriptor &descriptors);
     // The memory file systems and the segments that nobody has attached, of the places of all processes that
     // were asked for before; and, as their container, all shared memory.
     std::vector<task_held_object> ofKernel();
