@@ -4,9 +4,11 @@ void HXFamilyPages::addRest(HXSharerSets::Bits set, std::span<const uint32_t> la
                             const HXPageCount &pages) {
     const uint32_t lowest = HXSharerSets::first(set);
     HXSharerSets::forEachMember(set, [&](uint32_t member) {
-        Rest &entry = rest[{member, layout[member]}];
-        entry.pages += pages;
-        if (member == lowest) entry.counted += pages;
+        auto *&last = _lastRest[member];
+        if (last == nullptr || last->first.mapping != layout[member])
+            last = &*rest.try_emplace({member, layout[member]}).first;
+        last->second.pages += pages;
+        if (member == lowest) last->second.counted += pages;
     });
 }
 

@@ -84,7 +84,9 @@ struct HXRepeatedPage {
 struct HXFamilyPages {
     explicit HXFamilyPages(size_t memberCount, size_t setLimit)
         : members(memberCount), sets(memberCount, setLimit), figures(memberCount),
-          mayBeLazilyFreed(memberCount) {}
+          mayBeLazilyFreed(memberCount), _lastRest(memberCount) {}
+    HXFamilyPages(HXFamilyPages &&) = default; // not copied: `_lastRest`
+    HXFamilyPages &operator=(HXFamilyPages &&) = default;
 
     static constexpr uint32_t kNoMapping = UINT32_MAX;
     // How many of the shared pages lie in one mapping of each member: a set's pages in one layout.
@@ -115,4 +117,8 @@ struct HXFamilyPages {
     void addRest(HXSharerSets::Bits set, std::span<const uint32_t> layout, const HXPageCount &pages);
     // Adds what was read elsewhere.
     void add(const HXFamilyPages &other);
+
+  private:
+    // Of each member the element of `rest` that was counted last: its pages come mapping by mapping.
+    std::vector<std::pair<const HXFamilyMapping, Rest> *> _lastRest;
 };
