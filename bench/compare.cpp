@@ -10,6 +10,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <optional>
+#include <random>
 #include <string>
 #include <vector>
 
@@ -281,9 +282,17 @@ void compare(const PopulationPlan &plan, const std::string &programs, int rounds
     const Population population(plan);
     std::vector<Command> commands = commandsFor(programs, population.pids());
     const size_t mappings = countMappings();
-    for (int round = 0; round < rounds; round++)
-        for (Command &command : commands)
-            if (!command.shell.empty()) run(command);
+    // In another order each round: whoever comes behind one that uses a single processor finds the others'
+    // caches cold and their clocks slow.
+    std::vector<Command *> order;
+    for (Command &command : commands)
+        if (!command.shell.empty()) order.push_back(&command);
+    std::mt19937 random; // always the same
+    for (int round = 0; round < rounds; round++) {
+        std::shuffle(order.begin(), order.end(), random);
+        for (Command *command : order)
+            run(*command);
+    }
 
     const Command &reference = commands.front();
     const auto memory =
