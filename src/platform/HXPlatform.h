@@ -167,6 +167,9 @@ class HXPlatform {
     // Resource usage, flavor RUSAGE_INFO_V4. 0 on success.
     virtual int32_t proc_pid_rusage(int32_t pid, int32_t flavor, rusage_info_v4 *info) = 0;
 
+    // Whether the process's argument area surely names it as its record does: then it need not be asked for.
+    virtual bool isNamedByRecord(const proc_bsdinfo &) { return false; }
+
     // Whether the process may be called `name` by its argument area, as far as its record tells: only those
     // that may need be asked for it.
     virtual bool mayBeNamed(const proc_bsdinfo &, std::string_view) { return true; }

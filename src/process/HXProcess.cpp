@@ -110,6 +110,7 @@ std::string HXProcess::_nameForBsdInfoCommName(const proc_bsdinfo &info) {
 
 std::string HXProcess::_nameForBsdInfo(const proc_bsdinfo &info) {
     HXPlatform &platform = HXPlatform::current();
+    if (platform.isNamedByRecord(info)) return _nameForBsdInfoCommName(info);
     const int32_t maximumName[] = {CTL_KERN, KERN_ARGMAX};
     int32_t maximum = 0;
     size_t length = sizeof maximum;

@@ -75,6 +75,9 @@ class HXLinuxPlatform final : public HXPlatform {
     int32_t proc_pid_rusage(int32_t pid, int32_t flavor, rusage_info_v4 *info) override;
     int32_t proc_get_dirty(int32_t pid, uint32_t *flags) override;
     int32_t proc_regionfilename(int32_t pid, uint64_t address, char *buffer, uint32_t bufferBytes) override;
+    bool isNamedByRecord(const proc_bsdinfo &info) override {
+        return HXLinuxProcesses::isNamedByRecord(info);
+    }
     bool mayBeNamed(const proc_bsdinfo &info, std::string_view name) override {
         return HXLinuxProcesses::mayBeNamed(info, name);
     }

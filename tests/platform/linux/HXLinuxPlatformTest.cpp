@@ -151,6 +151,14 @@ TEST_F(HXLinuxPlatformTest, NamesProcessesAsPsDoes) {
         process(pid, item.comm, kMapping);
         proc.link(folder + "exe", item.exe);
         EXPECT_EQ(nameInArguments(pid), item.expected);
+        proc_bsdinfo record;
+        ASSERT_EQ(platform.proc_pidinfo(pid, 3, 0, &record, sizeof record), 136);
+        const std::string recorded(record.pbi_comm, strnlen(record.pbi_comm, 16));
+        const bool isCutOrReplaced = recorded.size() == 15 || recorded.find('?') != std::string::npos;
+        EXPECT_EQ(platform.isNamedByRecord(record), !isCutOrReplaced);
+        if (!isCutOrReplaced && item.expected.starts_with('/')) {
+            EXPECT_TRUE(item.expected.ends_with('/' + recorded));
+        }
     }
     process(2000, "kthread", "");
     EXPECT_EQ(nameInArguments(2000), "error " + std::to_string(ENOENT));

@@ -4,7 +4,7 @@
 
 #include <sys/random.h>
 
-#include <array>
+#include <memory>
 #include <mutex>
 
 namespace {
@@ -64,8 +64,9 @@ struct HXObjectIdentifiers::Remembered {
 uint64_t HXObjectIdentifiers::interned(const Key &key) {
     // Not by the seed: it is to be the same in every run.
     const auto preferred = static_cast<uint32_t>(KeyHash{0}(key) >> 33);
-    thread_local std::array<Remembered, 256> known;
-    Remembered &remembered = known[preferred % known.size()];
+    constexpr size_t most = 256;
+    thread_local const auto known = std::make_unique<Remembered[]>(most);
+    Remembered &remembered = known[preferred % most];
     if (remembered.table == _table && remembered.key == key) return remembered.identifier;
     const uint32_t shardIndex = preferred % kShards;
     Shard &shard = _shards[shardIndex];

@@ -7,8 +7,8 @@
 #include <sys/mman.h>
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
+#include <memory>
 
 namespace {
 
@@ -144,8 +144,8 @@ bool HXPageScan::isComplete() {
 std::optional<HXPageScan::Walk> HXPageScan::find(const HXDescriptor &pagemap, bool tellsFiles, uint64_t start,
                                                  uint64_t end, std::span<HXPageRun> runs) {
     if (!support().isSupported) return std::nullopt;
-    thread_local std::array<Region, kMostRuns> regions;
-    const auto room = std::span(regions).first(std::min(regions.size(), runs.size()));
+    thread_local const auto regions = std::make_unique_for_overwrite<Region[]>(kMostRuns);
+    const std::span room(regions.get(), std::min(kMostRuns, runs.size()));
     const uint64_t categories = support().categories & ~(tellsFiles ? 0 : kFile);
     Walk walk{};
     const int found = scan(pagemap, categories, start, end, room, &walk.end);
@@ -163,9 +163,9 @@ std::optional<HXPageScan::Walk> HXPageScan::find(const HXDescriptor &pagemap, bo
 
 size_t HXReadPageFacts(const HXDescriptor &pagemap, uint64_t page, std::span<uint8_t> facts) {
     constexpr size_t step = 4096; // 32 KiB of entries: 16 MiB of small pages
-    thread_local std::array<uint64_t, step> entries;
-    const size_t length = std::min(facts.size(), entries.size()) * sizeof entries[0];
-    const ssize_t got = pagemap.readAt(page * sizeof entries[0], entries.data(), length);
+    thread_local const auto entries = std::make_unique_for_overwrite<uint64_t[]>(step);
+    const size_t length = std::min(facts.size(), step) * sizeof entries[0];
+    const ssize_t got = pagemap.readAt(page * sizeof entries[0], entries.get(), length);
     const size_t count = got < 0 ? 0 : static_cast<size_t>(got) / sizeof entries[0];
     for (size_t i = 0; i < count; i++)
         facts[i] = factsOf(entries[i], kEntryBits);

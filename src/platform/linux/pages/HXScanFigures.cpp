@@ -5,7 +5,7 @@
 #include "platform/linux/procfs/HXProcFile.h"
 
 #include <algorithm>
-#include <array>
+#include <memory>
 #include <span>
 
 namespace {
@@ -85,12 +85,13 @@ bool Scanner::scanStretch(size_t begin, size_t count) {
 
 // From the mapping `first` to the one before `end`.
 bool Scanner::walk(size_t first, size_t end, bool tellsFiles) {
-    thread_local std::array<HXPageRun, HXPageScan::kMostRuns> runs;
+    thread_local const auto memory = std::make_unique_for_overwrite<HXPageRun[]>(HXPageScan::kMostRuns);
+    const std::span runs(memory.get(), HXPageScan::kMostRuns);
     const uint64_t endAddress = _addressSpace[end - 1].end;
     for (uint64_t start = _addressSpace[first].start; start < endAddress;) {
         const auto found = HXPageScan::find(_pagemap, tellsFiles, start, endAddress, runs);
         if (!found) return false;
-        for (const HXPageRun &run : std::span(runs).first(found->count))
+        for (const HXPageRun &run : runs.first(found->count))
             add(run);
         start = found->end;
     }

@@ -291,6 +291,12 @@ int32_t HXLinuxProcesses::proc_pidinfo(int32_t pid, int32_t flavor, void *buffer
     return answer(shortInfo(*stat, hasEnded, flags), buffer, bufferBytes);
 }
 
+bool HXLinuxProcesses::isNamedByRecord(const proc_bsdinfo &info) {
+    const std::string_view recorded(info.pbi_comm, ::strnlen(info.pbi_comm, sizeof info.pbi_comm));
+    // A name that was not cut is whole. What stands for other bytes may have been longer.
+    return recorded.size() < kCommLength && recorded.find('?') == std::string_view::npos;
+}
+
 bool HXLinuxProcesses::mayBeNamed(const proc_bsdinfo &info, std::string_view name) {
     constexpr size_t surelyWhole = kCommLength - 3; // behind them the cut may have split a character
     std::string_view recorded(info.pbi_comm, ::strnlen(info.pbi_comm, surelyWhole));

@@ -58,6 +58,8 @@ class HXLinuxProcesses {
     // it right. Nothing is read from the process's memory, as cmdline, environ and auxv partly are: a page of
     // it can make the reader wait for ever.
     int32_t copyArguments(int32_t pid, void *old, size_t *oldBytes);
+    // Whether that area surely names the process of this record as the record does.
+    static bool isNamedByRecord(const proc_bsdinfo &info);
     // Whether that area can name the process of this record so.
     static bool mayBeNamed(const proc_bsdinfo &info, std::string_view name);
 
