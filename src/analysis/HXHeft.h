@@ -5,6 +5,7 @@
 #include "analysis/HXHeftSharingData.h"
 #include "analysis/HXObjectMap.h"
 #include "analysis/HXOutputFormatter.h"
+#include "analysis/HXWorkAhead.h"
 #include "model/HXHeftSwitches.h"
 #include "model/HXMemoryCategory.h"
 #include "model/HXMemoryObject.h"
@@ -101,7 +102,7 @@ class HXHeft : public HXHeftSwitches {
     HXMemoryObject &objectAt(const Place &place);
     void merge(HXMemoryRegion &region, const HXProcess &process, HXMemoryObject &object);
     void reportProcesses(const Processes &processes, Report &report, const HXHeftSharingData &sharing,
-                         bool summarize);
+                         bool summarize, HXWorkAhead &summing);
     void reportProcess(const HXProcess &process, Report &report, const GroupReports &groups);
     GroupReports groupReports(const HXProcess &process, const HXHeftSharingData &sharing,
                               bool summarize) const;

@@ -57,16 +57,27 @@ void HXHeft::reportProcess(const HXProcess &process, Report &report, const Group
         formatter->printProcessAuxData(auxData.get());
 }
 
-// What is said of each is worked out for many at a time, which is little enough to keep.
+// One worker writes; the others work out, ahead of him, what is said of each process, of so many at a time
+// that it is little enough to keep, and then the sums, which are written last.
 void HXHeft::reportProcesses(const Processes &processes, Report &report, const HXHeftSharingData &sharing,
-                             bool summarize) {
-    constexpr size_t most = 512, leastObjects = 8192;
+                             bool summarize, HXWorkAhead &summing) {
+    constexpr size_t most = 512, leastObjects = 2048, mostHelpers = 64;
+    const size_t helpers = std::min(_objects.size() / leastObjects, mostHelpers);
     for (size_t first = 0; first < processes.size(); first += most) {
         std::vector<GroupReports> groups(std::min(most, processes.size() - first));
-        forAll(groups.size(), leastObjects,
-               [&](size_t i) { groups[i] = groupReports(*processes[first + i], sharing, summarize); });
-        for (size_t i = 0; i < groups.size(); i++)
-            reportProcess(*processes[first + i], report, groups[i]);
+        HXWorkAhead grouping(groups.size(), [&](size_t i) {
+            groups[i] = groupReports(*processes[first + i], sharing, summarize);
+        });
+        forAll(1 + helpers, leastObjects, [&](size_t worker) {
+            if (worker > 0) {
+                grouping.help();
+                return summing.help();
+            }
+            for (size_t i = 0; i < groups.size(); i++) {
+                grouping.need(i);
+                reportProcess(*processes[first + i], report, groups[i]);
+            }
+        });
     }
 }
 
@@ -90,18 +101,13 @@ void HXHeft::printOutputVerbose(bool verbose, bool summarize) {
     const Processes inOrder = _processesBySortingHeft(_notHiddenProcesses());
     if (verbose) printAtlasLikeOutputForProcesses(inOrder);
 
-    HXHeftSharingData sharing;
+    const HXHeftSharingData sharing = _sharingData();
     HXCategoryMap summary;
-    constexpr size_t leastObjects = 16384;
-    forAll(2, leastObjects, [&](size_t i) {
-        if (i == 0)
-            sharing = _sharingData();
-        else
-            summary = _categoriesForAllProcessesShouldSummarize(summarize);
-    });
+    HXWorkAhead summing(1, [&](size_t) { summary = _categoriesForAllProcessesShouldSummarize(summarize); });
     Report report;
-    reportProcesses(inOrder, report, sharing, summarize);
+    reportProcesses(inOrder, report, sharing, summarize, summing);
     reportWholeGroups(sharing, summarize);
+    summing.need(0);
 
     const HXGlobalMessages messages = {HXProcess::globalErrors(), _warnings};
     for (HXOutputFormatter *formatter : _outputFormatters)
