@@ -94,3 +94,27 @@ TEST(HXHeftReportTest, EveryReportAddsUp) {
         (void)report(machine, arguments);
     }
 }
+
+// Of so many objects that one thread writes while others work out what is to be written. The processes are
+// all of one size, so that they come by pid, the highest first.
+TEST(HXHeftReportTest, AReportThatSeveralThreadsMakeIsInOrder) {
+    constexpr int processes = 600, regions = 8;
+    std::string machine = "host  self_region_heft=1\n";
+    for (int i = 0; i < processes; i++) {
+        const int pid = 1000 + i;
+        machine += "process  pid=" + std::to_string(pid) + "  name=p\n";
+        for (int j = 0; j < regions; j++)
+            machine += region(pid, 0x1000000u * (j + 1), 0x4000,
+                              "share_mode=" + std::to_string(j == 0 ? 1 : 2) +
+                                  "  object_id=" + std::to_string(j == 0 ? 1 + i / 2 : pid * 10 + j) +
+                                  "  dirtied=1  resident=1");
+    }
+    const HXRun made = report(machine, {"-a"});
+    size_t last = 0;
+    for (int pid = 1000 + processes - 1; pid >= 1000; pid--) {
+        const size_t place = made.out.find("\np [" + std::to_string(pid) + "]: ");
+        ASSERT_NE(place, std::string::npos) << pid;
+        ASSERT_GT(place, last) << pid;
+        last = place;
+    }
+}
