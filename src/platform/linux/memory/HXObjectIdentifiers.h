@@ -14,11 +14,14 @@
 #include "platform/HXAdaptiveMutex.h"
 #include "platform/linux/procfs/HXMapping.h"
 
+#include <algorithm>
 #include <atomic>
 #include <cstdint>
 #include <deque>
 #include <optional>
 #include <unordered_map>
+#include <utility>
+#include <vector>
 
 // Whose a mapping is.
 struct HXMappingOwner {
@@ -31,24 +34,57 @@ struct HXMappingOwner {
 template <typename Key, typename Hash>
 class HXNumberTable {
   public:
-    HXNumberTable(uint32_t limit, Hash hash) : _limit(limit), _given(0, hash), _displaced(0, hash) {}
+    // `limit`: at most UINT32_MAX.
+    HXNumberTable(uint32_t limit, Hash hash) : _limit(limit), _hash(hash), _displaced(0, hash) {}
 
     // The key's number: from the first time it is asked for on `preferred`, if no other key has that, else
     // any that is free; none when all are given. Takes no longer the more are.
     std::optional<uint32_t> of(const Key &key, uint32_t preferred) {
-        if (preferred < _limit && _given.try_emplace(preferred, key).first->second == key) return preferred;
+        if (preferred < _limit && give(preferred, key).first == key) return preferred;
         const auto [entry, isNew] = _displaced.try_emplace(key, _limit);
         for (bool isFound = !isNew; !isFound && _next < _limit; _next++) {
-            isFound = _given.try_emplace(_next, key).second;
+            isFound = give(_next, key).second;
             if (isFound) entry->second = _next;
         }
         return entry->second < _limit ? std::optional(entry->second) : std::nullopt;
     }
 
   private:
+    struct Given {
+        uint32_t number = UINT32_MAX; // none
+        Key key = {};
+    };
+
+    // The key that has the number, and whether it is given to this one now.
+    std::pair<const Key &, bool> give(uint32_t number, const Key &key) {
+        if (_givenCount + _givenCount / 3 >= _given.size()) grow();
+        Given &given = slotOf(number);
+        const bool isNew = given.number != number;
+        if (isNew) {
+            given = {number, key};
+            _givenCount++;
+        }
+        return {given.key, isNew};
+    }
+    // Where the number is, or may be put.
+    Given &slotOf(uint32_t number) {
+        size_t place = _hash(number) & (_given.size() - 1);
+        while (_given[place].number != number && _given[place].number != UINT32_MAX)
+            place = (place + 1) & (_given.size() - 1);
+        return _given[place];
+    }
+    void grow() {
+        constexpr size_t least = 16;
+        const auto before = std::exchange(_given, std::vector<Given>(std::max(least, _given.size() * 2)));
+        for (const Given &given : before)
+            if (given.number != UINT32_MAX) slotOf(given.number) = given;
+    }
+
     const uint32_t _limit;
-    uint32_t _next = 0;                             // all below have been given
-    std::unordered_map<uint32_t, Key, Hash> _given; // by number
+    const Hash _hash;
+    uint32_t _next = 0;        // all below have been given
+    std::vector<Given> _given; // by hash of the number; a power of two, a quarter of them free
+    size_t _givenCount = 0;
     std::unordered_map<Key, uint32_t, Hash> _displaced;
 };
 
