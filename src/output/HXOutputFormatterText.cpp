@@ -136,6 +136,7 @@ HXOutputFormatterText::_sortedKeysForCategories(const HXCategoryMap &categories)
     if (column == kColumns) keys.insert(keys.end(), {reclaimable, clean});
 
     std::vector<const HXMemoryCategory *> sorted;
+    sorted.reserve(categories.categories().size());
     for (const HXMemoryCategory &category : categories.categories())
         sorted.push_back(&category);
     std::sort(sorted.begin(), sorted.end(), [&](const HXMemoryCategory *a, const HXMemoryCategory *b) {

@@ -46,14 +46,14 @@ bool isUnsafe(uint32_t c) {
                        [c](const auto &range) { return c >= range.first && c <= range.last; });
 }
 
-bool isPlain(std::string_view text) {
+} // namespace
+
+bool HXIsPlainText(std::string_view text) {
     return std::all_of(text.begin(), text.end(), [](char c) { return c >= 0x20 && c < 0x7F && c != '\\'; });
 }
 
-} // namespace
-
 std::string HXSafeText(std::string_view text) {
-    if (isPlain(text)) return std::string(text);
+    if (HXIsPlainText(text)) return std::string(text);
     std::string safe;
     safe.reserve(text.size());
     while (!text.empty()) {

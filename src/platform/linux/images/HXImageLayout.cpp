@@ -153,6 +153,7 @@ void Finder::assign(const HXMapping &mapping, Candidate *candidate) const {
     }
     if (segment.name == nullptr) return;
     auto &segments = candidate->image.segments;
+    if (segments.empty()) segments.reserve(candidate->headers->loads.size() + 2); // relocated, zero-filled
     if (!segments.empty() && segments.back().name == segment.name &&
         segments.back().start + segments.back().length == segment.start)
         segments.back().length += segment.length;

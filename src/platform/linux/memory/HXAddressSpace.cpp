@@ -65,9 +65,12 @@ std::string_view HXAddressSpace::kept(std::string_view text) {
 // `raw` is kept.
 HXMappedPath HXAddressSpace::mappedPath(std::string_view raw, HXNamedTags &tags) {
     HXMappedPath path;
-    const std::string text =
-        HXSafeText(raw.find('\\') == std::string_view::npos ? std::string(raw) : plainPath(raw));
-    path.text = text == raw ? raw : kept(text);
+    path.text = raw;
+    if (!HXIsPlainText(raw)) {
+        const bool isEscaped = raw.find('\\') != std::string_view::npos;
+        const std::string text = isEscaped ? HXSafeText(plainPath(raw)) : HXSafeText(raw);
+        if (text != raw) path.text = kept(text);
+    }
     path.kind = HXPathKindOf(raw);
     const std::string_view name = HXGivenName(path.text);
     if (!name.empty()) path.namedTag = static_cast<uint8_t>(tags.tagForName(name).value_or(0));
