@@ -50,8 +50,12 @@ std::vector<size_t> HXWorkLoop::run(size_t iterations, size_t workers,
                                     std::function<void(size_t)> work, const Look &look) {
     const auto loop = std::make_shared<HXWorkLoop>(iterations, answerTime.has_value(), std::move(work));
     std::unique_lock lock(loop->_mutex);
-    for (size_t i = 0; i < std::min(iterations, workers); i++)
+    // Where nothing is given up and nobody is told, nobody needs to watch.
+    const bool takesPart = !answerTime && !look;
+    for (size_t i = takesPart ? 1 : 0; i < std::min(iterations, workers); i++)
         if (loop->_next == loop->_iterations || !loop->startWorker(lock)) break;
+    while (takesPart && loop->_next < loop->_iterations)
+        loop->workOnNext(lock);
     const auto pause =
         answerTime ? std::max(*answerTime / kLooks, std::chrono::milliseconds(1)) : kPauseWithoutEnd;
     loop->watch(lock, pause, look);
@@ -100,6 +104,14 @@ void HXWorkLoop::runWorker(Worker &worker) {
     if (_running == 0) _ended.notify_all();
 }
 
+// On the calling thread.
+void HXWorkLoop::workOnNext(std::unique_lock<std::mutex> &lock) {
+    const size_t iteration = _next++;
+    lock.unlock();
+    _work(iteration);
+    lock.lock();
+}
+
 // Without the lock, which workers need: whoever is told may wait for his terminal.
 void HXWorkLoop::tell(std::unique_lock<std::mutex> &lock, const Look &look) const {
     size_t done = _next;
@@ -128,11 +140,7 @@ void HXWorkLoop::watch(std::unique_lock<std::mutex> &lock, std::chrono::millisec
             if (_running == 0) return;
             continue;
         }
-        // No thread may be had at all: this one does the work.
-        const size_t iteration = _next++;
-        lock.unlock();
-        _work(iteration);
-        lock.lock();
+        workOnNext(lock); // no thread may be had at all
     }
 }
 

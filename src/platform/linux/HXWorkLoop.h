@@ -13,10 +13,10 @@
 #include <thread>
 #include <vector>
 
-// The calling thread only watches: whatever a process can keep from answering is asked by a worker. One that
-// waits in the kernel is soon joined by another, so that many that wait cost no more time than one; after the
-// answer time it is left to itself. It keeps the loop alive, touches nothing but its iteration and ends after
-// it.
+// The calling thread only watches: whatever a process can keep from answering is asked by a worker. (Where
+// nobody can, and nobody is told how it goes, it is one of the workers.) One that waits in the kernel is soon
+// joined by another, so that many that wait cost no more time than one; after the answer time it is left to
+// itself. It keeps the loop alive, touches nothing but its iteration and ends after it.
 class HXWorkLoop : public std::enable_shared_from_this<HXWorkLoop> {
   public:
     // Told some times a second how many iterations have returned, and which one sleeps in the kernel.
@@ -50,6 +50,7 @@ class HXWorkLoop : public std::enable_shared_from_this<HXWorkLoop> {
     bool startWorker(std::unique_lock<std::mutex> &lock);
     void look(Worker &worker, std::unique_lock<std::mutex> &lock);
     void runWorker(Worker &worker);
+    void workOnNext(std::unique_lock<std::mutex> &lock);
     void watch(std::unique_lock<std::mutex> &lock, std::chrono::milliseconds pause, const Look &observer);
     void tell(std::unique_lock<std::mutex> &lock, const Look &look) const;
     static bool hasProgressed(Worker &worker);
