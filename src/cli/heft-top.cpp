@@ -5,6 +5,8 @@
 #include "report/HXReportSource.h"
 #include "report/HXTop.h"
 
+#include <malloc.h>
+
 #include <algorithm>
 #include <charconv>
 #include <chrono>
@@ -140,6 +142,7 @@ class Pause {
     }
     // False when interrupted.
     bool wait(double seconds) {
+        ::malloc_trim(0); // what a reading takes is others' meanwhile
         std::unique_lock lock(_mutex);
         _changed.wait_for(lock, std::chrono::duration<double>(seconds), [this] { return _isInterrupted; });
         return !_isInterrupted;
