@@ -105,7 +105,8 @@ class HXServices {
     // long, without a moment of processor time, that it may never come back. Answers the ones given up, in
     // ascending order. They go on when the kernel lets them, maybe after this has returned: whatever `work`
     // touches must be owned by it or live as long as the program, which must end with `finish`.
-    // On a queue whose work is its own nothing is given up: it may use what its caller has.
+    // On a queue whose work is its own nothing is given up: it may use what its caller has, and may run on
+    // the calling thread.
     virtual std::vector<size_t> dispatch_apply(size_t iterations, const HXDispatchQueue &queue,
                                                std::function<void(size_t)> work) = 0;
 
